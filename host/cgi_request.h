@@ -1,0 +1,29 @@
+// Reading one CGI request: the environment the web server sets and the body
+// on stdin, turned into the web API's parameters.
+#pragma once
+
+#include <string>
+
+#include "webapi/url_encoded.h"
+
+struct CgiRequest {
+  std::string method;           // REQUEST_METHOD
+  std::string cookie;           // HTTP_COOKIE
+  std::string token;            // HTTP_X_KIVO_TOKEN
+  std::string accept_language;  // HTTP_ACCEPT_LANGUAGE
+  FormFields query;             // fields of the query string, in order
+  FormFields body;              // fields of an urlencoded body, in order
+};
+
+// Limits that keep a hostile request from costing memory or time.
+constexpr size_t kMaxBodyBytes = 4 << 20;
+constexpr size_t kMaxFields = 1000;
+
+// Reads the request from the environment and `body_fd`. Returns false with a
+// short reason for the client when the request is malformed: an invalid
+// percent-escape, an unsupported method or content type, a body larger than
+// kMaxBodyBytes or shorter than its CONTENT_LENGTH, too many fields.
+bool ReadCgiRequest(int body_fd, CgiRequest* out, std::string* reason);
+
+// The value of cookie `name` in a Cookie header; empty when absent.
+std::string CookieValue(const std::string& header, const std::string& name);

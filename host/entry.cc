@@ -1,0 +1,148 @@
+// entry.cgi: the appliance's web API server program, run by the web server
+// once per request (CGI). It reads the request, finds the API's row in the
+// tables of the loaded modules, checks who is calling, runs the row's
+// parameter checker and handler, and writes the JSON answer.
+
+#include <syslog.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstring>
+#include <exception>
+#include <memory>
+#include <string>
+
+#include <json/writer.h>
+
+#include "host/cgi_request.h"
+#include "host/host_api.h"
+#include "host/module_table.h"
+#include "webapi/api_request.h"
+#include "webapi/api_response.h"
+
+namespace {
+
+Json::Value Reason(const std::string& reason) {
+  Json::Value data(Json::objectValue);
+  data["reason"] = reason;
+  return data;
+}
+
+// Methods that browsers load by URL (images, the inline-frame page) cannot
+// send the token header; they answer only images and a blank page.
+bool IsLoadedByURL(const std::string& api, const std::string& method) {
+  static const char* const kAPIs[] = {
+      "KIVO.Core.Package.Thumb", "KIVO.Core.Package.Thumb.Server", "KIVO.Core.Package.Screenshot",
+      "KIVO.Core.Package.Screenshot.Server", "KIVO.Core.Package.FakeIFrame"};
+  if (method != "get") return false;
+  for (const char* a : kAPIs) {
+    if (api == a) return true;
+  }
+  return false;
+}
+
+// "de-DE,de;q=0.9" -> "ger". The interface language picks package texts.
+std::string UILanguage(const std::string& accept_language) {
+  static const struct {
+    const char* prefix;
+    const char* code;
+  } kLanguages[] = {{"de", "ger"}, {"fr", "fre"}, {"it", "ita"}, {"es", "spn"},
+                    {"ja", "jpn"}, {"ko", "krn"}, {"nl", "nld"}, {"zh-tw", "cht"},
+                    {"zh", "chs"}, {"ru", "rus"}, {"pt", "ptb"}, {"en", "enu"}};
+  std::string first = accept_language.substr(0, accept_language.find_first_of(",;"));
+  for (char& c : first) c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
+  for (const auto& l : kLanguages) {
+    if (first.compare(0, strlen(l.prefix), l.prefix) == 0) return l.code;
+  }
+  return "enu";
+}
+
+// "api", "method" and "version" of the call; false when one is missing.
+bool ReadIdentity(APIRequest* request) {
+  APIParameter<std::string> api = request->GetAndCheckString("api", PARAM_REQUIRED);
+  APIParameter<std::string> method = request->GetAndCheckString("method", PARAM_REQUIRED);
+  APIParameter<std::string> version = request->GetAndCheckString("version", PARAM_REQUIRED);
+  if (api.IsInvalid() || method.IsInvalid() || version.IsInvalid() || api.Get().empty() ||
+      method.Get().empty()) {
+    return false;
+  }
+  const std::string& v = version.Get();
+  if (v.empty() || v.size() > 9 || v.find_first_not_of("0123456789") != std::string::npos) {
+    return false;
+  }
+  request->SetAPI(api.Get(), method.Get(), std::stoi(v));
+  return true;
+}
+
+void RunModuleAPI(const CgiRequest& cgi, APIRequest* request, APIResponse* response) {
+  ModuleTable modules(DefaultModuleDir());
+  Route route;
+  switch (modules.Find(request->GetAPIClass(), request->GetAPIMethod(), request->GetAPIVersion(),
+                       &route)) {
+    case RouteResult::UnknownAPI:
+      return response->SetError(kErrNoSuchAPI);
+    case RouteResult::UnknownMethod:
+      return response->SetError(kErrNoSuchMethod);
+    case RouteResult::UnsupportedVersion:
+      return response->SetError(kErrBadVersion);
+    case RouteResult::Found:
+      break;
+  }
+  bool by_url = IsLoadedByURL(request->GetAPIClass(), request->GetAPIMethod());
+  if (!AuthorizeAdministrator(cgi, by_url, request, response)) return;
+  if (route.checker && !route.checker(request, response)) return;
+  route.handler(request, response);
+}
+
+void Serve(APIRequest* request, APIResponse* response) {
+  CgiRequest cgi;
+  std::string reason;
+  if (!ReadCgiRequest(STDIN_FILENO, &cgi, &reason)) return response->SetError(kErrBadRequest, Reason(reason));
+  for (const auto& field : cgi.query) request->AddRawParam(field.first, field.second);
+  for (const auto& field : cgi.body) request->AddRawParam(field.first, field.second);
+  if (!ReadIdentity(request)) {
+    return response->SetError(kErrBadRequest, Reason("api, method and version are required"));
+  }
+  request->SetUILanguage(UILanguage(cgi.accept_language));
+  if (IsHostAPI(request->GetAPIClass())) {
+    std::unique_ptr<ModuleTable> modules;
+    if (request->GetAPIClass() == "KIVO.API.Info") modules.reset(new ModuleTable(DefaultModuleDir()));
+    return RunHostAPI(cgi, request, modules.get(), response);
+  }
+  RunModuleAPI(cgi, request, response);
+}
+
+void WriteAnswer(const APIResponse& response) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "";
+  std::string body = Json::writeString(builder, response.ToEnvelope());
+  std::string head = "Content-Type: application/json; charset=utf-8\r\n";
+  for (const std::string& h : response.Headers()) head += h + "\r\n";
+  head += "Cache-Control: no-store\r\n\r\n";
+  fwrite(head.data(), 1, head.size(), stdout);
+  fwrite(body.data(), 1, body.size(), stdout);
+  fflush(stdout);
+}
+
+}  // namespace
+
+int main() {
+  openlog("entry.cgi", LOG_PID | LOG_PERROR, LOG_USER);
+  const pid_t self = getpid();
+  APIRequest request;
+  APIResponse response;
+  try {
+    Serve(&request, &response);
+  } catch (const std::exception& e) {
+    if (getpid() == self) {
+      syslog(LOG_ERR, "%s:%d %s %s failed: %s", "entry", __LINE__, request.GetAPIClass().c_str(),
+             request.GetAPIMethod().c_str(), e.what());
+      response.SetError(kErrUnknown);
+    }
+  }
+  // A worker forked by a handler that came back here must not answer the
+  // request a second time.
+  if (getpid() != self) _exit(0);
+  if (response.IsOutputEnabled()) WriteAnswer(response);
+  return 0;
+}

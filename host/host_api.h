@@ -1,0 +1,43 @@
+// The host's own APIs and the sign-in rules that guard the modules' APIs.
+//
+//  "KIVO.API.Info" "query"   every API with its lowest and highest version
+//  "KIVO.API.Auth" "login"   account + passwd -> {"sid", "token"} and cookie id=<sid>
+//  "KIVO.API.Auth" "logout"  ends the calling session
+#pragma once
+
+#include <string>
+
+#include "host/cgi_request.h"
+#include "host/module_table.h"
+#include "host/session_store.h"
+#include "webapi/api_request.h"
+#include "webapi/api_response.h"
+
+// Host error codes.
+enum HostError {
+  kErrUnknown = 100,
+  kErrBadRequest = 101,  // no api, method or version, or a malformed request
+  kErrNoSuchAPI = 102,
+  kErrNoSuchMethod = 103,
+  kErrBadVersion = 104,
+  kErrNotPermitted = 105,
+  kErrSessionExpired = 106,
+  kErrNotSignedIn = 119,
+  kErrParameter = 120,
+  kErrWrongPassword = 400,
+};
+
+// True when `api` is served by the host itself.
+bool IsHostAPI(const std::string& api);
+
+// Answers a host API call. `modules` is asked only by "KIVO.API.Info".
+void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* modules,
+                APIResponse* response);
+
+// Checks that the caller of a module API is a signed-in administrator. The
+// session comes from the cookie "id" (then the X-KIVO-Token header must
+// carry its token, except for `token_exempt` calls that browsers load by URL)
+// or from the parameter "_sid". Sets the login user on `request`; on refusal
+// sets the error on `response` and answers false.
+bool AuthorizeAdministrator(const CgiRequest& cgi, bool token_exempt, APIRequest* request,
+                            APIResponse* response);

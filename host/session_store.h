@@ -1,0 +1,53 @@
+// Signed-in sessions: one small file per session under "/run/kivo/sessions"
+// of the system root, named after the session id.
+//
+// A session id and its CSRF token are 128 random bits each (hex). A session
+// expires when it has not been used for `idle_timeout` seconds (its file's
+// modification time is the last use) or when it is older than `max_age`.
+#pragma once
+
+#include <ctime>
+#include <string>
+
+struct Session {
+  std::string id;
+  std::string user;
+  std::string token;
+};
+
+struct SessionLimits {
+  long idle_timeout = 1800;
+  long max_age = 86400;
+};
+
+enum class SessionLookup { Found, Unknown, Expired };
+
+class SessionStore {
+ public:
+  explicit SessionStore(SessionLimits limits);
+
+  // Creates a session for `user`. False when it cannot be stored.
+  bool Create(const std::string& user, Session* out);
+  // Finds a live session and marks it used. An expired one is removed.
+  SessionLookup Find(const std::string& id, Session* out);
+  void Remove(const std::string& id);
+
+  // True when `id` has the shape of a session id (so it is safe as a file name).
+  static bool IsWellFormedId(const std::string& id);
+
+ private:
+  std::string PathOf(const std::string& id) const;
+  // Deletes the files of sessions idle for longer than the limit; run at each
+  // sign-in so that abandoned sessions do not pile up.
+  void RemoveExpired();
+
+  SessionLimits limits_;
+  std::string dir_;
+};
+
+// Reads the limits from "/etc/kivo/webapi.conf" (session_idle_timeout,
+// session_max_age, in seconds); defaults for missing or bad values.
+SessionLimits LoadSessionLimits();
+
+// Compares without an early exit, so timing does not tell how much matched.
+bool ConstantTimeEquals(const std::string& a, const std::string& b);

@@ -1,0 +1,58 @@
+// Members whose methods this build does not serve yet. Each answers a clear
+// error instead of inventing data; a member moves to its area's source when
+// it is built.
+
+#include "log_line.h"
+#include "package_webapi.h"
+
+namespace KIVO_PACKAGE {
+
+void PackageWebAPI::AnswerNotAvailable(const char* member) {
+  Json::Value data(Json::objectValue);
+  data["reason"] = "not_available";
+  data["message"] = request->GetAPIClass() + " " + request->GetAPIMethod() +
+                    " is not available in this build yet";
+  PKG_LOG_ERR("%s: %s is not available yet", request->GetAPIClass().c_str(), member);
+  response->SetError(4501, data);
+}
+
+#define KIVO_NOT_AVAILABLE(name) \
+  void PackageWebAPI::name() { AnswerNotAvailable(#name); }
+
+KIVO_NOT_AVAILABLE(List)
+KIVO_NOT_AVAILABLE(Get)
+KIVO_NOT_AVAILABLE(FeasibilityCheck)
+KIVO_NOT_AVAILABLE(Start)
+KIVO_NOT_AVAILABLE(Stop)
+KIVO_NOT_AVAILABLE(Uninstall)
+KIVO_NOT_AVAILABLE(CheckEnv)
+KIVO_NOT_AVAILABLE(ReadProgress)
+KIVO_NOT_AVAILABLE(CancelProgress)
+KIVO_NOT_AVAILABLE(Upload)
+KIVO_NOT_AVAILABLE(Install)
+KIVO_NOT_AVAILABLE(CleanTmp)
+KIVO_NOT_AVAILABLE(DeleteTmp)
+KIVO_NOT_AVAILABLE(CheckDownloadPkgInfo)
+KIVO_NOT_AVAILABLE(ListServerPackage)
+KIVO_NOT_AVAILABLE(CheckUpdate)
+KIVO_NOT_AVAILABLE(LoadFeedList)
+KIVO_NOT_AVAILABLE(EditFeedList)
+KIVO_NOT_AVAILABLE(AddFeedList)
+KIVO_NOT_AVAILABLE(DelFeedList)
+KIVO_NOT_AVAILABLE(AddKeyring)
+KIVO_NOT_AVAILABLE(ListKeyring)
+KIVO_NOT_AVAILABLE(DelKeyring)
+KIVO_NOT_AVAILABLE(GetSetting)
+KIVO_NOT_AVAILABLE(SetSetting)
+KIVO_NOT_AVAILABLE(LoadConfig)
+KIVO_NOT_AVAILABLE(SetDefVol)
+KIVO_NOT_AVAILABLE(GetDefVol)
+KIVO_NOT_AVAILABLE(AddAutoUpdate)
+KIVO_NOT_AVAILABLE(DelAutoUpdate)
+KIVO_NOT_AVAILABLE(GetServerIcon)
+KIVO_NOT_AVAILABLE(GetVXIcon)
+KIVO_NOT_AVAILABLE(GetServerScreenshot)
+KIVO_NOT_AVAILABLE(GetVXScreenshot)
+KIVO_NOT_AVAILABLE(GetFakeIFrame)
+
+}  // namespace KIVO_PACKAGE

@@ -1,0 +1,181 @@
+#include "accounts/accounts.h"
+
+#include <crypt.h>
+#include <grp.h>
+#include <pwd.h>
+#include <shadow.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstring>
+#include <memory>
+#include <sstream>
+
+#include "klibc/atomic_file.h"
+#include "klibc/sysroot.h"
+
+namespace {
+
+struct FileCloser {
+  void operator()(FILE* f) const { fclose(f); }
+};
+using UniqueFile = std::unique_ptr<FILE, FileCloser>;
+
+UniqueFile OpenRootFile(const char* fixed) {
+  return UniqueFile(fopen(KIVORootPath(fixed).c_str(), "re"));
+}
+
+// The stored hash of `account`, from shadow, or from passwd when passwd holds
+// the hash itself. Empty when the account is unknown.
+std::string StoredHash(const std::string& account) {
+  std::string hash;
+  UniqueFile pw = OpenRootFile("/etc/passwd");
+  for (struct passwd* p; pw && (p = fgetpwent(pw.get()));) {
+    if (account == p->pw_name) hash = p->pw_passwd ? p->pw_passwd : "";
+  }
+  if (hash != "x") return hash;
+  hash.clear();
+  UniqueFile sp = OpenRootFile("/etc/shadow");
+  for (struct spwd* s; sp && (s = fgetspent(sp.get()));) {
+    if (account == s->sp_namp) hash = s->sp_pwdp ? s->sp_pwdp : "";
+  }
+  return hash;
+}
+
+std::vector<std::string> ReadLines(const char* fixed) {
+  std::vector<std::string> lines;
+  std::string text;
+  if (!KIVOReadFile(KIVORootPath(fixed), &text)) return lines;
+  std::istringstream in(text);
+  for (std::string line; std::getline(in, line);) {
+    if (!line.empty()) lines.push_back(line);
+  }
+  return lines;
+}
+
+bool WriteLines(const char* fixed, const std::vector<std::string>& lines, unsigned mode) {
+  std::string text;
+  for (const std::string& line : lines) text += line + "\n";
+  return KIVOWriteFileAtomic(KIVORootPath(fixed), text, SyncToDisk::Yes, mode);
+}
+
+std::string FieldOf(const std::string& line, size_t index) {
+  std::istringstream in(line);
+  std::string field;
+  for (size_t i = 0; i <= index; ++i) {
+    if (!std::getline(in, field, ':')) return "";
+  }
+  return field;
+}
+
+// Replaces the line whose first field is `name`, or appends `line`.
+void Upsert(std::vector<std::string>* lines, const std::string& name, const std::string& line) {
+  for (std::string& l : *lines) {
+    if (FieldOf(l, 0) == name) {
+      l = line;
+      return;
+    }
+  }
+  lines->push_back(line);
+}
+
+unsigned NextFreeId(const std::vector<std::string>& lines, unsigned first) {
+  unsigned id = first;
+  for (const std::string& l : lines) {
+    id = std::max(id, static_cast<unsigned>(std::strtoul(FieldOf(l, 2).c_str(), nullptr, 10)) + 1);
+  }
+  return id;
+}
+
+std::string HashPassword(const std::string& password) {
+  char salt[CRYPT_GENSALT_OUTPUT_SIZE];
+  if (!crypt_gensalt_rn("$y$", 0, nullptr, 0, salt, sizeof(salt))) return "";
+  struct crypt_data data;
+  memset(&data, 0, sizeof(data));
+  const char* hash = crypt_r(password.c_str(), salt, &data);
+  return hash && hash[0] != '*' ? hash : "";
+}
+
+std::string AddMember(const std::string& group_line, const std::string& account) {
+  std::string members = FieldOf(group_line, 3);
+  std::istringstream in(members);
+  for (std::string m; std::getline(in, m, ',');) {
+    if (m == account) return group_line;
+  }
+  size_t last_colon = group_line.rfind(':');
+  return group_line.substr(0, last_colon + 1) + (members.empty() ? "" : members + ",") + account;
+}
+
+}  // namespace
+
+bool KIVOAccountNameValid(const std::string& name) {
+  if (name.empty() || name.size() > 32) return false;
+  if (!(islower(static_cast<unsigned char>(name[0])) || name[0] == '_')) return false;
+  return std::all_of(name.begin(), name.end(), [](char c) {
+    return islower(static_cast<unsigned char>(c)) || isdigit(static_cast<unsigned char>(c)) ||
+           c == '_' || c == '.' || c == '-';
+  });
+}
+
+bool KIVOAccountCheckPassword(const std::string& account, const std::string& password) {
+  if (!KIVOAccountNameValid(account)) return false;
+  std::string hash = StoredHash(account);
+  // Locked ("!..."), disabled ("*") and empty hashes never match.
+  if (hash.empty() || hash[0] == '!' || hash[0] == '*') return false;
+  struct crypt_data data;
+  memset(&data, 0, sizeof(data));
+  const char* computed = crypt_r(password.c_str(), hash.c_str(), &data);
+  return computed && computed[0] != '*' && hash == computed;
+}
+
+bool KIVOAccountInGroup(const std::string& account, const std::string& group) {
+  gid_t primary = static_cast<gid_t>(-1);
+  UniqueFile pw = OpenRootFile("/etc/passwd");
+  for (struct passwd* p; pw && (p = fgetpwent(pw.get()));) {
+    if (account == p->pw_name) primary = p->pw_gid;
+  }
+  UniqueFile gr = OpenRootFile("/etc/group");
+  for (struct group* g; gr && (g = fgetgrent(gr.get()));) {
+    if (group != g->gr_name) continue;
+    if (g->gr_gid == primary) return true;
+    for (char** m = g->gr_mem; m && *m; ++m) {
+      if (account == *m) return true;
+    }
+  }
+  return false;
+}
+
+bool KIVOAccountSet(const std::string& account, const std::string& password,
+                    const std::vector<std::string>& groups, std::string* error) {
+  if (!KIVOAccountNameValid(account)) return (*error = "invalid account name: " + account), false;
+  for (const std::string& g : groups) {
+    if (!KIVOAccountNameValid(g)) return (*error = "invalid group name: " + g), false;
+  }
+  std::string hash = HashPassword(password);
+  if (hash.empty()) return (*error = "cannot hash the password"), false;
+
+  std::vector<std::string> passwd = ReadLines("/etc/passwd");
+  std::vector<std::string> shadow = ReadLines("/etc/shadow");
+  std::vector<std::string> group = ReadLines("/etc/group");
+  std::string uid;
+  for (const std::string& l : passwd) {
+    if (FieldOf(l, 0) == account) uid = FieldOf(l, 2);
+  }
+  if (uid.empty()) uid = std::to_string(NextFreeId(passwd, 1024));
+  Upsert(&passwd, account, account + ":x:" + uid + ":100::/var/services/homes/" + account +
+                               ":/sbin/nologin");
+  Upsert(&shadow, account, account + ":" + hash + ":0:0:99999:7:::");
+  for (const std::string& g : groups) {
+    std::string line = g + ":x:" + std::to_string(NextFreeId(group, 1024)) + ":";
+    for (const std::string& l : group) {
+      if (FieldOf(l, 0) == g) line = l;
+    }
+    Upsert(&group, g, AddMember(line, account));
+  }
+  if (!WriteLines("/etc/group", group, 0644) || !WriteLines("/etc/shadow", shadow, 0600) ||
+      !WriteLines("/etc/passwd", passwd, 0644)) {
+    *error = "cannot write the account files under " + KIVORootPath("/etc");
+    return false;
+  }
+  return true;
+}

@@ -1,0 +1,40 @@
+#include "settings/web_utils.h"
+
+#include <memory>
+
+#include <json/reader.h>
+#include <json/writer.h>
+
+#include "klibc/atomic_file.h"
+#include "klibc/last_error.h"
+
+namespace WebUtils {
+
+bool LoadJsonFile(const std::string& path, Json::Value& out) {
+  out = Json::Value();
+  std::string text;
+  if (!KIVOReadFile(path, &text)) return false;
+  Json::CharReaderBuilder builder;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  std::string errors;
+  if (!reader->parse(text.data(), text.data() + text.size(), &out, &errors)) {
+    out = Json::Value();
+    KLIBCErrSet(KLIBC_ERR_FILE_READ);
+    return false;
+  }
+  return true;
+}
+
+bool SaveJsonFile(const std::string& path, const Json::Value& value) {
+  size_t slash = path.rfind('/');
+  if (slash != std::string::npos && slash > 0 &&
+      KIVOFSMkdirP(path.substr(0, slash).c_str()) != 0) {
+    return false;
+  }
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "  ";
+  return KIVOWriteFileAtomic(path, Json::writeString(builder, value) + "\n");
+}
+
+}  // namespace WebUtils

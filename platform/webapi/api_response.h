@@ -1,0 +1,43 @@
+// The answer of one web API call. A handler answers once: SetSuccess or
+// SetError (a later call replaces the earlier one, which is how a handler adds
+// details to an error it has set). Raw-output handlers write their own HTTP
+// answer on stdout and switch the JSON answer off with SetEnableOutput(false).
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include <json/value.h>
+
+class APIResponse {
+ public:
+  APIResponse() = default;
+  APIResponse(const APIResponse&) = delete;
+  APIResponse& operator=(const APIResponse&) = delete;
+
+  void SetSuccess(const Json::Value& data = Json::Value());
+  void SetError(int code, const Json::Value& data = Json::Value());
+  // The error code set so far; 0 when none (also after SetSuccess).
+  int GetError() const { return error_code_; }
+  void SetEnableOutput(bool enable) { output_enabled_ = enable; }
+
+  // Host side.
+  bool IsOutputEnabled() const { return output_enabled_; }
+  bool IsAnswered() const { return answered_; }
+  bool IsSuccess() const { return answered_ && error_code_ == 0; }
+  const Json::Value& GetData() const { return data_; }
+  // Extra HTTP header lines ("Set-Cookie: ...") sent with the JSON answer.
+  void AddHeader(const std::string& line) { headers_.push_back(line); }
+  const std::vector<std::string>& Headers() const { return headers_; }
+  // {"success": true, "data": D} or {"success": false, "error": {"code": N,
+  // "errors": D}}, with "data"/"errors" left out when null. An unanswered
+  // response gives the default error 100.
+  Json::Value ToEnvelope() const;
+
+ private:
+  bool answered_ = false;
+  bool output_enabled_ = true;
+  int error_code_ = 0;
+  Json::Value data_;
+  std::vector<std::string> headers_;
+};

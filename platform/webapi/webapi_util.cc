@@ -1,0 +1,59 @@
+#include "webapi/webapi_util.h"
+
+#include <exception>
+#include <memory>
+
+#include <json/reader.h>
+
+namespace WebAPIUtil {
+namespace {
+
+// Strict JSON, any root type, bounded nesting. jsoncpp throws when the
+// nesting limit is passed, so callers catch.
+bool ParseStrict(const std::string& text, Json::Value* out) {
+  Json::CharReaderBuilder builder;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  builder["strictRoot"] = false;
+  builder["stackLimit"] = 200;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  try {
+    return reader->parse(text.data(), text.data() + text.size(), out, nullptr);
+  } catch (const std::exception&) {
+    return false;
+  }
+}
+
+bool MayBeJson(const std::string& raw) {
+  if (raw.empty()) return false;
+  char c = raw[0];
+  return c == '{' || c == '[' || c == '"' || c == '-' || (c >= '0' && c <= '9') || c == 't' ||
+         c == 'f' || c == 'n';
+}
+
+}  // namespace
+
+bool ParseJson(const std::string& text, Json::Value& out) {
+  Json::Value parsed;
+  if (!ParseStrict(text, &parsed)) return false;
+  out = parsed;
+  return true;
+}
+
+bool JsonArrayHasString(const Json::Value& array, const std::string& value) {
+  if (!array.isArray()) return false;
+  for (const Json::Value& item : array) {
+    if (item.isString() && item.asString() == value) return true;
+  }
+  return false;
+}
+
+Json::Value DecodeParamValue(const std::string& raw) {
+  Json::Value value;
+  if (!MayBeJson(raw) || !ParseStrict(raw, &value)) return Json::Value(raw);
+  // Reals keep their text, and so do integers too large for 64 bits, which
+  // jsoncpp reads as reals.
+  if (value.type() == Json::realValue) return Json::Value(raw);
+  return value;
+}
+
+}  // namespace WebAPIUtil

@@ -1,0 +1,123 @@
+#include "testing/cgi_client.h"
+
+#include <fcntl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <memory>
+
+#include <json/reader.h>
+
+#include "testing/temp_root.h"
+
+namespace {
+
+void WriteAll(int fd, const std::string& data) {
+  size_t done = 0;
+  while (done < data.size()) {
+    ssize_t n = write(fd, data.data() + done, data.size() - done);
+    if (n <= 0) return;
+    done += static_cast<size_t>(n);
+  }
+}
+
+std::string ReadAll(int fd) {
+  std::string out;
+  char buf[65536];
+  for (ssize_t n; (n = read(fd, buf, sizeof(buf))) > 0;) out.append(buf, static_cast<size_t>(n));
+  return out;
+}
+
+Json::Value ParseJson(const std::string& text) {
+  Json::CharReaderBuilder builder;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value value;
+  if (!reader->parse(text.data(), text.data() + text.size(), &value, nullptr)) return Json::Value();
+  return value;
+}
+
+}  // namespace
+
+CgiAnswer RunEntryCgi(const CgiEnv& env, const std::string& body) {
+  std::vector<std::string> vars = {"PATH=/usr/bin:/bin"};
+  if (const char* root = getenv("KIVO_ROOT")) vars.push_back(std::string("KIVO_ROOT=") + root);
+  for (const auto& e : env) vars.push_back(e.first + "=" + e.second);
+  std::vector<char*> envp;
+  for (std::string& v : vars) envp.push_back(&v[0]);
+  envp.push_back(nullptr);
+  std::string program = BuildDir() + "/bin/entry.cgi";
+
+  int in[2], out[2];
+  if (pipe2(in, O_CLOEXEC) != 0 || pipe2(out, O_CLOEXEC) != 0) abort();
+  pid_t pid = fork();
+  if (pid == 0) {
+    dup2(in[0], STDIN_FILENO);
+    dup2(out[1], STDOUT_FILENO);
+    char* argv[] = {&program[0], nullptr};
+    execve(program.c_str(), argv, envp.data());
+    _exit(127);
+  }
+  close(in[0]);
+  close(out[1]);
+  WriteAll(in[1], body);
+  close(in[1]);
+  std::string raw = ReadAll(out[0]);
+  close(out[0]);
+  int status = 0;
+  waitpid(pid, &status, 0);
+
+  CgiAnswer answer;
+  answer.exit_status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  size_t split = raw.find("\r\n\r\n");
+  answer.head = raw.substr(0, split);
+  answer.body = split == std::string::npos ? "" : raw.substr(split + 4);
+  answer.json = ParseJson(answer.body);
+  return answer;
+}
+
+std::string EncodeForm(const Params& params) {
+  static const char kHex[] = "0123456789ABCDEF";
+  std::string out;
+  for (const auto& p : params) {
+    if (!out.empty()) out += '&';
+    for (int part = 0; part < 2; ++part) {
+      if (part == 1) out += '=';
+      for (unsigned char c : part == 0 ? p.first : p.second) {
+        if (isalnum(c) || c == '-' || c == '_' || c == '.' || c == '~') {
+          out += static_cast<char>(c);
+        } else {
+          out += '%';
+          out += kHex[c >> 4];
+          out += kHex[c & 15];
+        }
+      }
+    }
+  }
+  return out;
+}
+
+ApiClient::ApiClient(const std::string& account, const std::string& password) {
+  std::string body = EncodeForm({{"api", "KIVO.API.Auth"}, {"method", "login"}, {"version", "1"},
+                                 {"account", account}, {"passwd", password}});
+  CgiAnswer a = RunEntryCgi({{"REQUEST_METHOD", "POST"},
+                             {"CONTENT_TYPE", "application/x-www-form-urlencoded"},
+                             {"CONTENT_LENGTH", std::to_string(body.size())}},
+                            body);
+  if (!a.Success()) return;
+  sid_ = a.Data()["sid"].asString();
+  token_ = a.Data()["token"].asString();
+}
+
+CgiAnswer ApiClient::Call(const std::string& api, const std::string& method, int version,
+                          const Params& params) const {
+  Params all = {{"api", api}, {"method", method}, {"version", std::to_string(version)}};
+  all.insert(all.end(), params.begin(), params.end());
+  std::string body = EncodeForm(all);
+  return RunEntryCgi({{"REQUEST_METHOD", "POST"},
+                      {"CONTENT_TYPE", "application/x-www-form-urlencoded"},
+                      {"CONTENT_LENGTH", std::to_string(body.size())},
+                      {"HTTP_COOKIE", "id=" + sid_},
+                      {"HTTP_X_KIVO_TOKEN", token_}},
+                     body);
+}

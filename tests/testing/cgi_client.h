@@ -1,0 +1,52 @@
+// Calls the real entry.cgi the way the web server does: a CGI environment,
+// the body on stdin, the answer read from stdout.
+#pragma once
+
+#include <map>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include <json/value.h>
+
+struct CgiAnswer {
+  std::string head;   // header lines
+  std::string body;   // raw body
+  Json::Value json;   // the body parsed, null when it is not JSON
+  int exit_status = -1;
+
+  bool Success() const { return json["success"].asBool(); }
+  int Code() const { return json["error"]["code"].asInt(); }
+  const Json::Value& Errors() const { return json["error"]["errors"]; }
+  const Json::Value& Data() const { return json["data"]; }
+};
+
+using CgiEnv = std::map<std::string, std::string>;
+
+// Runs entry.cgi with `env` (plus KIVO_ROOT and PATH) and `body` on stdin.
+CgiAnswer RunEntryCgi(const CgiEnv& env, const std::string& body = "");
+
+using Params = std::vector<std::pair<std::string, std::string>>;
+
+// "a=1&b=2" with each name and value percent-encoded.
+std::string EncodeForm(const Params& params);
+
+// A signed-in client of the web API.
+class ApiClient {
+ public:
+  // Signs in `account`; check signed_in().
+  ApiClient(const std::string& account, const std::string& password);
+
+  bool signed_in() const { return !sid_.empty(); }
+  const std::string& sid() const { return sid_; }
+  const std::string& token() const { return token_; }
+
+  // Calls api/method/version with `params` in a form body, carrying the
+  // session as cookie and token header, as the web desktop does.
+  CgiAnswer Call(const std::string& api, const std::string& method, int version,
+                 const Params& params = {}) const;
+
+ private:
+  std::string sid_;
+  std::string token_;
+};

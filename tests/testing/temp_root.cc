@@ -1,0 +1,40 @@
+#include "testing/temp_root.h"
+
+#include <stdlib.h>
+
+#include <gtest/gtest.h>
+
+#include "accounts/accounts.h"
+#include "klibc/atomic_file.h"
+#include "klibc/process.h"
+#include "tools/kivoctl/root_setup.h"
+
+std::string BuildDir() {
+  const char* dir = getenv("KIVO_BUILD_DIR");
+  return dir ? dir : ".";
+}
+
+TempRoot::TempRoot() {
+  const char* tmp = getenv("TMPDIR");
+  std::string pattern = std::string(tmp ? tmp : "/tmp") + "/kivo-root-XXXXXX";
+  char* made = mkdtemp(&pattern[0]);
+  if (!made) abort();
+  dir_ = made;
+  std::string error;
+  if (!KIVOCreateSystemRoot(dir_, &error)) ADD_FAILURE() << error;
+  setenv("KIVO_ROOT", dir_.c_str(), 1);
+}
+
+TempRoot::~TempRoot() { KLIBCExec("/bin/rm", "-rf", dir_.c_str(), nullptr, nullptr); }
+
+void TempRoot::Write(const std::string& fixed, const std::string& content) const {
+  std::string path = Path(fixed);
+  KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str());
+  ASSERT_TRUE(KIVOWriteFileAtomic(path, content, SyncToDisk::No)) << path;
+}
+
+void TempRoot::AddAccount(const std::string& name, const std::string& password,
+                          const std::vector<std::string>& groups) const {
+  std::string error;
+  ASSERT_TRUE(KIVOAccountSet(name, password, groups, &error)) << error;
+}

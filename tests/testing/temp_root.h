@@ -1,0 +1,28 @@
+// A system root of its own for one test: created with the same code as
+// `kivoctl init-root`, pointed at by KIVO_ROOT, removed afterwards.
+#pragma once
+
+#include <string>
+#include <vector>
+
+class TempRoot {
+ public:
+  TempRoot();
+  ~TempRoot();
+  TempRoot(const TempRoot&) = delete;
+  TempRoot& operator=(const TempRoot&) = delete;
+
+  const std::string& dir() const { return dir_; }
+  // "<root>" + fixed.
+  std::string Path(const std::string& fixed) const { return dir_ + fixed; }
+  // Writes a file under the root, creating its folders.
+  void Write(const std::string& fixed, const std::string& content) const;
+  void AddAccount(const std::string& name, const std::string& password,
+                  const std::vector<std::string>& groups) const;
+
+ private:
+  std::string dir_;
+};
+
+// The build tree (KIVO_BUILD_DIR, set by ctest).
+std::string BuildDir();
