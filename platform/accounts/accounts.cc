@@ -1,6 +1,7 @@
 #include "accounts/accounts.h"
 
 #include <crypt.h>
+#include <dlfcn.h>
 #include <grp.h>
 #include <pwd.h>
 #include <shadow.h>
@@ -15,6 +16,33 @@
 #include "klibc/sysroot.h"
 
 namespace {
+
+// libcrypt is needed only to sign in and to set passwords, but entry.cgi
+// starts for every request; loading it on first use keeps it out of every
+// other request's start-up.
+struct CryptLibrary {
+  using CryptR = char* (*)(const char*, const char*, struct crypt_data*);
+  using GenSalt = char* (*)(const char*, unsigned long, const char*, int, char*, int);
+  CryptR crypt_r = nullptr;
+  GenSalt gensalt = nullptr;
+};
+
+const CryptLibrary& Crypt() {
+  static const CryptLibrary lib = [] {
+    CryptLibrary l;
+    if (void* handle = dlopen("libcrypt.so.1", RTLD_NOW | RTLD_LOCAL)) {
+      l.crypt_r = reinterpret_cast<CryptLibrary::CryptR>(dlsym(handle, "crypt_r"));
+      l.gensalt = reinterpret_cast<CryptLibrary::GenSalt>(dlsym(handle, "crypt_gensalt_rn"));
+    }
+    return l;
+  }();
+  return lib;
+}
+
+// crypt_r of the lazily loaded library; null when it cannot be loaded.
+const char* CryptR(const std::string& password, const char* setting, struct crypt_data* data) {
+  return Crypt().crypt_r ? Crypt().crypt_r(password.c_str(), setting, data) : nullptr;
+}
 
 struct FileCloser {
   void operator()(FILE* f) const { fclose(f); }
@@ -89,10 +117,10 @@ unsigned NextFreeId(const std::vector<std::string>& lines, unsigned first) {
 
 std::string HashPassword(const std::string& password) {
   char salt[CRYPT_GENSALT_OUTPUT_SIZE];
-  if (!crypt_gensalt_rn("$y$", 0, nullptr, 0, salt, sizeof(salt))) return "";
+  if (!Crypt().gensalt || !Crypt().gensalt("$y$", 0, nullptr, 0, salt, sizeof(salt))) return "";
   struct crypt_data data;
   memset(&data, 0, sizeof(data));
-  const char* hash = crypt_r(password.c_str(), salt, &data);
+  const char* hash = CryptR(password, salt, &data);
   return hash && hash[0] != '*' ? hash : "";
 }
 
@@ -124,7 +152,7 @@ bool KIVOAccountCheckPassword(const std::string& account, const std::string& pas
   if (hash.empty() || hash[0] == '!' || hash[0] == '*') return false;
   struct crypt_data data;
   memset(&data, 0, sizeof(data));
-  const char* computed = crypt_r(password.c_str(), hash.c_str(), &data);
+  const char* computed = CryptR(password, hash.c_str(), &data);
   return computed && computed[0] != '*' && hash == computed;
 }
 

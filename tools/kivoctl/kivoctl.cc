@@ -2,6 +2,7 @@
 //
 //   kivoctl init-root DIR
 //   kivoctl [--root DIR] user-add NAME [--password PW | --password-stdin] [--group G]...
+//   kivoctl [--root DIR] web-config [--port N] [--address A] [--cgi PATH]
 
 #include <unistd.h>
 
@@ -13,6 +14,7 @@
 
 #include "accounts/accounts.h"
 #include "tools/kivoctl/root_setup.h"
+#include "tools/kivoctl/web_config.h"
 
 namespace {
 
@@ -25,6 +27,10 @@ const char kUsage[] =
     "                           create an account in the root, or reset its password\n"
     "                           and add it to groups (administrators may use the\n"
     "                           package center)\n"
+    "  web-config [--port N] [--address A] [--cgi PATH]\n"
+    "                           print the lighttpd configuration that serves the\n"
+    "                           root's web API (default 127.0.0.1:5000, the entry.cgi\n"
+    "                           beside this program)\n"
     "\n"
     "--root DIR selects the system root (default: $KIVO_ROOT, else /).\n";
 
@@ -65,6 +71,38 @@ int UserAdd(const std::vector<std::string>& args) {
   return 0;
 }
 
+// entry.cgi is installed beside kivoctl.
+std::string EntryCgiBesideUs() {
+  char exe[4096];
+  ssize_t n = readlink("/proc/self/exe", exe, sizeof(exe) - 1);
+  if (n <= 0) return "/usr/bin/entry.cgi";
+  std::string path(exe, static_cast<size_t>(n));
+  return path.substr(0, path.rfind('/')) + "/entry.cgi";
+}
+
+int WebConfig(const std::vector<std::string>& args) {
+  WebConfigOptions options;
+  const char* root = getenv("KIVO_ROOT");
+  options.root = root && *root ? root : "/";
+  options.entry_cgi = EntryCgiBesideUs();
+  for (size_t i = 0; i < args.size(); ++i) {
+    bool has_value = i + 1 < args.size();
+    if (args[i] == "--port" && has_value) {
+      options.port = std::atoi(args[++i].c_str());
+    } else if (args[i] == "--address" && has_value) {
+      options.address = args[++i];
+    } else if (args[i] == "--cgi" && has_value) {
+      options.entry_cgi = args[++i];
+    } else {
+      return Fail("unknown option for web-config: " + args[i]);
+    }
+  }
+  if (options.port <= 0 || options.port > 65535) return Fail("--port takes 1 to 65535");
+  if (options.root[0] != '/') return Fail("the root must be an absolute path");
+  std::cout << KIVOWebConfig(options);
+  return 0;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -81,6 +119,7 @@ int main(int argc, char** argv) {
   args.erase(args.begin());
   if (command == "init-root") return InitRoot(args);
   if (command == "user-add") return UserAdd(args);
+  if (command == "web-config") return WebConfig(args);
   std::cerr << kUsage;
   return Fail("unknown command: " + command);
 }

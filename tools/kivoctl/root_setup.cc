@@ -15,6 +15,7 @@ const char* const kFolders[] = {
     "run/kivo/sessions",       // signed-in sessions
     "tmp",                     // temporary files of uploads and downloads
     "volume1",                 // the first data volume
+    "usr/kivo/www",            // the web server's document root
 };
 
 struct DefaultFile {

@@ -1,0 +1,77 @@
+// The web API over HTTP through lighttpd, as a browser or script reaches it.
+
+#include <gtest/gtest.h>
+
+#include <json/reader.h>
+
+#include <sys/wait.h>
+#include <unistd.h>
+#include "testing/temp_root.h"
+#include "testing/web_server.h"
+
+namespace {
+
+struct HttpAnswer {
+  std::string head;
+  Json::Value json;
+};
+
+// Runs curl with `args` and returns the response headers and parsed body.
+HttpAnswer Curl(const std::vector<std::string>& args) {
+  std::vector<const char*> argv = {"curl", "-s", "-i"};
+  for (const std::string& a : args) argv.push_back(a.c_str());
+  argv.push_back(nullptr);
+  int fds[2];
+  EXPECT_EQ(0, pipe(fds));
+  pid_t pid = fork();
+  if (pid == 0) {
+    dup2(fds[1], STDOUT_FILENO);
+    execv("/usr/bin/curl", const_cast<char* const*>(argv.data()));
+    _exit(127);
+  }
+  close(fds[1]);
+  std::string raw;
+  char buf[4096];
+  for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) > 0;) raw.append(buf, static_cast<size_t>(n));
+  close(fds[0]);
+  waitpid(pid, nullptr, 0);
+  HttpAnswer answer;
+  size_t split = raw.find("\r\n\r\n");
+  answer.head = raw.substr(0, split);
+  std::string body = split == std::string::npos ? "" : raw.substr(split + 4);
+  Json::CharReaderBuilder builder;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  reader->parse(body.data(), body.data() + body.size(), &answer.json, nullptr);
+  return answer;
+}
+
+TEST(EndToEndHttpTest, SignInQueryAndReadALogThroughLighttpd) {
+  TempRoot root;
+  root.AddAccount("admin", "secret", {"administrators"});
+  root.Write("/var/packages/demo/INFO", "package=\"demo\"\nlogfile=\"demo.log\"\n");
+  root.Write("/var/packages/demo/var/demo.log", "hello from demo\n");
+  WebServer server(root.dir());
+  ASSERT_TRUE(server.running());
+  const std::string url = server.EntryURL();
+  const std::string jar = root.Path("/cookies");
+
+  HttpAnswer login = Curl({"-c", jar, "--data",
+                           "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret",
+                           url});
+  ASSERT_TRUE(login.json["success"].asBool()) << login.head;
+  EXPECT_NE(std::string::npos, login.head.find("application/json"));
+  std::string token = login.json["data"]["token"].asString();
+
+  HttpAnswer info = Curl({url + "?api=KIVO.API.Info&version=1&method=query"});
+  EXPECT_EQ(2, info.json["data"]["KIVO.Core.Package.Installation"]["maxVersion"].asInt());
+
+  const std::string log_url = url + "?api=KIVO.Core.Package.Log&version=1&method=get&name=demo";
+  HttpAnswer log = Curl({"-b", jar, "-H", "X-KIVO-Token: " + token, log_url});
+  EXPECT_EQ("hello from demo\n", log.json["data"]["pkglog"].asString()) << log.head;
+
+  EXPECT_EQ(105, Curl({"-b", jar, log_url}).json["error"]["code"].asInt());
+  EXPECT_EQ(119, Curl({log_url}).json["error"]["code"].asInt());
+  EXPECT_EQ(101, Curl({url + "?api=%zz"}).json["error"]["code"].asInt());
+}
+
+}  // namespace

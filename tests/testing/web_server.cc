@@ -1,0 +1,73 @@
+#include "testing/web_server.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "klibc/atomic_file.h"
+#include "testing/temp_root.h"
+#include "tools/kivoctl/web_config.h"
+
+namespace {
+
+sockaddr_in Loopback(int port) {
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_port = htons(static_cast<uint16_t>(port));
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  return addr;
+}
+
+bool Accepts(int port) {
+  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in addr = Loopback(port);
+  bool ok = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0;
+  close(fd);
+  return ok;
+}
+
+}  // namespace
+
+int FreeLoopbackPort() {
+  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in addr = Loopback(0);
+  socklen_t len = sizeof(addr);
+  bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr));
+  getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len);
+  close(fd);
+  return ntohs(addr.sin_port);
+}
+
+WebServer::WebServer(const std::string& root, const std::string& entry_cgi) {
+  WebConfigOptions options;
+  options.root = root;
+  options.entry_cgi = entry_cgi.empty() ? BuildDir() + "/bin/entry.cgi" : entry_cgi;
+  options.port = port_ = FreeLoopbackPort();
+  std::string conf = root + "/lighttpd-" + std::to_string(port_) + ".conf";
+  if (!KIVOWriteFileAtomic(conf, KIVOWebConfig(options), SyncToDisk::No)) return;
+  pid_t pid = fork();
+  if (pid == 0) {
+    execl("/usr/sbin/lighttpd", "lighttpd", "-D", "-f", conf.c_str(), static_cast<char*>(nullptr));
+    _exit(127);
+  }
+  pid_ = pid;
+  for (int i = 0; i < 500 && !Accepts(port_); ++i) usleep(10000);
+  if (!Accepts(port_)) {
+    kill(pid_, SIGKILL);
+    waitpid(pid_, nullptr, 0);
+    pid_ = -1;
+  }
+}
+
+WebServer::~WebServer() {
+  if (pid_ <= 0) return;
+  kill(pid_, SIGTERM);
+  waitpid(pid_, nullptr, 0);
+}
+
+std::string WebServer::EntryURL() const {
+  return "http://127.0.0.1:" + std::to_string(port_) + "/webapi/entry.cgi";
+}

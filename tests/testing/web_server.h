@@ -1,0 +1,30 @@
+// lighttpd serving a system root's web API on a loopback port chosen at run
+// time, for end-to-end tests and benchmarks. Stopped when destroyed.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+
+class WebServer {
+ public:
+  // Starts lighttpd for `root` with the configuration `kivoctl web-config`
+  // writes, and waits until it accepts connections. Check running().
+  // `entry_cgi` replaces the build's entry.cgi (benchmarks serve a baseline).
+  explicit WebServer(const std::string& root, const std::string& entry_cgi = "");
+  ~WebServer();
+  WebServer(const WebServer&) = delete;
+  WebServer& operator=(const WebServer&) = delete;
+
+  bool running() const { return pid_ > 0; }
+  int port() const { return port_; }
+  // "http://127.0.0.1:<port>/webapi/entry.cgi"
+  std::string EntryURL() const;
+
+ private:
+  pid_t pid_ = -1;
+  int port_ = 0;
+};
+
+// A port on 127.0.0.1 that nothing listens on right now.
+int FreeLoopbackPort();
