@@ -1,17 +1,25 @@
 #!/usr/bin/env bash
-# Installs what is missing (as root), builds, and runs every test.
-# With KIVO_SANITIZE=1 the build and the tests run under ASan and UBSan,
-# in build-asan/.
+# Installs what is missing (as root), builds, and runs every test: once in
+# build/, then again under AddressSanitizer and UndefinedBehaviorSanitizer in
+# build-asan/. KIVO_SANITIZE=0 skips the second run, KIVO_SANITIZE=only runs
+# just that one.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 scripts/deps.sh
-if [ "${KIVO_SANITIZE:-0}" = 1 ]; then
-  export BUILD_DIR=build-asan
-  scripts/build.sh -DKIVO_SANITIZE=ON
-else
+
+run_tests() {
+  (cd "$BUILD_DIR" && ctest -j"$(nproc)" --output-on-failure --timeout 300)
+}
+
+if [ "${KIVO_SANITIZE:-1}" != only ]; then
   export BUILD_DIR=build
   scripts/build.sh
+  run_tests
 fi
-cd "$BUILD_DIR"
-ctest -j"$(nproc)" --output-on-failure --timeout 300
+if [ "${KIVO_SANITIZE:-1}" != 0 ]; then
+  export BUILD_DIR=build-asan
+  export UBSAN_OPTIONS=halt_on_error=1:print_stacktrace=1
+  scripts/build.sh -DKIVO_SANITIZE=ON
+  run_tests
+fi
