@@ -1,39 +1,155 @@
-// PackageManager: the package tool's view of the installed packages, used by
-// the web API module once per request. Cheap to construct; call init() first.
+// PackageManager: the package tool as the web API module and kivoctl use it.
+// Cheap to construct; call init() first. Every call records a result code
+// (result_codes.h) that getResult() answers until the next call, and the
+// changing operations leave an operation log (getLogFilePath) and worker
+// messages (getJsonParam("worker_msg")) for the caller to read and delete.
 //
-// Every call records a result code (result_codes.h) that getResult() answers
-// until the next call.
+// Changing operations (install, upgrade, uninstall, start, stop) take the
+// tool's exclusive lock; when another operation holds it past a short wait
+// they fail with 275 instead of waiting. They first remove what an
+// interrupted operation left behind (see registry.h).
 #pragma once
 
+#include <cstdint>
+#include <map>
+#include <set>
 #include <string>
+#include <vector>
+
+#include <json/value.h>
+
+#include "pkgtool/dependency.h"
+#include "pkgtool/package_info.h"
+#include "pkgtool/result_codes.h"
 
 class PackageManager {
  public:
   PackageManager() = default;
+  ~PackageManager();
   PackageManager(const PackageManager&) = delete;
   PackageManager& operator=(const PackageManager&) = delete;
 
-  // Makes sure the registry can be read (creating its folder on a fresh
-  // system). False, with result 263, when it cannot.
+  // Makes sure the registry can be read (creating it on a fresh system).
+  // False, with result 263, when it cannot.
   bool init();
 
-  // The last result code.
   int getResult() const { return result_; }
+  // The result, and for 260 the services that are not running (array).
+  int getResult(Json::Value& services) const;
 
-  // The path of the package's own log file, as its INFO declares it ("logfile",
-  // relative to the package's data folder). With `evenIfMissing` false (the
-  // one-argument form) the path is given only when the file exists; with true,
-  // also when the package has not written it yet. Empty when the package is
-  // unknown (result 255), declares no log or declares a path that leaves its
-  // data folder (result 0).
+  // --- Reading -----------------------------------------------------------
+
+  // Ids of the installed packages, sorted. `language` and `mask` are kept
+  // for the callers' sake; every package is listed.
+  std::vector<std::string> enumPackages(const std::string& language = "", uint64_t mask = ~0ULL);
+  // Every installed package's record, by id.
+  bool enumPackageInfoMap(std::map<std::string, PackageInfo>& out, const std::string& language,
+                          uint64_t mask);
+  // The installed record of `id`. False with 255 when not installed.
+  bool getPackageInfo(const std::string& id, PackageInfo& info, const std::string& language = "",
+                      uint64_t mask = ~0ULL);
+  bool getInstallPackageInfo(const std::string& id, PackageInfo& info) {
+    return getPackageInfo(id, info);
+  }
+  // Reads a package file's INFO (and with the wizard, its install or
+  // upgrade wizard in `language`). False with 261 when it is not one.
+  bool queryPackageFileInfo(const std::string& path, PackageInfo& info, PKG_INSTALLATION_TYPE type,
+                            const char* language);
+  bool queryPackageFileInfoWithWizard(const std::string& path, PackageInfo& info,
+                                      PKG_INSTALLATION_TYPE type, const char* language);
+  // Loads the installed package's wizard of operation `op` (PKG_OP_UNINSTALL
+  // ...) in `language` into out.getUIFile(). False when it has none.
+  bool readUIFile(int op, const PackageInfo& package, PackageInfo& out, const std::string& language);
+  // Whether the package runs. False when it cannot be told; then the result
+  // says why (255 not installed, 258 broken, 264 not supported...).
+  bool getServiceStatus(const PackageInfo& info, bool& running, bool checkBroken);
+  // Flags of an installed package: bit 0 installed, bit 1 running, bit 2 broken.
+  unsigned getPkgRoughStatus(const std::string& id);
+  // The package's own log file (INFO "logfile", in its data folder). With
+  // `evenIfMissing` false only when the file exists. "" when none.
   std::string getPackageLog(const std::string& id) { return getPackageLog(id, false); }
   std::string getPackageLog(const std::string& id, bool evenIfMissing);
+  // The last operation's log file ("" before any).
+  const std::string& getLogFilePath() const { return log_path_; }
+  // "worker_msg": the last operation's worker messages (array).
+  Json::Value getJsonParam(const std::string& key) const;
+  // "curver", "oldver", "deppkg": texts the last operation left.
+  std::string getMapParam(const std::string& key) const;
+  // The service names of a service string, as a JSON array.
+  void parseService(const std::string& services, Json::Value& out) const;
+
+  // --- Dependencies ------------------------------------------------------
+
+  // Every installed package, each after the packages it depends on... in
+  // reverse: dependents first, so stopping in this order is safe and
+  // starting goes in the reverse order.
+  bool getDependencyOrder(std::vector<std::string>& order);
+  // True when every entry is installed at an accepted version and running.
+  // Otherwise `notInstalled` (array) gets the entries missing or at a refused
+  // version and `notStarted` the ids (", "-joined) that do not run.
+  bool arePackagesInstallAndStart(const DepPkgVector& deps, Json::Value& notInstalled,
+                                  std::string& notStarted, const char* language);
+  // True when no running package depends on `id`; else `running` names them.
+  bool areDependentPackageStop(const std::string& id, const char* language, std::string& running);
+  // True when an installed package conflicts with `package`: one named in
+  // `conflicts` (at a matching version), or one whose own conflicts name
+  // `package`. `message` names them.
+  bool arePackagesConflict(const PackageBasicInfo& package, const DepPkgVector& conflicts,
+                           std::string& message, const char* language);
+  // The running packages that depend on `id` into `list` ([{"id","name"}]).
+  // 0 on success.
+  int getDepPkgListStop(std::string id, const char* language, Json::Value& list);
+  std::set<std::string> getServiceSetFromString(const char* services) const;
+  // The services of `services` that are not running.
+  std::set<std::string> checkServiceStarted(const std::set<std::string>& services) const;
+  unsigned checkServiceStarted(unsigned mask) const;
+  static unsigned PMSExplodeServiceString(const char* services);
+
+  // --- Changing ------------------------------------------------------------
+
+  // Starts or stops `id` through its start-stop-status script.
+  bool serviceControl(int opType, const std::string& id, bool start, const std::string& language,
+                      const std::string& user, void* list, bool checkDeps, bool recordState);
+  // Removes `id`, handing the uninstall wizard's answers to its scripts.
+  bool uninstall(const std::string& id, const Json::Value* wizardValues, const std::string& language,
+                 int opType, bool force, const std::string& user);
+
+  // The tool's exclusive lock, waiting at most `seconds`. False when another
+  // process holds it.
+  bool ExLock(int seconds);
+  void UnLock();
+
+  // For the install functions of install.cc.
+  void setOutcome(int result, const std::string& log_path, const Json::Value& workers,
+                  const std::map<std::string, std::string>& params, const Json::Value& services);
 
  private:
   int result_ = 0;
+  int lock_fd_ = -1;
+  std::string log_path_;
+  Json::Value worker_messages_{Json::arrayValue};
+  Json::Value services_{Json::arrayValue};
+  std::map<std::string, std::string> map_params_;
 };
 
-// The whole text of a package log file; when the file is larger than 1 MiB,
-// its last 1 MiB (the recent lines are the ones worth reading). Empty when the
-// file cannot be read.
+// The package file's check against this appliance, before an install:
+// format, signature by the trust level, architecture, OS version limits,
+// conflicts, required services and packages, port, volume. Returns true when
+// it may be installed; else `code` is the result code, `message` says why,
+// and `details` holds "serviceNoStarted", "unStartPkgList", "packages",
+// "instPackageList" where they apply.
+bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std::string& message,
+                              PKG_ERRCODE& code, Json::Value& details, PackageInfo& info);
+
+// Installs or upgrades the package file `path` onto `volume` ("" for the
+// default volume). `extraValues` is the wizard's JSON text; `typeFlag` true
+// starts the package when installed. `details` receives "workerMessage",
+// "installReboot", "curVersion"/"insVersion" and "deppkg" where they apply.
+bool InstallPackageFileImpl(const std::string& user, const std::string& path,
+                            const std::string& volume, int reserved, const std::string& extraValues,
+                            bool typeFlag, const std::string& language, std::string& message,
+                            PKG_ERRCODE& code, Json::Value& details, bool force, bool checkCodesign);
+
+// The log text of a package log file; when it is larger than 1 MiB, its last
+// 1 MiB. "" when it cannot be read.
 std::string PMSReadPackageLog(const std::string& path);

@@ -1,16 +1,23 @@
-// The installed-package registry: one folder per installed package under
-// "/var/packages" of the system root, named after the package id.
+// The installed-package registry under "/var/packages" of the system root.
 //
-//   var/packages/<id>/INFO    the package's INFO as installed (key/value)
-//   var/packages/<id>/target  the folder the payload is installed in
-//   var/packages/<id>/var     the package's own data folder (kept on upgrade)
+//   var/packages/<id>              symlink to .records/<id>.<nonce>
+//   var/packages/.records/<id>.<n> one version's record:
+//       INFO        the package's INFO as installed
+//       scripts/, WIZARD_UIFILES/, LICENSE, PACKAGE_ICON*.PNG
+//       target ->   <volume>/@appstore/<id>.<n>  (the payload)
+//       var    ->   <volume>/@appdata/<id>       (data, kept across upgrades)
+//       enabled     present while the package is meant to run
 //
-// A package is installed exactly when its folder exists with an INFO file:
-// the package tool builds a record elsewhere and renames it into place last,
-// so a reader never sees half a record.
+// A package is installed exactly when var/packages/<id> resolves to a record
+// with an INFO file. A record is built completely under a fresh name and
+// published by renaming a new symlink over var/packages/<id>: one atomic
+// step, so a crash leaves the old state or the new one, never half. Records
+// and payload folders that no symlink reaches are leftovers of an
+// interrupted operation; PMSRecoverLeftovers removes them.
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "klibc/key_value_file.h"
 
@@ -18,13 +25,25 @@ namespace PackageRegistry {
 
 // "<root>/var/packages".
 std::string Dir();
-// "<root>/var/packages/<id>"; `id` must be valid (PMSIsValidPackageId).
+// "<root>/var/packages/<id>" (the published name); `id` must be valid.
 std::string RecordDir(const std::string& id);
-// True when a record with an INFO file exists for `id`.
+// "<root>/var/packages/.records".
+std::string RecordsDir();
+// True when a record with an INFO file is published for `id`.
 bool IsInstalled(const std::string& id);
-// Reads the record's INFO. False when the package is not installed or the
-// file cannot be read.
+// Reads the published record's INFO.
 bool ReadInfo(const std::string& id, KeyValueMap* info);
+// Installed package ids, sorted.
+std::vector<std::string> List();
+// The record folder name `id` is published as (".records/<id>.<n>"), "" if none.
+std::string PublishedRecord(const std::string& id);
+// Publishes `record` (a name under .records) as `id`, replacing any earlier
+// record in one rename. False with errno on failure.
+bool Publish(const std::string& id, const std::string& record);
+// Removes the published name of `id` (the record folder stays for clean-up).
+bool Unpublish(const std::string& id);
+// A fresh record name for `id`: "<id>.<random>".
+std::string NewRecordName(const std::string& id);
 
 }  // namespace PackageRegistry
 

@@ -1,14 +1,48 @@
-// Result codes of the package tool (PackageManager::getResult and the
-// operations' error codes). docs/package-tool.md gives each its meaning.
+// Result codes of the package tool: PackageManager::getResult, the PKG_ERRCODE
+// of package file checks and installs, and the operations of `kivoctl`.
+// docs/package-tool.md gives each its meaning and where it comes from.
 #pragma once
 
-enum PKG_RESULT {
-  PKG_RESULT_OK = 0,
-  PKG_RESULT_BROKEN = 150,
-  PKG_RESULT_NOT_INSTALLED = 255,
-  PKG_RESULT_NA = 256,
-  PKG_RESULT_BROKEN_RECORD = 258,
-  PKG_RESULT_VERSION_LIMIT = 259,
-  PKG_RESULT_BAD_ID = 262,
-  PKG_RESULT_REGISTRY = 263,
+enum PKG_ERRCODE {
+  PKG_OK = 0,
+  PKG_ERR_SIGNATURE_UNCHECKABLE = 150,  // the signature could not be checked at all
+  PKG_ERR_NOT_INSTALLED = 255,
+  PKG_ERR_STATUS_UNKNOWN = 256,
+  PKG_ERR_BROKEN = 258,                 // record or installed files damaged
+  PKG_ERR_VERSION_LIMIT = 259,          // a dependency's version does not satisfy the package
+  PKG_ERR_SERVICE_NOT_RUNNING = 260,
+  PKG_ERR_NOT_PACKAGE_FILE = 261,
+  PKG_ERR_BAD_ID = 262,
+  PKG_ERR_REGISTRY = 263,
+  PKG_ERR_NOT_SUPPORTED = 264,          // architecture or device kind (install, status)
+  PKG_ERR_BUILTIN = 265,
+  PKG_ERR_NOT_NEWER = 267,              // same or newer version installed
+  PKG_ERR_DEPENDENCY = 268,             // needed package missing or stopped; dependents (uninstall)
+  PKG_ERR_DEPENDENTS_RUNNING = 269,
+  PKG_ERR_BAD_WIZARD_VALUES = 270,
+  PKG_ERR_SCRIPT_FAILED = 274,
+  PKG_ERR_BUSY = 275,                   // another package operation holds the lock
+  PKG_ERR_EXTRACT = 276,                // the payload could not be extracted
+  PKG_ERR_HOSTILE_MEMBER = 277,         // a member escapes its folder, a device node, setuid...
+  PKG_ERR_INTERNAL = 278,
+  PKG_ERR_NO_SPACE = 279,
+  PKG_ERR_ARCH = 281,                   // architecture or device kind (package file check)
+  PKG_ERR_PORT_IN_USE = 283,
+  PKG_ERR_CONFLICT = 284,
+  PKG_ERR_NO_TMP = 285,
+  PKG_ERR_NO_SIGNATURE = 288,
+  PKG_ERR_BAD_SIGNATURE = 289,
+  PKG_ERR_UNKNOWN_SIGNER = 290,
+  PKG_ERR_EXPIRED_KEY = 291,
+  PKG_ERR_REVOKED_KEY = 292,
+  PKG_ERR_FORMAT_VERSION = 293,         // a package format newer than this tool
+  PKG_ERR_VOLUME_CRASHED = 296,
+  PKG_ERR_NO_VOLUME = 297,
+  PKG_ERR_OS_TOO_NEW = 302,             // the OS is above the package's os_max_ver
+  PKG_ERR_OS_TOO_OLD = 303,             // the OS is below the package's os_min_ver
+  PKG_ERR_CANCELLED = 304,
+  PKG_ERR_UPGRADE_ROLLED_BACK = 305,
 };
+
+// A short English text for a code, for logs and the command line.
+const char* PMSResultText(int code);

@@ -3,6 +3,8 @@
 //   kivoctl init-root DIR
 //   kivoctl [--root DIR] user-add NAME [--password PW | --password-stdin] [--group G]...
 //   kivoctl [--root DIR] web-config [--port N] [--address A] [--cgi PATH]
+//   kivoctl build|sign|inspect ...            (package authors)
+//   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
 
 #include <unistd.h>
 
@@ -13,6 +15,7 @@
 #include <vector>
 
 #include "accounts/accounts.h"
+#include "tools/kivoctl/package_commands.h"
 #include "tools/kivoctl/root_setup.h"
 #include "tools/kivoctl/web_config.h"
 
@@ -31,6 +34,19 @@ const char kUsage[] =
     "                           print the lighttpd configuration that serves the\n"
     "                           root's web API (default 127.0.0.1:5000, the entry.cgi\n"
     "                           beside this program)\n"
+    "\n"
+    "package authors:\n"
+    "  build SOURCE OUT.kpk [--level N]   build a package file from a source folder\n"
+    "  sign FILE.kpk --homedir GNUPGHOME --key KEY [--output OUT.kpk]\n"
+    "  inspect FILE.kpk                   INFO, members and signature as JSON\n"
+    "\n"
+    "operators (on the system root):\n"
+    "  install FILE.kpk [--volume V] [--wizard JSON] [--run] [--no-codesign] [--no-force]\n"
+    "                                     install, or upgrade an installed package\n"
+    "  uninstall ID [--wizard JSON]       remove a package\n"
+    "  start ID | stop ID | status ID     control a package\n"
+    "  list                               installed packages\n"
+    "  log ID                             the package's own log\n"
     "\n"
     "--root DIR selects the system root (default: $KIVO_ROOT, else /).\n";
 
@@ -120,6 +136,16 @@ int main(int argc, char** argv) {
   if (command == "init-root") return InitRoot(args);
   if (command == "user-add") return UserAdd(args);
   if (command == "web-config") return WebConfig(args);
+  if (command == "build") return KivoctlBuild(args);
+  if (command == "sign") return KivoctlSign(args);
+  if (command == "inspect") return KivoctlInspect(args);
+  if (command == "install" || command == "upgrade") return KivoctlInstall(args);
+  if (command == "uninstall") return KivoctlUninstall(args);
+  if (command == "start") return KivoctlStartStop(args, true);
+  if (command == "stop") return KivoctlStartStop(args, false);
+  if (command == "status") return KivoctlStatus(args);
+  if (command == "list") return KivoctlList(args);
+  if (command == "log") return KivoctlLog(args);
   std::cerr << kUsage;
   return Fail("unknown command: " + command);
 }

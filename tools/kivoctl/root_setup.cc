@@ -16,6 +16,7 @@ const char* const kFolders[] = {
     "tmp",                     // temporary files of uploads and downloads
     "volume1",                 // the first data volume
     "usr/kivo/www",            // the web server's document root
+    "run/kivo/pkgtool",        // the package tool's lock and progress
 };
 
 struct DefaultFile {
@@ -30,11 +31,31 @@ const DefaultFile kFiles[] = {
     {"etc/group", "root:x:0:\nusers:x:100:\nadministrators:x:101:\n", 0644},
     {"etc/kivoinfo.conf",
      "# Package center settings of this appliance.\n"
-     "update_channel=\"stable\"\n"
-     "pkg_trust_level=\"0\"\n"
-     "enable_pkg_autoupdate=\"no\"\n"
-     "enable_pkg_autoupdate_all=\"no\"\n"
-     "pkg_autoupdate_all=\"no\"\n",
+     "package_update_channel=\"stable\"\n"
+     "pkg_source_trust_level=\"0\"\n"
+     "upgrade_pkg_email_notification=\"no\"\n"
+     "upgrade_pkg_nvx_notification=\"yes\"\n"
+     "enable_pkg_autoupdate_all=\"no\"\n",
+     0644},
+    {"etc/kivo/volumes.json",
+     "[\n  {\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 0, \"brick\": false}\n]\n",
+     0644},
+    {"etc/kivo/device.conf",
+     "# What this appliance is.\n"
+     "os_version=\"7.2-0064\"\n"
+     "arch=\"x86_64\"\n"
+     "kind=\"nas\"\n",
+     0644},
+    {"etc/kivo/services.conf",
+     "# System services and their state.\n"
+     "pgsql=\"running\"\n"
+     "web=\"running\"\n"
+     "ssh=\"running\"\n"
+     "smb=\"running\"\n",
+     0644},
+    {"etc/kivo/pkgtool.conf",
+     "# Package tool settings: seconds a package script may run.\n"
+     "script_timeout=\"120\"\n",
      0644},
     {"etc/kivo/webapi.conf",
      "# Web API host settings.\n"
@@ -54,6 +75,9 @@ bool KIVOCreateSystemRoot(const std::string& dir, std::string* error) {
     if (KIVOFSMkdirP(path.c_str(), mode) != 0) return (*error = "cannot create " + path), false;
   }
   chmod((dir + "/tmp").c_str(), 01777);
+  // GnuPG insists on a private home for the appliance keyring.
+  std::string keyring = dir + "/usr/kivo/etc/packages/gnupg";
+  if (KIVOFSMkdirP(keyring.c_str(), 0700) != 0) return (*error = "cannot create " + keyring), false;
   for (const DefaultFile& f : kFiles) {
     std::string path = dir + "/" + f.path;
     if (KLIBCFileExist(path.c_str())) continue;

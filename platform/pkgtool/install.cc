@@ -1,0 +1,346 @@
+// Checking and installing package files. The install is one transaction:
+// the new version is staged under fresh names (record and payload folder),
+// its scripts run, and it becomes the installed version by one atomic
+// rename (registry.h). Until then the old version is untouched and runs; a
+// failure after it puts the old record back.
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <ctime>
+#include <memory>
+
+#include "klibc/atomic_file.h"
+#include "klibc/last_error.h"
+#include "klibc/sysroot.h"
+#include "pkgtool/install_checks.h"
+#include "pkgtool/lifecycle.h"
+#include "pkgtool/package_file.h"
+#include "pkgtool/package_manager.h"
+#include "pkgtool/package_state.h"
+#include "pkgtool/pms.h"
+#include "pkgtool/registry.h"
+#include "pkgtool/signature.h"
+#include "webapi/webapi_util.h"
+
+namespace {
+
+constexpr int kLockWaitSeconds = 3;
+
+// Fills `info` from a package file's header members.
+void InfoFromHeader(const std::string& path, const PackageFileHeader& header,
+                    PKG_INSTALLATION_TYPE wizard, const char* language, PackageInfo* info) {
+  *info = PackageInfo(header.info);
+  info->setFilePath(path);
+  auto license = header.members.find("LICENSE");
+  if (license != header.members.end()) info->setLicense(license->second);
+  unsigned mask = 0;
+  const struct { const char* name; PKG_INSTALLATION_TYPE op; } kWizards[] = {
+      {"WIZARD_UIFILES/install_uifile", PKG_OP_INSTALL},
+      {"WIZARD_UIFILES/upgrade_uifile", PKG_OP_UPGRADE},
+      {"WIZARD_UIFILES/uninstall_uifile", PKG_OP_UNINSTALL}};
+  for (const auto& w : kWizards) {
+    auto it = header.members.find(w.name);
+    if (it == header.members.end()) continue;
+    mask |= w.op;
+    if (w.op != wizard) continue;
+    auto localized = header.members.find(std::string(w.name) + "_" + (language ? language : ""));
+    Json::Value ui;
+    WebAPIUtil::ParseJson(localized != header.members.end() ? localized->second : it->second, ui);
+    info->setUIFile(ui);
+  }
+  info->setWizardMask(mask);
+}
+
+// The signature outcome under the appliance's trust level.
+int SignatureVerdict(const PackageFileHeader& header, std::string* message) {
+  std::string signer, error;
+  int outcome = PMSCheckSignature(header.manifest, header.signature, &signer, &error);
+  int verdict = PMSApplyTrustLevel(outcome, PMSTrustLevel());
+  if (verdict != PKG_OK) *message = PMSResultText(verdict) + (error.empty() ? "" : ": " + error);
+  return verdict;
+}
+
+// Everything a staged install creates, removed again unless committed.
+struct Staging {
+  std::string id;
+  std::string record_name;
+  std::string record;  // <root>/var/packages/.records/<name>
+  std::string target;  // <root>/<volume>/@appstore/<name>
+  std::string data;    // <root>/<volume>/@appdata/<id>
+  bool created_data = false;
+  bool committed = false;
+
+  ~Staging() {
+    if (committed) return;
+    PMSRemoveTree(record);
+    PMSRemoveTree(target);
+    if (created_data) PMSRemoveTree(data);
+  }
+};
+
+bool WriteRecordMembers(const PackageFileHeader& header, const KeyValueMap& info,
+                        const Staging& s) {
+  if (KIVOFSMkdirP((s.record + "/scripts").c_str()) != 0) return false;
+  std::string info_text;
+  for (const auto& kv : info) info_text += KIVOKeyValueLine(kv.first, kv.second) + "\n";
+  if (!KIVOWriteFileAtomic(s.record + "/INFO", info_text)) return false;
+  for (const auto& m : header.members) {
+    if (m.first == "INFO") continue;
+    std::string path = s.record + "/" + m.first;
+    KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str());
+    unsigned mode = m.first.compare(0, 8, "scripts/") == 0 ? 0755 : 0644;
+    if (!KIVOWriteFileAtomic(path, m.second, SyncToDisk::No, mode)) return false;
+  }
+  return symlink(s.target.c_str(), (s.record + "/target").c_str()) == 0 &&
+         symlink(s.data.c_str(), (s.record + "/var").c_str()) == 0;
+}
+
+// Runs the installed version's start-stop-status with `action`.
+bool ControlRecord(const std::string& record, const PackageInfo& info, const std::string& action,
+                   const Operation& op) {
+  auto env = PMSScriptEnv(info, record, action, op, Json::Value());
+  return PMSRunPackageScript(record, "start-stop-status", action, env, op);
+}
+
+struct InstallJob {
+  std::string path, volume, user, language;
+  Json::Value wizard;
+  bool run_after = false, force = true, check_codesign = true;
+};
+
+class Installer {
+ public:
+  Installer(const InstallJob& job, std::string* message, Json::Value* details)
+      : job_(job), message_(message), details_(details) {}
+
+  int Run();
+  // Hands the operation's log text and worker messages to the caller and
+  // removes the log.
+  void Report();
+
+ private:
+  int Refuse(int code, const std::string& text) {
+    *message_ = text;
+    return code;
+  }
+  int CheckVersions(const PackageInfo& info);
+  int Stage(PackageFileReader* reader, const PackageInfo& info, Staging* s);
+  int RunScriptsAndPublish(const PackageInfo& info, Staging* s);
+  int Finish(const PackageInfo& info, Staging* s);
+
+  const InstallJob& job_;
+  std::string* message_;
+  Json::Value* details_;
+  std::unique_ptr<Operation> op_;
+  bool upgrade_ = false;
+  bool was_running_ = false;
+  PackageInfo old_;
+  std::string old_record_;
+  std::string id_;
+};
+
+int Installer::CheckVersions(const PackageInfo& info) {
+  upgrade_ = PMSLoadInstalled(info.getId(), &old_);
+  if (!upgrade_) return PKG_OK;
+  old_record_ = PackageRegistry::PublishedRecord(info.getId());
+  (*details_)["curVersion"] = old_.getVersion();
+  (*details_)["insVersion"] = info.getVersion();
+  if (!job_.force && PMSCompareVersion(info.getVersion(), old_.getVersion()) <= 0) {
+    return Refuse(PKG_ERR_NOT_NEWER, "version " + old_.getVersion() + " is installed");
+  }
+  // Running packages that depend on this one must accept the new version.
+  for (const std::string& other : PMSInstalledDependents(info.getId())) {
+    PackageInfo dependent;
+    if (!PMSLoadInstalled(other, &dependent) || !PMSIsRunning(other, dependent)) continue;
+    for (const PackageBasicInfo& dep : dependent.getDependencies()) {
+      if (dep.getName() == info.getId() && !dep.accepts(info.getVersion())) {
+        (*details_)["deppkg"] = other;
+        return Refuse(PKG_ERR_DEPENDENTS_RUNNING, other + " runs and needs " + dep.toString());
+      }
+    }
+  }
+  return PKG_OK;
+}
+
+int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging* s) {
+  VolumeConfig volume;
+  std::string text;
+  // The payload unpacks to more than its compressed size; ask for twice it.
+  uint64_t needed = reader->header().payload_size * 2;
+  int code = PMSChooseVolume(info, job_.volume, needed, &volume, &text);
+  if (code != PKG_OK) return Refuse(code, text);
+  s->id = info.getId();
+  s->record_name = PackageRegistry::NewRecordName(info.getId());
+  s->record = PackageRegistry::RecordsDir() + "/" + s->record_name;
+  s->target = KIVORootPath(volume.path + "/@appstore/" + s->record_name);
+  s->data = KIVORootPath(volume.path + "/@appdata/" + info.getId());
+  s->created_data = !KLIBCFileExist(s->data.c_str());
+  KeyValueMap installed = reader->header().info;
+  installed["install_volume"] = volume.path;
+  installed["installed_time"] = std::to_string(time(nullptr));
+  installed["installed_by"] = job_.user;
+  if (KIVOFSMkdirP(s->target.c_str()) != 0 || KIVOFSMkdirP(s->data.c_str()) != 0 ||
+      !WriteRecordMembers(reader->header(), installed, *s)) {
+    return Refuse(KLIBCErrGet() == KLIBC_ERR_NO_SPACE ? PKG_ERR_NO_SPACE : PKG_ERR_INTERNAL,
+                  "cannot prepare the package's folders");
+  }
+  PMSFaultPoint("staged");
+  std::string error;
+  const std::string id = info.getId();
+  code = reader->ReadPayload(PackageFileReader::Payload::Extract, s->target,
+                             [&id](double f) { PMSSetProgress(id, f * 0.9); }, &error);
+  if (code != PKG_OK) return Refuse(code, error);
+  PMSFaultPoint("extracted");
+  return PKG_OK;
+}
+
+int Installer::RunScriptsAndPublish(const PackageInfo& info, Staging* s) {
+  const std::string op_name = upgrade_ ? "upgrade" : "install";
+  auto env = PMSScriptEnv(info, s->record, op_name, *op_, job_.wizard, upgrade_ ? old_.getVersion() : "");
+  if (upgrade_) {
+    was_running_ = PMSIsRunning(info.getId(), old_);
+    std::string old_record = PackageRegistry::RecordDir(info.getId());
+    if (was_running_) ControlRecord(old_record, old_, "stop", *op_);
+    if (!PMSRunPackageScript(s->record, "preupgrade", "", env, *op_)) {
+      if (was_running_) ControlRecord(old_record, old_, "start", *op_);
+      return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "preupgrade failed; " + old_.getVersion() + " stays");
+    }
+  } else if (!PMSRunPackageScript(s->record, "preinst", "", env, *op_)) {
+    return Refuse(PKG_ERR_SCRIPT_FAILED, "preinst failed");
+  }
+  PMSFaultPoint("before_publish");
+  if (!PackageRegistry::Publish(info.getId(), ".records/" + s->record_name)) {
+    return Refuse(PKG_ERR_INTERNAL, "cannot publish the package record");
+  }
+  PMSFaultPoint("published");
+  if (PMSRunPackageScript(s->record, upgrade_ ? "postupgrade" : "postinst", "", env, *op_)) return PKG_OK;
+  // The new version failed its last step: put back what was there before.
+  if (upgrade_) {
+    PackageRegistry::Publish(info.getId(), old_record_);
+    if (was_running_) ControlRecord(PackageRegistry::RecordDir(info.getId()), old_, "start", *op_);
+    return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "postupgrade failed; " + old_.getVersion() + " was restored");
+  }
+  PackageRegistry::Unpublish(info.getId());
+  return Refuse(PKG_ERR_SCRIPT_FAILED, "postinst failed");
+}
+
+int Installer::Finish(const PackageInfo& info, Staging* s) {
+  s->committed = true;
+  if (job_.run_after || was_running_) {
+    if (ControlRecord(s->record, info, "start", *op_)) {
+      KIVOWriteFileAtomic(s->record + "/enabled", "", SyncToDisk::No);
+    } else {
+      op_->Log("installed, but the package did not start");
+    }
+  }
+  // The old version's record and files are no longer reachable.
+  if (upgrade_ && old_record_.compare(0, 9, ".records/") == 0) {
+    PMSRemoveTree(PackageRegistry::Dir() + "/" + old_record_);
+    if (!old_.getTarget().empty()) PMSRemoveTree(old_.getTarget());
+  }
+  PMSFaultPoint("done");
+  return PKG_OK;
+}
+
+int Installer::Run() {
+  PackageFileReader reader;
+  std::string error;
+  int code = reader.Open(job_.path, &error);
+  if (code != PKG_OK) return Refuse(code, error);
+  PackageInfo info;
+  InfoFromHeader(job_.path, reader.header(), PKG_OP_NONE, nullptr, &info);
+  id_ = info.getId();
+  code = CheckVersions(info);
+  op_.reset(new Operation(upgrade_ ? "upgrade" : "install", info.getId()));
+  if (code != PKG_OK) return code;
+  if ((code = PMSCheckPackageFits(info, PKG_ERR_NOT_SUPPORTED, message_, details_)) != PKG_OK) return code;
+  if (job_.check_codesign && (code = SignatureVerdict(reader.header(), message_)) != PKG_OK) return code;
+  Staging staging;
+  if ((code = Stage(&reader, info, &staging)) != PKG_OK) return code;
+  if ((code = RunScriptsAndPublish(info, &staging)) != PKG_OK) return code;
+  code = Finish(info, &staging);
+  (*details_)["installReboot"] = info.getBool("install_reboot");
+  return code;
+}
+
+void Installer::Report() {
+  if (!id_.empty()) PMSClearProgress(id_);
+  if (!op_) return;
+  (*details_)["workerMessage"] = op_->WorkerMessages();
+  std::string log = PMSReadPackageLog(op_->log_path());
+  if (!log.empty()) *message_ += (message_->empty() ? "" : "\n") + log;
+  unlink(op_->log_path().c_str());
+}
+
+}  // namespace
+
+bool PackageManager::queryPackageFileInfo(const std::string& path, PackageInfo& info,
+                                          PKG_INSTALLATION_TYPE type, const char* language) {
+  PackageFileReader reader;
+  std::string error;
+  result_ = reader.Open(path, &error);
+  if (result_ != PKG_OK) return false;
+  InfoFromHeader(path, reader.header(), PKG_OP_NONE, language, &info);
+  return true;
+}
+
+bool PackageManager::queryPackageFileInfoWithWizard(const std::string& path, PackageInfo& info,
+                                                    PKG_INSTALLATION_TYPE type,
+                                                    const char* language) {
+  PackageFileReader reader;
+  std::string error;
+  result_ = reader.Open(path, &error);
+  if (result_ != PKG_OK) return false;
+  PackageInfo probe(reader.header().info);
+  PKG_INSTALLATION_TYPE wizard =
+      PackageRegistry::IsInstalled(probe.getId()) ? PKG_OP_UPGRADE : PKG_OP_INSTALL;
+  InfoFromHeader(path, reader.header(), wizard, language, &info);
+  return true;
+}
+
+bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std::string& message,
+                              PKG_ERRCODE& code, Json::Value& details, PackageInfo& info) {
+  PackageFileReader reader;
+  int result = reader.Open(path, &message);
+  if (result == PKG_OK) {
+    InfoFromHeader(path, reader.header(), PKG_OP_NONE, language, &info);
+    result = reader.ReadPayload(PackageFileReader::Payload::Check, "", nullptr, &message);
+  }
+  if (result == PKG_OK) result = PMSCheckPackageFits(info, PKG_ERR_ARCH, &message, &details);
+  if (result == PKG_OK) {
+    VolumeConfig volume;
+    result = PMSChooseVolume(info, "", reader.header().payload_size * 2, &volume, &message);
+  }
+  // The signature comes last, so that a package that cannot be installed
+  // says why before it says who signed it.
+  if (result == PKG_OK) result = SignatureVerdict(reader.header(), &message);
+  code = static_cast<PKG_ERRCODE>(result);
+  return result == PKG_OK;
+}
+
+bool InstallPackageFileImpl(const std::string& user, const std::string& path,
+                            const std::string& volume, int reserved, const std::string& extraValues,
+                            bool typeFlag, const std::string& language, std::string& message,
+                            PKG_ERRCODE& code, Json::Value& details, bool force, bool checkCodesign) {
+  InstallJob job{path, volume, user, language, Json::Value(), typeFlag, force, checkCodesign};
+  details = Json::Value(Json::objectValue);
+  details["workerMessage"] = Json::Value(Json::arrayValue);
+  if (!extraValues.empty() && !WebAPIUtil::ParseJson(extraValues, job.wizard)) {
+    code = PKG_ERR_BAD_WIZARD_VALUES;
+    message = "the wizard values are not valid JSON";
+    return false;
+  }
+  PackageManager lock_holder;
+  if (!lock_holder.ExLock(kLockWaitSeconds)) {
+    code = PKG_ERR_BUSY;
+    message = PMSResultText(PKG_ERR_BUSY);
+    return false;
+  }
+  PMSRecoverLeftovers();
+  Installer installer(job, &message, &details);
+  int result = installer.Run();
+  installer.Report();
+  code = static_cast<PKG_ERRCODE>(result);
+  return result == PKG_OK;
+}

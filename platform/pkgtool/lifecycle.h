@@ -1,0 +1,48 @@
+// Pieces shared by the package tool's changing operations: the scripts'
+// environment, running one script into the operation log, progress, fault
+// injection for crash tests, and clean-up of interrupted operations.
+#pragma once
+
+#include <map>
+#include <string>
+
+#include <json/value.h>
+
+#include "pkgtool/operation.h"
+#include "pkgtool/package_info.h"
+
+// The environment a package script runs with:
+//   KIVO_PKG_NAME, KIVO_PKG_VERSION, KIVO_PKG_OPERATION (install, upgrade,
+//   uninstall, start, stop), KIVO_PKG_DEST (the installed files),
+//   KIVO_PKG_VAR (the data folder), KIVO_PKG_OLD_VERSION (upgrades),
+//   KIVO_WORKER_MSG (a file: each line is a message for the user),
+//   KIVO_WIZARD_VALUES (a file with the wizard's answers as JSON) and
+//   KIVO_WIZARD_<key> for each top-level answer that is a string, number or
+//   bool, KIVO_ROOT, PATH, LANG, HOME.
+std::map<std::string, std::string> PMSScriptEnv(const PackageInfo& info, const std::string& record,
+                                                const std::string& operation,
+                                                const Operation& op,
+                                                const Json::Value& wizard_values,
+                                                const std::string& old_version = "");
+
+// Runs `record`/scripts/`name` (missing scripts succeed) and logs how it
+// ended. True when it succeeded.
+bool PMSRunPackageScript(const std::string& record, const std::string& name,
+                         const std::string& arg, const std::map<std::string, std::string>& env,
+                         const Operation& op);
+
+// Publishes install progress of `id` (0.0 to 1.0) for PMSGetProgress.
+void PMSSetProgress(const std::string& id, double progress);
+void PMSClearProgress(const std::string& id);
+
+// Crash tests: when $KIVO_PKGTOOL_FAULT names `step`, the process kills
+// itself with SIGKILL right there, as a power cut or `kill -9` would.
+void PMSFaultPoint(const char* step);
+
+// Removes records and payload folders that no published record reaches,
+// and half-made temporary names: what an interrupted operation leaves.
+// Must run under the tool's exclusive lock.
+void PMSRecoverLeftovers();
+
+// rm -rf through the platform's exec call.
+void PMSRemoveTree(const std::string& path);

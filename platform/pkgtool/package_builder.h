@@ -1,0 +1,24 @@
+// Building and signing package files (docs/package-format.md), for package
+// authors through `kivoctl build` and `kivoctl sign`.
+#pragma once
+
+#include <string>
+
+struct BuildOptions {
+  int compression_level = 6;  // gzip level of package.tgz, 1 (fast) to 9 (small)
+};
+
+// Builds a package file at `output` from the source folder `source`:
+//   INFO                 required
+//   package/             the payload, becomes package.tgz
+//   scripts/...          preinst, postinst, ..., start-stop-status
+//   WIZARD_UIFILES/...   install_uifile[_lang], upgrade_..., uninstall_... (JSON)
+//   LICENSE, PACKAGE_ICON.PNG, PACKAGE_ICON_256.PNG
+// Returns false with `*error` telling the author exactly what is wrong.
+bool PMSBuildPackage(const std::string& source, const std::string& output,
+                     const BuildOptions& options, std::string* error);
+
+// Writes a signed copy of the package file `input` to `output` (they may be
+// the same path), signed with `key` of the GnuPG home `gnupg_home`.
+bool PMSSignPackage(const std::string& input, const std::string& output,
+                    const std::string& gnupg_home, const std::string& key, std::string* error);

@@ -1,0 +1,24 @@
+// Runs a package's scripts: in a session of their own (so a time-out kills
+// every process a script started), with a defined environment, stdin from
+// /dev/null and stdout/stderr appended to the operation log.
+#pragma once
+
+#include <map>
+#include <string>
+
+// Result of a script run: its exit status, or one of these.
+enum ScriptStatus {
+  SCRIPT_MISSING = -1,    // the package has no such script (not a failure)
+  SCRIPT_TIMED_OUT = -2,  // killed after the time limit
+  SCRIPT_NOT_RUN = -3,    // could not be started
+};
+
+// Runs `script` with the single argument `arg` (may be empty) and exactly
+// the environment `env`, waiting at most `timeout_seconds`.
+int PMSRunScript(const std::string& script, const std::string& arg,
+                 const std::map<std::string, std::string>& env, int timeout_seconds,
+                 const std::string& log_path);
+
+// The script time limit: "script_timeout" of /etc/kivo/pkgtool.conf (seconds),
+// 120 by default.
+int PMSScriptTimeout();

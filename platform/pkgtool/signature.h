@@ -1,0 +1,38 @@
+// Code signatures of package files: a detached OpenPGP signature over the
+// package's MANIFEST, checked with gpgme against the appliance keyring
+// ("/usr/kivo/etc/packages/gnupg" under the system root, the keyring the
+// code-signing script manages).
+#pragma once
+
+#include <string>
+
+// How strict the appliance is ("pkg_source_trust_level" in
+// /etc/kivoinfo.conf):
+//   0  only packages signed by a key of the appliance keyring;
+//   1  those, and unsigned packages;
+//   2  any package whose signature, if it has one, is intact (unknown and
+//      expired signers are accepted; a revoked key never is).
+enum PKG_TRUST_LEVEL { PKG_TRUST_KEYRING = 0, PKG_TRUST_UNSIGNED = 1, PKG_TRUST_ANY = 2 };
+
+// The trust level the appliance's settings name (0 when unset or unreadable).
+int PMSTrustLevel();
+
+// The outcome of checking one signature, before any trust level applies:
+// PKG_OK (good, by a key of the keyring), PKG_ERR_NO_SIGNATURE,
+// PKG_ERR_BAD_SIGNATURE (tampered, or a signature file that holds no
+// signature), PKG_ERR_UNKNOWN_SIGNER, PKG_ERR_EXPIRED_KEY,
+// PKG_ERR_REVOKED_KEY, or PKG_ERR_SIGNATURE_UNCHECKABLE.
+// `*signer` gets the key's fingerprint when one was named.
+int PMSCheckSignature(const std::string& data, const std::string& signature, std::string* signer,
+                      std::string* error);
+
+// Applies the trust level to an outcome: PKG_OK when the package may be used.
+int PMSApplyTrustLevel(int outcome, int trust_level);
+
+// Signs `data` with `key` (fingerprint, id or user id) of the keyring in
+// `gnupg_home`; *signature gets an armored detached signature.
+bool PMSSignData(const std::string& gnupg_home, const std::string& key, const std::string& data,
+                 std::string* signature, std::string* error);
+
+// The appliance keyring's folder.
+std::string PMSKeyringHome();

@@ -1,0 +1,79 @@
+#include "storage/storage_config.h"
+
+#include <sys/statvfs.h>
+
+#include <cstdio>
+
+#include "klibc/key_value_file.h"
+#include "klibc/sysroot.h"
+#include "settings/web_utils.h"
+
+std::vector<VolumeConfig> KIVOVolumesLoad() {
+  std::vector<VolumeConfig> volumes;
+  Json::Value list;
+  if (!WebUtils::LoadJsonFile(KIVORootPath("/etc/kivo/volumes.json"), list) || !list.isArray()) {
+    return volumes;
+  }
+  for (const Json::Value& v : list) {
+    if (!v.isObject() || !v["path"].isString()) continue;
+    VolumeConfig volume;
+    volume.path = v["path"].asString();
+    if (volume.path.empty() || volume.path[0] != '/' || volume.path.find("..") != std::string::npos) {
+      continue;
+    }
+    volume.status = v["status"].isString() ? v["status"].asString() : "normal";
+    volume.cap_bytes = v["cap_bytes"].isUInt64() ? v["cap_bytes"].asUInt64() : 0;
+    volume.brick = v["brick"].isBool() && v["brick"].asBool();
+    volumes.push_back(volume);
+  }
+  return volumes;
+}
+
+bool KIVOVolumeFind(const std::string& path, VolumeConfig* out) {
+  for (const VolumeConfig& v : KIVOVolumesLoad()) {
+    if (path == v.path || path.compare(0, v.path.size() + 1, v.path + "/") == 0) {
+      *out = v;
+      return true;
+    }
+  }
+  return false;
+}
+
+int64_t KIVOVolumeFreeBytes(const VolumeConfig& volume) {
+  struct statvfs st;
+  if (statvfs(KIVORootPath(volume.path).c_str(), &st) != 0) return -1;
+  uint64_t free_bytes = static_cast<uint64_t>(st.f_bavail) * st.f_frsize;
+  if (volume.cap_bytes > 0 && volume.cap_bytes < free_bytes) free_bytes = volume.cap_bytes;
+  return static_cast<int64_t>(free_bytes);
+}
+
+DeviceInfo KIVODeviceLoad() {
+  DeviceInfo device;
+  KeyValueMap conf;
+  if (!KIVOKeyValueLoad(KIVORootPath("/etc/kivo/device.conf"), &conf)) return device;
+  if (!conf["os_version"].empty()) device.os_version = conf["os_version"];
+  if (!conf["arch"].empty()) device.arch = conf["arch"];
+  if (!conf["kind"].empty()) device.kind = conf["kind"];
+  return device;
+}
+
+bool KIVOServiceRunning(const std::string& name) {
+  KeyValueMap conf;
+  return KIVOKeyValueLoad(KIVORootPath("/etc/kivo/services.conf"), &conf) &&
+         conf[name] == "running";
+}
+
+bool KIVOParseOSVersion(const std::string& text, int* major, int* minor, int* build) {
+  char tail;
+  return sscanf(text.c_str(), "%d.%d-%d%c", major, minor, build, &tail) == 3;
+}
+
+int KIVOCompareOSVersion(const std::string& a, const std::string& b) {
+  int a1 = 0, a2 = 0, a3 = 0, b1 = 0, b2 = 0, b3 = 0;
+  KIVOParseOSVersion(a, &a1, &a2, &a3);
+  KIVOParseOSVersion(b, &b1, &b2, &b3);
+  if (a1 != b1) return a1 < b1 ? -1 : 1;
+  if (a2 != b2) return a2 < b2 ? -1 : 1;
+  if (a3 != b3) return a3 < b3 ? -1 : 1;
+  return 0;
+}

@@ -1,0 +1,50 @@
+// The appliance's storage, device and system services as configured under
+// the system root. They stand in for the storage manager and the service
+// manager, which are not part of the package center:
+//
+//   /etc/kivo/volumes.json  [{"path": "/volume1", "status": "normal",
+//                             "cap_bytes": 0, "brick": false}, ...]
+//   /etc/kivo/device.conf   os_version="7.2-0064" arch="x86_64" kind="nas"
+//   /etc/kivo/services.conf pgsql="running" web="running" ssh="stopped"
+//
+// Free space is the real statvfs figure of the volume's folder, capped at
+// "cap_bytes" when that is above 0 (so that a full volume can be produced on
+// purpose).
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+struct VolumeConfig {
+  std::string path;    // "/volume1", as the appliance names it
+  std::string status;  // "normal", "degraded", "crashed", ...
+  uint64_t cap_bytes = 0;
+  bool brick = false;  // serves as a cluster file system brick
+
+  bool usable() const { return status == "normal" || status == "degraded"; }
+};
+
+// Every configured volume, in file order. Empty when the file is missing
+// or unreadable.
+std::vector<VolumeConfig> KIVOVolumesLoad();
+// The volume whose path is `path` or holds it ("/volume1/x" -> "/volume1").
+bool KIVOVolumeFind(const std::string& path, VolumeConfig* out);
+// Free bytes of the volume (statvfs of its folder under the root, capped).
+// -1 when the folder cannot be measured.
+int64_t KIVOVolumeFreeBytes(const VolumeConfig& volume);
+
+struct DeviceInfo {
+  std::string os_version = "7.2-0064";
+  std::string arch = "x86_64";
+  std::string kind = "nas";  // "nas", or "tinbox" for the single-volume device
+};
+DeviceInfo KIVODeviceLoad();
+
+// True when the system service `name` is running (services.conf says "running").
+bool KIVOServiceRunning(const std::string& name);
+
+// "7.2-0064" -> 7, 2, 64. False when malformed.
+bool KIVOParseOSVersion(const std::string& text, int* major, int* minor, int* build);
+// <0, 0, >0 comparing two OS versions as (major, minor, build).
+int KIVOCompareOSVersion(const std::string& a, const std::string& b);

@@ -1,0 +1,203 @@
+#include "tools/kivoctl/package_commands.h"
+
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <iostream>
+
+#include <json/writer.h>
+
+#include "pkgtool/package_builder.h"
+#include "pkgtool/package_file.h"
+#include "pkgtool/package_manager.h"
+#include "pkgtool/package_state.h"
+#include "pkgtool/signature.h"
+#include "webapi/webapi_util.h"
+
+namespace {
+
+int Fail(const std::string& message, int /*code*/ = 1) {
+  std::cerr << "kivoctl: " << message << "\n";
+  return 1;
+}
+
+// The value following option `name`, or `def`.
+std::string Option(const std::vector<std::string>& args, const std::string& name,
+                   const std::string& def = "") {
+  for (size_t i = 0; i + 1 < args.size(); ++i) {
+    if (args[i] == name) return args[i + 1];
+  }
+  return def;
+}
+
+bool Flag(const std::vector<std::string>& args, const std::string& name) {
+  for (const std::string& a : args) {
+    if (a == name) return true;
+  }
+  return false;
+}
+
+// Positional arguments: those that are not options or option values.
+std::vector<std::string> Positional(const std::vector<std::string>& args,
+                                    const std::vector<std::string>& with_value) {
+  std::vector<std::string> out;
+  for (size_t i = 0; i < args.size(); ++i) {
+    if (std::find(with_value.begin(), with_value.end(), args[i]) != with_value.end()) {
+      ++i;
+    } else if (args[i].compare(0, 2, "--") != 0) {
+      out.push_back(args[i]);
+    }
+  }
+  return out;
+}
+
+void PrintJson(const Json::Value& value) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "  ";
+  std::cout << Json::writeString(builder, value) << "\n";
+}
+
+// Prints and deletes an operation's log, prints its worker messages.
+int Report(PackageManager& pm, bool ok, const std::string& what) {
+  std::string log = PMSReadPackageLog(pm.getLogFilePath());
+  if (!log.empty()) std::cerr << log;
+  if (!pm.getLogFilePath().empty()) unlink(pm.getLogFilePath().c_str());
+  for (const Json::Value& m : pm.getJsonParam("worker_msg")) std::cout << m.asString() << "\n";
+  if (ok) return 0;
+  std::string detail = pm.getMapParam("deppkg");
+  return Fail(what + ": " + PMSResultText(pm.getResult()) + (detail.empty() ? "" : " (" + detail + ")") +
+                  " [" + std::to_string(pm.getResult()) + "]",
+              pm.getResult());
+}
+
+int Usage(const std::string& usage) {
+  std::cerr << "kivoctl: " << usage << "\n";
+  return 2;
+}
+
+}  // namespace
+
+int KivoctlBuild(const std::vector<std::string>& args) {
+  std::vector<std::string> pos = Positional(args, {"--level"});
+  if (pos.size() != 2) return Usage("kivoctl build SOURCE-FOLDER OUTPUT.kpk [--level 1-9]");
+  BuildOptions options;
+  options.compression_level = std::atoi(Option(args, "--level", "6").c_str());
+  if (options.compression_level < 1 || options.compression_level > 9) return Fail("--level takes 1 to 9");
+  std::string error;
+  if (!PMSBuildPackage(pos[0], pos[1], options, &error)) return Fail(pos[0] + ": " + error);
+  std::cout << "built " << pos[1] << "\n";
+  return 0;
+}
+
+int KivoctlSign(const std::vector<std::string>& args) {
+  std::vector<std::string> pos = Positional(args, {"--homedir", "--key", "--output"});
+  std::string home = Option(args, "--homedir"), key = Option(args, "--key");
+  if (pos.size() != 1 || home.empty() || key.empty()) {
+    return Usage("kivoctl sign FILE.kpk --homedir GNUPGHOME --key KEY [--output OUT.kpk]");
+  }
+  std::string error;
+  std::string output = Option(args, "--output", pos[0]);
+  if (!PMSSignPackage(pos[0], output, home, key, &error)) return Fail(error);
+  std::cout << "signed " << output << "\n";
+  return 0;
+}
+
+int KivoctlInspect(const std::vector<std::string>& args) {
+  if (args.size() != 1) return Usage("kivoctl inspect FILE.kpk");
+  PackageFileReader reader;
+  std::string error;
+  int code = reader.Open(args[0], &error);
+  if (code != PKG_OK) return Fail(args[0] + ": " + error, code);
+  Json::Value out(Json::objectValue);
+  for (const auto& kv : reader.header().info) out["info"][kv.first] = kv.second;
+  out["members"] = Json::Value(Json::arrayValue);
+  for (const auto& d : reader.header().digests) out["members"].append(d.first);
+  std::string signer, sig_error;
+  int outcome = PMSCheckSignature(reader.header().manifest, reader.header().signature, &signer, &sig_error);
+  out["signature"]["result"] = outcome;
+  out["signature"]["text"] = PMSResultText(outcome);
+  if (!signer.empty()) out["signature"]["key"] = signer;
+  code = reader.ReadPayload(PackageFileReader::Payload::Check, "", nullptr, &error);
+  out["payload"] = code == PKG_OK ? "intact" : error;
+  PrintJson(out);
+  return code;
+}
+
+int KivoctlInstall(const std::vector<std::string>& args) {
+  std::vector<std::string> pos = Positional(args, {"--volume", "--wizard"});
+  if (pos.size() != 1) {
+    return Usage("kivoctl install FILE.kpk [--volume /volumeN] [--wizard JSON] [--run] "
+                "[--no-codesign] [--no-force]");
+  }
+  std::string message;
+  PKG_ERRCODE code = PKG_OK;
+  Json::Value details;
+  const char* user = getenv("USER");
+  bool ok = InstallPackageFileImpl(user ? user : "root", pos[0], Option(args, "--volume"), 0,
+                                   Option(args, "--wizard"), Flag(args, "--run"), "enu", message,
+                                   code, details, !Flag(args, "--no-force"),
+                                   !Flag(args, "--no-codesign"));
+  if (!message.empty()) std::cerr << message << (message.back() == '\n' ? "" : "\n");
+  for (const Json::Value& m : details["workerMessage"]) std::cout << m.asString() << "\n";
+  if (!ok) return Fail(pos[0] + ": " + PMSResultText(code) + " [" + std::to_string(code) + "]", code);
+  std::cout << "installed " << pos[0] << "\n";
+  return 0;
+}
+
+int KivoctlUninstall(const std::vector<std::string>& args) {
+  std::vector<std::string> pos = Positional(args, {"--wizard"});
+  if (pos.size() != 1) return Usage("kivoctl uninstall ID [--wizard JSON]");
+  Json::Value wizard;
+  std::string text = Option(args, "--wizard");
+  if (!text.empty() && !WebAPIUtil::ParseJson(text, wizard)) return Fail("--wizard is not JSON");
+  PackageManager pm;
+  if (!pm.init()) return Fail("the package registry cannot be read", pm.getResult());
+  return Report(pm, pm.uninstall(pos[0], &wizard, "enu", PKG_OP_UNINSTALL, false, "root"),
+                "uninstall " + pos[0]);
+}
+
+int KivoctlStartStop(const std::vector<std::string>& args, bool start) {
+  if (args.size() != 1) return Usage(std::string("usage: kivoctl ") + (start ? "start" : "stop") + " ID");
+  PackageManager pm;
+  if (!pm.init()) return Fail("the package registry cannot be read", pm.getResult());
+  bool ok = pm.serviceControl(start ? PKG_OP_START : PKG_OP_STOP, args[0], start, "enu", "root",
+                              nullptr, true, true);
+  return Report(pm, ok, std::string(start ? "start " : "stop ") + args[0]);
+}
+
+int KivoctlStatus(const std::vector<std::string>& args) {
+  if (args.size() != 1) return Usage("kivoctl status ID");
+  PackageManager pm;
+  PackageInfo info;
+  if (!pm.init() || !pm.getPackageInfo(args[0], info)) {
+    return Fail(args[0] + ": " + PMSResultText(pm.getResult()), pm.getResult());
+  }
+  bool running = false;
+  pm.getServiceStatus(info, running, true);
+  std::cout << args[0] << " " << info.getVersion() << " " << (running ? "running" : "stopped") << "\n";
+  return 0;
+}
+
+int KivoctlList(const std::vector<std::string>& args) {
+  PackageManager pm;
+  if (!pm.init()) return Fail("the package registry cannot be read", pm.getResult());
+  for (const std::string& id : pm.enumPackages()) {
+    PackageInfo info;
+    bool running = false;
+    pm.getPackageInfo(id, info);
+    pm.getServiceStatus(info, running, true);
+    std::cout << id << " " << info.getVersion() << " " << (running ? "running" : "stopped") << "\n";
+  }
+  return 0;
+}
+
+int KivoctlLog(const std::vector<std::string>& args) {
+  if (args.size() != 1) return Usage("kivoctl log ID");
+  PackageManager pm;
+  pm.init();
+  std::string path = pm.getPackageLog(args[0]);
+  if (pm.getResult() == PKG_ERR_NOT_INSTALLED) return Fail(args[0] + " is not installed", pm.getResult());
+  std::cout << (path.empty() ? "" : PMSReadPackageLog(path));
+  return 0;
+}
