@@ -166,8 +166,7 @@ int Installer::CheckVersions(const PackageInfo& info) {
 int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging* s) {
   VolumeConfig volume;
   std::string text;
-  // The payload unpacks to more than its compressed size; ask for twice it.
-  uint64_t needed = reader->header().payload_size * 2;
+  uint64_t needed = PMSNeededBytes(info, reader->header().payload_size);
   int code = PMSChooseVolume(info, job_.volume, needed, &volume, &text);
   if (code != PKG_OK) return Refuse(code, text);
   s->id = info.getId();
@@ -310,7 +309,8 @@ bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std
   if (result == PKG_OK) result = PMSCheckPackageFits(info, PKG_ERR_ARCH, &message, &details);
   if (result == PKG_OK) {
     VolumeConfig volume;
-    result = PMSChooseVolume(info, "", reader.header().payload_size * 2, &volume, &message);
+    result = PMSChooseVolume(info, "", PMSNeededBytes(info, reader.header().payload_size), &volume,
+                             &message);
   }
   // The signature comes last, so that a package that cannot be installed
   // says why before it says who signed it.

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdlib>
 
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
@@ -89,6 +90,11 @@ int PMSCheckPackageFits(const PackageInfo& info, int arch_code, std::string* mes
   return PKG_OK;
 }
 
+uint64_t PMSNeededBytes(const PackageInfo& info, uint64_t payload_size) {
+  uint64_t kib = std::strtoull(info.get("extractsize").c_str(), nullptr, 10);
+  return kib > 0 ? kib * 1024 : payload_size * 2;
+}
+
 int PMSChooseVolume(const PackageInfo& info, const std::string& requested, uint64_t needed_bytes,
                     VolumeConfig* out, std::string* message) {
   std::string wanted = requested;
@@ -98,11 +104,12 @@ int PMSChooseVolume(const PackageInfo& info, const std::string& requested, uint6
   if (!wanted.empty()) {
     found = KIVOVolumeFind(wanted, out);
   } else {
+    // The first usable volume; failing that, a crashed one, so the answer
+    // says why there is nowhere to install.
     for (const VolumeConfig& v : KIVOVolumesLoad()) {
-      if (v.usable()) {
+      if (!found || (v.usable() && !out->usable())) {
         *out = v;
         found = true;
-        break;
       }
     }
   }

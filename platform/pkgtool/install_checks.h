@@ -17,6 +17,10 @@
 int PMSCheckPackageFits(const PackageInfo& info, int arch_code, std::string* message,
                         Json::Value* details);
 
+// The room an install of `info` needs: its INFO "extractsize" (KiB, which
+// the builder records), or twice the compressed payload when it has none.
+uint64_t PMSNeededBytes(const PackageInfo& info, uint64_t payload_size);
+
 // Picks the volume to install `info` on: `requested` when given, else the
 // volume of the installed version, else the default volume, else the first
 // usable one. Returns PKG_OK, 297 (none), 296 (crashed) or 279 (too little

@@ -218,6 +218,18 @@ bool ExtractRawPayload(const std::string& input, const std::string& payload_path
   return ok;
 }
 
+// Bytes of the regular files below `dir`.
+uint64_t TreeBytes(const std::string& dir) {
+  std::vector<std::string> paths;
+  ListTree(dir, "", &paths);
+  uint64_t total = 0;
+  for (const std::string& path : paths) {
+    struct stat st;
+    if (lstat((dir + "/" + path).c_str(), &st) == 0 && S_ISREG(st.st_mode)) total += st.st_size;
+  }
+  return total;
+}
+
 }  // namespace
 
 bool PMSBuildPackage(const std::string& source, const std::string& output,
@@ -228,9 +240,34 @@ bool PMSBuildPackage(const std::string& source, const std::string& output,
   if (stat((source + "/package").c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
     return Fail(error, "the package source has no package/ folder (the payload)");
   }
+  // The installer needs to know the room the payload takes unpacked.
+  if (!KIVOKeyValueParse(members["INFO"]).count("extractsize")) {
+    uint64_t kib = (TreeBytes(source + "/package") + 1023) / 1024;
+    members["INFO"] += KIVOKeyValueLine("extractsize", std::to_string(kib)) + "\n";
+  }
   std::string payload = output + ".payload";
   bool ok = WritePayload(source + "/package", payload, options.compression_level, error) &&
-            WriteOuter(output, members, MakeManifest(members, FileDigest(payload)), "", payload, error);
+            PMSWritePackage(members, payload, "", output, error);
+  unlink(payload.c_str());
+  return ok;
+}
+
+bool PMSWritePackage(const std::map<std::string, std::string>& members,
+                     const std::string& payload_path, const std::string& signature,
+                     const std::string& output, std::string* error) {
+  if (!members.count("INFO")) return Fail(error, "no INFO member");
+  return WriteOuter(output, members, MakeManifest(members, FileDigest(payload_path)), signature,
+                    payload_path, error);
+}
+
+bool PMSAttachSignature(const std::string& input, const std::string& output,
+                        const std::string& signature, std::string* error) {
+  PackageFileReader reader;
+  if (reader.Open(input, error) != 0) return false;
+  std::string payload = output + ".payload";
+  bool ok = ExtractRawPayload(input, payload) || Fail(error, "cannot read the payload of " + input);
+  ok = ok && WriteOuter(output, reader.header().members, reader.header().manifest, signature,
+                        payload, error);
   unlink(payload.c_str());
   return ok;
 }
@@ -240,12 +277,6 @@ bool PMSSignPackage(const std::string& input, const std::string& output,
   PackageFileReader reader;
   if (reader.Open(input, error) != 0) return false;
   std::string signature;
-  if (!PMSSignData(gnupg_home, key, reader.header().manifest, &signature, error)) return false;
-  std::string payload = output + ".payload";
-  bool ok = ExtractRawPayload(input, payload) ||
-            Fail(error, "cannot read the payload of " + input);
-  ok = ok && WriteOuter(output, reader.header().members, reader.header().manifest, signature,
-                        payload, error);
-  unlink(payload.c_str());
-  return ok;
+  return PMSSignData(gnupg_home, key, reader.header().manifest, &signature, error) &&
+         PMSAttachSignature(input, output, signature, error);
 }

@@ -2,6 +2,7 @@
 // authors through `kivoctl build` and `kivoctl sign`.
 #pragma once
 
+#include <map>
 #include <string>
 
 struct BuildOptions {
@@ -18,7 +19,19 @@ struct BuildOptions {
 bool PMSBuildPackage(const std::string& source, const std::string& output,
                      const BuildOptions& options, std::string* error);
 
+// Writes a package file from its parts: `members` (INFO and the other
+// non-payload members, by name) and an existing package.tgz. MANIFEST is
+// computed; `signature` ("" for none) is stored as signature.asc as given.
+bool PMSWritePackage(const std::map<std::string, std::string>& members,
+                     const std::string& payload_path, const std::string& signature,
+                     const std::string& output, std::string* error);
+
 // Writes a signed copy of the package file `input` to `output` (they may be
 // the same path), signed with `key` of the GnuPG home `gnupg_home`.
 bool PMSSignPackage(const std::string& input, const std::string& output,
                     const std::string& gnupg_home, const std::string& key, std::string* error);
+
+// Like PMSSignPackage with a detached signature made elsewhere (over the
+// package's MANIFEST, which `kivoctl inspect` shows).
+bool PMSAttachSignature(const std::string& input, const std::string& output,
+                        const std::string& signature, std::string* error);

@@ -93,11 +93,13 @@ struct PayloadSource {
   std::vector<char> buffer = std::vector<char>(256 << 10);
   const std::function<void(double)>* progress;
   double reported = 0;
+  bool failed = false;  // the package file itself ended early or could not be read
 };
 
 la_ssize_t ReadPayloadBlock(struct archive*, void* data, const void** block) {
   auto* src = static_cast<PayloadSource*>(data);
   la_ssize_t n = archive_read_data(src->outer, src->buffer.data(), src->buffer.size());
+  if (n < 0) src->failed = true;
   if (n > 0) {
     src->sha->Update(src->buffer.data(), static_cast<size_t>(n));
     src->done += static_cast<uint64_t>(n);
@@ -328,14 +330,17 @@ int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
     code = Fail(error, PKG_ERR_EXTRACT, std::string("payload damaged: ") + archive_error_string(in));
   }
   archive_read_free(in);
-  if (code != PKG_OK) return code;
-  // The digest covers every byte of package.tgz, also any after the tar's end.
+  // The digest covers every byte of package.tgz, also any after the tar's
+  // end, and it decides first: a payload that is not the one MANIFEST names
+  // has been tampered with, whatever else is wrong with it.
   const void* rest;
   while (ReadPayloadBlock(nullptr, &src, &rest) > 0) {
   }
+  if (src.failed) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "the package file is truncated or damaged");
   if (sha.FinishHex() != header_.digests[kPayload]) {
     return Fail(error, PKG_ERR_BAD_SIGNATURE, "package.tgz does not match MANIFEST");
   }
+  if (code != PKG_OK) return code;
   if (progress) progress(1.0);
   return PKG_OK;
 }

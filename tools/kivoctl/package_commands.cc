@@ -72,7 +72,7 @@ int Report(PackageManager& pm, bool ok, const std::string& what) {
 }
 
 int Usage(const std::string& usage) {
-  std::cerr << "kivoctl: " << usage << "\n";
+  std::cerr << "kivoctl: usage: " << usage << "\n";
   return 2;
 }
 
@@ -158,7 +158,7 @@ int KivoctlUninstall(const std::vector<std::string>& args) {
 }
 
 int KivoctlStartStop(const std::vector<std::string>& args, bool start) {
-  if (args.size() != 1) return Usage(std::string("usage: kivoctl ") + (start ? "start" : "stop") + " ID");
+  if (args.size() != 1) return Usage(std::string("kivoctl ") + (start ? "start" : "stop") + " ID");
   PackageManager pm;
   if (!pm.init()) return Fail("the package registry cannot be read", pm.getResult());
   bool ok = pm.serviceControl(start ? PKG_OP_START : PKG_OP_STOP, args[0], start, "enu", "root",

@@ -1,0 +1,27 @@
+// OpenPGP keys for signature tests, made with the gpg command in a folder
+// of the test's own: good, expired and revoked publisher keys.
+#pragma once
+
+#include <string>
+
+class TestKeys {
+ public:
+  // Makes a GnuPG home in `dir`.
+  explicit TestKeys(const std::string& dir);
+
+  // Creates a signing key for `uid`; with `expired` it was valid for one day
+  // in 2020. Returns its fingerprint.
+  std::string Create(const std::string& uid, bool expired = false);
+  // Revokes `fpr` (its revocation certificate, imported here and exported
+  // to the appliance keyring by Trust).
+  void Revoke(const std::string& fpr);
+  // Imports the public key (and any revocation) into the system root's keyring.
+  void Trust(const std::string& fpr) const;
+  // Signs the package file in place with `fpr`, as `kivoctl sign` does;
+  // expired keys sign at a time they were valid.
+  void Sign(const std::string& package, const std::string& fpr, bool expired = false) const;
+  const std::string& home() const { return home_; }
+
+ private:
+  std::string home_;
+};

@@ -1,0 +1,39 @@
+// Package files for tests, built by the project's own builder from sources
+// the test describes: INFO keys, scripts, payload files, wizards.
+#pragma once
+
+#include <map>
+#include <string>
+#include <vector>
+
+struct TestPackage {
+  std::string id = "test-app";
+  std::string version = "1.0";
+  std::map<std::string, std::string> info;     // further INFO keys
+  std::map<std::string, std::string> scripts;  // name -> shell body (after #!/bin/sh)
+  std::map<std::string, std::string> files;    // payload path -> content
+  std::map<std::string, std::string> members;  // other members (WIZARD_UIFILES/..., LICENSE)
+  bool daemon = true;                          // a service tracked by a pid file
+
+  // Builds it into `dir` and returns the package file's path.
+  std::string Build(const std::string& dir) const;
+};
+
+// A package whose payload is written entry by entry with libarchive, so a
+// test can put in what the builder never would (escaping paths, devices,
+// hard links, setuid files). Entries: {path, type, mode, link target}.
+struct RawEntry {
+  std::string path;
+  char type;  // 'f' file, 'd' folder, 'l' symlink, 'h' hard link, 'c' character device
+  unsigned mode;
+  std::string target;
+};
+std::string BuildRawPackage(const std::string& dir, const std::string& id,
+                            const std::vector<RawEntry>& entries);
+
+// Runs a program and returns its exit status; stdout and stderr into *out.
+int RunProgram(const std::vector<std::string>& argv, std::string* out,
+               const std::map<std::string, std::string>& extra_env = {});
+// Runs build/bin/kivoctl with `args` in the current KIVO_ROOT.
+int Kivoctl(const std::vector<std::string>& args, std::string* out = nullptr,
+            const std::map<std::string, std::string>& extra_env = {});
