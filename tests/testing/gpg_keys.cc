@@ -30,7 +30,7 @@ std::string TestKeys::Create(const std::string& uid, bool expired) {
   std::string out;
   EXPECT_EQ(0, RunProgram(args, &out)) << out;
   EXPECT_EQ(0, RunProgram({"sh", "-c", "gpg --homedir '" + home_ + "' --batch --with-colons --list-keys '" +
-                                           uid + "' | awk -F: '/^fpr/ {print $10; exit}'"},
+                                           uid + "' 2>/dev/null | awk -F: '/^fpr/ {print $10; exit}'"},
                           &out));
   return Trim(out);
 }
