@@ -16,6 +16,7 @@
 #include "pkgtool/install_checks.h"
 #include "pkgtool/lifecycle.h"
 #include "pkgtool/package_file.h"
+#include "pkgtool/package_file_ops.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
@@ -272,33 +273,23 @@ void Installer::Report() {
   unlink(op_->log_path().c_str());
 }
 
-}  // namespace
-
-bool PackageManager::queryPackageFileInfo(const std::string& path, PackageInfo& info,
-                                          PKG_INSTALLATION_TYPE type, const char* language) {
+// The record of a package file; with the wizard, the install wizard (or the
+// upgrade wizard when the package is installed) in `language`.
+int QueryFile(const std::string& path, PackageInfo& info, bool with_wizard, const char* language) {
   PackageFileReader reader;
   std::string error;
-  result_ = reader.Open(path, &error);
-  if (result_ != PKG_OK) return false;
-  InfoFromHeader(path, reader.header(), PKG_OP_NONE, language, &info);
-  return true;
-}
-
-bool PackageManager::queryPackageFileInfoWithWizard(const std::string& path, PackageInfo& info,
-                                                    PKG_INSTALLATION_TYPE type,
-                                                    const char* language) {
-  PackageFileReader reader;
-  std::string error;
-  result_ = reader.Open(path, &error);
-  if (result_ != PKG_OK) return false;
-  PackageInfo probe(reader.header().info);
-  PKG_INSTALLATION_TYPE wizard =
-      PackageRegistry::IsInstalled(probe.getId()) ? PKG_OP_UPGRADE : PKG_OP_INSTALL;
+  int result = reader.Open(path, &error);
+  if (result != PKG_OK) return result;
+  PKG_INSTALLATION_TYPE wizard = PKG_OP_NONE;
+  if (with_wizard) {
+    bool installed = PackageRegistry::IsInstalled(PackageInfo(reader.header().info).getId());
+    wizard = installed ? PKG_OP_UPGRADE : PKG_OP_INSTALL;
+  }
   InfoFromHeader(path, reader.header(), wizard, language, &info);
-  return true;
+  return PKG_OK;
 }
 
-bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std::string& message,
+bool CheckFile(const char* language, const std::string& path, std::string& message,
                               PKG_ERRCODE& code, Json::Value& details, PackageInfo& info) {
   PackageFileReader reader;
   int result = reader.Open(path, &message);
@@ -319,10 +310,10 @@ bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std
   return result == PKG_OK;
 }
 
-bool InstallPackageFileImpl(const std::string& user, const std::string& path,
-                            const std::string& volume, int reserved, const std::string& extraValues,
-                            bool typeFlag, const std::string& language, std::string& message,
-                            PKG_ERRCODE& code, Json::Value& details, bool force, bool checkCodesign) {
+bool InstallFile(const std::string& user, const std::string& path, const std::string& volume,
+                 int reserved, const std::string& extraValues, bool typeFlag,
+                 const std::string& language, std::string& message, PKG_ERRCODE& code,
+                 Json::Value& details, bool force, bool checkCodesign) {
   InstallJob job{path, volume, user, language, Json::Value(), typeFlag, force, checkCodesign};
   details = Json::Value(Json::objectValue);
   details["workerMessage"] = Json::Value(Json::arrayValue);
@@ -343,4 +334,12 @@ bool InstallPackageFileImpl(const std::string& user, const std::string& path,
   installer.Report();
   code = static_cast<PKG_ERRCODE>(result);
   return result == PKG_OK;
+}
+
+const PackageFileOps kOps = {QueryFile, CheckFile, InstallFile};
+
+}  // namespace
+
+extern "C" __attribute__((visibility("default"))) const PackageFileOps* KivoPackageFileOps() {
+  return &kOps;
 }

@@ -6,12 +6,15 @@
 
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
-#include "settings/web_utils.h"
+#include "klibc/atomic_file.h"
+#include "webapi/webapi_util.h"
 
 std::vector<VolumeConfig> KIVOVolumesLoad() {
   std::vector<VolumeConfig> volumes;
   Json::Value list;
-  if (!WebUtils::LoadJsonFile(KIVORootPath("/etc/kivo/volumes.json"), list) || !list.isArray()) {
+  std::string text;
+  if (!KIVOReadFile(KIVORootPath("/etc/kivo/volumes.json"), &text, 1 << 20) ||
+      !WebAPIUtil::ParseJson(text, list) || !list.isArray()) {
     return volumes;
   }
   for (const Json::Value& v : list) {
