@@ -1,0 +1,137 @@
+// Installs a package whose payload is generated files of mixed sizes
+// (default 1 GiB) and prints the time next to `tar -xzf` of the very same
+// package.tgz into the same volume, and the package tool's peak memory.
+//
+//   install_bench [payload MiB]
+
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstring>
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+#include <vector>
+
+#include "klibc/atomic_file.h"
+#include "pkgtool/package_builder.h"
+#include "testing/temp_root.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+double Seconds(Clock::time_point since) {
+  return std::chrono::duration<double>(Clock::now() - since).count();
+}
+
+// Half of each file is random bytes (media-like, incompressible), half text.
+void WriteFile(const std::string& path, size_t size, uint64_t* seed) {
+  std::vector<char> buf(size);
+  for (size_t i = 0; i < size / 2; i += 8) {
+    *seed ^= *seed << 13;
+    *seed ^= *seed >> 7;
+    *seed ^= *seed << 17;
+    memcpy(&buf[i], seed, std::min<size_t>(8, size / 2 - i));
+  }
+  static const char kText[] = "The quick brown fox jumps over the lazy dog 0123456789.\n";
+  for (size_t i = size / 2; i < size; ++i) buf[i] = kText[i % (sizeof(kText) - 1)];
+  KIVOWriteFileAtomic(path, std::string(buf.data(), size), SyncToDisk::No);
+}
+
+// Mixed sizes: many small files, some medium ones, a few large ones.
+uint64_t GeneratePayload(const std::string& dir, uint64_t total) {
+  uint64_t written = 0, seed = 88172645463325252ull;
+  int n = 0;
+  const size_t kSizes[] = {4 << 10, 16 << 10, 64 << 10, 1 << 20, 4 << 20, 32 << 20};
+  while (written < total) {
+    size_t size = kSizes[n % 6];
+    if (written + size > total) size = total - written;
+    std::string sub = dir + "/d" + std::to_string(n % 37);
+    KIVOFSMkdirP(sub.c_str());
+    WriteFile(sub + "/f" + std::to_string(n), size, &seed);
+    written += size;
+    ++n;
+  }
+  return written;
+}
+
+// Runs a command, returns seconds taken and the peak RSS in KiB.
+double Run(const std::vector<std::string>& argv, long* peak_kib) {
+  Clock::time_point start = Clock::now();
+  pid_t pid = fork();
+  if (pid == 0) {
+    int null = open("/dev/null", O_WRONLY);
+    dup2(null, STDOUT_FILENO);
+    std::vector<char*> args;
+    for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+    args.push_back(nullptr);
+    execvp(args[0], args.data());
+    _exit(127);
+  }
+  int status = 0;
+  struct rusage usage;
+  wait4(pid, &status, 0, &usage);
+  if (peak_kib) *peak_kib = usage.ru_maxrss;
+  if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
+    fprintf(stderr, "%s failed\n", argv[0].c_str());
+    exit(1);
+  }
+  return Seconds(start);
+}
+
+std::string SelfDir() {
+  char exe[4096];
+  ssize_t n = readlink("/proc/self/exe", exe, sizeof(exe) - 1);
+  std::string path(exe, n > 0 ? static_cast<size_t>(n) : 0);
+  return path.substr(0, path.rfind('/'));
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  uint64_t mib = argc > 1 ? std::strtoull(argv[1], nullptr, 10) : 1024;
+  setenv("KIVO_BUILD_DIR", (SelfDir() + "/..").c_str(), 0);
+  TempRoot root;
+  KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+  std::string src = root.Path("/tmp/src");
+  KIVOFSMkdirP((src + "/package").c_str());
+  KIVOWriteFileAtomic(src + "/INFO", "package=\"bench-payload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
+  Clock::time_point t = Clock::now();
+  uint64_t bytes = GeneratePayload(src + "/package", mib << 20);
+  printf("payload: %.0f MiB in generated files (%.1f s)\n", bytes / 1048576.0, Seconds(t));
+
+  std::string pkg = root.Path("/tmp/bench.kpk"), error;
+  BuildOptions options;
+  options.compression_level = 1;
+  t = Clock::now();
+  if (!PMSBuildPackage(src, pkg, options, &error)) {
+    fprintf(stderr, "build failed: %s\n", error.c_str());
+    return 1;
+  }
+  printf("package built with gzip level 1 (%.1f s)\n", Seconds(t));
+  std::string work = root.Path("/tmp/work");
+  KIVOFSMkdirP(work.c_str());
+  Run({"tar", "-xf", pkg, "-C", work, "package.tgz"}, nullptr);
+  Run({"rm", "-rf", src}, nullptr);
+  Run({"cat", pkg, work + "/package.tgz"}, nullptr);  // both start from the page cache
+
+  std::string tar_target = root.Path("/volume1/tar-target");
+  KIVOFSMkdirP(tar_target.c_str());
+  long tar_kib = 0, tool_kib = 0;
+  double tar_s = Run({"tar", "-xzf", work + "/package.tgz", "-C", tar_target}, &tar_kib);
+  Run({"rm", "-rf", tar_target}, nullptr);
+  Run({"sync"}, nullptr);
+  double tool_s = Run({BuildDir() + "/bin/kivoctl", "install", pkg}, &tool_kib);
+
+  printf("%-28s %8s %10s %12s\n", "", "seconds", "MiB/s", "peak RSS");
+  printf("%-28s %8.2f %10.0f %9ld KiB\n", "tar -xzf package.tgz", tar_s, bytes / 1048576.0 / tar_s, tar_kib);
+  printf("%-28s %8.2f %10.0f %9ld KiB\n", "kivoctl install", tool_s, bytes / 1048576.0 / tool_s, tool_kib);
+  printf("speed of the tool relative to tar: %.2fx\n", tar_s / tool_s);
+  return 0;
+}
