@@ -103,18 +103,12 @@ void Print(const char* path, const char* program, int clients, const Figures& f)
   printf("%-9s %-10s %7d %9.2f %9.2f %9.0f\n", path, program, clients, f.p50_ms, f.p99_ms, f.rps);
 }
 
-std::string SelfDir() {
-  char exe[4096];
-  ssize_t n = readlink("/proc/self/exe", exe, sizeof(exe) - 1);
-  std::string path(exe, n > 0 ? static_cast<size_t>(n) : 0);
-  return path.substr(0, path.rfind('/'));
-}
 
 }  // namespace
 
 int main(int argc, char** argv) {
   int per_client = argc > 1 ? std::max(1, atoi(argv[1])) : 200;
-  setenv("KIVO_BUILD_DIR", (SelfDir() + "/..").c_str(), 0);
+  UseBuildDirOfThisProgram();
   TempRoot root;
   root.AddAccount("admin", "secret", {"administrators"});
   ApiClient admin("admin", "secret");

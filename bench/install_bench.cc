@@ -85,18 +85,12 @@ double Run(const std::vector<std::string>& argv, long* peak_kib) {
   return Seconds(start);
 }
 
-std::string SelfDir() {
-  char exe[4096];
-  ssize_t n = readlink("/proc/self/exe", exe, sizeof(exe) - 1);
-  std::string path(exe, n > 0 ? static_cast<size_t>(n) : 0);
-  return path.substr(0, path.rfind('/'));
-}
 
 }  // namespace
 
 int main(int argc, char** argv) {
   uint64_t mib = argc > 1 ? std::strtoull(argv[1], nullptr, 10) : 1024;
-  setenv("KIVO_BUILD_DIR", (SelfDir() + "/..").c_str(), 0);
+  UseBuildDirOfThisProgram();
   TempRoot root;
   KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
   std::string src = root.Path("/tmp/src");

@@ -16,14 +16,27 @@ scripts/deps.sh
 scripts/build.sh
 
 ROOT=$PWD/demo-root
+K="build/bin/kivoctl --root $ROOT"
 build/bin/kivoctl init-root "$ROOT"
-build/bin/kivoctl --root "$ROOT" user-add admin --password "$PASSWORD" --group administrators
-build/bin/kivoctl --root "$ROOT" web-config --port "$PORT" > "$ROOT/lighttpd.conf"
+$K user-add admin --password "$PASSWORD" --group administrators
+$K web-config --port "$PORT" > "$ROOT/lighttpd.conf"
+
+# The sample packages, signed by a demo publisher key that this root trusts.
+examples/build.sh "$PWD/build/bin/kivoctl" "$PWD/build/examples"
+gpg --homedir "$ROOT/usr/kivo/etc/packages/gnupg" --batch --quiet --import \
+  build/examples/demo-publisher.asc 2>/dev/null
+mkdir -p "$ROOT/volume1/public/packages"
+cp build/examples/*.kpk "$ROOT/volume1/public/packages/"
+for pkg in demo-web demo-notes; do
+  $K status $pkg >/dev/null 2>&1 || $K install "build/examples/$pkg.kpk" --run || true
+done
 
 cat <<TXT
 
 The web API of $ROOT:
   http://127.0.0.1:$PORT/webapi/entry.cgi      account: admin   password: $PASSWORD
+Installed: $($K list | tr '\n' ';')
+Sample package files: $ROOT/volume1/public/packages
 Try the curl lines of README.md. Ctrl-C stops the server.
 
 TXT

@@ -20,17 +20,20 @@ std::string JoinIds(const std::vector<std::string>& ids) {
 
 }  // namespace
 
+int PackageManager::LoadAndLock(const std::string& id, PackageInfo* info) {
+  if (!PMSLoadInstalled(id, info)) return PKG_ERR_NOT_INSTALLED;
+  return ExLock(kLockWaitSeconds) ? PKG_OK : PKG_ERR_BUSY;
+}
+
 bool PackageManager::serviceControl(int opType, const std::string& id, bool start,
                                     const std::string& language, const std::string& user,
                                     void* list, bool checkDeps, bool recordState) {
   Operation op(start ? "start" : "stop", PMSIsValidPackageId(id) ? id : "invalid");
   Json::Value services(Json::arrayValue);
-  int result = PKG_OK;
   PackageInfo info;
-  if (!PMSLoadInstalled(id, &info)) {
-    result = PKG_ERR_NOT_INSTALLED;
-  } else if (!ExLock(kLockWaitSeconds)) {
-    result = PKG_ERR_BUSY;
+  int result = LoadAndLock(id, &info);
+  if (result != PKG_OK) {
+    // Nothing to do: not installed, or the tool is busy.
   } else if (start && checkDeps) {
     for (const std::string& s : checkServiceStarted(PMSServiceSet(info.getServiceString()))) {
       services.append(s);
@@ -76,13 +79,9 @@ bool PackageManager::uninstall(const std::string& id, const Json::Value* wizardV
                                const std::string& user) {
   Operation op("uninstall", PMSIsValidPackageId(id) ? id : "invalid");
   std::map<std::string, std::string> params;
-  int result = PKG_OK;
   PackageInfo info;
-  if (!PMSLoadInstalled(id, &info)) {
-    result = PKG_ERR_NOT_INSTALLED;
-  } else if (!ExLock(kLockWaitSeconds)) {
-    result = PKG_ERR_BUSY;
-  } else {
+  int result = LoadAndLock(id, &info);
+  if (result == PKG_OK) {
     PMSRecoverLeftovers();
     std::vector<std::string> dependents = PMSInstalledDependents(id);
     if (!dependents.empty() && !force) {

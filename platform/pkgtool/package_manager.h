@@ -124,6 +124,10 @@ class PackageManager {
                   const std::map<std::string, std::string>& params, const Json::Value& services);
 
  private:
+  // The installed record of `id`, with the exclusive lock taken: PKG_OK,
+  // 255 or 275.
+  int LoadAndLock(const std::string& id, PackageInfo* info);
+
   int result_ = 0;
   int lock_fd_ = -1;
   std::string log_path_;

@@ -31,6 +31,18 @@ int VolumeProblem(const VolumeConfig& v, int64_t needed) {
   return free_bytes <= needed ? KLIBC_ERR_NO_SPACE : 0;
 }
 
+// The volume named exactly `path`, when it exists and can take packages;
+// otherwise false with the platform error number set.
+bool FindUsableVolume(const std::string& path, VolumeConfig* v) {
+  if (!KIVOVolumeFind(path, v) || v->path != path) {
+    KLIBCErrSet(KLIBC_ERR_VOLUME_NOT_FOUND);
+    return false;
+  }
+  int problem = VolumeProblem(*v, 0);
+  if (problem) KLIBCErrSet(problem);
+  return problem == 0;
+}
+
 bool MakeFreshDir(const std::string& parent, const std::string& prefix, std::string* out) {
   if (KIVOFSMkdirP(parent.c_str(), 0755) != 0) return false;
   std::string pattern = parent + "/" + prefix + "XXXXXX";
@@ -70,32 +82,14 @@ bool PMSGetPackageDefVol(std::string& path) {
     return true;
   }
   VolumeConfig v;
-  if (!KIVOVolumeFind(buf, &v)) {
-    KLIBCErrSet(KLIBC_ERR_VOLUME_NOT_FOUND);
-    return false;
-  }
-  int problem = VolumeProblem(v, 0);
-  if (problem) {
-    KLIBCErrSet(problem);
-    return false;
-  }
+  if (!FindUsableVolume(buf, &v)) return false;
   path = v.path;
   return true;
 }
 
 bool PMSSavePackageDefVolPath(const std::string& path) {
-  if (!path.empty()) {
-    VolumeConfig v;
-    if (!KIVOVolumeFind(path, &v) || v.path != path) {
-      KLIBCErrSet(KLIBC_ERR_VOLUME_NOT_FOUND);
-      return false;
-    }
-    int problem = VolumeProblem(v, 0);
-    if (problem) {
-      KLIBCErrSet(problem);
-      return false;
-    }
-  }
+  VolumeConfig v;
+  if (!path.empty() && !FindUsableVolume(path, &v)) return false;
   return KLIBCINFOSetKeyValue(kDefVolKey, path.c_str()) == 0;
 }
 

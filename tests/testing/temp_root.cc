@@ -1,6 +1,7 @@
 #include "testing/temp_root.h"
 
 #include <stdlib.h>
+#include <unistd.h>
 
 #include <gtest/gtest.h>
 
@@ -12,6 +13,13 @@
 std::string BuildDir() {
   const char* dir = getenv("KIVO_BUILD_DIR");
   return dir ? dir : ".";
+}
+
+void UseBuildDirOfThisProgram() {
+  char exe[4096];
+  ssize_t n = readlink("/proc/self/exe", exe, sizeof(exe) - 1);
+  std::string path(exe, n > 0 ? static_cast<size_t>(n) : 0);
+  setenv("KIVO_BUILD_DIR", (path.substr(0, path.rfind('/')) + "/..").c_str(), 0);
 }
 
 TempRoot::TempRoot() {

@@ -26,3 +26,6 @@ class TempRoot {
 
 // The build tree (KIVO_BUILD_DIR, set by ctest).
 std::string BuildDir();
+// For programs run outside ctest (benchmarks): the build tree is the folder
+// above the one this program lies in, unless KIVO_BUILD_DIR says otherwise.
+void UseBuildDirOfThisProgram();
