@@ -21,6 +21,9 @@
 namespace {
 
 constexpr char kDefVolKey[] = "pkg_def_volume";
+// A volume with less free room than this counts as full: packages and their
+// downloads must never take its last bytes.
+constexpr int64_t kReserveBytes = 1 << 20;
 
 // A volume's own problem as a platform error number, 0 when it can be used.
 int VolumeProblem(const VolumeConfig& v, int64_t needed) {
@@ -28,7 +31,7 @@ int VolumeProblem(const VolumeConfig& v, int64_t needed) {
   if (!v.usable()) return KLIBC_ERR_VOLUME_NOT_FOUND;
   int64_t free_bytes = KIVOVolumeFreeBytes(v);
   if (free_bytes < 0) return KLIBC_ERR_VOLUME_NOT_FOUND;
-  return free_bytes <= needed ? KLIBC_ERR_NO_SPACE : 0;
+  return free_bytes < needed + kReserveBytes ? KLIBC_ERR_NO_SPACE : 0;
 }
 
 // The volume named exactly `path`, when it exists and can take packages;

@@ -25,7 +25,8 @@ TEST(VersionTest, OperatorsAndValidity) {
   EXPECT_FALSE(server.compare(installed, PKG_VER_LT));
   EXPECT_TRUE(installed.compare(installed, PKG_VER_GE));
   EXPECT_TRUE(PMSIsValidVersion("1.2.3-0045"));
-  for (const char* bad : {"", "beta", "1 2", "1;rm", std::string(33, '1').c_str()}) {
+  for (const std::string& bad : {std::string(), std::string("beta"), std::string("1 2"),
+                                 std::string("1;rm"), std::string(33, '1')}) {
     EXPECT_FALSE(PMSIsValidVersion(bad)) << bad;
   }
 }
