@@ -4,6 +4,9 @@
 // destroys the object. Members answer exactly once through `response`.
 #pragma once
 
+#include <cstdint>
+#include <map>
+
 #include "pkgtool/package_manager.h"
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
@@ -64,6 +67,26 @@ class PackageWebAPI {
  private:
   // Answers that the member's method is not part of this build yet.
   void AnswerNotAvailable(const char* member);
+
+  // Rendering (package_info.cc): the live status and web address of an
+  // installed package, its uninstall wizard pages, a package file.
+  void DumpStatusInfo(const PackageInfo& info, uint64_t mask, Json::Value& additional);
+  void DumpUninstallPages(const PackageInfo& info, uint64_t mask, Json::Value& additional);
+  void DumpPkgInfo(const std::string& path, const PackageInfo& info, Json::Value& out);
+
+  // List and get (list.cc).
+  struct AutoUpdateState {
+    bool all = false;
+    Json::Value list{Json::arrayValue};
+  };
+  AutoUpdateState ReadAutoUpdateState(uint64_t mask);
+  void RenderInstalled(const PackageInfo& info, uint64_t mask, const AutoUpdateState& autoupdate,
+                       Json::Value& out);
+  bool IsBrickCached(const std::string& target, std::map<std::string, bool>& cache);
+
+  // Start and stop (control.cc).
+  void StartStop(bool start);
+  bool ServiceControl(const char* name, bool start, Json::Value& result);
 
   APIRequest* request;
   APIResponse* response;

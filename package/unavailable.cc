@@ -19,12 +19,6 @@ void PackageWebAPI::AnswerNotAvailable(const char* member) {
 #define KIVO_NOT_AVAILABLE(name) \
   void PackageWebAPI::name() { AnswerNotAvailable(#name); }
 
-KIVO_NOT_AVAILABLE(List)
-KIVO_NOT_AVAILABLE(Get)
-KIVO_NOT_AVAILABLE(FeasibilityCheck)
-KIVO_NOT_AVAILABLE(Start)
-KIVO_NOT_AVAILABLE(Stop)
-KIVO_NOT_AVAILABLE(Uninstall)
 KIVO_NOT_AVAILABLE(CheckEnv)
 KIVO_NOT_AVAILABLE(ReadProgress)
 KIVO_NOT_AVAILABLE(CancelProgress)

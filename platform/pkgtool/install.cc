@@ -33,6 +33,7 @@ void InfoFromHeader(const std::string& path, const PackageFileHeader& header,
                     PKG_INSTALLATION_TYPE wizard, const char* language, PackageInfo* info) {
   *info = PackageInfo(header.info);
   info->setFilePath(path);
+  info->setLanguage(language ? language : "");
   auto license = header.members.find("LICENSE");
   if (license != header.members.end()) info->setLicense(license->second);
   unsigned mask = 0;

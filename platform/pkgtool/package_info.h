@@ -48,6 +48,13 @@ class PackageInfo {
   DepPkgVector getConflicts() const;
   std::string getServiceString() const { return get("install_dep_services"); }
 
+  // The interface language the record was read in ("enu" when not given);
+  // the display name and description follow it.
+  const std::string& getLanguage() const { return language_; }
+  void setLanguage(const std::string& language) { language_ = language.empty() ? "enu" : language; }
+  std::string getDisplayName() const { return getDisplayName(language_); }
+  std::string getDescription() const { return getDescription(language_); }
+
   // Where the record came from: the package file, or the installed target.
   const std::string& getFilePath() const { return file_path_; }
   void setFilePath(const std::string& path) { file_path_ = path; }
@@ -66,6 +73,7 @@ class PackageInfo {
 
  private:
   KeyValueMap info_;
+  std::string language_ = "enu";
   std::string file_path_;
   std::string target_;
   std::string license_;

@@ -71,7 +71,10 @@ bool PackageManager::enumPackageInfoMap(std::map<std::string, PackageInfo>& out,
   out.clear();
   for (const std::string& id : PackageRegistry::List()) {
     PackageInfo info;
-    if (PMSLoadInstalled(id, &info)) out[id] = info;
+    if (PMSLoadInstalled(id, &info)) {
+      info.setLanguage(language);
+      out[id] = info;
+    }
   }
   result_ = PKG_OK;
   return true;
@@ -87,8 +90,11 @@ bool PackageManager::getPackageInfo(const std::string& id, PackageInfo& info,
     result_ = PKG_ERR_NOT_INSTALLED;
     return false;
   }
-  result_ = info.getTarget().empty() ? PKG_ERR_BROKEN : PKG_OK;
-  return result_ == PKG_OK;
+  info.setLanguage(language);
+  // A package whose installed files are gone still has its record: readers
+  // show it, and getServiceStatus reports it broken.
+  result_ = PKG_OK;
+  return true;
 }
 
 bool PackageManager::readUIFile(int op, const PackageInfo& package, PackageInfo& out,

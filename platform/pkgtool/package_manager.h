@@ -45,7 +45,9 @@ class PackageManager {
   // Every installed package's record, by id.
   bool enumPackageInfoMap(std::map<std::string, PackageInfo>& out, const std::string& language,
                           uint64_t mask);
-  // The installed record of `id`. False with 255 when not installed.
+  // The installed record of `id`. False with 255 when not installed. A
+  // package whose installed files are gone is read all the same (its status
+  // says broken).
   bool getPackageInfo(const std::string& id, PackageInfo& info, const std::string& language = "",
                       uint64_t mask = ~0ULL);
   bool getInstallPackageInfo(const std::string& id, PackageInfo& info) {

@@ -80,3 +80,28 @@ int KIVOCompareOSVersion(const std::string& a, const std::string& b) {
   if (a3 != b3) return a3 < b3 ? -1 : 1;
   return 0;
 }
+
+namespace {
+
+// "<root>/volume1/x" -> the configured volume holding it.
+bool VolumeOfRealPath(const std::string& path, VolumeConfig* out) {
+  std::string root = KIVOSysRoot();
+  if (path.compare(0, root.size(), root) != 0) return false;
+  std::string rest = path.substr(root.size());
+  return !rest.empty() && rest[0] == '/' && KIVOVolumeFind(rest, out);
+}
+
+}  // namespace
+
+int VolumePathParseEx(const std::string& path, std::string& volume) {
+  VolumeConfig v;
+  if (!VolumeOfRealPath(path, &v)) return -1;
+  volume = v.path;
+  return 0;
+}
+
+int KIVOVolumeIsUsedByGlusterFs(const std::string& path) {
+  VolumeConfig v;
+  if (!VolumeOfRealPath(path, &v)) return -1;
+  return v.brick ? 1 : 0;
+}

@@ -48,3 +48,11 @@ bool KIVOServiceRunning(const std::string& name);
 bool KIVOParseOSVersion(const std::string& text, int* major, int* minor, int* build);
 // <0, 0, >0 comparing two OS versions as (major, minor, build).
 int KIVOCompareOSVersion(const std::string& a, const std::string& b);
+
+// The volume part of a real path under the system root
+// ("<root>/volume1/@appstore/x" -> "/volume1") into `volume`. 0 on success,
+// -1 when the path lies on no configured volume.
+int VolumePathParseEx(const std::string& path, std::string& volume);
+// 1 when the volume holding the real path `path` serves as a cluster file
+// system brick, 0 when not, -1 when the path lies on no volume.
+int KIVOVolumeIsUsedByGlusterFs(const std::string& path);

@@ -1,0 +1,108 @@
+// The installed packages: "list" (also under the legacy API name) and "get".
+
+#include "klibc/key_value_file.h"
+#include "klibc/sysroot.h"
+#include "package_webapi.h"
+#include "pkgserver/auto_update.h"
+#include "pkgtool/pms.h"
+#include "storage/storage_config.h"
+#include "utils/package_utils.h"
+#include "webapi/webapi_util.h"
+
+namespace KIVO_PACKAGE {
+
+namespace {
+
+using PackageUtils::kAutoupdate;
+using PackageUtils::kInstalledInfo;
+using PackageUtils::kLogPath;
+
+bool SettingIsYes(const char* key) {
+  std::string conf = KIVORootPath("/etc/kivoinfo.conf");
+  return KLIBCFileCheckKeyValue(conf.c_str(), key, "yes", 0) == 1;
+}
+
+}  // namespace
+
+PackageWebAPI::AutoUpdateState PackageWebAPI::ReadAutoUpdateState(uint64_t mask) {
+  AutoUpdateState state;
+  if (!(mask & kAutoupdate) || !SettingIsYes("enable_pkg_autoupdate_all")) return state;
+  if (SettingIsYes("pkg_autoupdate_all")) {
+    state.all = true;
+  } else {
+    KIVOPackageServer::List(state.list);
+  }
+  return state;
+}
+
+void PackageWebAPI::RenderInstalled(const PackageInfo& info, uint64_t mask,
+                                    const AutoUpdateState& autoupdate, Json::Value& out) {
+  PackageUtils::DumpInfo(info, mask, out);
+  if (mask == 0) return;
+  DumpStatusInfo(info, mask, out["additional"]);
+  DumpUninstallPages(info, mask, out["additional"]);
+  if (mask & kAutoupdate) {
+    out["additional"]["autoupdate"] =
+        autoupdate.all || WebAPIUtil::JsonArrayHasString(autoupdate.list, info.getId());
+  }
+}
+
+bool PackageWebAPI::IsBrickCached(const std::string& target, std::map<std::string, bool>& cache) {
+  std::string volume;
+  if (VolumePathParseEx(target, volume) != 0) volume = target;
+  auto it = cache.find(volume);
+  if (it == cache.end()) it = cache.emplace(volume, KIVOVolumeIsUsedByGlusterFs(target) == 1).first;
+  return it->second;
+}
+
+void PackageWebAPI::List() {
+  uint64_t mask = PackageUtils::ParseAdditional(request->GetParam("additional", Json::Value(Json::arrayValue)));
+  AutoUpdateState autoupdate = ReadAutoUpdateState(mask);
+  std::map<std::string, bool> bricks;
+  Json::Value packages(Json::arrayValue);
+  const std::string language = request->GetUILanguage();
+  for (const std::string& id : pkgMgr.enumPackages("", ~0ULL)) {
+    PackageInfo info;
+    if (!pkgMgr.getPackageInfo(id, info, language, ~0ULL)) continue;
+    Json::Value object(Json::objectValue);
+    RenderInstalled(info, mask, autoupdate, object);
+    if (mask & kLogPath) object["additional"]["log_path"] = pkgMgr.getPackageLog(id, true);
+    if (mask & kInstalledInfo) {
+      std::string target = PMSGetPackageTarget(info);
+      object["additional"]["installed_info"]["is_brick"] = IsBrickCached(target, bricks);
+      object["additional"]["installed_info"]["path"] = target;
+    }
+    packages.append(object);
+  }
+  Json::Value result(Json::objectValue);
+  result["packages"] = packages;
+  result["total"] = packages.size();
+  response->SetSuccess(result);
+}
+
+void PackageWebAPI::Get() {
+  const std::string id = request->GetParam("id", "").asString();
+  if (!pkgMgr.init()) {
+    response->SetError(4501, Json::Value());
+    return;
+  }
+  uint64_t mask = PackageUtils::ParseAdditional(request->GetParam("additional", Json::Value(Json::arrayValue)));
+  AutoUpdateState autoupdate = ReadAutoUpdateState(mask);
+  PackageInfo info;
+  if (!pkgMgr.getPackageInfo(id, info, request->GetUILanguage(), ~0ULL) && pkgMgr.getResult() == 255) {
+    response->SetError(4545, Json::Value());
+    return;
+  }
+  // Any other failure still renders the record as it stands: only an
+  // unknown package is an error.
+  Json::Value object(Json::objectValue);
+  RenderInstalled(info, mask, autoupdate, object);
+  if (mask & kInstalledInfo) {
+    std::string target = PMSGetPackageTarget(info);
+    object["additional"]["installed_info"]["is_brick"] = KIVOVolumeIsUsedByGlusterFs(target) == 1;
+    object["additional"]["installed_info"]["path"] = target;
+  }
+  response->SetSuccess(object);
+}
+
+}  // namespace KIVO_PACKAGE

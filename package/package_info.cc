@@ -1,0 +1,136 @@
+// Package information rendering that needs the request: a package's live
+// status (from the tasks of running operations and the package tool), its
+// web address, its uninstall wizard pages, and the description of a package
+// file for the install wizard.
+
+#include <cstdlib>
+#include <memory>
+
+#include "package_webapi.h"
+#include "pkgtool/pms.h"
+#include "task_record.h"
+#include "utils/package_utils.h"
+
+namespace KIVO_PACKAGE {
+
+namespace {
+
+using PackageUtils::kInstallingProgress;
+using PackageUtils::kStatus;
+using PackageUtils::kUninstallPages;
+using PackageUtils::kUrl;
+
+// "nas.local:5000" -> "nas.local"; "[::1]:5000" -> "[::1]". At most 255 bytes.
+std::string RequestHost() {
+  const char* env = getenv("HTTP_HOST");
+  std::string host = env ? std::string(env).substr(0, 255) : "";
+  size_t colon = host.rfind(':');
+  if (colon != std::string::npos && host.find(']', colon) == std::string::npos) host.resize(colon);
+  return host;
+}
+
+// The status the package tool's last result gives a package that does not run.
+const char* StoppedStatus(int result) {
+  switch (result) {
+    case 255: return "non_installed";
+    case 256: case 263: return "NA";
+    case 150: case 258: return "broken";
+    case 259: return "version_limit";
+    case 265: return "builtin";
+    case 264: return "non_support";
+    default: return "stop";
+  }
+}
+
+// The "data" of task `prefix`+id when a living process runs it; a task whose
+// process is gone is removed. Null when there is no such live task.
+Json::Value LiveTaskData(NVX::TaskMgr& mgr, const std::string& id, const char* prefix) {
+  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, prefix + id));
+  if (!task) return Json::Value();
+  Json::Value data = task->getProperty("data");
+  if (TaskProcessAlive(data) && !task->isFinished()) return data;
+  if (!TaskProcessAlive(data)) task->remove();
+  return Json::Value();
+}
+
+}  // namespace
+
+void PackageWebAPI::DumpStatusInfo(const PackageInfo& info, uint64_t mask, Json::Value& additional) {
+  if (!(mask & (kUrl | kStatus))) return;
+  const std::string id = info.getId();
+  NVX::TaskMgr mgr(kTaskOwner);
+  Json::Value startstop = LiveTaskData(mgr, id, kStartStopPrefix);
+  if (startstop.isMember("status")) {
+    if (mask & kStatus) additional["status"] = startstop["status"];
+    return;
+  }
+  Json::Value download = LiveTaskData(mgr, id, kDownloadPrefix);
+  if (download["installing"].isBool() && download["installing"].asBool()) {
+    if (mask & kStatus) additional["status"] = download.isMember("status") ? download["status"] : "installing";
+    double progress = PMSGetProgress(id);
+    if ((mask & kInstallingProgress) && progress != -1.0) additional["installing_progress"] = progress;
+    return;
+  }
+  if (!LiveTaskData(mgr, id, kUninstallPrefix).isNull()) {
+    if (mask & kStatus) additional["status"] = "uninstalling";
+    return;
+  }
+  bool running = false;
+  bool ok = pkgMgr.getServiceStatus(info, running, request->GetAPIClass() != "KIVO.Package");
+  if (ok && running) {
+    if (mask & kStatus) additional["status"] = "running";
+    if ((mask & kUrl) && info.getAdminPort() > 0) {
+      std::string protocol = info.get("adminprotocol").empty() ? "http" : info.get("adminprotocol");
+      std::string path = info.get("adminurl");
+      if (path.empty() || path[0] != '/') path = "/" + path;
+      additional["url"] = protocol + "://" + RequestHost() + ":" +
+                          std::to_string(info.getAdminPort()) + path;
+    }
+    return;
+  }
+  if (mask & kStatus) additional["status"] = StoppedStatus(pkgMgr.getResult());
+}
+
+void PackageWebAPI::DumpUninstallPages(const PackageInfo& info, uint64_t mask, Json::Value& additional) {
+  if (!(mask & kUninstallPages) || !info.hasWizard(PKG_OP_UNINSTALL)) return;
+  PackageInfo pages;
+  if (!pkgMgr.readUIFile(PKG_OP_UNINSTALL, info, pages, request->GetUILanguage())) return;
+  if (!pages.getUIFile().empty()) PackageUtils::DumpUIFIle(pages, additional["uninstall_pages"]);
+}
+
+void PackageWebAPI::DumpPkgInfo(const std::string& path, const PackageInfo& info, Json::Value& out) {
+  out["path"] = path;
+  out["id"] = info.getId();
+  out["version"] = info.getVersion();
+  out["name"] = info.getDisplayName();
+  out["description"] = info.getDescription();
+  out["maintainer"] = info.get("maintainer");
+  if (!info.getUIFile().isNull() && !info.getUIFile().empty()) {
+    PackageUtils::DumpUIFIle(info, out["install_pages"]);
+  }
+  std::string status = "NA";
+  bool running = false;
+  PackageInfo installed;
+  bool known = pkgMgr.getPackageInfo(info.getId(), installed, request->GetUILanguage());
+  if (!known || !pkgMgr.getServiceStatus(installed, running, true) || !running) {
+    status = StoppedStatus(pkgMgr.getResult());
+    if (pkgMgr.getResult() == 256 || pkgMgr.getResult() == 263) status = "NA";
+  } else {
+    status = "running";
+  }
+  if (status == "NA" || status == "running" || status == "stop") {
+    NVX::TaskMgr mgr(kTaskOwner);
+    for (const char* prefix : {kDownloadPrefix, kStartStopPrefix}) {
+      Json::Value data = LiveTaskData(mgr, info.getId(), prefix);
+      bool installing = data["installing"].isBool() && data["installing"].asBool();
+      if (prefix == kDownloadPrefix && installing) {
+        status = data.isMember("status") ? data["status"].asString() : "installing";
+        break;
+      }
+      if (prefix == kStartStopPrefix && data.isMember("status")) status = data["status"].asString();
+    }
+  }
+  out["status"] = status;
+}
+
+}  // namespace KIVO_PACKAGE

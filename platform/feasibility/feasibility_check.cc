@@ -1,0 +1,165 @@
+#include "feasibility/feasibility_check.h"
+
+#include <memory>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "klibc/last_error.h"
+#include "klibc/process.h"
+#include "klibc/sysroot.h"
+#include "pkgtool/package_manager.h"
+#include "pkgtool/package_state.h"
+#include "pkgtool/pms.h"
+#include "pkgtool/registry.h"
+#include "storage/storage_config.h"
+#include "taskmgr/task.h"
+
+namespace {
+
+constexpr int64_t kLowSpaceBytes = 1LL << 30;
+
+std::vector<std::string> SplitIds(const std::string& text, bool* valid) {
+  std::vector<std::string> ids;
+  std::istringstream in(text);
+  *valid = true;
+  for (std::string id; std::getline(in, id, ',');) {
+    if (!PMSIsValidPackageId(id)) *valid = false;
+    ids.push_back(id);
+  }
+  if (ids.empty()) *valid = false;
+  return ids;
+}
+
+// True when another process holds the package tool's lock.
+bool ToolBusy() {
+  int fd = PMSLockFile(KIVORootPath("/run/kivo/pkgtool/lock"), 0);
+  PMSUnlockFile(fd);
+  return fd < 0;
+}
+
+// True when a task of a running job (a live "pid") concerns `id`.
+bool OperationRunning(NVX::TaskMgr& mgr, const std::string& id) {
+  for (const char* prefix : {"@KIVOPKG_DOWNLOAD_", "@KIVOPKG_STARTSTOP_", "@KIVOPKG_UNINSTALL_"}) {
+    std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, prefix + id));
+    if (!task) continue;
+    Json::Value data = task->getProperty("data");
+    if (data["pid"].isInt() && KLIBCProcAlive(data["pid"].asInt()) == 1 && !task->isFinished()) {
+      return true;
+    }
+  }
+  return false;
+}
+
+std::vector<std::string> RunningDependents(const std::string& id) {
+  std::vector<std::string> running;
+  for (const std::string& other : PMSInstalledDependents(id)) {
+    PackageInfo info;
+    if (PMSLoadInstalled(other, &info) && PMSIsRunning(other, info)) running.push_back(other);
+  }
+  return running;
+}
+
+class Checker {
+ public:
+  Checker(int type, PKLIBSZLIST* reasons) : type_(type), reasons_(reasons) {}
+
+  void Hard(const std::string& id, NVX::TaskMgr& mgr);
+  void Soft(const std::string& id);
+  int count() const { return count_; }
+  void Add(const std::string& reason) {
+    KLIBCSzListPush(reasons_, reason.c_str());
+    ++count_;
+  }
+
+ private:
+  void InstallVolume(const std::string& id, bool hard);
+
+  int type_;
+  PKLIBSZLIST* reasons_;
+  int count_ = 0;
+};
+
+void Checker::InstallVolume(const std::string& id, bool hard) {
+  std::string path;
+  if (!PMSGetPackageVol(id, path)) PMSGetPackageDefVol(path);
+  VolumeConfig volume;
+  bool found = !path.empty() && KIVOVolumeFind(path, &volume);
+  if (!found) {
+    for (const VolumeConfig& v : KIVOVolumesLoad()) {
+      if (v.usable()) {
+        volume = v;
+        found = true;
+        break;
+      }
+    }
+  }
+  if (hard && !found) Add("No volume can take packages.");
+  if (hard && found && volume.status == "crashed") Add("Volume " + volume.path + " is crashed.");
+  if (!hard && found && volume.usable() && KIVOVolumeFreeBytes(volume) < kLowSpaceBytes) {
+    Add("Volume " + volume.path + " has less than 1 GiB of free space.");
+  }
+}
+
+void Checker::Hard(const std::string& id, NVX::TaskMgr& mgr) {
+  if (OperationRunning(mgr, id)) Add(id + " is being installed or changed right now.");
+  bool installed = PackageRegistry::IsInstalled(id);
+  if (type_ == KIVO_FEASIBILITY_INSTALL) {
+    InstallVolume(id, true);
+    return;
+  }
+  if (!installed) {
+    Add(id + " is not installed.");
+    return;
+  }
+  if (type_ == KIVO_FEASIBILITY_UNINSTALL) {
+    for (const std::string& other : PMSInstalledDependents(id)) Add(other + " needs " + id + ".");
+  } else {
+    for (const std::string& other : RunningDependents(id)) Add(other + " runs and needs " + id + ".");
+  }
+}
+
+void Checker::Soft(const std::string& id) {
+  if (type_ == KIVO_FEASIBILITY_INSTALL) {
+    InstallVolume(id, false);
+  } else if (type_ == KIVO_FEASIBILITY_UNINSTALL && PackageRegistry::IsInstalled(id)) {
+    Add("Removing " + id + " deletes the data it keeps.");
+  } else if (type_ == KIVO_FEASIBILITY_STOP) {
+    for (const std::string& other : PMSInstalledDependents(id)) {
+      Add(other + " cannot start while " + id + " is stopped.");
+    }
+  }
+}
+
+}  // namespace
+
+int KIVOFeasibilityCheck(int type, int check_type, PKLIBSZLIST* reasons, const char* packages,
+                         int flags) {
+  bool valid = false;
+  std::vector<std::string> ids = SplitIds(packages ? packages : "", &valid);
+  bool known_type = type == KIVO_FEASIBILITY_INSTALL || type == KIVO_FEASIBILITY_UNINSTALL ||
+                    type == KIVO_FEASIBILITY_STOP;
+  bool known_check = check_type == KIVO_FEASIBILITY_HARD || check_type == KIVO_FEASIBILITY_SOFT;
+  if (!reasons || !*reasons || !known_type || !known_check || !valid) {
+    KLIBCErrSet(KLIBC_ERR_BAD_PARAMETER);
+    return -1;
+  }
+  PackageManager pm;
+  if (!pm.init()) {
+    KLIBCErrSet(KLIBC_ERR_FILE_READ);
+    return -1;
+  }
+  Checker checker(type, reasons);
+  if (check_type == KIVO_FEASIBILITY_HARD && ToolBusy()) {
+    checker.Add("The package center is busy with another package operation.");
+  }
+  NVX::TaskMgr mgr("@administrators");
+  for (const std::string& id : ids) {
+    if (check_type == KIVO_FEASIBILITY_HARD) {
+      checker.Hard(id, mgr);
+    } else {
+      checker.Soft(id);
+    }
+  }
+  return checker.count();
+}

@@ -1,0 +1,240 @@
+#include "taskmgr/task.h"
+
+#include <sys/random.h>
+#include <unistd.h>
+
+#include <ctime>
+#include <mutex>
+
+#include <json/writer.h>
+#include <sqlite3.h>
+
+#include "taskmgr/task_store.h"
+#include "webapi/webapi_util.h"
+
+namespace NVX {
+
+namespace {
+
+// One prepared statement, finalized with the object.
+class Statement {
+ public:
+  Statement(sqlite3* db, const char* sql) {
+    if (db) sqlite3_prepare_v2(db, sql, -1, &stmt_, nullptr);
+  }
+  ~Statement() { sqlite3_finalize(stmt_); }
+  Statement(const Statement&) = delete;
+  Statement& operator=(const Statement&) = delete;
+
+  Statement& Bind(int i, const std::string& text) {
+    if (stmt_) sqlite3_bind_text(stmt_, i, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
+    return *this;
+  }
+  Statement& Bind(int i, long long value) {
+    if (stmt_) sqlite3_bind_int64(stmt_, i, value);
+    return *this;
+  }
+  // Runs a statement without results. False on failure.
+  bool Run() { return stmt_ && sqlite3_step(stmt_) == SQLITE_DONE; }
+  // Steps to the next row. False when there is none (or on failure).
+  bool Row() { return stmt_ && sqlite3_step(stmt_) == SQLITE_ROW; }
+  std::string Text(int col) {
+    const unsigned char* t = sqlite3_column_text(stmt_, col);
+    return t ? reinterpret_cast<const char*>(t) : "";
+  }
+  long long Int(int col) { return sqlite3_column_int64(stmt_, col); }
+
+ private:
+  sqlite3_stmt* stmt_ = nullptr;
+};
+
+std::string Serialize(const Json::Value& value) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "";
+  return Json::writeString(builder, value);
+}
+
+bool WriteProperty(sqlite3* db, const std::string& owner, const std::string& id,
+                   const std::string& name, bool unset, const Json::Value& value) {
+  if (unset) {
+    return Statement(db, "DELETE FROM properties WHERE owner=? AND id=? AND name=?")
+        .Bind(1, owner).Bind(2, id).Bind(3, name).Run();
+  }
+  return Statement(db, "INSERT OR REPLACE INTO properties (owner, id, name, value) VALUES (?,?,?,?)")
+      .Bind(1, owner).Bind(2, id).Bind(3, name).Bind(4, Serialize(value)).Run();
+}
+
+}  // namespace
+
+Task::Task(std::shared_ptr<TaskStore> store, std::string owner, std::string id)
+    : store_(std::move(store)), owner_(std::move(owner)), id_(std::move(id)) {}
+
+Task::~Task() = default;
+
+Json::Value Task::getProperty(const std::string& name) {
+  Statement s(store_->db(), "SELECT value FROM properties WHERE owner=? AND id=? AND name=?");
+  s.Bind(1, owner_).Bind(2, id_).Bind(3, name);
+  Json::Value value;
+  if (s.Row()) WebAPIUtil::ParseJson(s.Text(0), value);
+  return value;
+}
+
+double Task::getDoubleProperty(const std::string& name, double def) {
+  Json::Value v = getProperty(name);
+  return v.isNumeric() ? v.asDouble() : def;
+}
+
+bool Task::setProperty(const std::string& name, const Json::Value& value) {
+  if (batching_) {
+    pending_.push_back(PendingWrite{name, false, value});
+    return true;
+  }
+  return WriteProperty(store_->db(), owner_, id_, name, false, value);
+}
+
+bool Task::unsetProperty(const std::string& name) {
+  if (batching_) {
+    pending_.push_back(PendingWrite{name, true, Json::Value()});
+    return true;
+  }
+  return WriteProperty(store_->db(), owner_, id_, name, true, Json::Value());
+}
+
+void Task::beginUpdate() {
+  batching_ = true;
+  pending_.clear();
+}
+
+bool Task::endUpdate() {
+  batching_ = false;
+  sqlite3* db = store_->db();
+  // BEGIN IMMEDIATE takes the write lock at once, so the batch never fails
+  // half-way for another writer.
+  bool ok = store_->Exec("BEGIN IMMEDIATE");
+  for (const PendingWrite& w : pending_) {
+    ok = ok && WriteProperty(db, owner_, id_, w.name, w.unset, w.value);
+  }
+  pending_.clear();
+  if (ok) return store_->Exec("COMMIT");
+  store_->Exec("ROLLBACK");
+  return false;
+}
+
+bool Task::setFinishValue(bool finished) {
+  return Statement(store_->db(), "UPDATE tasks SET finished=? WHERE owner=? AND id=?")
+      .Bind(1, finished ? 1LL : 0LL).Bind(2, owner_).Bind(3, id_).Run();
+}
+
+bool Task::finish(bool ok) {
+  return Statement(store_->db(), "UPDATE tasks SET finished=1, ok=? WHERE owner=? AND id=?")
+      .Bind(1, ok ? 1LL : 0LL).Bind(2, owner_).Bind(3, id_).Run();
+}
+
+bool Task::isFinished() {
+  Statement s(store_->db(), "SELECT finished FROM tasks WHERE owner=? AND id=?");
+  s.Bind(1, owner_).Bind(2, id_);
+  return s.Row() && s.Int(0) != 0;
+}
+
+bool Task::remove() {
+  if (!store_->Exec("BEGIN IMMEDIATE")) return false;
+  bool ok = Statement(store_->db(), "DELETE FROM properties WHERE owner=? AND id=?")
+                .Bind(1, owner_).Bind(2, id_).Run() &&
+            Statement(store_->db(), "DELETE FROM tasks WHERE owner=? AND id=?")
+                .Bind(1, owner_).Bind(2, id_).Run();
+  if (ok) return store_->Exec("COMMIT");
+  store_->Exec("ROLLBACK");
+  return false;
+}
+
+bool Task::waitForDataReady(const std::string& name, int seconds) {
+  time_t deadline = time(nullptr) + seconds;
+  while (true) {
+    if (!getProperty(name).isNull()) return true;
+    if (time(nullptr) >= deadline) return false;
+    usleep(50000);
+  }
+}
+
+namespace {
+
+// One connection per process serves every TaskMgr: a list of thousands of
+// packages looks tasks up for each of them. It stays open for the life of
+// the process (a request); a forked child or a changed system root gets a
+// connection of its own (TaskStore::db).
+std::shared_ptr<TaskStore> SharedStore() {
+  static std::mutex mutex;
+  static std::shared_ptr<TaskStore> shared;
+  std::lock_guard<std::mutex> lock(mutex);
+  if (!shared) shared = std::make_shared<TaskStore>();
+  return shared;
+}
+
+}  // namespace
+
+TaskMgr::TaskMgr(const std::string& owner) : store_(SharedStore()), owner_(owner) {}
+
+TaskMgr::~TaskMgr() = default;
+
+bool TaskMgr::hasTask(const std::string& id) {
+  Statement s(store_->db(), "SELECT 1 FROM tasks WHERE owner=? AND id=?");
+  s.Bind(1, owner_).Bind(2, id);
+  return s.Row();
+}
+
+Task* TaskMgr::getTask(const std::string& id) {
+  return hasTask(id) ? new Task(store_, owner_, id) : nullptr;
+}
+
+Task* TaskMgr::createTask(const std::string& id) {
+  if (id.empty() || !store_->db()) return nullptr;
+  if (!store_->Exec("BEGIN IMMEDIATE")) return nullptr;
+  bool ok = Statement(store_->db(), "DELETE FROM properties WHERE owner=? AND id=?")
+                .Bind(1, owner_).Bind(2, id).Run() &&
+            Statement(store_->db(),
+                      "INSERT OR REPLACE INTO tasks (owner, id, finished, ok, created) VALUES (?,?,0,0,?)")
+                .Bind(1, owner_).Bind(2, id).Bind(3, static_cast<long long>(time(nullptr))).Run();
+  if (!ok || !store_->Exec("COMMIT")) {
+    store_->Exec("ROLLBACK");
+    return nullptr;
+  }
+  return new Task(store_, owner_, id);
+}
+
+std::vector<std::string> TaskMgr::listTasks(const std::string& prefix) {
+  std::vector<std::string> ids;
+  Statement s(store_->db(), "SELECT id FROM tasks WHERE owner=? AND substr(id, 1, ?)=? ORDER BY id");
+  s.Bind(1, owner_).Bind(2, static_cast<long long>(prefix.size())).Bind(3, prefix);
+  while (s.Row()) ids.push_back(s.Text(0));
+  return ids;
+}
+
+namespace TaskUtil {
+
+std::string getUniqueID(const std::string& owner, int reserved) {
+  unsigned char bytes[8] = {0};
+  getrandom(bytes, sizeof(bytes), 0);
+  static const char kHex[] = "0123456789abcdef";
+  std::string id = std::to_string(time(nullptr)) + "_";
+  for (unsigned char b : bytes) {
+    id += kHex[b >> 4];
+    id += kHex[b & 15];
+  }
+  return id;
+}
+
+}  // namespace TaskUtil
+
+}  // namespace NVX
+
+namespace KIVOPackageTool {
+
+NVX::Task* GetTaskWithTaskMgr(NVX::TaskMgr& mgr, const std::string& id) { return mgr.getTask(id); }
+
+NVX::Task* GetNewTask(const char* owner, const char* id) {
+  if (!owner || !id) return nullptr;
+  NVX::TaskMgr mgr(owner);
+  return mgr.createTask(id);
+}
+
+}  // namespace KIVOPackageTool

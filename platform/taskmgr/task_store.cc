@@ -1,0 +1,68 @@
+#include "taskmgr/task_store.h"
+
+#include <syslog.h>
+#include <unistd.h>
+
+#include <sqlite3.h>
+
+#include "klibc/atomic_file.h"
+#include "klibc/sysroot.h"
+
+namespace NVX {
+
+namespace {
+
+constexpr int kBusyTimeoutMs = 10000;
+
+const char kSchema[] =
+    "CREATE TABLE IF NOT EXISTS tasks ("
+    "  owner TEXT NOT NULL, id TEXT NOT NULL, finished INTEGER NOT NULL DEFAULT 0,"
+    "  ok INTEGER NOT NULL DEFAULT 0, created INTEGER NOT NULL, PRIMARY KEY (owner, id));"
+    "CREATE TABLE IF NOT EXISTS properties ("
+    "  owner TEXT NOT NULL, id TEXT NOT NULL, name TEXT NOT NULL, value TEXT NOT NULL,"
+    "  PRIMARY KEY (owner, id, name));";
+
+}  // namespace
+
+TaskStore::TaskStore() = default;
+
+TaskStore::~TaskStore() {
+  // A child never closes its parent's connection: that would touch the
+  // parent's locks and journal.
+  if (db_ && pid_ == getpid()) sqlite3_close(db_);
+}
+
+sqlite3* TaskStore::db() {
+  std::string dir = KIVORootPath("/run/kivo");
+  std::string path = dir + "/tasks.db";
+  if (db_ && pid_ == getpid() && path == path_) return db_;
+  if (db_ && pid_ == getpid()) sqlite3_close(db_);
+  db_ = nullptr;
+  pid_ = getpid();
+  path_ = path;
+  KIVOFSMkdirP(dir.c_str());
+  if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) !=
+      SQLITE_OK) {
+    syslog(LOG_ERR, "%s:%d cannot open %s: %s", "task_store", __LINE__, path.c_str(),
+           db_ ? sqlite3_errmsg(db_) : "out of memory");
+    sqlite3_close(db_);
+    db_ = nullptr;
+    return nullptr;
+  }
+  sqlite3_busy_timeout(db_, kBusyTimeoutMs);
+  // Several processes write this file: keep the rollback journal (see task.h).
+  Exec("PRAGMA journal_mode=DELETE; PRAGMA synchronous=NORMAL;");
+  Exec(kSchema);
+  return db_;
+}
+
+bool TaskStore::Exec(const char* sql) {
+  if (!db_) return false;
+  char* error = nullptr;
+  if (sqlite3_exec(db_, sql, nullptr, nullptr, &error) == SQLITE_OK) return true;
+  syslog(LOG_ERR, "%s:%d task store: %s", "task_store", __LINE__, error ? error : "?");
+  sqlite3_free(error);
+  return false;
+}
+
+}  // namespace NVX

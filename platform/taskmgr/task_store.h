@@ -1,0 +1,31 @@
+// The SQLite database behind the task manager. Internal to platform/taskmgr.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+
+struct sqlite3;
+
+namespace NVX {
+
+class TaskStore {
+ public:
+  TaskStore();
+  ~TaskStore();
+  TaskStore(const TaskStore&) = delete;
+  TaskStore& operator=(const TaskStore&) = delete;
+
+  // The connection of this process, opened (and the schema made) on first
+  // use and again after a fork. Null when the database cannot be opened.
+  sqlite3* db();
+  // Runs `sql` (no results). False on failure.
+  bool Exec(const char* sql);
+
+ private:
+  sqlite3* db_ = nullptr;
+  pid_t pid_ = 0;
+  std::string path_;
+};
+
+}  // namespace NVX
