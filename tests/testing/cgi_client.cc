@@ -118,6 +118,7 @@ CgiAnswer ApiClient::Call(const std::string& api, const std::string& method, int
                       {"CONTENT_TYPE", "application/x-www-form-urlencoded"},
                       {"CONTENT_LENGTH", std::to_string(body.size())},
                       {"HTTP_COOKIE", "id=" + sid_},
-                      {"HTTP_X_KIVO_TOKEN", token_}},
+                      {"HTTP_X_KIVO_TOKEN", token_},
+                      {"HTTP_HOST", "nas.example:5000"}},
                      body);
 }
