@@ -112,10 +112,10 @@ void Serve(APIRequest* request, APIResponse* response) {
   RunModuleAPI(cgi, request, response);
 }
 
-void WriteAnswer(const APIResponse& response) {
+void WriteAnswer(APIResponse& response) {
   Json::StreamWriterBuilder builder;
   builder["indentation"] = "";
-  std::string body = Json::writeString(builder, response.ToEnvelope());
+  std::string body = Json::writeString(builder, response.TakeEnvelope());
   std::string head = "Content-Type: application/json; charset=utf-8\r\n";
   for (const std::string& h : response.Headers()) head += h + "\r\n";
   head += "Cache-Control: no-store\r\n\r\n";

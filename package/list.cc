@@ -72,12 +72,12 @@ void PackageWebAPI::List() {
       object["additional"]["installed_info"]["is_brick"] = IsBrickCached(target, bricks);
       object["additional"]["installed_info"]["path"] = target;
     }
-    packages.append(object);
+    packages.append(std::move(object));
   }
   Json::Value result(Json::objectValue);
-  result["packages"] = packages;
   result["total"] = packages.size();
-  response->SetSuccess(result);
+  result["packages"] = std::move(packages);
+  response->SetSuccess(std::move(result));
 }
 
 void PackageWebAPI::Get() {

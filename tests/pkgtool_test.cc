@@ -183,7 +183,22 @@ TEST_F(PackageToolTest, DependenciesConflictsAndServices) {
   PackageManager pm;
   std::vector<std::string> order;
   ASSERT_TRUE(pm.getDependencyOrder(order));
-  EXPECT_EQ((std::vector<std::string>{"needs-base", "base-app"}), order);  // dependents first
+  // Dependents come before what they need.
+  auto before = [&order](const std::string& a, const std::string& b) {
+    return std::find(order.begin(), order.end(), a) < std::find(order.begin(), order.end(), b);
+  };
+  EXPECT_TRUE(before("needs-base", "base-app"));
+
+  // A package without a service only needs to be installed.
+  TestPackage library;
+  library.id = "a-library";
+  library.daemon = false;
+  library.info = {{"startable", "no"}};
+  ASSERT_EQ(0, Install(Build(library)));
+  TestPackage uses_library;
+  uses_library.id = "uses-library";
+  uses_library.info = {{"install_dep_packages", "a-library"}};
+  EXPECT_EQ(0, Install(Build(uses_library))) << out_;
 
   TestPackage rival;
   rival.id = "rival";

@@ -123,7 +123,8 @@ bool PackageManager::getServiceStatus(const PackageInfo& info, bool& running, bo
     result_ = PKG_ERR_NOT_INSTALLED;
     return false;
   }
-  if (checkBroken && RealPath(PackageRegistry::RecordDir(id) + "/target").empty()) {
+  struct stat st;
+  if (checkBroken && stat((PackageRegistry::RecordDir(id) + "/target").c_str(), &st) != 0) {
     result_ = PKG_ERR_BROKEN;
     return false;
   }
@@ -210,7 +211,8 @@ bool PackageManager::arePackagesInstallAndStart(const DepPkgVector& deps, Json::
       }
       continue;
     }
-    if (!PMSIsRunning(dep.getName(), info)) stopped.push_back(dep.getName());
+    // A package without a service (a library) is ready once installed.
+    if (info.isStartable() && !PMSIsRunning(dep.getName(), info)) stopped.push_back(dep.getName());
   }
   notStarted = Join(stopped, ", ");
   return notInstalled.empty() && stopped.empty();

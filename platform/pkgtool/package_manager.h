@@ -86,7 +86,8 @@ class PackageManager {
   // reverse: dependents first, so stopping in this order is safe and
   // starting goes in the reverse order.
   bool getDependencyOrder(std::vector<std::string>& order);
-  // True when every entry is installed at an accepted version and running.
+  // True when every entry is installed at an accepted version and running
+  // (a package without a service only needs to be installed).
   // Otherwise `notInstalled` (array) gets the entries missing or at a refused
   // version and `notStarted` the ids (", "-joined) that do not run.
   bool arePackagesInstallAndStart(const DepPkgVector& deps, Json::Value& notInstalled,

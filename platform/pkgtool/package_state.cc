@@ -33,8 +33,15 @@ bool PMSLoadInstalled(const std::string& id, PackageInfo* info) {
   if (!PackageRegistry::IsInstalled(id) || !PackageRegistry::ReadInfo(id, &kv)) return false;
   std::string record = PackageRegistry::RecordDir(id);
   *info = PackageInfo(kv);
-  char real[PATH_MAX];
-  if (realpath((record + "/target").c_str(), real)) info->setTarget(real);
+  // The installer writes `target` as an absolute link to the payload folder:
+  // one readlink, where realpath would read every component of the path.
+  char target[PATH_MAX];
+  ssize_t n = readlink((record + "/target").c_str(), target, sizeof(target) - 1);
+  struct stat st;
+  if (n > 0 && target[0] == '/') {
+    target[n] = '\0';
+    if (stat(target, &st) == 0 && S_ISDIR(st.st_mode)) info->setTarget(target);
+  }
   info->setWizardMask(WizardMask(record));
   std::string license;
   if (KIVOReadFile(record + "/LICENSE", &license, 1 << 20)) info->setLicense(license);

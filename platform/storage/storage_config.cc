@@ -1,6 +1,9 @@
 #include "storage/storage_config.h"
 
+#include <sys/stat.h>
 #include <sys/statvfs.h>
+
+#include <mutex>
 
 #include <cstdio>
 
@@ -9,12 +12,13 @@
 #include "klibc/atomic_file.h"
 #include "webapi/webapi_util.h"
 
-std::vector<VolumeConfig> KIVOVolumesLoad() {
+namespace {
+
+std::vector<VolumeConfig> ParseVolumes(const std::string& path) {
   std::vector<VolumeConfig> volumes;
   Json::Value list;
   std::string text;
-  if (!KIVOReadFile(KIVORootPath("/etc/kivo/volumes.json"), &text, 1 << 20) ||
-      !WebAPIUtil::ParseJson(text, list) || !list.isArray()) {
+  if (!KIVOReadFile(path, &text, 1 << 20) || !WebAPIUtil::ParseJson(text, list) || !list.isArray()) {
     return volumes;
   }
   for (const Json::Value& v : list) {
@@ -30,6 +34,30 @@ std::vector<VolumeConfig> KIVOVolumesLoad() {
     volumes.push_back(volume);
   }
   return volumes;
+}
+
+}  // namespace
+
+std::vector<VolumeConfig> KIVOVolumesLoad() {
+  // A list of thousands of packages asks for the volume of each; parse the
+  // file again only when it has changed (a rename gives it a new inode).
+  static std::mutex mutex;
+  static struct {
+    std::string path;
+    struct stat st;
+    std::vector<VolumeConfig> volumes;
+  } cache;
+  std::string path = KIVORootPath("/etc/kivo/volumes.json");
+  struct stat st;
+  if (stat(path.c_str(), &st) != 0) return {};
+  std::lock_guard<std::mutex> lock(mutex);
+  if (cache.path != path || cache.st.st_ino != st.st_ino || cache.st.st_mtim.tv_nsec != st.st_mtim.tv_nsec ||
+      cache.st.st_mtime != st.st_mtime || cache.st.st_size != st.st_size) {
+    cache.volumes = ParseVolumes(path);
+    cache.path = path;
+    cache.st = st;
+  }
+  return cache.volumes;
 }
 
 bool KIVOVolumeFind(const std::string& path, VolumeConfig* out) {

@@ -16,13 +16,14 @@ namespace NVX {
 
 namespace {
 
-// One prepared statement, finalized with the object.
+// One use of a statement the store keeps prepared; reset after use, so the
+// store's read locks end with the statement.
 class Statement {
  public:
-  Statement(sqlite3* db, const char* sql) {
-    if (db) sqlite3_prepare_v2(db, sql, -1, &stmt_, nullptr);
+  Statement(TaskStore& store, const char* sql) : stmt_(store.Prepared(sql)) {}
+  ~Statement() {
+    if (stmt_) sqlite3_reset(stmt_);
   }
-  ~Statement() { sqlite3_finalize(stmt_); }
   Statement(const Statement&) = delete;
   Statement& operator=(const Statement&) = delete;
 
@@ -54,7 +55,7 @@ std::string Serialize(const Json::Value& value) {
   return Json::writeString(builder, value);
 }
 
-bool WriteProperty(sqlite3* db, const std::string& owner, const std::string& id,
+bool WriteProperty(TaskStore& db, const std::string& owner, const std::string& id,
                    const std::string& name, bool unset, const Json::Value& value) {
   if (unset) {
     return Statement(db, "DELETE FROM properties WHERE owner=? AND id=? AND name=?")
@@ -72,7 +73,7 @@ Task::Task(std::shared_ptr<TaskStore> store, std::string owner, std::string id)
 Task::~Task() = default;
 
 Json::Value Task::getProperty(const std::string& name) {
-  Statement s(store_->db(), "SELECT value FROM properties WHERE owner=? AND id=? AND name=?");
+  Statement s(*store_, "SELECT value FROM properties WHERE owner=? AND id=? AND name=?");
   s.Bind(1, owner_).Bind(2, id_).Bind(3, name);
   Json::Value value;
   if (s.Row()) WebAPIUtil::ParseJson(s.Text(0), value);
@@ -89,7 +90,7 @@ bool Task::setProperty(const std::string& name, const Json::Value& value) {
     pending_.push_back(PendingWrite{name, false, value});
     return true;
   }
-  return WriteProperty(store_->db(), owner_, id_, name, false, value);
+  return WriteProperty(*store_, owner_, id_, name, false, value);
 }
 
 bool Task::unsetProperty(const std::string& name) {
@@ -97,7 +98,7 @@ bool Task::unsetProperty(const std::string& name) {
     pending_.push_back(PendingWrite{name, true, Json::Value()});
     return true;
   }
-  return WriteProperty(store_->db(), owner_, id_, name, true, Json::Value());
+  return WriteProperty(*store_, owner_, id_, name, true, Json::Value());
 }
 
 void Task::beginUpdate() {
@@ -107,7 +108,7 @@ void Task::beginUpdate() {
 
 bool Task::endUpdate() {
   batching_ = false;
-  sqlite3* db = store_->db();
+  TaskStore& db = *store_;
   // BEGIN IMMEDIATE takes the write lock at once, so the batch never fails
   // half-way for another writer.
   bool ok = store_->Exec("BEGIN IMMEDIATE");
@@ -121,26 +122,26 @@ bool Task::endUpdate() {
 }
 
 bool Task::setFinishValue(bool finished) {
-  return Statement(store_->db(), "UPDATE tasks SET finished=? WHERE owner=? AND id=?")
+  return Statement(*store_, "UPDATE tasks SET finished=? WHERE owner=? AND id=?")
       .Bind(1, finished ? 1LL : 0LL).Bind(2, owner_).Bind(3, id_).Run();
 }
 
 bool Task::finish(bool ok) {
-  return Statement(store_->db(), "UPDATE tasks SET finished=1, ok=? WHERE owner=? AND id=?")
+  return Statement(*store_, "UPDATE tasks SET finished=1, ok=? WHERE owner=? AND id=?")
       .Bind(1, ok ? 1LL : 0LL).Bind(2, owner_).Bind(3, id_).Run();
 }
 
 bool Task::isFinished() {
-  Statement s(store_->db(), "SELECT finished FROM tasks WHERE owner=? AND id=?");
+  Statement s(*store_, "SELECT finished FROM tasks WHERE owner=? AND id=?");
   s.Bind(1, owner_).Bind(2, id_);
   return s.Row() && s.Int(0) != 0;
 }
 
 bool Task::remove() {
   if (!store_->Exec("BEGIN IMMEDIATE")) return false;
-  bool ok = Statement(store_->db(), "DELETE FROM properties WHERE owner=? AND id=?")
+  bool ok = Statement(*store_, "DELETE FROM properties WHERE owner=? AND id=?")
                 .Bind(1, owner_).Bind(2, id_).Run() &&
-            Statement(store_->db(), "DELETE FROM tasks WHERE owner=? AND id=?")
+            Statement(*store_, "DELETE FROM tasks WHERE owner=? AND id=?")
                 .Bind(1, owner_).Bind(2, id_).Run();
   if (ok) return store_->Exec("COMMIT");
   store_->Exec("ROLLBACK");
@@ -177,7 +178,7 @@ TaskMgr::TaskMgr(const std::string& owner) : store_(SharedStore()), owner_(owner
 TaskMgr::~TaskMgr() = default;
 
 bool TaskMgr::hasTask(const std::string& id) {
-  Statement s(store_->db(), "SELECT 1 FROM tasks WHERE owner=? AND id=?");
+  Statement s(*store_, "SELECT 1 FROM tasks WHERE owner=? AND id=?");
   s.Bind(1, owner_).Bind(2, id);
   return s.Row();
 }
@@ -189,9 +190,9 @@ Task* TaskMgr::getTask(const std::string& id) {
 Task* TaskMgr::createTask(const std::string& id) {
   if (id.empty() || !store_->db()) return nullptr;
   if (!store_->Exec("BEGIN IMMEDIATE")) return nullptr;
-  bool ok = Statement(store_->db(), "DELETE FROM properties WHERE owner=? AND id=?")
+  bool ok = Statement(*store_, "DELETE FROM properties WHERE owner=? AND id=?")
                 .Bind(1, owner_).Bind(2, id).Run() &&
-            Statement(store_->db(),
+            Statement(*store_,
                       "INSERT OR REPLACE INTO tasks (owner, id, finished, ok, created) VALUES (?,?,0,0,?)")
                 .Bind(1, owner_).Bind(2, id).Bind(3, static_cast<long long>(time(nullptr))).Run();
   if (!ok || !store_->Exec("COMMIT")) {
@@ -203,7 +204,7 @@ Task* TaskMgr::createTask(const std::string& id) {
 
 std::vector<std::string> TaskMgr::listTasks(const std::string& prefix) {
   std::vector<std::string> ids;
-  Statement s(store_->db(), "SELECT id FROM tasks WHERE owner=? AND substr(id, 1, ?)=? ORDER BY id");
+  Statement s(*store_, "SELECT id FROM tasks WHERE owner=? AND substr(id, 1, ?)=? ORDER BY id");
   s.Bind(1, owner_).Bind(2, static_cast<long long>(prefix.size())).Bind(3, prefix);
   while (s.Row()) ids.push_back(s.Text(0));
   return ids;

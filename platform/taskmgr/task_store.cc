@@ -26,18 +26,38 @@ const char kSchema[] =
 
 TaskStore::TaskStore() = default;
 
-TaskStore::~TaskStore() {
+TaskStore::~TaskStore() { Close(); }
+
+void TaskStore::Close() {
   // A child never closes its parent's connection: that would touch the
   // parent's locks and journal.
-  if (db_ && pid_ == getpid()) sqlite3_close(db_);
+  if (db_ && pid_ == getpid()) {
+    for (auto& s : statements_) sqlite3_finalize(s.second);
+    sqlite3_close(db_);
+  }
+  statements_.clear();
+  db_ = nullptr;
+}
+
+sqlite3_stmt* TaskStore::Prepared(const char* sql) {
+  if (!db()) return nullptr;
+  auto it = statements_.find(sql);
+  if (it != statements_.end()) {
+    sqlite3_reset(it->second);
+    sqlite3_clear_bindings(it->second);
+    return it->second;
+  }
+  sqlite3_stmt* stmt = nullptr;
+  if (sqlite3_prepare_v2(db_, sql, -1, &stmt, nullptr) != SQLITE_OK) return nullptr;
+  statements_[sql] = stmt;
+  return stmt;
 }
 
 sqlite3* TaskStore::db() {
   std::string dir = KIVORootPath("/run/kivo");
   std::string path = dir + "/tasks.db";
   if (db_ && pid_ == getpid() && path == path_) return db_;
-  if (db_ && pid_ == getpid()) sqlite3_close(db_);
-  db_ = nullptr;
+  Close();
   pid_ = getpid();
   path_ = path;
   KIVOFSMkdirP(dir.c_str());

@@ -3,9 +3,11 @@
 
 #include <sys/types.h>
 
+#include <map>
 #include <string>
 
 struct sqlite3;
+struct sqlite3_stmt;
 
 namespace NVX {
 
@@ -21,11 +23,17 @@ class TaskStore {
   sqlite3* db();
   // Runs `sql` (no results). False on failure.
   bool Exec(const char* sql);
+  // The prepared statement for `sql`, reset and with its bindings cleared;
+  // kept for the connection's life (a list looks tasks up thousands of
+  // times). Null on failure.
+  sqlite3_stmt* Prepared(const char* sql);
 
  private:
   sqlite3* db_ = nullptr;
   pid_t pid_ = 0;
   std::string path_;
+  std::map<const char*, sqlite3_stmt*> statements_;  // by the address of their SQL text
+  void Close();
 };
 
 }  // namespace NVX

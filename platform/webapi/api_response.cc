@@ -1,26 +1,34 @@
 #include "webapi/api_response.h"
 
-void APIResponse::SetSuccess(const Json::Value& data) {
+void APIResponse::SetSuccess(Json::Value data) {
   answered_ = true;
   error_code_ = 0;
-  data_ = data;
+  data_ = std::move(data);
 }
 
-void APIResponse::SetError(int code, const Json::Value& data) {
+void APIResponse::SetError(int code, Json::Value data) {
   answered_ = true;
   error_code_ = code;
-  data_ = data;
+  data_ = std::move(data);
 }
 
-Json::Value APIResponse::ToEnvelope() const {
+namespace {
+
+Json::Value Envelope(bool answered, int code, Json::Value data) {
   Json::Value out(Json::objectValue);
-  if (answered_ && error_code_ == 0) {
+  if (answered && code == 0) {
     out["success"] = true;
-    if (!data_.isNull()) out["data"] = data_;
+    if (!data.isNull()) out["data"] = std::move(data);
     return out;
   }
   out["success"] = false;
-  out["error"]["code"] = answered_ ? error_code_ : 100;
-  if (answered_ && !data_.isNull()) out["error"]["errors"] = data_;
+  out["error"]["code"] = answered ? code : 100;
+  if (answered && !data.isNull()) out["error"]["errors"] = std::move(data);
   return out;
 }
+
+}  // namespace
+
+Json::Value APIResponse::ToEnvelope() const { return Envelope(answered_, error_code_, data_); }
+
+Json::Value APIResponse::TakeEnvelope() { return Envelope(answered_, error_code_, std::move(data_)); }

@@ -15,8 +15,8 @@ class APIResponse {
   APIResponse(const APIResponse&) = delete;
   APIResponse& operator=(const APIResponse&) = delete;
 
-  void SetSuccess(const Json::Value& data = Json::Value());
-  void SetError(int code, const Json::Value& data = Json::Value());
+  void SetSuccess(Json::Value data = Json::Value());
+  void SetError(int code, Json::Value data = Json::Value());
   // The error code set so far; 0 when none (also after SetSuccess).
   int GetError() const { return error_code_; }
   void SetEnableOutput(bool enable) { output_enabled_ = enable; }
@@ -33,6 +33,9 @@ class APIResponse {
   // "errors": D}}, with "data"/"errors" left out when null. An unanswered
   // response gives the default error 100.
   Json::Value ToEnvelope() const;
+  // The same, moving the data into it (the response is spent afterwards):
+  // a large answer is not copied once more on its way out.
+  Json::Value TakeEnvelope();
 
  private:
   bool answered_ = false;

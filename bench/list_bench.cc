@@ -1,0 +1,105 @@
+// "list" with every additional key through lighttpd, for 30, 300 and 3000
+// installed packages: p50 and p99 per size, and the cost per package.
+//
+//   list_bench [requests per size]      (default 20)
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <string>
+#include <vector>
+
+#include "klibc/atomic_file.h"
+#include "pkgtool/package_manager.h"
+#include "testing/cgi_client.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+#include "testing/web_server.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+const char kAllKeys[] =
+    "%5B%22autoupdate%22%2C%22beta%22%2C%22description%22%2C%22description_enu%22%2C%22distributor%22%2C"
+    "%22distributor_url%22%2C%22nvx_apps%22%2C%22help_url%22%2C%22install_reboot%22%2C%22install_type%22%2C"
+    "%22installed_info%22%2C%22is_uninstall_pages%22%2C%22maintainer%22%2C%22maintainer_url%22%2C%22url%22%2C"
+    "%22report_beta_url%22%2C%22silent_install%22%2C%22silent_upgrade%22%2C%22silent_uninstall%22%2C"
+    "%22startable%22%2C%22status%22%2C%22support_center%22%2C%22support_url%22%2C%22uninstall_pages%22%2C"
+    "%22dependent_packages%22%2C%22start_dependent_services%22%2C%22installing_progress%22%2C"
+    "%22ctl_uninstall%22%2C%22log_path%22%5D";
+
+// One HTTP/1.0 GET, read to the end; returns the body size.
+size_t HttpGet(int port, const std::string& target, const std::string& headers) {
+  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_port = htons(static_cast<uint16_t>(port));
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) return 0;
+  std::string request = "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n";
+  if (write(fd, request.data(), request.size()) < 0) return 0;
+  char buf[65536];
+  size_t total = 0;
+  for (ssize_t n; (n = read(fd, buf, sizeof(buf))) > 0;) total += static_cast<size_t>(n);
+  close(fd);
+  return total;
+}
+
+void InstallMany(const std::string& dir, int count) {
+  for (int i = 0; i < count; ++i) {
+    TestPackage p;
+    p.id = "bench-" + std::to_string(i);
+    p.info = {{"description", "Benchmark package"}, {"maintainer", "Bench"}, {"adminport", "18000"},
+              {"checkport", "no"}, {"logfile", "app.log"},
+              {"install_dep_services", "pgsql"}};
+    if (i == 0) p.info["startable"] = "no";  // a library the others need
+    if (i > 0 && i % 3 == 0) p.info["install_dep_packages"] = "bench-0";
+    std::string file = p.Build(dir), message;
+    PKG_ERRCODE code;
+    Json::Value details;
+    if (!InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true, false)) {
+      fprintf(stderr, "install of %s failed: %s\n", p.id.c_str(), message.c_str());
+      exit(1);
+    }
+    unlink(file.c_str());
+  }
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  int requests = argc > 1 ? std::max(1, atoi(argv[1])) : 20;
+  UseBuildDirOfThisProgram();
+  printf("%8s %9s %9s %14s %12s\n", "packages", "p50 ms", "p99 ms", "ms/package", "answer KiB");
+  for (int count : {30, 300, 3000}) {
+    TempRoot root;
+    root.AddAccount("admin", "secret", {"administrators"});
+    KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+    std::string dir = root.Path("/tmp/src");
+    KIVOFSMkdirP(dir.c_str());
+    InstallMany(dir, count);
+    ApiClient admin("admin", "secret");
+    WebServer server(root.dir());
+    std::string target = "/webapi/entry.cgi?api=KIVO.Core.Package&version=1&method=list&additional=" +
+                         std::string(kAllKeys);
+    std::string headers = "Cookie: id=" + admin.sid() + "\r\nX-KIVO-Token: " + admin.token() + "\r\n";
+    size_t size = HttpGet(server.port(), target, headers);  // warm-up
+    std::vector<double> ms;
+    for (int r = 0; r < requests; ++r) {
+      Clock::time_point t = Clock::now();
+      HttpGet(server.port(), target, headers);
+      ms.push_back(std::chrono::duration<double, std::milli>(Clock::now() - t).count());
+    }
+    std::sort(ms.begin(), ms.end());
+    double p50 = ms[ms.size() / 2], p99 = ms[std::min(ms.size() - 1, ms.size() * 99 / 100)];
+    printf("%8d %9.1f %9.1f %14.3f %12.0f\n", count, p50, p99, p50 / count, size / 1024.0);
+    fflush(stdout);
+  }
+  return 0;
+}
