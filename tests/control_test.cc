@@ -2,6 +2,7 @@
 // on packages installed by the package tool.
 
 #include <dirent.h>
+#include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -12,6 +13,7 @@
 #include "klibc/atomic_file.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
+#include "taskmgr/task.h"
 #include "testing/cgi_client.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
@@ -76,6 +78,7 @@ class ControlTest : public ::testing::Test {
 };
 
 constexpr char kControl[] = "KIVO.Core.Package.Control";
+constexpr char kPkg[] = "KIVO.Core.Package";
 
 TEST_F(ControlTest, StartAndStopOnePackage) {
   Install("base");
@@ -95,6 +98,29 @@ TEST_F(ControlTest, StartAndStopOnePackage) {
   EXPECT_EQ(4500, empty_id.Code());
   EXPECT_FALSE(empty_id.json["error"].isMember("errors"));
   EXPECT_EQ(4501, Call(kControl, "start", {{"id", "[\"not-installed\"]"}}).Code());
+}
+
+// While a start script runs, the package shows as starting.
+TEST_F(ControlTest, StartingShowsWhileTheScriptRuns) {
+  TestPackage slow;
+  slow.id = "slow";
+  slow.daemon = false;
+  slow.scripts = {{"start-stop-status", "[ \"$1\" = start ] && sleep 2; exit 0\n"}};
+  std::string out;
+  ASSERT_EQ(0, Kivoctl({"install", slow.Build(dir_)}, &out)) << out;
+  pid_t pid = fork();
+  if (pid == 0) _exit(Kivoctl({"start", "slow"}));
+  std::string status;
+  for (int i = 0; i < 100 && status != "starting"; ++i) {
+    usleep(20000);
+    CgiAnswer a = Call(kPkg, "get", {{"id", "slow"}, {"additional", "[\"status\"]"}});
+    status = a.Data()["additional"]["status"].asString();
+  }
+  EXPECT_EQ("starting", status);
+  int exit_status;
+  waitpid(pid, &exit_status, 0);
+  EXPECT_EQ(0, WEXITSTATUS(exit_status));
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask("@KIVOPKG_STARTSTOP_slow"));
 }
 
 TEST_F(ControlTest, DependencyRefusalsCarryTheirDetails) {
@@ -152,8 +178,6 @@ TEST_F(ControlTest, BusyPackageToolIs4530) {
   EXPECT_EQ(4530, Call("KIVO.Core.Package.Uninstallation", "uninstall", {{"id", "base"}}).Code());
   PMSUnlockFile(lock);
 }
-
-constexpr char kPkg[] = "KIVO.Core.Package";
 
 TEST_F(ControlTest, FeasibilityHardSoftAndFailure) {
   Install("base", "", true);

@@ -75,11 +75,17 @@ class FileLock {
 }  // namespace
 
 KeyValueMap KIVOKeyValueParse(const std::string& text) {
+  // Every package's INFO passes through here on each list; split lines by
+  // hand rather than through a stream.
   KeyValueMap out;
-  std::istringstream in(text);
   std::string line, key, value;
-  while (std::getline(in, line)) {
-    if (ParseLine(line, &key, &value)) out[key] = value;
+  size_t start = 0;
+  while (start < text.size()) {
+    size_t end = text.find('\n', start);
+    if (end == std::string::npos) end = text.size();
+    line.assign(text, start, end - start);
+    if (ParseLine(line, &key, &value)) out[std::move(key)] = std::move(value);
+    start = end + 1;
   }
   return out;
 }

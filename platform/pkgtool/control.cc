@@ -2,15 +2,40 @@
 
 #include <unistd.h>
 
+#include <memory>
+
 #include "klibc/atomic_file.h"
 #include "pkgtool/lifecycle.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/registry.h"
+#include "taskmgr/task.h"
 
 namespace {
 
 constexpr int kLockWaitSeconds = 3;
+
+// The task that shows readers an operation on `id` is under way, with this
+// process as its worker; removed when the operation ends.
+class OperationTask {
+ public:
+  OperationTask(const std::string& id, const char* prefix, const char* status) {
+    task_.reset(GetNewTask("@administrators", (prefix + id).c_str()));
+    if (!task_) return;
+    Json::Value data(Json::objectValue);
+    data["status"] = status;
+    data["pid"] = static_cast<int>(getpid());
+    task_->setProperty("data", data);
+  }
+  ~OperationTask() {
+    if (task_) task_->remove();
+  }
+  OperationTask(const OperationTask&) = delete;
+  OperationTask& operator=(const OperationTask&) = delete;
+
+ private:
+  std::unique_ptr<NVX::Task> task_;
+};
 
 std::string JoinIds(const std::vector<std::string>& ids) {
   std::string out;
@@ -56,6 +81,7 @@ bool PackageManager::serviceControl(int opType, const std::string& id, bool star
   }
   std::string record = PMSIsValidPackageId(id) ? PackageRegistry::RecordDir(id) : "";
   if (result == PKG_OK && info.isStartable()) {
+    OperationTask task(id, "@KIVOPKG_STARTSTOP_", start ? "starting" : "stopping");
     auto env = PMSScriptEnv(info, record, start ? "start" : "stop", op, Json::Value());
     if (!PMSRunPackageScript(record, "start-stop-status", start ? "start" : "stop", env, op)) {
       result = PKG_ERR_SCRIPT_FAILED;
@@ -91,6 +117,7 @@ bool PackageManager::uninstall(const std::string& id, const Json::Value* wizardV
     }
   }
   if (result == PKG_OK) {
+    OperationTask task(id, "@KIVOPKG_UNINSTALL_", "uninstalling");
     std::string published = PackageRegistry::RecordDir(id);
     std::string record = PackageRegistry::Dir() + "/" + PackageRegistry::PublishedRecord(id);
     Json::Value wizard = wizardValues ? *wizardValues : Json::Value();
