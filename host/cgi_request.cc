@@ -41,14 +41,30 @@ std::string MediaType(const std::string& content_type) {
   return type;
 }
 
-bool ReadFormBody(int fd, CgiRequest* out, std::string* reason) {
+// "multipart/form-data; boundary=xyz" -> "xyz" (quotes removed).
+std::string Boundary(const std::string& content_type) {
+  size_t at = content_type.find("boundary=");
+  if (at == std::string::npos) return "";
+  std::string b = content_type.substr(at + 9);
+  b = b.substr(0, b.find(';'));
+  if (b.size() >= 2 && b.front() == '"' && b.back() == '"') b = b.substr(1, b.size() - 2);
+  return b.size() <= 70 ? b : "";
+}
+
+bool ReadFormBody(int fd, uint64_t max_upload, CgiRequest* out, std::string* reason) {
   size_t length = 0;
   if (!ParseLength(Env("CONTENT_LENGTH"), &length)) return (*reason = "invalid CONTENT_LENGTH"), false;
   if (length == 0) return true;
   std::string type = MediaType(Env("CONTENT_TYPE"));
   if (type == "multipart/form-data") {
-    *reason = "multipart bodies are not accepted by this build yet";
-    return false;
+    out->boundary = Boundary(Env("CONTENT_TYPE"));
+    out->content_length = length;
+    if (out->boundary.empty()) return (*reason = "multipart body without a boundary"), false;
+    if (length > max_upload) {
+      *reason = "upload larger than the limit of " + std::to_string(max_upload) + " bytes";
+      return false;
+    }
+    return true;
   }
   if (!type.empty() && type != "application/x-www-form-urlencoded") {
     *reason = "unsupported content type: send application/x-www-form-urlencoded";
@@ -64,7 +80,7 @@ bool ReadFormBody(int fd, CgiRequest* out, std::string* reason) {
 
 }  // namespace
 
-bool ReadCgiRequest(int body_fd, CgiRequest* out, std::string* reason) {
+bool ReadCgiRequest(int body_fd, uint64_t max_upload, CgiRequest* out, std::string* reason) {
   out->method = Env("REQUEST_METHOD");
   out->cookie = Env("HTTP_COOKIE");
   out->token = Env("HTTP_X_KIVO_TOKEN");
@@ -78,7 +94,7 @@ bool ReadCgiRequest(int body_fd, CgiRequest* out, std::string* reason) {
     *reason = "query string: " + error;
     return false;
   }
-  if (out->method == "POST" && !ReadFormBody(body_fd, out, reason)) return false;
+  if (out->method == "POST" && !ReadFormBody(body_fd, max_upload, out, reason)) return false;
   if (out->query.size() + out->body.size() > kMaxFields) {
     *reason = "too many parameters";
     return false;

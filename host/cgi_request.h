@@ -2,6 +2,7 @@
 // on stdin, turned into the web API's parameters.
 #pragma once
 
+#include <cstdint>
 #include <string>
 
 #include "webapi/url_encoded.h"
@@ -13,6 +14,8 @@ struct CgiRequest {
   std::string accept_language;  // HTTP_ACCEPT_LANGUAGE
   FormFields query;             // fields of the query string, in order
   FormFields body;              // fields of an urlencoded body, in order
+  std::string boundary;         // multipart/form-data: its boundary (the body is left unread)
+  uint64_t content_length = 0;
 };
 
 // Limits that keep a hostile request from costing memory or time.
@@ -21,9 +24,11 @@ constexpr size_t kMaxFields = 1000;
 
 // Reads the request from the environment and `body_fd`. Returns false with a
 // short reason for the client when the request is malformed: an invalid
-// percent-escape, an unsupported method or content type, a body larger than
-// kMaxBodyBytes or shorter than its CONTENT_LENGTH, too many fields.
-bool ReadCgiRequest(int body_fd, CgiRequest* out, std::string* reason);
+// percent-escape, an unsupported method or content type, an urlencoded body
+// larger than kMaxBodyBytes or shorter than its CONTENT_LENGTH, a multipart
+// body larger than `max_upload` or without a boundary, too many fields. A
+// multipart body is not read here: it streams to the handler (`boundary`).
+bool ReadCgiRequest(int body_fd, uint64_t max_upload, CgiRequest* out, std::string* reason);
 
 // The value of cookie `name` in a Cookie header; empty when absent.
 std::string CookieValue(const std::string& header, const std::string& name);

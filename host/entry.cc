@@ -3,6 +3,7 @@
 // tables of the loaded modules, checks who is calling, runs the row's
 // parameter checker and handler, and writes the JSON answer.
 
+#include <dlfcn.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -17,8 +18,11 @@
 #include "host/cgi_request.h"
 #include "host/host_api.h"
 #include "host/module_table.h"
+#include "host/multipart/multipart_source.h"
+#include "host/session_store.h"
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
+#include "webapi/api_upload.h"
 
 namespace {
 
@@ -94,12 +98,38 @@ void RunModuleAPI(const CgiRequest& cgi, APIRequest* request, APIResponse* respo
   route.handler(request, response);
 }
 
+// Opens the multipart reader library beside the platform library and reads
+// the fields posted before the file. Null (with `*reason`) on failure.
+std::unique_ptr<UploadSource> OpenUpload(const CgiRequest& cgi, APIRequest* request,
+                                         std::string* reason) {
+  std::string lib = DefaultModuleDir() + "/../../libkivo_multipart.so";
+  void* handle = dlopen(lib.c_str(), RTLD_NOW | RTLD_LOCAL);
+  auto open = handle ? reinterpret_cast<KivoOpenMultipartFn>(dlsym(handle, "KivoOpenMultipart")) : nullptr;
+  std::unique_ptr<UploadSource> source(
+      open ? open(STDIN_FILENO, cgi.content_length, cgi.boundary.c_str()) : nullptr);
+  Json::Value fields(Json::objectValue);
+  if (!source || source->ReadFields(fields) != UPLOAD_OK) {
+    *reason = source ? "malformed multipart body" : "cannot read multipart bodies";
+    return nullptr;
+  }
+  for (const std::string& name : fields.getMemberNames()) request->AddRawParam(name, fields[name].asString());
+  return source;
+}
+
 void Serve(APIRequest* request, APIResponse* response) {
   CgiRequest cgi;
   std::string reason;
-  if (!ReadCgiRequest(STDIN_FILENO, &cgi, &reason)) return response->SetError(kErrBadRequest, Reason(reason));
+  if (!ReadCgiRequest(STDIN_FILENO, LoadUploadLimit(), &cgi, &reason)) {
+    return response->SetError(kErrBadRequest, Reason(reason));
+  }
   for (const auto& field : cgi.query) request->AddRawParam(field.first, field.second);
   for (const auto& field : cgi.body) request->AddRawParam(field.first, field.second);
+  std::unique_ptr<UploadSource> upload;
+  if (!cgi.boundary.empty()) {
+    upload = OpenUpload(cgi, request, &reason);
+    if (!upload) return response->SetError(kErrBadRequest, Reason(reason));
+    request->SetUploadSource(upload.get());
+  }
   if (!ReadIdentity(request)) {
     return response->SetError(kErrBadRequest, Reason("api, method and version are required"));
   }
@@ -110,6 +140,7 @@ void Serve(APIRequest* request, APIResponse* response) {
     return RunHostAPI(cgi, request, modules.get(), response);
   }
   RunModuleAPI(cgi, request, response);
+  request->SetUploadSource(nullptr);
 }
 
 void WriteAnswer(APIResponse& response) {

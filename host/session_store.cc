@@ -50,6 +50,15 @@ SessionLimits LoadSessionLimits() {
   return limits;
 }
 
+uint64_t LoadUploadLimit() {
+  KeyValueMap conf;
+  uint64_t limit = 4ULL << 30;
+  if (KIVOKeyValueLoad(KIVORootPath("/etc/kivo/webapi.conf"), &conf) && !conf["max_upload_bytes"].empty()) {
+    limit = std::strtoull(conf["max_upload_bytes"].c_str(), nullptr, 10);
+  }
+  return limit;
+}
+
 SessionStore::SessionStore(SessionLimits limits)
     : limits_(limits), dir_(KIVORootPath("/run/kivo/sessions")) {}
 

@@ -6,6 +6,7 @@
 // modification time is the last use) or when it is older than `max_age`.
 #pragma once
 
+#include <cstdint>
 #include <ctime>
 #include <string>
 
@@ -48,6 +49,10 @@ class SessionStore {
 // Reads the limits from "/etc/kivo/webapi.conf" (session_idle_timeout,
 // session_max_age, in seconds); defaults for missing or bad values.
 SessionLimits LoadSessionLimits();
+
+// The largest upload the host accepts: "max_upload_bytes" of
+// /etc/kivo/webapi.conf, 4 GiB by default.
+uint64_t LoadUploadLimit();
 
 // Compares without an early exit, so timing does not tell how much matched.
 bool ConstantTimeEquals(const std::string& a, const std::string& b);

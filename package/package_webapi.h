@@ -84,6 +84,22 @@ class PackageWebAPI {
                        Json::Value& out);
   bool IsBrickCached(const std::string& target, std::map<std::string, bool>& cache);
 
+  // Installation (install.cc, environment.cc, misc.cc).
+  bool CheckPackageFileInfo(const char* path, PackageInfo& info);
+  bool CheckPackageFileInfo(const char* path, PackageInfo& info, bool strictCodesign,
+                            Json::Value& result);
+  bool UploadAndDescribe(const std::string& file, Json::Value& result);
+  bool InstallPackageFile(const char* path);
+  bool VolumeListGet(Json::Value& out);
+  bool TinboxSpaceOk(const std::string& install_type);
+  bool CheckEnvConflicts(PackageManager& manager, const std::string& id, const std::string& version,
+                         const std::string& conflicts, Json::Value& result);
+  bool CheckEnvServices(PackageManager& manager, const std::string& depsers, int version,
+                        Json::Value& result);
+  bool CheckEnvDependencies(PackageManager& manager, const std::string& deppkgs, Json::Value& result);
+  bool CheckEnvDependents(PackageManager& manager, const std::string& id, Json::Value& result);
+  bool DeleteTmpFile(const char* path);
+
   // Start and stop (control.cc).
   void StartStop(bool start);
   bool ServiceControl(const char* name, bool start, Json::Value& result);

@@ -19,13 +19,6 @@ void PackageWebAPI::AnswerNotAvailable(const char* member) {
 #define KIVO_NOT_AVAILABLE(name) \
   void PackageWebAPI::name() { AnswerNotAvailable(#name); }
 
-KIVO_NOT_AVAILABLE(CheckEnv)
-KIVO_NOT_AVAILABLE(ReadProgress)
-KIVO_NOT_AVAILABLE(CancelProgress)
-KIVO_NOT_AVAILABLE(Upload)
-KIVO_NOT_AVAILABLE(Install)
-KIVO_NOT_AVAILABLE(CleanTmp)
-KIVO_NOT_AVAILABLE(DeleteTmp)
 KIVO_NOT_AVAILABLE(CheckDownloadPkgInfo)
 KIVO_NOT_AVAILABLE(ListServerPackage)
 KIVO_NOT_AVAILABLE(CheckUpdate)

@@ -3,6 +3,8 @@
 #include <sys/stat.h>
 #include <sys/statvfs.h>
 
+#include <algorithm>
+#include <cstring>
 #include <mutex>
 
 #include <cstdio>
@@ -133,3 +135,54 @@ int KIVOVolumeIsUsedByGlusterFs(const std::string& path) {
   if (!VolumeOfRealPath(path, &v)) return -1;
   return v.brick ? 1 : 0;
 }
+
+bool KLIBCIsTinbox() { return KIVODeviceLoad().kind == "tinbox"; }
+
+int KIVOMountVolInfoGet(const char* path, KIVOMountVolInfo* info) {
+  VolumeConfig v;
+  if (!path || !info || !KIVOVolumeFind(path, &v) || v.path != path) return -1;
+  int64_t free_bytes = KIVOVolumeFreeBytes(v);
+  info->available = v.usable() && free_bytes >= 0 ? 1 : 0;
+  info->free_bytes = free_bytes > 0 ? static_cast<uint64_t>(free_bytes) : 0;
+  return 0;
+}
+
+int KIVOShareTmpPathGet(const char* path, char* buf, int size) {
+  VolumeConfig v;
+  if (!path || !buf || size <= 0 || !VolumeOfRealPath(path, &v)) return -1;
+  std::string tmp = KIVORootPath(v.path + "/@tmp");
+  if (static_cast<int>(tmp.size()) >= size) return -1;
+  memcpy(buf, tmp.c_str(), tmp.size() + 1);
+  return static_cast<int>(tmp.size());
+}
+
+namespace KIVO {
+namespace PXS {
+namespace STORAGE_WEBUTILS {
+
+bool Volume::VolumeListGet(Json::Value& out, bool with_unusable) {
+  struct stat st;
+  if (stat(KIVORootPath("/etc/kivo/volumes.json").c_str(), &st) != 0) return false;
+  Json::Value list(Json::arrayValue);
+  for (const VolumeConfig& v : KIVOVolumesLoad()) {
+    if (!v.usable() && !with_unusable) continue;
+    struct statvfs fs;
+    Json::Value entry(Json::objectValue);
+    entry["volume_path"] = v.path;
+    entry["status"] = v.status;
+    entry["size_free_byte"] = std::to_string(std::max<int64_t>(0, KIVOVolumeFreeBytes(v)));
+    uint64_t total = statvfs(KIVORootPath(v.path).c_str(), &fs) == 0
+                         ? static_cast<uint64_t>(fs.f_blocks) * fs.f_frsize : 0;
+    if (v.cap_bytes > 0 && v.cap_bytes < total) total = v.cap_bytes;
+    entry["size_total_byte"] = std::to_string(total);
+    entry["is_brick"] = v.brick;
+    list.append(entry);
+  }
+  out["volume_count"] = list.size();
+  out["volumes"] = list;
+  return true;
+}
+
+}  // namespace STORAGE_WEBUTILS
+}  // namespace PXS
+}  // namespace KIVO

@@ -16,6 +16,8 @@
 #include <string>
 #include <vector>
 
+#include <json/value.h>
+
 struct VolumeConfig {
   std::string path;    // "/volume1", as the appliance names it
   std::string status;  // "normal", "degraded", "crashed", ...
@@ -56,3 +58,42 @@ int VolumePathParseEx(const std::string& path, std::string& volume);
 // 1 when the volume holding the real path `path` serves as a cluster file
 // system brick, 0 when not, -1 when the path lies on no volume.
 int KIVOVolumeIsUsedByGlusterFs(const std::string& path);
+
+// True on the single-volume device kind ("tinbox" in device.conf).
+bool KLIBCIsTinbox();
+
+// The mount facts of a volume path ("/volume1").
+struct KIVOMountVolInfo {
+  int available = 0;        // 1 when the volume is mounted and usable
+  uint64_t free_bytes = 0;  // free space (statvfs, capped)
+};
+// 0 and `info` filled, or -1 when `path` is no configured volume.
+int KIVOMountVolInfoGet(const char* path, KIVOMountVolInfo* info);
+
+// The temporary folder of the shared folder that holds the real path
+// `path` ("<root>/volume1/<share>/x"): the volume's "@tmp" folder, where
+// uploads and downloads are kept. Written to `buf` (NUL-terminated); the
+// length, or -1 when `path` lies on no volume or `buf` is too small.
+int KIVOShareTmpPathGet(const char* path, char* buf, int size);
+
+namespace KIVO {
+namespace PXS {
+namespace STORAGE_WEBUTILS {
+
+// The volume list the web desktop shows for installs.
+class Volume {
+ public:
+  // `flags` selects the volumes; every kind lists the usable ones.
+  explicit Volume(int flags) : flags_(flags) {}
+  // out["volumes"] = [{"volume_path", "status", "size_free_byte",
+  // "size_total_byte", "is_brick"}], out["volume_count"]. False when the
+  // storage configuration cannot be read.
+  bool VolumeListGet(Json::Value& out, bool with_unusable);
+
+ private:
+  int flags_;
+};
+
+}  // namespace STORAGE_WEBUTILS
+}  // namespace PXS
+}  // namespace KIVO

@@ -10,6 +10,8 @@
 
 #include "webapi/api_parameter.h"
 
+class UploadSource;
+
 class APIRequest {
  public:
   APIRequest() = default;
@@ -64,6 +66,9 @@ class APIRequest {
 
   void SetAPI(const std::string& api, const std::string& method, int version);
   void SetLoginUserName(const std::string& user) { user_ = user; }
+  // The posted body of a multipart request (null otherwise); owned by the host.
+  UploadSource* GetUploadSource() const { return upload_; }
+  void SetUploadSource(UploadSource* upload) { upload_ = upload; }
   void SetUILanguage(const std::string& language) { language_ = language; }
 
  private:
@@ -82,4 +87,5 @@ class APIRequest {
   int version_ = 0;
   std::string user_;
   std::string language_ = "enu";
+  UploadSource* upload_ = nullptr;
 };

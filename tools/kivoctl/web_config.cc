@@ -13,7 +13,9 @@ std::string KIVOWebConfig(const WebConfigOptions& o) {
          // entry.cgi decodes the body itself; hand it over as it arrives
          // instead of buffering whole uploads in the web server.
          "server.stream-request-body = 2\n"
-         "server.max-request-size = 8388608\n"
+         // Uploads stream through; entry.cgi applies its own limit
+         // ("max_upload_bytes"), so the web server only caps at 4 GiB.
+         "server.max-request-size = 4194304\n"
          "alias.url = (\"/webapi/entry.cgi\" => \"" + o.entry_cgi + "\")\n"
          "$HTTP[\"url\"] == \"/webapi/entry.cgi\" {\n"
          "  cgi.assign = (\"\" => \"\")\n"
