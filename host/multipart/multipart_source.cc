@@ -61,7 +61,8 @@ class MultipartSource : public UploadSource {
 
   int ReadFields(Json::Value& fields) override {
     try {
-      ReadUntilFile(fields);
+      ReadUntilFile();
+      CopySeen(fields);
       return UPLOAD_OK;
     } catch (const std::exception&) {
       return UPLOAD_FAILED;
@@ -71,7 +72,7 @@ class MultipartSource : public UploadSource {
   int StoreFile(Json::Value& fields) override {
     std::string path;
     try {
-      ReadUntilFile(fields);
+      ReadUntilFile();
       if (!file_next_) return UPLOAD_NO_FILE;
       int code = OpenTarget(&path);
       if (code != UPLOAD_OK) return code;
@@ -81,9 +82,10 @@ class MultipartSource : public UploadSource {
         unlink(path.c_str());
         return code;
       }
-      fields["file_tmp"] = path;
-      fields["file_name"] = file_name_;
-      ReadUntilFile(fields);  // the fields after the file
+      seen_["file_tmp"] = path;
+      seen_["file_name"] = file_name_;
+      ReadUntilFile();  // the fields after the file
+      CopySeen(fields);
       return UPLOAD_OK;
     } catch (const std::exception&) {
       if (!path.empty()) unlink(path.c_str());
@@ -92,8 +94,14 @@ class MultipartSource : public UploadSource {
   }
 
  private:
-  // Reads parts into `fields` until a file part is next (or the body ends).
-  void ReadUntilFile(Json::Value& fields) {
+  // Every field read so far goes to `fields`: the host reads the fields
+  // before the file first, and a handler asks for them again.
+  void CopySeen(Json::Value& fields) {
+    for (const std::string& name : seen_.getMemberNames()) fields[name] = seen_[name];
+  }
+
+  // Reads parts into seen_ until a file part is next (or the body ends).
+  void ReadUntilFile() {
     while (!file_next_ && reader_.hasNextPart()) {
       Poco::Net::MessageHeader header;
       reader_.nextPart(header);
@@ -116,7 +124,7 @@ class MultipartSource : public UploadSource {
         }
         value.append(buf, static_cast<size_t>(part.gcount()));
       }
-      fields[params.get("name", "")] = value;
+      seen_[params.get("name", "")] = value;
     }
   }
 
@@ -171,6 +179,7 @@ class MultipartSource : public UploadSource {
   FdStreamBuf buf_;
   std::istream in_;
   Poco::Net::MultipartReader reader_;
+  Json::Value seen_{Json::objectValue};
   bool file_next_ = false;
   std::string file_field_;
   std::string file_name_;

@@ -295,7 +295,8 @@ bool CheckFile(const char* language, const std::string& path, std::string& messa
   PackageFileReader reader;
   int result = reader.Open(path, &message);
   if (result == PKG_OK) {
-    InfoFromHeader(path, reader.header(), PKG_OP_NONE, language, &info);
+    bool installed = PackageRegistry::IsInstalled(PackageInfo(reader.header().info).getId());
+    InfoFromHeader(path, reader.header(), installed ? PKG_OP_UPGRADE : PKG_OP_INSTALL, language, &info);
     result = reader.ReadPayload(PackageFileReader::Payload::Check, "", nullptr, &message);
   }
   if (result == PKG_OK) result = PMSCheckPackageFits(info, PKG_ERR_ARCH, &message, &details);

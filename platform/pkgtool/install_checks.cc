@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstdlib>
 
+#include "klibc/last_error.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
@@ -99,7 +100,12 @@ int PMSChooseVolume(const PackageInfo& info, const std::string& requested, uint6
                     VolumeConfig* out, std::string* message) {
   std::string wanted = requested;
   if (wanted.empty()) PMSGetPackageVol(info.getId(), wanted);
-  if (wanted.empty()) PMSGetPackageDefVol(wanted);
+  if (wanted.empty() && !PMSGetPackageDefVol(wanted)) {
+    // The default volume is set but cannot take the package; one that is
+    // gone altogether leaves the choice to the first usable volume.
+    if (KLIBCErrGet() == KLIBC_ERR_VOLUME_CRASHED) return Refuse(PKG_ERR_VOLUME_CRASHED, "the default volume is crashed", message);
+    if (KLIBCErrGet() == KLIBC_ERR_NO_SPACE) return Refuse(PKG_ERR_NO_SPACE, "the default volume is full", message);
+  }
   bool found = false;
   if (!wanted.empty()) {
     found = KIVOVolumeFind(wanted, out);

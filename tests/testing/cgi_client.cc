@@ -122,3 +122,37 @@ CgiAnswer ApiClient::Call(const std::string& api, const std::string& method, int
                       {"HTTP_HOST", "nas.example:5000"}},
                      body);
 }
+
+std::string MultipartBody(const Params& fields, const std::string& file_name,
+                          const std::string& content, std::string* content_type) {
+  const std::string boundary = "----kivo-test-boundary-7d1f";
+  *content_type = "multipart/form-data; boundary=" + boundary;
+  std::string body;
+  for (const auto& f : fields) {
+    body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"" + f.first + "\"\r\n\r\n" +
+            f.second + "\r\n";
+  }
+  body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"file\"; filename=\"" + file_name +
+          "\"\r\nContent-Type: application/octet-stream\r\n\r\n" + content + "\r\n--" + boundary +
+          "--\r\n";
+  return body;
+}
+
+CgiAnswer ApiClient::Upload(const std::string& api, const std::string& method, int version,
+                            const Params& fields, const std::string& path) const {
+  std::string content, content_type;
+  FILE* f = fopen(path.c_str(), "rb");
+  char buf[65536];
+  for (size_t n; f && (n = fread(buf, 1, sizeof(buf), f)) > 0;) content.append(buf, n);
+  if (f) fclose(f);
+  std::string body = MultipartBody(fields, path.substr(path.rfind('/') + 1), content, &content_type);
+  return RunEntryCgi({{"REQUEST_METHOD", "POST"},
+                      {"QUERY_STRING", EncodeForm({{"api", api}, {"method", method},
+                                                   {"version", std::to_string(version)}})},
+                      {"CONTENT_TYPE", content_type},
+                      {"CONTENT_LENGTH", std::to_string(body.size())},
+                      {"HTTP_COOKIE", "id=" + sid_},
+                      {"HTTP_X_KIVO_TOKEN", token_},
+                      {"HTTP_HOST", "nas.example:5000"}},
+                     body);
+}

@@ -22,11 +22,15 @@ struct CgiAnswer {
 };
 
 using CgiEnv = std::map<std::string, std::string>;
+using Params = std::vector<std::pair<std::string, std::string>>;
+
+// A multipart/form-data body of `fields` and a file part "file" with
+// `content`; *content_type gets the header value.
+std::string MultipartBody(const Params& fields, const std::string& file_name,
+                          const std::string& content, std::string* content_type);
 
 // Runs entry.cgi with `env` (plus KIVO_ROOT and PATH) and `body` on stdin.
 CgiAnswer RunEntryCgi(const CgiEnv& env, const std::string& body = "");
-
-using Params = std::vector<std::pair<std::string, std::string>>;
 
 // "a=1&b=2" with each name and value percent-encoded.
 std::string EncodeForm(const Params& params);
@@ -45,6 +49,10 @@ class ApiClient {
   // session as cookie and token header, as the web desktop does.
   CgiAnswer Call(const std::string& api, const std::string& method, int version,
                  const Params& params = {}) const;
+  // Posts `fields` and the file `path` (field "file") as multipart/form-data,
+  // with api, method and version in the query string, as the desktop does.
+  CgiAnswer Upload(const std::string& api, const std::string& method, int version,
+                   const Params& fields, const std::string& path) const;
 
  private:
   std::string sid_;

@@ -1,0 +1,386 @@
+// Installing from a package file through the real host: upload, check,
+// install, status and cancel, clean and delete.
+
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <memory>
+
+#include <gtest/gtest.h>
+
+#include "klibc/atomic_file.h"
+#include "klibc/process.h"
+#include "pkgtool/pms.h"
+#include "pkgtool/registry.h"
+#include "taskmgr/task.h"
+#include "testing/cgi_client.h"
+#include "testing/gpg_keys.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+
+namespace {
+
+constexpr char kInst[] = "KIVO.Core.Package.Installation";
+
+class InstallFlowTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_.AddAccount("admin", "secret", {"administrators"});
+    Trust(1);
+    dir_ = root_.Path("/tmp/packages");
+  }
+  void TearDown() override {
+    for (pid_t pid : children_) {
+      kill(pid, SIGKILL);
+      waitpid(pid, nullptr, 0);
+    }
+    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
+  }
+  void Trust(int level) {
+    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"" + std::to_string(level) + "\"\n");
+  }
+  const ApiClient& client() {
+    if (!client_) client_.reset(new ApiClient("admin", "secret"));
+    return *client_;
+  }
+  CgiAnswer Upload(const std::string& file, const Params& fields = {}) {
+    return client().Upload(kInst, "upload", 1, fields, file);
+  }
+  CgiAnswer Call(const std::string& method, const Params& params, int version = 1) {
+    return client().Call(kInst, method, version, params);
+  }
+  // Files left in the upload area.
+  int Uploads() {
+    std::string out;
+    RunProgram({"sh", "-c", "ls -A '" + root_.Path("/volume1/@tmp/upload") + "' 2>/dev/null | wc -l"}, &out);
+    return std::atoi(out.c_str());
+  }
+  pid_t Spawn(const std::vector<std::string>& argv) {
+    pid_t pid = fork();
+    if (pid == 0) {
+      setpgid(0, 0);
+      std::vector<char*> args;
+      for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+      args.push_back(nullptr);
+      execvp(args[0], args.data());
+      _exit(1);
+    }
+    children_.push_back(pid);
+    return pid;
+  }
+
+  TempRoot root_;
+  std::string dir_;
+  std::unique_ptr<ApiClient> client_;
+  std::vector<pid_t> children_;
+};
+
+TEST_F(InstallFlowTest, UploadCheckInstallStatusList) {
+  TestPackage app;
+  app.info = {{"displayname", "Test App"}, {"install_dep_services", "pgsql"}};
+  app.members = {{"LICENSE", "Use it well."},
+                 {"WIZARD_UIFILES/install_uifile", "[{\"step_title\": \"Welcome\"}]"}};
+  CgiAnswer up = Upload(app.Build(dir_), {{"additional", "[\"status\",\"beta\"]"}});
+  ASSERT_TRUE(up.Success()) << up.body;
+  const Json::Value& d = up.Data();
+  EXPECT_EQ("test-app", d["id"].asString());
+  EXPECT_EQ("Test App", d["name"].asString());
+  EXPECT_EQ("Use%20it%20well.", d["licence"].asString());
+  EXPECT_EQ("%5B%7B%22step_title%22%3A%22Welcome%22%7D%5D", d["install_pages"].asString());
+  EXPECT_EQ("non_installed", d["additional"]["status"].asString());
+  EXPECT_FALSE(d.isMember("codesign_error"));
+  std::string task_id = d["task_id"].asString();
+  EXPECT_EQ(0u, task_id.find("@KIVOPKG_UPLOAD_"));
+  EXPECT_EQ(1, Uploads());
+
+  CgiAnswer check = Call("check", {{"id", "test-app"}, {"depsers", "pgsql"}, {"size", "1000"}}, 2);
+  ASSERT_TRUE(check.Success()) << check.body;
+  EXPECT_EQ(1u, check.Data()["volume_count"].asUInt());
+  EXPECT_FALSE(check.Data()["is_occupied"].asBool());
+
+  CgiAnswer install = Call("install", {{"task_id", task_id}, {"installrunpackage", "true"}, {"type", "1"}});
+  ASSERT_TRUE(install.Success()) << install.body;
+  EXPECT_TRUE(install.Data()["worker_message"].isArray());
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(task_id));
+  EXPECT_TRUE(Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_test-app"}}).Data()["finished"].asBool());
+  CgiAnswer list = client().Call("KIVO.Core.Package", "list", 1, {{"additional", "[\"status\"]"}});
+  EXPECT_EQ("running", list.Data()["packages"][0]["additional"]["status"].asString());
+}
+
+TEST_F(InstallFlowTest, StatusShowsAnUpgradeInProgress) {
+  TestPackage v1;
+  ASSERT_EQ(0, Kivoctl({"install", v1.Build(dir_)}));
+  TestPackage v2 = v1;
+  v2.version = "2.0";
+  v2.files = {{"data.bin", std::string(1 << 20, 'z')}};
+  v2.scripts = {{"preupgrade", "sleep 2\n"}};
+  std::string file = v2.Build(dir_);
+  pid_t installer = fork();
+  if (installer == 0) _exit(client().Call(kInst, "install", 1, {{"path", file}}).Success() ? 0 : 1);
+  std::string status;
+  double last_progress = -1;
+  for (int i = 0; i < 150 && status != "upgrading"; ++i) {
+    usleep(20000);
+    CgiAnswer s = Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_test-app"}});
+    status = s.Data()["status"].asString();
+    last_progress = s.Data()["progress"].asDouble();
+  }
+  EXPECT_EQ("upgrading", status);
+  EXPECT_GE(last_progress, 0.0);
+  int exit_status;
+  waitpid(installer, &exit_status, 0);
+  EXPECT_EQ(0, WEXITSTATUS(exit_status));
+  KeyValueMap info;
+  ASSERT_TRUE(PackageRegistry::ReadInfo("test-app", &info));
+  EXPECT_EQ("2.0", info["version"]);
+}
+
+TEST_F(InstallFlowTest, RefusalsAtUploadComeFromRealState) {
+  root_.Write("/etc/kivo/device.conf", "os_version=\"7.2-0064\"\n");
+  TestPackage future;
+  future.id = "future";
+  future.info = {{"os_min_ver", "9.0-0001"}};
+  CgiAnswer low = Upload(future.Build(dir_));
+  EXPECT_EQ(4538, low.Code());
+  EXPECT_EQ("9.0-0001", low.Errors()["firmware"].asString());
+  TestPackage old;
+  old.id = "old";
+  old.info = {{"os_max_ver", "6.2-0064"}};
+  EXPECT_EQ("6.2-0064", Upload(old.Build(dir_)).Errors()["firmware"].asString());
+
+  TestPackage base;
+  base.id = "base";
+  ASSERT_EQ(0, Kivoctl({"install", base.Build(dir_)}));
+  TestPackage rival;
+  rival.id = "rival";
+  rival.info = {{"install_conflict_packages", "base"}};
+  CgiAnswer conflict = Upload(rival.Build(dir_));
+  EXPECT_EQ(4524, conflict.Code());
+  EXPECT_EQ("base", conflict.Errors()["packages"].asString());
+
+  TestPackage needs;
+  needs.id = "needs";
+  needs.info = {{"install_dep_packages", "base:missing-one"}};
+  CgiAnswer dep = Upload(needs.Build(dir_));
+  EXPECT_EQ(4526, dep.Code());
+  EXPECT_EQ("base", dep.Errors()["unstart_packages"].asString());
+  EXPECT_EQ("missing-one", dep.Errors()["uninstall_packages"][0].asString());
+
+  root_.Write("/etc/kivo/services.conf", "pgsql=\"stopped\"\n");
+  TestPackage db;
+  db.id = "db";
+  db.info = {{"install_dep_services", "pgsql"}};
+  CgiAnswer service = Upload(db.Build(dir_));
+  EXPECT_EQ(4525, service.Code());
+  EXPECT_EQ("pgsql", service.Errors()["services"][0].asString());
+
+  TestPackage big;
+  big.id = "big";
+  big.files = {{"zeros", std::string(4 << 20, '\0')}};  // 4 MiB unpacked, a few KiB packed
+  std::string big_file = big.Build(dir_);
+  root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 3000000}]");
+  EXPECT_EQ(4504, Upload(big_file).Code());
+  root_.Write("/etc/kivo/volumes.json",
+              "[{\"path\": \"/volume1\", \"status\": \"normal\"}, {\"path\": \"/volume2\", \"status\": \"crashed\"}]");
+  root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\npkg_def_volume=\"/volume2\"\n");
+  EXPECT_EQ(4505, Upload(big_file).Code());
+  root_.Write("/etc/kivo/volumes.json", "[]");
+  EXPECT_EQ(4502, Upload(big_file).Code());  // nowhere to store the upload
+
+  EXPECT_EQ(0, Uploads());  // refused uploads leave nothing behind
+  std::string junk = dir_ + "/junk.kpk";
+  root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"normal\"}]");
+  KIVOWriteFileAtomic(junk, "not a package", SyncToDisk::No);
+  EXPECT_EQ(4521, Upload(junk).Code());
+  EXPECT_EQ(0, Uploads());
+}
+
+TEST_F(InstallFlowTest, CodeSignatureIsLenientAtUploadAndStrictAtInstall) {
+  TestKeys keys(root_.Path("/tmp"));
+  std::string stranger = keys.Create("Stranger <s@test.invalid>");
+  TestPackage signed_app;
+  std::string text;
+  for (int i = 0; i < 500; ++i) text += std::to_string(i * 7919) + " ";
+  signed_app.files = {{"text.txt", text}};  // a payload big enough to tamper with
+  std::string file = signed_app.Build(dir_);
+  keys.Sign(file, stranger);
+  Trust(0);
+  CgiAnswer up = Upload(file);
+  ASSERT_TRUE(up.Success()) << up.body;
+  EXPECT_EQ(4533, up.Data()["codesign_error"].asInt());
+  CgiAnswer strict = Call("install", {{"task_id", up.Data()["task_id"].asString()}});
+  EXPECT_EQ(4533, strict.Code());
+  EXPECT_FALSE(PackageRegistry::IsInstalled("test-app"));
+  // The failed install leaves its tasks finished for the status call.
+  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(*new NVX::TaskMgr("@administrators"), "@KIVOPKG_DOWNLOAD_test-app"));
+  ASSERT_TRUE(task);
+  EXPECT_TRUE(task->isFinished());
+
+  TestPackage unsigned_app;
+  unsigned_app.id = "unsigned";
+  CgiAnswer up2 = Upload(unsigned_app.Build(dir_));
+  EXPECT_EQ(4531, up2.Data()["codesign_error"].asInt());
+  CgiAnswer lenient = Call("install", {{"task_id", up2.Data()["task_id"].asString()}, {"check_codesign", "false"}});
+  EXPECT_TRUE(lenient.Success()) << lenient.body;
+
+  std::string tampered_file = dir_ + "/tampered.kpk";
+  std::string data;
+  KIVOReadFile(file, &data);
+  data[data.find("\x1f\x8b\x08", data.find("package.tgz")) + 30] ^= 0x40;
+  KIVOWriteFileAtomic(tampered_file, data, SyncToDisk::No);
+  EXPECT_EQ(4532, Upload(tampered_file).Data()["codesign_error"].asInt());
+}
+
+TEST_F(InstallFlowTest, EnvironmentCheckVersionsServicesAndLock) {
+  root_.Write("/etc/kivo/services.conf", "pgsql=\"stopped\"\nweb=\"stopped\"\nssh=\"running\"\n");
+  CgiAnswer v1 = Call("check", {{"depsers", "web:ssh:pgsql"}}, 1);
+  EXPECT_EQ(4525, v1.Code());
+  EXPECT_EQ(0x3u, v1.Errors()["services"].asUInt());  // pgsql and web bits
+  EXPECT_FALSE(v1.Errors().isMember("volume_count"));  // the pgsql case drops the volume list
+  CgiAnswer v2 = Call("check", {{"depsers", "web:ssh"}}, 2);
+  EXPECT_EQ(4525, v2.Code());
+  EXPECT_EQ("web", v2.Errors()["services"][0].asString());
+  EXPECT_TRUE(v2.Errors().isMember("volume_count"));
+
+  TestPackage base;
+  base.id = "base";
+  ASSERT_EQ(0, Kivoctl({"install", base.Build(dir_), "--run"}));
+  // Version 1 tests conflicts with the version "1" whatever "ver" says.
+  CgiAnswer conflict = Call("check", {{"id", "new"}, {"conflictpkgs", "{\"base\": {\"operator\": \">=\", \"version\": \"1\"}}"},
+                                      {"ver", "5"}}, 1);
+  EXPECT_EQ(4524, conflict.Code());
+  EXPECT_EQ("base", conflict.Errors()["packages"].asString());
+  CgiAnswer deps = Call("check", {{"deppkgs", "{\"base\": {}, \"absent\": {}}"}}, 2);
+  EXPECT_EQ(4526, deps.Code());
+  EXPECT_EQ("absent", deps.Errors()["uninstall_packages"][0].asString());
+
+  TestPackage user;
+  user.id = "user";
+  user.info = {{"displayname", "User App"}, {"install_dep_packages", "base"}};
+  ASSERT_EQ(0, Kivoctl({"install", user.Build(dir_), "--run"}));
+  CgiAnswer dependents = Call("check", {{"id", "base"}}, 2);
+  EXPECT_EQ(4552, dependents.Code());
+  EXPECT_EQ("User App", dependents.Errors()["packages"].asString());
+  EXPECT_TRUE(Call("check", {{"id", "base"}, {"blCheckDep", "false"}}, 2).Success());
+
+  root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\npkg_def_volume=\"/volume1\"\n");
+  int lock = PMSLockFile(root_.Path("/run/kivo/pkgtool/lock"), 1);
+  CgiAnswer busy = Call("check", {{"id", "new"}}, 2);
+  ASSERT_TRUE(busy.Success()) << busy.body;
+  EXPECT_TRUE(busy.Data()["is_occupied"].asBool());
+  EXPECT_EQ("/volume1", busy.Data()["volume_path"].asString());
+  PMSUnlockFile(lock);
+}
+
+TEST_F(InstallFlowTest, StatusAndCancelOfJobs) {
+  EXPECT_TRUE(Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_none"}}).Data()["finished"].asBool());
+  EXPECT_TRUE(Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_none"}}).Success());
+
+  auto make_task = [](const std::string& id, const Json::Value& data, double progress) {
+    std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", id.c_str()));
+    task->setProperty("data", data);
+    task->setProperty("progress", progress);
+  };
+  // A download whose worker lives: cancel stops it and drops its folder.
+  std::string folder = root_.Path("/volume1/@tmp/download-x");
+  KIVOFSMkdirP(folder.c_str());
+  Json::Value job(Json::objectValue);
+  job["pid"] = Spawn({"sleep", "60"});
+  job["tmp_folder"] = folder;
+  make_task("@KIVOPKG_DOWNLOAD_x", job, 0.5);
+  EXPECT_DOUBLE_EQ(0.5, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_x"}}).Data()["progress"].asDouble());
+  ASSERT_TRUE(Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_x"}}).Success());
+  EXPECT_EQ(0, KLIBCProcAlive(job["pid"].asInt()));  // ended (a zombie until this test reaps it)
+  EXPECT_FALSE(KLIBCFileExist(folder.c_str()));
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask("@KIVOPKG_DOWNLOAD_x"));
+
+  // Progress 1.0 counts only with the downloaded file; a negative one ends the job.
+  job["pid"] = Spawn({"sleep", "60"});
+  KIVOFSMkdirP(folder.c_str());
+  make_task("@KIVOPKG_DOWNLOAD_y", job, 1.0);
+  EXPECT_DOUBLE_EQ(0.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
+  root_.Write(folder.substr(root_.dir().size()) + "/@KIVOPKG_DOWNLOAD_y", "payload");
+  EXPECT_DOUBLE_EQ(1.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
+  make_task("@KIVOPKG_DOWNLOAD_y", job, -1.0);
+  EXPECT_DOUBLE_EQ(0.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask("@KIVOPKG_DOWNLOAD_y"));
+  EXPECT_FALSE(KLIBCFileExist(folder.c_str()));
+
+  // An install under way is not cancelled, and its task is dropped all the same.
+  Json::Value install(Json::objectValue);
+  install["pid"] = Spawn({"sleep", "60"});
+  install["installing"] = true;
+  make_task("@KIVOPKG_DOWNLOAD_z", install, 0.0);
+  EXPECT_EQ(4506, Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_z"}}).Code());
+  EXPECT_EQ(1, KLIBCProcAlive(install["pid"].asInt()));
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask("@KIVOPKG_DOWNLOAD_z"));
+
+  // A dead worker: cancel answers success; no pid at all: 4501.
+  job["pid"] = 999999;
+  make_task("@KIVOPKG_DOWNLOAD_dead", job, 0.2);
+  EXPECT_TRUE(Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_dead"}}).Success());
+  job.removeMember("pid");
+  make_task("@KIVOPKG_DOWNLOAD_nopid", job, 0.2);
+  EXPECT_EQ(4501, Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_nopid"}}).Code());
+}
+
+TEST_F(InstallFlowTest, CancelKillsAWorkerThatIgnoresSigterm) {
+  Json::Value job(Json::objectValue);
+  job["pid"] = Spawn({"sh", "-c", "trap '' TERM; while :; do sleep 0.1; done"});
+  usleep(200000);  // let the shell set its trap
+  std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", "@KIVOPKG_DOWNLOAD_stubborn"));
+  task->setProperty("data", job);
+  time_t start = time(nullptr);
+  ASSERT_TRUE(Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_stubborn"}}).Success());
+  EXPECT_GE(time(nullptr) - start, 9);  // ten one-second waits before SIGKILL
+  int status = 0;
+  EXPECT_EQ(job["pid"].asInt(), waitpid(job["pid"].asInt(), &status, 0));
+  EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL);
+}
+
+TEST_F(InstallFlowTest, CleanAndGuardedDelete) {
+  TestPackage app;
+  CgiAnswer up = Upload(app.Build(dir_));
+  ASSERT_TRUE(up.Success()) << up.body;
+  ASSERT_EQ(1, Uploads());
+  ASSERT_TRUE(Call("clean", {{"task_id", up.Data()["task_id"].asString()}}).Success());
+  for (int i = 0; i < 100 && Uploads() > 0; ++i) usleep(20000);
+  EXPECT_EQ(0, Uploads());
+  for (int i = 0; i < 100 && NVX::TaskMgr("@administrators").hasTask(up.Data()["task_id"].asString()); ++i) usleep(20000);
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(up.Data()["task_id"].asString()));
+
+  root_.Write("/etc/keep", "precious");
+  root_.Write("/tmp/junk/file", "junk");
+  root_.Write("/volume1/@tmp/old-download/file", "junk");
+  ASSERT_EQ(0, symlink(root_.Path("/etc").c_str(), root_.Path("/tmp/to-etc").c_str()));
+  for (const std::string& hostile :
+       {root_.Path("/tmp/../etc"), root_.Path("/tmp/../etc/keep"), root_.Path("/tmp/to-etc/keep"),
+        root_.Path("/tmp"), root_.Path("/tmp/"), root_.Path("/volume1/@tmp"), root_.Path("/volume1/public/x"),
+        std::string("/etc/passwd"), std::string("relative/path")}) {
+    EXPECT_EQ(4501, Call("delete", {{"path", hostile}}).Code()) << hostile;
+  }
+  // A symlink inside the temporary folder goes, as a link; its target stays.
+  EXPECT_TRUE(Call("delete", {{"path", root_.Path("/tmp/to-etc")}}).Success());
+  ASSERT_TRUE(Call("delete", {{"path", root_.Path("/tmp/junk")}}).Success());
+  ASSERT_TRUE(Call("delete", {{"path", root_.Path("/volume1/@tmp/old-download")}}).Success());
+  for (int i = 0; i < 100 && (KLIBCFileExist(root_.Path("/tmp/junk").c_str()) ||
+                              KLIBCFileExist(root_.Path("/volume1/@tmp/old-download").c_str()));
+       ++i) {
+    usleep(20000);
+  }
+  EXPECT_FALSE(KLIBCFileExist(root_.Path("/tmp/junk").c_str()));
+  EXPECT_FALSE(KLIBCFileExist(root_.Path("/volume1/@tmp/old-download").c_str()));
+  EXPECT_TRUE(KLIBCFileExist(root_.Path("/etc/keep").c_str()));
+  EXPECT_TRUE(KLIBCFileExist(root_.Path("/etc/passwd").c_str()));
+}
+
+TEST_F(InstallFlowTest, InstallNamingAServerPackageIsNotAvailableYet) {
+  CgiAnswer a = Call("install", {{"name", "demo"}, {"url", "http://127.0.0.1/x.kpk"}, {"filesize", "10"}});
+  EXPECT_EQ(4501, a.Code());
+  EXPECT_EQ("not_available", a.Errors()["reason"].asString());
+  EXPECT_EQ(4501, Call("install", {{"task_id", "@KIVOPKG_UPLOAD_nothing"}}).Code());
+}
+
+}  // namespace
