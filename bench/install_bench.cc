@@ -20,6 +20,7 @@
 
 #include "klibc/atomic_file.h"
 #include "pkgtool/package_builder.h"
+#include "testing/payload_generator.h"
 #include "testing/temp_root.h"
 
 namespace {
@@ -28,37 +29,6 @@ using Clock = std::chrono::steady_clock;
 
 double Seconds(Clock::time_point since) {
   return std::chrono::duration<double>(Clock::now() - since).count();
-}
-
-// Half of each file is random bytes (media-like, incompressible), half text.
-void WriteFile(const std::string& path, size_t size, uint64_t* seed) {
-  std::vector<char> buf(size);
-  for (size_t i = 0; i < size / 2; i += 8) {
-    *seed ^= *seed << 13;
-    *seed ^= *seed >> 7;
-    *seed ^= *seed << 17;
-    memcpy(&buf[i], seed, std::min<size_t>(8, size / 2 - i));
-  }
-  static const char kText[] = "The quick brown fox jumps over the lazy dog 0123456789.\n";
-  for (size_t i = size / 2; i < size; ++i) buf[i] = kText[i % (sizeof(kText) - 1)];
-  KIVOWriteFileAtomic(path, std::string(buf.data(), size), SyncToDisk::No);
-}
-
-// Mixed sizes: many small files, some medium ones, a few large ones.
-uint64_t GeneratePayload(const std::string& dir, uint64_t total) {
-  uint64_t written = 0, seed = 88172645463325252ull;
-  int n = 0;
-  const size_t kSizes[] = {4 << 10, 16 << 10, 64 << 10, 1 << 20, 4 << 20, 32 << 20};
-  while (written < total) {
-    size_t size = kSizes[n % 6];
-    if (written + size > total) size = total - written;
-    std::string sub = dir + "/d" + std::to_string(n % 37);
-    KIVOFSMkdirP(sub.c_str());
-    WriteFile(sub + "/f" + std::to_string(n), size, &seed);
-    written += size;
-    ++n;
-  }
-  return written;
 }
 
 // Runs a command, returns seconds taken and the peak RSS in KiB.

@@ -230,6 +230,9 @@ void PackageWebAPI::Install() {
       t->finish(false);
     }
   }
+  // An installed upload has served its purpose; without its task nobody
+  // could clean it up any more.
+  if (ok && upload) RemoveFile(path);
 }
 
 bool PackageWebAPI::InstallPackageFile(const char* path) {

@@ -6,6 +6,8 @@
 
 #include <sys/wait.h>
 #include <unistd.h>
+#include "klibc/atomic_file.h"
+#include "testing/package_factory.h"
 #include "testing/temp_root.h"
 #include "testing/web_server.h"
 
@@ -72,6 +74,37 @@ TEST(EndToEndHttpTest, SignInQueryAndReadALogThroughLighttpd) {
   EXPECT_EQ(105, Curl({"-b", jar, log_url}).json["error"]["code"].asInt());
   EXPECT_EQ(119, Curl({log_url}).json["error"]["code"].asInt());
   EXPECT_EQ(101, Curl({url + "?api=%zz"}).json["error"]["code"].asInt());
+}
+
+TEST(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
+  TempRoot root;
+  root.AddAccount("admin", "secret", {"administrators"});
+  root.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
+  TestPackage app;
+  app.id = "http-app";
+  app.files = {{"big.bin", std::string(3 << 20, 'q')}};  // several MiB through the stream
+  std::string file = app.Build(root.Path("/tmp"));
+  WebServer server(root.dir());
+  ASSERT_TRUE(server.running());
+  const std::string url = server.EntryURL();
+  const std::string jar = root.Path("/cookies");
+  HttpAnswer login = Curl({"-c", jar, "--data",
+                           "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret", url});
+  std::string token = login.json["data"]["token"].asString();
+  const std::string header = "X-KIVO-Token: " + token;
+
+  HttpAnswer up = Curl({"-b", jar, "-H", header, "-F", "file=@" + file,
+                        url + "?api=KIVO.Core.Package.Installation&version=1&method=upload"});
+  ASSERT_TRUE(up.json["success"].asBool()) << up.head;
+  std::string task = up.json["data"]["task_id"].asString();
+  HttpAnswer install = Curl({"-b", jar, "-H", header, "--data",
+                             "api=KIVO.Core.Package.Installation&version=1&method=install&task_id=" + task, url});
+  ASSERT_TRUE(install.json["success"].asBool()) << install.head;
+  HttpAnswer list = Curl({"-b", jar, "-H", header, url + "?api=KIVO.Core.Package&version=1&method=list"});
+  EXPECT_EQ("http-app", list.json["data"]["packages"][0]["id"].asString());
+  std::string big;
+  ASSERT_TRUE(KIVOReadFile(root.Path("/var/packages/http-app/target/big.bin"), &big));
+  EXPECT_EQ(3u << 20, big.size());
 }
 
 }  // namespace

@@ -104,6 +104,7 @@ TEST_F(InstallFlowTest, UploadCheckInstallStatusList) {
   ASSERT_TRUE(install.Success()) << install.body;
   EXPECT_TRUE(install.Data()["worker_message"].isArray());
   EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(task_id));
+  EXPECT_EQ(0, Uploads());  // the installed upload is gone too
   EXPECT_TRUE(Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_test-app"}}).Data()["finished"].asBool());
   CgiAnswer list = client().Call("KIVO.Core.Package", "list", 1, {{"additional", "[\"status\"]"}});
   EXPECT_EQ("running", list.Data()["packages"][0]["additional"]["status"].asString());

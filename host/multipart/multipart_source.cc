@@ -1,9 +1,13 @@
 #include "multipart_source.h"
 
+#include <dirent.h>
 #include <errno.h>
+#include <sys/stat.h>
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <cstring>
+#include <ctime>
 #include <exception>
 #include <istream>
 #include <memory>
@@ -20,6 +24,8 @@
 #include "storage/storage_config.h"
 
 namespace {
+
+constexpr time_t kAbandonedAfterSeconds = 24 * 3600;
 
 // Reads at most `limit` bytes from a descriptor, so a body shorter than its
 // CONTENT_LENGTH shows as an early end and nothing after the body is read.
@@ -128,6 +134,23 @@ class MultipartSource : public UploadSource {
     }
   }
 
+  // Uploads whose install never came: older than a day, nobody will ask for
+  // them any more. Swept at each upload, so they cannot fill a volume.
+  static void SweepAbandoned(const std::string& dir) {
+    DIR* d = opendir(dir.c_str());
+    if (!d) return;
+    time_t now = time(nullptr);
+    while (struct dirent* e = readdir(d)) {
+      std::string path = dir + "/" + e->d_name;
+      struct stat st;
+      if (strncmp(e->d_name, "upload-", 7) == 0 && lstat(path.c_str(), &st) == 0 &&
+          S_ISREG(st.st_mode) && now - st.st_mtime > kAbandonedAfterSeconds) {
+        unlink(path.c_str());
+      }
+    }
+    closedir(d);
+  }
+
   // A new file on the first volume with room for the whole body.
   int OpenTarget(std::string* path) {
     std::vector<VolumeConfig> volumes = KIVOVolumesLoad();
@@ -139,6 +162,7 @@ class MultipartSource : public UploadSource {
       if (free_bytes < 0 || static_cast<uint64_t>(free_bytes) <= length_) continue;
       std::string dir = KIVORootPath(v.path + "/@tmp/upload");
       if (KIVOFSMkdirP(dir.c_str(), 0700) != 0) return UPLOAD_NO_TMP_DIR;
+      SweepAbandoned(dir);
       std::string pattern = dir + "/upload-XXXXXX";
       int fd = mkostemp(&pattern[0], O_CLOEXEC);
       if (fd < 0) return UPLOAD_NO_TMP_DIR;
