@@ -134,23 +134,6 @@ class MultipartSource : public UploadSource {
     }
   }
 
-  // Uploads whose install never came: older than a day, nobody will ask for
-  // them any more. Swept at each upload, so they cannot fill a volume.
-  static void SweepAbandoned(const std::string& dir) {
-    DIR* d = opendir(dir.c_str());
-    if (!d) return;
-    time_t now = time(nullptr);
-    while (struct dirent* e = readdir(d)) {
-      std::string path = dir + "/" + e->d_name;
-      struct stat st;
-      if (strncmp(e->d_name, "upload-", 7) == 0 && lstat(path.c_str(), &st) == 0 &&
-          S_ISREG(st.st_mode) && now - st.st_mtime > kAbandonedAfterSeconds) {
-        unlink(path.c_str());
-      }
-    }
-    closedir(d);
-  }
-
   // A new file on the first volume with room for the whole body.
   int OpenTarget(std::string* path) {
     std::vector<VolumeConfig> volumes = KIVOVolumesLoad();
@@ -162,7 +145,9 @@ class MultipartSource : public UploadSource {
       if (free_bytes < 0 || static_cast<uint64_t>(free_bytes) <= length_) continue;
       std::string dir = KIVORootPath(v.path + "/@tmp/upload");
       if (KIVOFSMkdirP(dir.c_str(), 0700) != 0) return UPLOAD_NO_TMP_DIR;
-      SweepAbandoned(dir);
+      // Uploads whose install never came: after a day nobody will ask for
+      // them any more, so they are swept here and cannot fill the volume.
+      KIVORemoveFilesOlderThan(dir, "upload-", kAbandonedAfterSeconds);
       std::string pattern = dir + "/upload-XXXXXX";
       int fd = mkostemp(&pattern[0], O_CLOEXEC);
       if (fd < 0) return UPLOAD_NO_TMP_DIR;

@@ -1,5 +1,6 @@
 #include "klibc/atomic_file.h"
 
+#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -7,6 +8,8 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <cstring>
+#include <ctime>
 
 #include "klibc/last_error.h"
 
@@ -80,6 +83,24 @@ bool KIVOReadFile(const std::string& path, std::string* content, size_t limit) {
 bool KLIBCFileExist(const char* path) {
   struct stat st;
   return path && lstat(path, &st) == 0;
+}
+
+int KIVORemoveFilesOlderThan(const std::string& dir, const std::string& prefix, long age_seconds) {
+  DIR* d = opendir(dir.c_str());
+  if (!d) return 0;
+  time_t now = time(nullptr);
+  int removed = 0;
+  while (struct dirent* e = readdir(d)) {
+    if (strncmp(e->d_name, prefix.c_str(), prefix.size()) != 0) continue;
+    std::string path = dir + "/" + e->d_name;
+    struct stat st;
+    if (lstat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) && now - st.st_mtime > age_seconds &&
+        unlink(path.c_str()) == 0) {
+      ++removed;
+    }
+  }
+  closedir(d);
+  return removed;
 }
 
 int KIVOFSMkdirP(const char* path, unsigned mode) {

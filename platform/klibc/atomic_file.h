@@ -23,5 +23,9 @@ bool KIVOReadFile(const std::string& path, std::string* content, size_t limit = 
 // True when `path` names an existing file system object (any type).
 bool KLIBCFileExist(const char* path);
 
+// Removes the regular files of `dir` whose names start with `prefix` and
+// that were last changed more than `age_seconds` ago. Returns how many.
+int KIVORemoveFilesOlderThan(const std::string& dir, const std::string& prefix, long age_seconds);
+
 // mkdir -p with `mode` for the folders it creates. 0 on success, -1 on failure.
 int KIVOFSMkdirP(const char* path, unsigned mode = 0755);

@@ -290,6 +290,31 @@ int QueryFile(const std::string& path, PackageInfo& info, bool with_wizard, cons
   return PKG_OK;
 }
 
+// A package file whose whole payload passed the check is remembered by
+// its identity (path, inode, size, modification time, MANIFEST digest), so
+// that the install right after an upload does not unpack it once more just
+// to look. The install's extraction checks every entry and the digest again.
+std::string CheckedMarker(const std::string& path, const PackageFileHeader& header) {
+  struct stat st;
+  if (stat(path.c_str(), &st) != 0) return "";
+  std::string identity = path + "\n" + std::to_string(st.st_ino) + " " + std::to_string(st.st_size) +
+                         " " + std::to_string(st.st_mtim.tv_sec) + "." + std::to_string(st.st_mtim.tv_nsec) +
+                         " " + PMSSha256Hex(header.manifest);
+  return KIVORootPath("/run/kivo/pkgtool/checked/") + PMSSha256Hex(identity);
+}
+
+bool PayloadCheckedBefore(const std::string& marker) {
+  return !marker.empty() && access(marker.c_str(), F_OK) == 0;
+}
+
+void RememberChecked(const std::string& marker) {
+  if (marker.empty()) return;
+  std::string dir = marker.substr(0, marker.rfind('/'));
+  KIVOFSMkdirP(dir.c_str());
+  KIVORemoveFilesOlderThan(dir, "", 24 * 3600);
+  KIVOWriteFileAtomic(marker, "", SyncToDisk::No);
+}
+
 bool CheckFile(const char* language, const std::string& path, std::string& message,
                               PKG_ERRCODE& code, Json::Value& details, PackageInfo& info) {
   PackageFileReader reader;
@@ -297,7 +322,11 @@ bool CheckFile(const char* language, const std::string& path, std::string& messa
   if (result == PKG_OK) {
     bool installed = PackageRegistry::IsInstalled(PackageInfo(reader.header().info).getId());
     InfoFromHeader(path, reader.header(), installed ? PKG_OP_UPGRADE : PKG_OP_INSTALL, language, &info);
-    result = reader.ReadPayload(PackageFileReader::Payload::Check, "", nullptr, &message);
+    std::string marker = CheckedMarker(path, reader.header());
+    if (!PayloadCheckedBefore(marker)) {
+      result = reader.ReadPayload(PackageFileReader::Payload::Check, "", nullptr, &message);
+      if (result == PKG_OK) RememberChecked(marker);
+    }
   }
   if (result == PKG_OK) result = PMSCheckPackageFits(info, PKG_ERR_ARCH, &message, &details);
   if (result == PKG_OK) {
