@@ -19,6 +19,7 @@
 #include "host/host_api.h"
 #include "host/module_table.h"
 #include "host/multipart/multipart_source.h"
+#include "host/host_config.h"
 #include "host/session_store.h"
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"

@@ -3,6 +3,7 @@
 #include <syslog.h>
 
 #include "accounts/accounts.h"
+#include "host/host_config.h"
 
 namespace {
 

@@ -31,33 +31,8 @@ bool RandomHex(size_t bytes, std::string* out) {
   return true;
 }
 
-long ReadLimit(const KeyValueMap& conf, const char* key, long def) {
-  auto it = conf.find(key);
-  if (it == conf.end()) return def;
-  long v = std::strtol(it->second.c_str(), nullptr, 10);
-  return v > 0 ? v : def;
-}
 
 }  // namespace
-
-SessionLimits LoadSessionLimits() {
-  SessionLimits limits;
-  KeyValueMap conf;
-  if (KIVOKeyValueLoad(KIVORootPath("/etc/kivo/webapi.conf"), &conf)) {
-    limits.idle_timeout = ReadLimit(conf, "session_idle_timeout", limits.idle_timeout);
-    limits.max_age = ReadLimit(conf, "session_max_age", limits.max_age);
-  }
-  return limits;
-}
-
-uint64_t LoadUploadLimit() {
-  KeyValueMap conf;
-  uint64_t limit = 4ULL << 30;
-  if (KIVOKeyValueLoad(KIVORootPath("/etc/kivo/webapi.conf"), &conf) && !conf["max_upload_bytes"].empty()) {
-    limit = std::strtoull(conf["max_upload_bytes"].c_str(), nullptr, 10);
-  }
-  return limit;
-}
 
 SessionStore::SessionStore(SessionLimits limits)
     : limits_(limits), dir_(KIVORootPath("/run/kivo/sessions")) {}

@@ -46,13 +46,5 @@ class SessionStore {
   std::string dir_;
 };
 
-// Reads the limits from "/etc/kivo/webapi.conf" (session_idle_timeout,
-// session_max_age, in seconds); defaults for missing or bad values.
-SessionLimits LoadSessionLimits();
-
-// The largest upload the host accepts: "max_upload_bytes" of
-// /etc/kivo/webapi.conf, 4 GiB by default.
-uint64_t LoadUploadLimit();
-
 // Compares without an early exit, so timing does not tell how much matched.
 bool ConstantTimeEquals(const std::string& a, const std::string& b);
