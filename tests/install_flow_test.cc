@@ -215,7 +215,8 @@ TEST_F(InstallFlowTest, CodeSignatureIsLenientAtUploadAndStrictAtInstall) {
   EXPECT_EQ(4533, strict.Code());
   EXPECT_FALSE(PackageRegistry::IsInstalled("test-app"));
   // The failed install leaves its tasks finished for the status call.
-  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(*new NVX::TaskMgr("@administrators"), "@KIVOPKG_DOWNLOAD_test-app"));
+  NVX::TaskMgr mgr("@administrators");
+  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, "@KIVOPKG_DOWNLOAD_test-app"));
   ASSERT_TRUE(task);
   EXPECT_TRUE(task->isFinished());
 
