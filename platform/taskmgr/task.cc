@@ -7,7 +7,7 @@
 #include <mutex>
 
 #include <json/writer.h>
-#include <sqlite3.h>
+#include "taskmgr/sqlite_api.h"
 
 #include "taskmgr/task_store.h"
 #include "webapi/webapi_util.h"
@@ -22,28 +22,28 @@ class Statement {
  public:
   Statement(TaskStore& store, const char* sql) : stmt_(store.Prepared(sql)) {}
   ~Statement() {
-    if (stmt_) sqlite3_reset(stmt_);
+    if (stmt_) Sqlite()->reset(stmt_);
   }
   Statement(const Statement&) = delete;
   Statement& operator=(const Statement&) = delete;
 
   Statement& Bind(int i, const std::string& text) {
-    if (stmt_) sqlite3_bind_text(stmt_, i, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
+    if (stmt_) Sqlite()->bind_text(stmt_, i, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
     return *this;
   }
   Statement& Bind(int i, long long value) {
-    if (stmt_) sqlite3_bind_int64(stmt_, i, value);
+    if (stmt_) Sqlite()->bind_int64(stmt_, i, value);
     return *this;
   }
   // Runs a statement without results. False on failure.
-  bool Run() { return stmt_ && sqlite3_step(stmt_) == SQLITE_DONE; }
+  bool Run() { return stmt_ && Sqlite()->step(stmt_) == SQLITE_DONE; }
   // Steps to the next row. False when there is none (or on failure).
-  bool Row() { return stmt_ && sqlite3_step(stmt_) == SQLITE_ROW; }
+  bool Row() { return stmt_ && Sqlite()->step(stmt_) == SQLITE_ROW; }
   std::string Text(int col) {
-    const unsigned char* t = sqlite3_column_text(stmt_, col);
+    const unsigned char* t = Sqlite()->column_text(stmt_, col);
     return t ? reinterpret_cast<const char*>(t) : "";
   }
-  long long Int(int col) { return sqlite3_column_int64(stmt_, col); }
+  long long Int(int col) { return Sqlite()->column_int64(stmt_, col); }
 
  private:
   sqlite3_stmt* stmt_ = nullptr;

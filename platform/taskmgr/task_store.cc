@@ -3,7 +3,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
-#include <sqlite3.h>
+#include "taskmgr/sqlite_api.h"
 
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"
@@ -32,8 +32,8 @@ void TaskStore::Close() {
   // A child never closes its parent's connection: that would touch the
   // parent's locks and journal.
   if (db_ && pid_ == getpid()) {
-    for (auto& s : statements_) sqlite3_finalize(s.second);
-    sqlite3_close(db_);
+    for (auto& s : statements_) Sqlite()->finalize(s.second);
+    Sqlite()->close(db_);
   }
   statements_.clear();
   db_ = nullptr;
@@ -43,17 +43,18 @@ sqlite3_stmt* TaskStore::Prepared(const char* sql) {
   if (!db()) return nullptr;
   auto it = statements_.find(sql);
   if (it != statements_.end()) {
-    sqlite3_reset(it->second);
-    sqlite3_clear_bindings(it->second);
+    Sqlite()->reset(it->second);
+    Sqlite()->clear_bindings(it->second);
     return it->second;
   }
   sqlite3_stmt* stmt = nullptr;
-  if (sqlite3_prepare_v2(db_, sql, -1, &stmt, nullptr) != SQLITE_OK) return nullptr;
+  if (Sqlite()->prepare_v2(db_, sql, -1, &stmt, nullptr) != SQLITE_OK) return nullptr;
   statements_[sql] = stmt;
   return stmt;
 }
 
 sqlite3* TaskStore::db() {
+  if (!Sqlite()) return nullptr;
   std::string dir = KIVORootPath("/run/kivo");
   std::string path = dir + "/tasks.db";
   if (db_ && pid_ == getpid() && path == path_) return db_;
@@ -61,15 +62,15 @@ sqlite3* TaskStore::db() {
   pid_ = getpid();
   path_ = path;
   KIVOFSMkdirP(dir.c_str());
-  if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) !=
+  if (Sqlite()->open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) !=
       SQLITE_OK) {
     syslog(LOG_ERR, "%s:%d cannot open %s: %s", "task_store", __LINE__, path.c_str(),
-           db_ ? sqlite3_errmsg(db_) : "out of memory");
-    sqlite3_close(db_);
+           db_ ? Sqlite()->errmsg(db_) : "out of memory");
+    Sqlite()->close(db_);
     db_ = nullptr;
     return nullptr;
   }
-  sqlite3_busy_timeout(db_, kBusyTimeoutMs);
+  Sqlite()->busy_timeout(db_, kBusyTimeoutMs);
   // Several processes write this file: keep the rollback journal (see task.h).
   Exec("PRAGMA journal_mode=DELETE; PRAGMA synchronous=NORMAL;");
   Exec(kSchema);
@@ -79,9 +80,9 @@ sqlite3* TaskStore::db() {
 bool TaskStore::Exec(const char* sql) {
   if (!db_) return false;
   char* error = nullptr;
-  if (sqlite3_exec(db_, sql, nullptr, nullptr, &error) == SQLITE_OK) return true;
+  if (Sqlite()->exec(db_, sql, nullptr, nullptr, &error) == SQLITE_OK) return true;
   syslog(LOG_ERR, "%s:%d task store: %s", "task_store", __LINE__, error ? error : "?");
-  sqlite3_free(error);
+  Sqlite()->free(error);
   return false;
 }
 
