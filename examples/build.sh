@@ -33,4 +33,6 @@ for src in "$HERE"/packages/*/; do
   [ "$name" = demo-unsigned ] || "$KIVOCTL" sign "$OUT/$name.kpk" --homedir "$GNUPGHOME" --key "$KEY" >/dev/null
   rm -rf "$work"
 done
+# Signing started an agent for this key folder; it is not needed any more.
+gpgconf --homedir "$GNUPGHOME" --kill gpg-agent 2>/dev/null || true
 echo "sample packages in $OUT"
