@@ -17,7 +17,7 @@
 
 namespace {
 
-int Fail(const std::string& message, int /*code*/ = 1) {
+int Fail(const std::string& message) {
   std::cerr << "kivoctl: " << message << "\n";
   return 1;
 }
@@ -67,8 +67,7 @@ int Report(PackageManager& pm, bool ok, const std::string& what) {
   if (ok) return 0;
   std::string detail = pm.getMapParam("deppkg");
   return Fail(what + ": " + PMSResultText(pm.getResult()) + (detail.empty() ? "" : " (" + detail + ")") +
-                  " [" + std::to_string(pm.getResult()) + "]",
-              pm.getResult());
+              " [" + std::to_string(pm.getResult()) + "]");
 }
 
 int Usage(const std::string& usage) {
@@ -108,7 +107,7 @@ int KivoctlInspect(const std::vector<std::string>& args) {
   PackageFileReader reader;
   std::string error;
   int code = reader.Open(args[0], &error);
-  if (code != PKG_OK) return Fail(args[0] + ": " + error, code);
+  if (code != PKG_OK) return Fail(args[0] + ": " + error + " [" + std::to_string(code) + "]");
   Json::Value out(Json::objectValue);
   for (const auto& kv : reader.header().info) out["info"][kv.first] = kv.second;
   out["members"] = Json::Value(Json::arrayValue);
@@ -140,7 +139,7 @@ int KivoctlInstall(const std::vector<std::string>& args) {
                                    !Flag(args, "--no-codesign"));
   if (!message.empty()) std::cerr << message << (message.back() == '\n' ? "" : "\n");
   for (const Json::Value& m : details["workerMessage"]) std::cout << m.asString() << "\n";
-  if (!ok) return Fail(pos[0] + ": " + PMSResultText(code) + " [" + std::to_string(code) + "]", code);
+  if (!ok) return Fail(pos[0] + ": " + PMSResultText(code) + " [" + std::to_string(code) + "]");
   std::cout << "installed " << pos[0] << "\n";
   return 0;
 }
@@ -152,7 +151,7 @@ int KivoctlUninstall(const std::vector<std::string>& args) {
   std::string text = Option(args, "--wizard");
   if (!text.empty() && !WebAPIUtil::ParseJson(text, wizard)) return Fail("--wizard is not JSON");
   PackageManager pm;
-  if (!pm.init()) return Fail("the package registry cannot be read", pm.getResult());
+  if (!pm.init()) return Fail("the package registry cannot be read");
   return Report(pm, pm.uninstall(pos[0], &wizard, "enu", PKG_OP_UNINSTALL, false, "root"),
                 "uninstall " + pos[0]);
 }
@@ -160,7 +159,7 @@ int KivoctlUninstall(const std::vector<std::string>& args) {
 int KivoctlStartStop(const std::vector<std::string>& args, bool start) {
   if (args.size() != 1) return Usage(std::string("kivoctl ") + (start ? "start" : "stop") + " ID");
   PackageManager pm;
-  if (!pm.init()) return Fail("the package registry cannot be read", pm.getResult());
+  if (!pm.init()) return Fail("the package registry cannot be read");
   bool ok = pm.serviceControl(start ? PKG_OP_START : PKG_OP_STOP, args[0], start, "enu", "root",
                               nullptr, true, true);
   return Report(pm, ok, std::string(start ? "start " : "stop ") + args[0]);
@@ -171,7 +170,7 @@ int KivoctlStatus(const std::vector<std::string>& args) {
   PackageManager pm;
   PackageInfo info;
   if (!pm.init() || !pm.getPackageInfo(args[0], info)) {
-    return Fail(args[0] + ": " + PMSResultText(pm.getResult()), pm.getResult());
+    return Fail(args[0] + ": " + PMSResultText(pm.getResult()) + " [" + std::to_string(pm.getResult()) + "]");
   }
   bool running = false;
   pm.getServiceStatus(info, running, true);
@@ -181,7 +180,7 @@ int KivoctlStatus(const std::vector<std::string>& args) {
 
 int KivoctlList(const std::vector<std::string>& args) {
   PackageManager pm;
-  if (!pm.init()) return Fail("the package registry cannot be read", pm.getResult());
+  if (!pm.init()) return Fail("the package registry cannot be read");
   for (const std::string& id : pm.enumPackages()) {
     PackageInfo info;
     bool running = false;
@@ -197,7 +196,7 @@ int KivoctlLog(const std::vector<std::string>& args) {
   PackageManager pm;
   pm.init();
   std::string path = pm.getPackageLog(args[0]);
-  if (pm.getResult() == PKG_ERR_NOT_INSTALLED) return Fail(args[0] + " is not installed", pm.getResult());
+  if (pm.getResult() == PKG_ERR_NOT_INSTALLED) return Fail(args[0] + " is not installed");
   std::cout << (path.empty() ? "" : PMSReadPackageLog(path));
   return 0;
 }
