@@ -6,8 +6,8 @@ set -euo pipefail
 PACKAGES=(
   g++ cmake ninja-build pkg-config ccache
   libjsoncpp-dev libcrypt-dev libgtest-dev googletest
-  libarchive-dev libsqlite3-dev libcurl4-openssl-dev libgpgme-dev libpoco-dev
-  lighttpd php-cli gnupg curl
+  libarchive-dev libsqlite3-dev libcurl4-openssl-dev libgpgme-dev libpoco-dev libssl-dev
+  lighttpd php-cli gnupg curl procps
 )
 
 missing=()
