@@ -4,6 +4,7 @@
 // parameter checker and handler, and writes the JSON answer.
 
 #include <dlfcn.h>
+#include <fcntl.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -103,6 +104,9 @@ void RunModuleAPI(const CgiRequest& cgi, APIRequest* request, APIResponse* respo
 // the fields posted before the file. Null (with `*reason`) on failure.
 std::unique_ptr<UploadSource> OpenUpload(const CgiRequest& cgi, APIRequest* request,
                                          std::string* reason) {
+  // The web server feeds the body through a pipe of 64 KiB by default; a
+  // larger one means far fewer wake-ups per upload. Best effort.
+  fcntl(STDIN_FILENO, F_SETPIPE_SZ, 1 << 20);
   std::string lib = DefaultModuleDir() + "/../../libkivo_multipart.so";
   void* handle = dlopen(lib.c_str(), RTLD_NOW | RTLD_LOCAL);
   auto open = handle ? reinterpret_cast<KivoOpenMultipartFn>(dlsym(handle, "KivoOpenMultipart")) : nullptr;
