@@ -55,21 +55,6 @@ void ExecCgi(const std::string& program, const std::vector<std::string>& env) {
   waitpid(pid, nullptr, 0);
 }
 
-// One HTTP/1.0 GET over loopback, read to the end.
-void HttpGet(int port, const std::string& target, const std::string& headers) {
-  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_port = htons(static_cast<uint16_t>(port));
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) abort();
-  std::string request = "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n";
-  if (write(fd, request.data(), request.size()) != static_cast<ssize_t>(request.size())) abort();
-  char buf[4096];
-  while (read(fd, buf, sizeof(buf)) > 0) {
-  }
-  close(fd);
-}
 
 struct Figures {
   double p50_ms, p99_ms, rps;
@@ -143,11 +128,11 @@ int main(int argc, char** argv) {
     Print("direct", "floor C++", clients,
           Measure(clients, per_client, [&] { ExecCgi(floor_cpp, env); }));
     Print("lighttpd", "entry.cgi", clients,
-          Measure(clients, per_client, [&] { HttpGet(ours.port(), target, headers); }));
+          Measure(clients, per_client, [&] { LoopbackGet(ours.port(), target, headers); }));
     Print("lighttpd", "floor", clients,
-          Measure(clients, per_client, [&] { HttpGet(base.port(), target, headers); }));
+          Measure(clients, per_client, [&] { LoopbackGet(base.port(), target, headers); }));
     Print("lighttpd", "floor C++", clients,
-          Measure(clients, per_client, [&] { HttpGet(base_cpp.port(), target, headers); }));
+          Measure(clients, per_client, [&] { LoopbackGet(base_cpp.port(), target, headers); }));
   }
   return 0;
 }

@@ -34,22 +34,6 @@ const char kAllKeys[] =
     "%22dependent_packages%22%2C%22start_dependent_services%22%2C%22installing_progress%22%2C"
     "%22ctl_uninstall%22%2C%22log_path%22%5D";
 
-// One HTTP/1.0 GET, read to the end; returns the body size.
-size_t HttpGet(int port, const std::string& target, const std::string& headers) {
-  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_port = htons(static_cast<uint16_t>(port));
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) return 0;
-  std::string request = "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n";
-  if (write(fd, request.data(), request.size()) < 0) return 0;
-  char buf[65536];
-  size_t total = 0;
-  for (ssize_t n; (n = read(fd, buf, sizeof(buf))) > 0;) total += static_cast<size_t>(n);
-  close(fd);
-  return total;
-}
 
 void InstallMany(const std::string& dir, int count) {
   for (int i = 0; i < count; ++i) {
@@ -89,11 +73,11 @@ int main(int argc, char** argv) {
     std::string target = "/webapi/entry.cgi?api=KIVO.Core.Package&version=1&method=list&additional=" +
                          std::string(kAllKeys);
     std::string headers = "Cookie: id=" + admin.sid() + "\r\nX-KIVO-Token: " + admin.token() + "\r\n";
-    size_t size = HttpGet(server.port(), target, headers);  // warm-up
+    size_t size = LoopbackGet(server.port(), target, headers);  // warm-up
     std::vector<double> ms;
     for (int r = 0; r < requests; ++r) {
       Clock::time_point t = Clock::now();
-      HttpGet(server.port(), target, headers);
+      LoopbackGet(server.port(), target, headers);
       ms.push_back(std::chrono::duration<double, std::milli>(Clock::now() - t).count());
     }
     std::sort(ms.begin(), ms.end());

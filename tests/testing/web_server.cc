@@ -71,3 +71,20 @@ WebServer::~WebServer() {
 std::string WebServer::EntryURL() const {
   return "http://127.0.0.1:" + std::to_string(port_) + "/webapi/entry.cgi";
 }
+
+size_t LoopbackGet(int port, const std::string& target, const std::string& headers) {
+  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in addr = Loopback(port);
+  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+    close(fd);
+    return 0;
+  }
+  std::string request = "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n";
+  size_t total = 0;
+  if (write(fd, request.data(), request.size()) == static_cast<ssize_t>(request.size())) {
+    char buf[65536];
+    for (ssize_t n; (n = read(fd, buf, sizeof(buf))) > 0;) total += static_cast<size_t>(n);
+  }
+  close(fd);
+  return total;
+}

@@ -4,6 +4,7 @@
 
 #include <sys/types.h>
 
+#include <cstddef>
 #include <string>
 
 class WebServer {
@@ -28,3 +29,8 @@ class WebServer {
 
 // A port on 127.0.0.1 that nothing listens on right now.
 int FreeLoopbackPort();
+
+// One HTTP/1.0 GET of `target` on 127.0.0.1:`port` with extra header lines
+// (each ending in "\r\n"), read to the end. The bytes received; 0 when the
+// connection failed.
+size_t LoopbackGet(int port, const std::string& target, const std::string& headers);
