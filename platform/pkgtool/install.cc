@@ -37,16 +37,12 @@ void InfoFromHeader(const std::string& path, const PackageFileHeader& header,
   auto license = header.members.find("LICENSE");
   if (license != header.members.end()) info->setLicense(license->second);
   unsigned mask = 0;
-  const struct { const char* name; PKG_INSTALLATION_TYPE op; } kWizards[] = {
-      {"WIZARD_UIFILES/install_uifile", PKG_OP_INSTALL},
-      {"WIZARD_UIFILES/upgrade_uifile", PKG_OP_UPGRADE},
-      {"WIZARD_UIFILES/uninstall_uifile", PKG_OP_UNINSTALL}};
-  for (const auto& w : kWizards) {
-    auto it = header.members.find(w.name);
+  for (const PMSWizardFile& w : kPMSWizardFiles) {
+    auto it = header.members.find(w.member);
     if (it == header.members.end()) continue;
     mask |= w.op;
     if (w.op != wizard) continue;
-    auto localized = header.members.find(std::string(w.name) + "_" + (language ? language : ""));
+    auto localized = header.members.find(std::string(w.member) + "_" + (language ? language : ""));
     Json::Value ui;
     WebAPIUtil::ParseJson(localized != header.members.end() ? localized->second : it->second, ui);
     info->setUIFile(ui);

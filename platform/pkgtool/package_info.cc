@@ -10,6 +10,18 @@
 
 #include "pkgtool/registry.h"
 
+const PMSWizardFile kPMSWizardFiles[3] = {
+    {"WIZARD_UIFILES/install_uifile", PKG_OP_INSTALL},
+    {"WIZARD_UIFILES/upgrade_uifile", PKG_OP_UPGRADE},
+    {"WIZARD_UIFILES/uninstall_uifile", PKG_OP_UNINSTALL}};
+
+const char* PMSWizardMember(int op) {
+  for (const PMSWizardFile& w : kPMSWizardFiles) {
+    if (w.op == op) return w.member;
+  }
+  return kPMSWizardFiles[0].member;
+}
+
 std::string PackageInfo::get(const std::string& key) const {
   auto it = info_.find(key);
   return it == info_.end() ? "" : it->second;

@@ -21,6 +21,16 @@ enum PKG_INSTALLATION_TYPE {
   PKG_OP_STOP = 16,
 };
 
+// The wizard file of each operation, as a member name of the package
+// ("WIZARD_UIFILES/install_uifile"); language variants add "_<lang>".
+struct PMSWizardFile {
+  const char* member;
+  PKG_INSTALLATION_TYPE op;
+};
+extern const PMSWizardFile kPMSWizardFiles[3];
+// The member of `op`'s wizard; the install wizard's for anything else.
+const char* PMSWizardMember(int op);
+
 class PackageInfo {
  public:
   PackageInfo() = default;

@@ -99,12 +99,9 @@ bool PackageManager::getPackageInfo(const std::string& id, PackageInfo& info,
 
 bool PackageManager::readUIFile(int op, const PackageInfo& package, PackageInfo& out,
                                 const std::string& language) {
-  const char* file = op == PKG_OP_UNINSTALL ? "uninstall_uifile"
-                     : op == PKG_OP_UPGRADE ? "upgrade_uifile"
-                                            : "install_uifile";
   std::string id = package.getId();
   if (!PMSIsValidPackageId(id)) return false;
-  std::string base = PackageRegistry::RecordDir(id) + "/WIZARD_UIFILES/" + file;
+  std::string base = PackageRegistry::RecordDir(id) + "/" + PMSWizardMember(op);
   std::string text;
   if (!KIVOReadFile(base + "_" + language, &text, 1 << 20) && !KIVOReadFile(base, &text, 1 << 20)) {
     return false;

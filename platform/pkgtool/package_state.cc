@@ -16,12 +16,8 @@ namespace {
 
 unsigned WizardMask(const std::string& record) {
   unsigned mask = 0;
-  const struct { const char* file; PKG_INSTALLATION_TYPE op; } kWizards[] = {
-      {"install_uifile", PKG_OP_INSTALL},
-      {"upgrade_uifile", PKG_OP_UPGRADE},
-      {"uninstall_uifile", PKG_OP_UNINSTALL}};
-  for (const auto& w : kWizards) {
-    if (access((record + "/WIZARD_UIFILES/" + w.file).c_str(), F_OK) == 0) mask |= w.op;
+  for (const PMSWizardFile& w : kPMSWizardFiles) {
+    if (access((record + "/" + w.member).c_str(), F_OK) == 0) mask |= w.op;
   }
   return mask;
 }
