@@ -6,25 +6,25 @@
 //
 //   host_bench [requests per client]      (default 200)
 
-#include <arpa/inet.h>
-#include <fcntl.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <fcntl.h>
 #include <functional>
 #include <string>
+#include <sys/socket.h>
+#include <sys/wait.h>
 #include <thread>
+#include <unistd.h>
 #include <vector>
 
 #include "testing/cgi_client.h"
 #include "testing/temp_root.h"
 #include "testing/web_server.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
 
 namespace {
 
@@ -55,7 +55,6 @@ void ExecCgi(const std::string& program, const std::vector<std::string>& env) {
   waitpid(pid, nullptr, 0);
 }
 
-
 struct Figures {
   double p50_ms, p99_ms, rps;
 };
@@ -80,14 +79,15 @@ Figures Measure(int clients, int per_client, const std::function<void()>& call) 
   std::vector<double> all;
   for (auto& t : times) all.insert(all.end(), t.begin(), t.end());
   std::sort(all.begin(), all.end());
-  auto at = [&all](double q) { return all[std::min(all.size() - 1, static_cast<size_t>(q * all.size()))]; };
+  auto at = [&all](double q) {
+    return all[std::min(all.size() - 1, static_cast<size_t>(q * all.size()))];
+  };
   return Figures{at(0.50), at(0.99), all.size() / seconds};
 }
 
 void Print(const char* path, const char* program, int clients, const Figures& f) {
   printf("%-9s %-10s %7d %9.2f %9.2f %9.0f\n", path, program, clients, f.p50_ms, f.p99_ms, f.rps);
 }
-
 
 }  // namespace
 
@@ -105,9 +105,9 @@ int main(int argc, char** argv) {
   const std::string entry = BuildDir() + "/bin/entry.cgi";
   const std::string floor = BuildDir() + "/bin/floor_cgi";
   const std::string floor_cpp = BuildDir() + "/bin/floor_cpp_cgi";
-  const std::vector<std::string> env = {
-      "KIVO_ROOT=" + root.dir(), "REQUEST_METHOD=GET", "QUERY_STRING=" + query,
-      "HTTP_COOKIE=id=" + admin.sid(), "HTTP_X_KIVO_TOKEN=" + admin.token()};
+  const std::vector<std::string> env = {"KIVO_ROOT=" + root.dir(), "REQUEST_METHOD=GET",
+                                        "QUERY_STRING=" + query, "HTTP_COOKIE=id=" + admin.sid(),
+                                        "HTTP_X_KIVO_TOKEN=" + admin.token()};
   const std::string headers =
       "Cookie: id=" + admin.sid() + "\r\nX-KIVO-Token: " + admin.token() + "\r\n";
 
@@ -123,7 +123,8 @@ int main(int argc, char** argv) {
   printf("%d requests per client; times in ms\n", per_client);
   printf("%-9s %-10s %7s %9s %9s %9s\n", "path", "program", "clients", "p50", "p99", "req/s");
   for (int clients : {1, 8}) {
-    Print("direct", "entry.cgi", clients, Measure(clients, per_client, [&] { ExecCgi(entry, env); }));
+    Print("direct", "entry.cgi", clients,
+          Measure(clients, per_client, [&] { ExecCgi(entry, env); }));
     Print("direct", "floor", clients, Measure(clients, per_client, [&] { ExecCgi(floor, env); }));
     Print("direct", "floor C++", clients,
           Measure(clients, per_client, [&] { ExecCgi(floor_cpp, env); }));

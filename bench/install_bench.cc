@@ -4,18 +4,17 @@
 //
 //   install_bench [payload MiB]
 
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
 #include <fcntl.h>
+#include <string>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <algorithm>
-#include <chrono>
-#include <cstring>
-#include <cstdio>
-#include <cstdlib>
-#include <string>
 #include <vector>
 
 #include "klibc/atomic_file.h"
@@ -55,7 +54,6 @@ double Run(const std::vector<std::string>& argv, long* peak_kib) {
   return Seconds(start);
 }
 
-
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -65,7 +63,8 @@ int main(int argc, char** argv) {
   KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
   std::string src = root.Path("/tmp/src");
   KIVOFSMkdirP((src + "/package").c_str());
-  KIVOWriteFileAtomic(src + "/INFO", "package=\"bench-payload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
+  KIVOWriteFileAtomic(src + "/INFO",
+                      "package=\"bench-payload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
   Clock::time_point t = Clock::now();
   uint64_t bytes = GeneratePayload(src + "/package", mib << 20);
   printf("payload: %.0f MiB in generated files (%.1f s)\n", bytes / 1048576.0, Seconds(t));
@@ -94,8 +93,10 @@ int main(int argc, char** argv) {
   double tool_s = Run({BuildDir() + "/bin/kivoctl", "install", pkg}, &tool_kib);
 
   printf("%-28s %8s %10s %12s\n", "", "seconds", "MiB/s", "peak RSS");
-  printf("%-28s %8.2f %10.0f %9ld KiB\n", "tar -xzf package.tgz", tar_s, bytes / 1048576.0 / tar_s, tar_kib);
-  printf("%-28s %8.2f %10.0f %9ld KiB\n", "kivoctl install", tool_s, bytes / 1048576.0 / tool_s, tool_kib);
+  printf("%-28s %8.2f %10.0f %9ld KiB\n", "tar -xzf package.tgz", tar_s, bytes / 1048576.0 / tar_s,
+         tar_kib);
+  printf("%-28s %8.2f %10.0f %9ld KiB\n", "kivoctl install", tool_s, bytes / 1048576.0 / tool_s,
+         tool_kib);
   printf("speed of the tool relative to tar: %.2fx\n", tar_s / tool_s);
   return 0;
 }

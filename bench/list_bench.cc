@@ -3,15 +3,12 @@
 //
 //   list_bench [requests per size]      (default 20)
 
-#include <arpa/inet.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <string>
+#include <sys/socket.h>
+#include <unistd.h>
 #include <vector>
 
 #include "klibc/atomic_file.h"
@@ -21,33 +18,44 @@
 #include "testing/temp_root.h"
 #include "testing/web_server.h"
 
+#include <arpa/inet.h>
+#include <netinet/in.h>
+
 namespace {
 
 using Clock = std::chrono::steady_clock;
 
 const char kAllKeys[] =
-    "%5B%22autoupdate%22%2C%22beta%22%2C%22description%22%2C%22description_enu%22%2C%22distributor%22%2C"
-    "%22distributor_url%22%2C%22nvx_apps%22%2C%22help_url%22%2C%22install_reboot%22%2C%22install_type%22%2C"
-    "%22installed_info%22%2C%22is_uninstall_pages%22%2C%22maintainer%22%2C%22maintainer_url%22%2C%22url%22%2C"
-    "%22report_beta_url%22%2C%22silent_install%22%2C%22silent_upgrade%22%2C%22silent_uninstall%22%2C"
-    "%22startable%22%2C%22status%22%2C%22support_center%22%2C%22support_url%22%2C%22uninstall_pages%22%2C"
+    "%5B%22autoupdate%22%2C%22beta%22%2C%22description%22%2C%22description_enu%22%2C%22distributor%"
+    "22%2C"
+    "%22distributor_url%22%2C%22nvx_apps%22%2C%22help_url%22%2C%22install_reboot%22%2C%22install_"
+    "type%22%2C"
+    "%22installed_info%22%2C%22is_uninstall_pages%22%2C%22maintainer%22%2C%22maintainer_url%22%2C%"
+    "22url%22%2C"
+    "%22report_beta_url%22%2C%22silent_install%22%2C%22silent_upgrade%22%2C%22silent_uninstall%22%"
+    "2C"
+    "%22startable%22%2C%22status%22%2C%22support_center%22%2C%22support_url%22%2C%22uninstall_"
+    "pages%22%2C"
     "%22dependent_packages%22%2C%22start_dependent_services%22%2C%22installing_progress%22%2C"
     "%22ctl_uninstall%22%2C%22log_path%22%5D";
-
 
 void InstallMany(const std::string& dir, int count) {
   for (int i = 0; i < count; ++i) {
     TestPackage p;
     p.id = "bench-" + std::to_string(i);
-    p.info = {{"description", "Benchmark package"}, {"maintainer", "Bench"}, {"adminport", "18000"},
-              {"checkport", "no"}, {"logfile", "app.log"},
+    p.info = {{"description", "Benchmark package"},
+              {"maintainer", "Bench"},
+              {"adminport", "18000"},
+              {"checkport", "no"},
+              {"logfile", "app.log"},
               {"install_dep_services", "pgsql"}};
     if (i == 0) p.info["startable"] = "no";  // a library the others need
     if (i > 0 && i % 3 == 0) p.info["install_dep_packages"] = "bench-0";
     std::string file = p.Build(dir), message;
     PKG_ERRCODE code;
     Json::Value details;
-    if (!InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true, false)) {
+    if (!InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true,
+                                false)) {
       fprintf(stderr, "install of %s failed: %s\n", p.id.c_str(), message.c_str());
       exit(1);
     }
@@ -70,9 +78,11 @@ int main(int argc, char** argv) {
     InstallMany(dir, count);
     ApiClient admin("admin", "secret");
     WebServer server(root.dir());
-    std::string target = "/webapi/entry.cgi?api=KIVO.Core.Package&version=1&method=list&additional=" +
-                         std::string(kAllKeys);
-    std::string headers = "Cookie: id=" + admin.sid() + "\r\nX-KIVO-Token: " + admin.token() + "\r\n";
+    std::string target =
+        "/webapi/entry.cgi?api=KIVO.Core.Package&version=1&method=list&additional=" +
+        std::string(kAllKeys);
+    std::string headers =
+        "Cookie: id=" + admin.sid() + "\r\nX-KIVO-Token: " + admin.token() + "\r\n";
     size_t size = LoopbackGet(server.port(), target, headers);  // warm-up
     std::vector<double> ms;
     for (int r = 0; r < requests; ++r) {

@@ -5,20 +5,19 @@
 //
 //   upload_bench [payload MiB]
 
-#include <dirent.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <atomic>
-#include <memory>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <dirent.h>
+#include <memory>
 #include <string>
+#include <sys/stat.h>
+#include <sys/wait.h>
 #include <thread>
+#include <unistd.h>
 #include <vector>
 
 #include <json/reader.h>
@@ -78,7 +77,8 @@ int main(int argc, char** argv) {
   KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
   std::string src = root.Path("/tmp/src");
   KIVOFSMkdirP((src + "/package").c_str());
-  KIVOWriteFileAtomic(src + "/INFO", "package=\"bench-upload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
+  KIVOWriteFileAtomic(src + "/INFO",
+                      "package=\"bench-upload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
   uint64_t bytes = GeneratePayload(src + "/package", mib << 20);
   std::string pkg = root.Path("/tmp/bench.kpk"), error;
   BuildOptions options;
@@ -109,9 +109,10 @@ int main(int argc, char** argv) {
   });
   std::string out;
   t = Clock::now();
-  RunProgram({"curl", "-s", "-F", "file=@" + pkg,
-              url + "?api=KIVO.Core.Package.Installation&version=1&method=upload&_sid=" + admin.sid()},
-             &out);
+  RunProgram(
+      {"curl", "-s", "-F", "file=@" + pkg,
+       url + "?api=KIVO.Core.Package.Installation&version=1&method=upload&_sid=" + admin.sid()},
+      &out);
   double upload_s = Seconds(t);
   done = true;
   watcher.join();
@@ -121,22 +122,27 @@ int main(int argc, char** argv) {
   // The same number of bytes that are not a package: stored, then refused
   // (4521) before any check, which times the transfer and store alone.
   std::string plain = root.Path("/tmp/plain.bin");
-  RunProgram({"sh", "-c", "head -c " + std::to_string(st.st_size) + " /dev/urandom > '" + plain + "'"}, nullptr);
+  RunProgram(
+      {"sh", "-c", "head -c " + std::to_string(st.st_size) + " /dev/urandom > '" + plain + "'"},
+      nullptr);
   RunProgram({"cat", plain}, nullptr);
   t = Clock::now();
-  RunProgram({"curl", "-s", "-F", "file=@" + plain,
-              url + "?api=KIVO.Core.Package.Installation&version=1&method=upload&_sid=" + admin.sid()},
-             &out);
+  RunProgram(
+      {"curl", "-s", "-F", "file=@" + plain,
+       url + "?api=KIVO.Core.Package.Installation&version=1&method=upload&_sid=" + admin.sid()},
+      &out);
   double store_s = Seconds(t);
   unlink(plain.c_str());
 
   t = Clock::now();
   RunProgram({"curl", "-s", "--data",
               "api=KIVO.Core.Package.Installation&version=1&method=install&_sid=" + admin.sid() +
-                  "&task_id=" + up["data"]["task_id"].asString(), url},
+                  "&task_id=" + up["data"]["task_id"].asString(),
+              url},
              &out);
   double api_install_s = Seconds(t);
-  if (!ParseBody(out)["success"].asBool()) return fprintf(stderr, "install failed: %s\n", out.c_str()), 1;
+  if (!ParseBody(out)["success"].asBool())
+    return fprintf(stderr, "install failed: %s\n", out.c_str()), 1;
   Kivoctl({"uninstall", "bench-upload"});
   t = Clock::now();
   Kivoctl({"install", pkg});
@@ -145,7 +151,8 @@ int main(int argc, char** argv) {
   printf("%-34s %8s %10s\n", "", "seconds", "MiB/s");
   printf("%-34s %8.2f %10.0f\n", "cp of the package file", cp_s, file_mib / cp_s);
   printf("%-34s %8.2f %10.0f\n", "upload through lighttpd (+check)", upload_s, file_mib / upload_s);
-  printf("%-34s %8.2f %10.0f\n", "upload through lighttpd, store only", store_s, file_mib / store_s);
+  printf("%-34s %8.2f %10.0f\n", "upload through lighttpd, store only", store_s,
+         file_mib / store_s);
   printf("upload speed relative to cp: %.2fx with the package check, %.2fx storing alone\n",
          cp_s / upload_s, cp_s / store_s);
   printf("%-34s %8.2f\n", "install through the web API", api_install_s);

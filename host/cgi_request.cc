@@ -1,10 +1,9 @@
 #include "host/cgi_request.h"
 
-#include <errno.h>
-#include <unistd.h>
-
 #include <cstdlib>
 #include <cstring>
+#include <errno.h>
+#include <unistd.h>
 
 namespace {
 
@@ -53,7 +52,8 @@ std::string Boundary(const std::string& content_type) {
 
 bool ReadFormBody(int fd, uint64_t max_upload, CgiRequest* out, std::string* reason) {
   size_t length = 0;
-  if (!ParseLength(Env("CONTENT_LENGTH"), &length)) return (*reason = "invalid CONTENT_LENGTH"), false;
+  if (!ParseLength(Env("CONTENT_LENGTH"), &length))
+    return (*reason = "invalid CONTENT_LENGTH"), false;
   if (length == 0) return true;
   std::string type = MediaType(Env("CONTENT_TYPE"));
   if (type == "multipart/form-data") {
@@ -72,7 +72,8 @@ bool ReadFormBody(int fd, uint64_t max_upload, CgiRequest* out, std::string* rea
   }
   if (length > kMaxBodyBytes) return (*reason = "request body too large"), false;
   std::string body;
-  if (!ReadBody(fd, length, &body)) return (*reason = "request body shorter than its length"), false;
+  if (!ReadBody(fd, length, &body))
+    return (*reason = "request body shorter than its length"), false;
   std::string error;
   if (!ParseUrlEncoded(body, &out->body, &error)) return (*reason = "body: " + error), false;
   return true;

@@ -3,24 +3,23 @@
 // tables of the loaded modules, checks who is calling, runs the row's
 // parameter checker and handler, and writes the JSON answer.
 
-#include <dlfcn.h>
-#include <fcntl.h>
-#include <syslog.h>
-#include <unistd.h>
-
 #include <cstdio>
 #include <cstring>
+#include <dlfcn.h>
 #include <exception>
+#include <fcntl.h>
 #include <memory>
 #include <string>
+#include <syslog.h>
+#include <unistd.h>
 
 #include <json/writer.h>
 
 #include "host/cgi_request.h"
 #include "host/host_api.h"
+#include "host/host_config.h"
 #include "host/module_table.h"
 #include "host/multipart/multipart_source.h"
-#include "host/host_config.h"
 #include "host/session_store.h"
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
@@ -109,7 +108,8 @@ std::unique_ptr<UploadSource> OpenUpload(const CgiRequest& cgi, APIRequest* requ
   fcntl(STDIN_FILENO, F_SETPIPE_SZ, 1 << 20);
   std::string lib = DefaultModuleDir() + "/../../libkivo_multipart.so";
   void* handle = dlopen(lib.c_str(), RTLD_NOW | RTLD_LOCAL);
-  auto open = handle ? reinterpret_cast<KivoOpenMultipartFn>(dlsym(handle, "KivoOpenMultipart")) : nullptr;
+  auto open =
+      handle ? reinterpret_cast<KivoOpenMultipartFn>(dlsym(handle, "KivoOpenMultipart")) : nullptr;
   std::unique_ptr<UploadSource> source(
       open ? open(STDIN_FILENO, cgi.content_length, cgi.boundary.c_str()) : nullptr);
   Json::Value fields(Json::objectValue);
@@ -117,7 +117,8 @@ std::unique_ptr<UploadSource> OpenUpload(const CgiRequest& cgi, APIRequest* requ
     *reason = source ? "malformed multipart body" : "cannot read multipart bodies";
     return nullptr;
   }
-  for (const std::string& name : fields.getMemberNames()) request->AddRawParam(name, fields[name].asString());
+  for (const std::string& name : fields.getMemberNames())
+    request->AddRawParam(name, fields[name].asString());
   return source;
 }
 
@@ -141,7 +142,8 @@ void Serve(APIRequest* request, APIResponse* response) {
   request->SetUILanguage(UILanguage(cgi.accept_language));
   if (IsHostAPI(request->GetAPIClass())) {
     std::unique_ptr<ModuleTable> modules;
-    if (request->GetAPIClass() == "KIVO.API.Info") modules.reset(new ModuleTable(DefaultModuleDir()));
+    if (request->GetAPIClass() == "KIVO.API.Info")
+      modules.reset(new ModuleTable(DefaultModuleDir()));
     return RunHostAPI(cgi, request, modules.get(), response);
   }
   RunModuleAPI(cgi, request, response);

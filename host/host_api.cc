@@ -28,7 +28,8 @@ void InfoQuery(const ModuleTable& modules, APIResponse* response) {
   Json::Value data(Json::objectValue);
   AddRange(&data, kInfoAPI, 1, 1);
   AddRange(&data, kAuthAPI, 1, 1);
-  for (const APIVersionRange& r : modules.Versions()) AddRange(&data, r.api, r.min_version, r.max_version);
+  for (const APIVersionRange& r : modules.Versions())
+    AddRange(&data, r.api, r.min_version, r.max_version);
   response->SetSuccess(data);
 }
 

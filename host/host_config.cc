@@ -20,7 +20,8 @@ HostConfig LoadHostConfig() {
   HostConfig config;
   KeyValueMap conf;
   if (!KIVOKeyValueLoad(KIVORootPath("/etc/kivo/webapi.conf"), &conf)) return config;
-  config.session.idle_timeout = ReadNumber(conf, "session_idle_timeout", config.session.idle_timeout);
+  config.session.idle_timeout =
+      ReadNumber(conf, "session_idle_timeout", config.session.idle_timeout);
   config.session.max_age = ReadNumber(conf, "session_max_age", config.session.max_age);
   config.max_upload_bytes = static_cast<uint64_t>(
       ReadNumber(conf, "max_upload_bytes", static_cast<long long>(config.max_upload_bytes)));

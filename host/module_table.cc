@@ -1,15 +1,14 @@
 #include "host/module_table.h"
 
-#include <dirent.h>
-#include <dlfcn.h>
-#include <syslog.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
+#include <dirent.h>
+#include <dlfcn.h>
 #include <map>
+#include <syslog.h>
+#include <unistd.h>
 
 namespace {
 

@@ -38,8 +38,8 @@ class ModuleTable {
     const WEBAPI_TABLE_ROW* table;
     const WEBAPI_CHECK_ROW* checks;  // may be null
   };
-  WebAPIChecker FindChecker(const Module& module, const std::string& api,
-                            const std::string& method, int version) const;
+  WebAPIChecker FindChecker(const Module& module, const std::string& api, const std::string& method,
+                            int version) const;
 
   std::vector<Module> modules_;
 };

@@ -1,12 +1,11 @@
 #include "host/session_store.h"
 
+#include <cstdlib>
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
-
-#include <cstdlib>
 
 #include "klibc/atomic_file.h"
 #include "klibc/key_value_file.h"
@@ -31,7 +30,6 @@ bool RandomHex(size_t bytes, std::string* out) {
   return true;
 }
 
-
 }  // namespace
 
 SessionStore::SessionStore(SessionLimits limits)
@@ -53,7 +51,8 @@ void SessionStore::RemoveExpired() {
     std::string path = PathOf(entry->d_name);
     // The creation time is inside the file; the idle limit alone is enough to
     // reclaim what nobody uses any more.
-    if (stat(path.c_str(), &st) == 0 && now - st.st_mtime > limits_.idle_timeout) unlink(path.c_str());
+    if (stat(path.c_str(), &st) == 0 && now - st.st_mtime > limits_.idle_timeout)
+      unlink(path.c_str());
   }
   closedir(dir);
 }
@@ -74,7 +73,8 @@ SessionLookup SessionStore::Find(const std::string& id, Session* out) {
   std::string path = PathOf(id);
   struct stat st;
   KeyValueMap fields;
-  if (stat(path.c_str(), &st) != 0 || !KIVOKeyValueLoad(path, &fields)) return SessionLookup::Unknown;
+  if (stat(path.c_str(), &st) != 0 || !KIVOKeyValueLoad(path, &fields))
+    return SessionLookup::Unknown;
   time_t now = time(nullptr);
   long created = std::strtol(fields["created"].c_str(), nullptr, 10);
   if (now - st.st_mtime > limits_.idle_timeout || now - created > limits_.max_age) {

@@ -1,8 +1,7 @@
 // Starting and stopping packages, one or a batch in dependency order.
 
-#include <unistd.h>
-
 #include <algorithm>
+#include <unistd.h>
 
 #include "package_webapi.h"
 #include "pkgtool/package_manager.h"
@@ -56,8 +55,9 @@ bool PackageWebAPI::ServiceControl(const char* name, bool start, Json::Value& re
       return false;
     }
   }
-  bool ok = manager.serviceControl(OperationType(type, start), name, start, request->GetUILanguage(),
-                                   request->GetLoginUserName(), nullptr, true, true);
+  bool ok =
+      manager.serviceControl(OperationType(type, start), name, start, request->GetUILanguage(),
+                             request->GetLoginUserName(), nullptr, true, true);
   result["message"] = PMSReadPackageLog(manager.getLogFilePath());
   result["worker_message"] = manager.getJsonParam("worker_msg");
   if (!result["worker_message"].isArray()) result["worker_message"] = Json::Value(Json::arrayValue);
@@ -75,10 +75,18 @@ bool PackageWebAPI::ServiceControl(const char* name, bool start, Json::Value& re
         result["require_version"] = manager.getMapParam("oldver");
         response->SetError(4583, Json::Value());
         break;
-      case 275: response->SetError(4530, Json::Value()); break;
-      case 297: response->SetError(4502, Json::Value()); break;
-      case 296: response->SetError(4505, Json::Value()); break;
-      default: response->SetError(start ? 4580 : 4581, Json::Value()); break;
+      case 275:
+        response->SetError(4530, Json::Value());
+        break;
+      case 297:
+        response->SetError(4502, Json::Value());
+        break;
+      case 296:
+        response->SetError(4505, Json::Value());
+        break;
+      default:
+        response->SetError(start ? 4580 : 4581, Json::Value());
+        break;
     }
   }
   // Each operation log is read once, here, and then removed.

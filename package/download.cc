@@ -1,8 +1,7 @@
 // The status of a running install or download.
 
-#include <unistd.h>
-
 #include <memory>
+#include <unistd.h>
 
 #include "klibc/process.h"
 #include "package_webapi.h"
@@ -27,7 +26,8 @@ double DownloadProgress(NVX::Task& task, const Json::Value& data) {
 
 void PackageWebAPI::ReadProgress() {
   NVX::TaskMgr mgr(kTaskOwner);
-  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, request->GetParam("task_id", "").asString()));
+  std::unique_ptr<NVX::Task> task(
+      GetTaskWithTaskMgr(mgr, request->GetParam("task_id", "").asString()));
   if (!task) {
     Json::Value done(Json::objectValue);
     done["finished"] = true;
@@ -48,7 +48,8 @@ void PackageWebAPI::ReadProgress() {
     data["progress"] = DownloadProgress(*task, data);
   }
   if (data["blqinst"].isBool() && data["blqinst"].asBool()) {
-    bool gone = !task->isFinished() && data["pid"].isInt() && KLIBCProcAlive(data["pid"].asInt()) != 1;
+    bool gone =
+        !task->isFinished() && data["pid"].isInt() && KLIBCProcAlive(data["pid"].asInt()) != 1;
     if (task->isFinished() || gone) {
       data["finished"] = true;
       task->remove();

@@ -2,9 +2,8 @@
 // ready for the package? Space and a volume, no conflict, the services and
 // packages it needs running, the package tool free, no running dependents.
 
-#include <unistd.h>
-
 #include <cstdlib>
+#include <unistd.h>
 
 #include "klibc/last_error.h"
 #include "package_webapi.h"
@@ -78,7 +77,8 @@ void PackageWebAPI::CheckEnv() {
   if (!CheckEnvDependencies(manager, deppkgs, result)) return;
   if (!tinbox) {
     std::string volume;
-    bool ok = id.empty() || !PMSCheckPackage(id) ? PMSGetPackageDefVol(volume) : PMSGetPackageVol(id, volume);
+    bool ok = id.empty() || !PMSCheckPackage(id) ? PMSGetPackageDefVol(volume)
+                                                 : PMSGetPackageVol(id, volume);
     if (ok) result["volume_path"] = volume;
   }
   result["is_occupied"] = !manager.ExLock(5);
@@ -98,7 +98,8 @@ bool PackageWebAPI::CheckEnvConflicts(PackageManager& manager, const std::string
   if (text != "null" && PMSParseDepJSONString(conflicts, list) == 0) return true;
   std::string message;
   if (manager.arePackagesConflict(PackageBasicInfo(id, version), list, message,
-                                  request->GetUILanguage().c_str()) && !message.empty()) {
+                                  request->GetUILanguage().c_str()) &&
+      !message.empty()) {
     result["packages"] = message;
     response->SetError(4524, result);
     return false;
@@ -106,17 +107,19 @@ bool PackageWebAPI::CheckEnvConflicts(PackageManager& manager, const std::string
   return true;
 }
 
-bool PackageWebAPI::CheckEnvServices(PackageManager& manager, const std::string& depsers, int version,
-                                     Json::Value& result) {
+bool PackageWebAPI::CheckEnvServices(PackageManager& manager, const std::string& depsers,
+                                     int version, Json::Value& result) {
   if (depsers.empty()) return true;
-  std::set<std::string> stopped = manager.checkServiceStarted(manager.getServiceSetFromString(depsers.c_str()));
+  std::set<std::string> stopped =
+      manager.checkServiceStarted(manager.getServiceSetFromString(depsers.c_str()));
   if (stopped.empty()) return true;
   if (stopped.count("pgsql")) {
     if (!VolumeListGet(result)) return false;
     result = Json::Value(Json::objectValue);
   }
   if (version == 1) {
-    result["services"] = manager.checkServiceStarted(PackageManager::PMSExplodeServiceString(depsers.c_str()));
+    result["services"] =
+        manager.checkServiceStarted(PackageManager::PMSExplodeServiceString(depsers.c_str()));
   } else {
     result["services"] = Json::Value(Json::arrayValue);
     for (const std::string& name : stopped) result["services"].append(name);
@@ -130,7 +133,8 @@ bool PackageWebAPI::CheckEnvDependencies(PackageManager& manager, const std::str
   DepPkgVector list;
   if (deppkgs.empty() || PMSParseDepJSONString(deppkgs, list) == 0) return true;
   std::string not_started;
-  if (manager.arePackagesInstallAndStart(list, result["uninstall_packages"], not_started, nullptr)) {
+  if (manager.arePackagesInstallAndStart(list, result["uninstall_packages"], not_started,
+                                         nullptr)) {
     result.removeMember("uninstall_packages");
     return true;
   }

@@ -1,14 +1,12 @@
 // Installation: the environment check, upload and inspection of a package
 // file, the install task, progress and cancel, clean-up of an upload.
 
-#include <errno.h>
-#include <signal.h>
-#include <string.h>
-#include <unistd.h>
-
 #include <cstdio>
 #include <cstdlib>
+#include <errno.h>
 #include <memory>
+#include <signal.h>
+#include <unistd.h>
 
 #include <json/writer.h>
 
@@ -23,6 +21,8 @@
 #include "webapi/api_upload.h"
 #include "webapi/webapi_util.h"
 
+#include <string.h>
+
 namespace KIVO_PACKAGE {
 
 namespace {
@@ -30,12 +30,18 @@ namespace {
 // Code-signature outcomes of the package tool as API errors.
 int CodesignError(int code) {
   switch (code) {
-    case 288: return 4531;
-    case 289: return 4532;
-    case 290: return 4533;
-    case 291: return 4534;
-    case 292: return 4535;
-    default: return 4501;
+    case 288:
+      return 4531;
+    case 289:
+      return 4532;
+    case 290:
+      return 4533;
+    case 291:
+      return 4534;
+    case 292:
+      return 4535;
+    default:
+      return 4501;
   }
 }
 
@@ -73,7 +79,8 @@ bool PackageWebAPI::CheckPackageFileInfo(const char* path, PackageInfo& info, bo
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details(Json::objectValue);
-  if (CheckPackageFileInfoImpl(request->GetUILanguage().c_str(), path, message, code, details, info)) {
+  if (CheckPackageFileInfoImpl(request->GetUILanguage().c_str(), path, message, code, details,
+                               info)) {
     return true;
   }
   if (IsCodesignCode(code)) {
@@ -90,22 +97,29 @@ bool PackageWebAPI::CheckPackageFileInfo(const char* path, PackageInfo& info, bo
     case 260:
       data["services"] = details["serviceNoStarted"];
       return response->SetError(4525, data), false;
-    case 261: return response->SetError(4522, Json::Value()), false;
+    case 261:
+      return response->SetError(4522, Json::Value()), false;
     case 268:
       data["unstart_packages"] = details["unStartPkgList"].asString();
       data["uninstall_packages"] = details["packages"];
       return response->SetError(4526, data), false;
-    case 277: return response->SetError(4529, Json::Value()), false;
-    case 279: return response->SetError(4504, Json::Value()), false;
-    case 281: return response->SetError(4528, Json::Value()), false;
+    case 277:
+      return response->SetError(4529, Json::Value()), false;
+    case 279:
+      return response->SetError(4504, Json::Value()), false;
+    case 281:
+      return response->SetError(4528, Json::Value()), false;
     case 283:
       data["port"] = info.getAdminPort();
       return response->SetError(4527, data), false;
     case 284:
       data["packages"] = details["instPackageList"].asString();
       return response->SetError(4524, data), false;
-    case 285: case 297: return response->SetError(4502, Json::Value()), false;
-    case 296: return response->SetError(4505, Json::Value()), false;
+    case 285:
+    case 297:
+      return response->SetError(4502, Json::Value()), false;
+    case 296:
+      return response->SetError(4505, Json::Value()), false;
     case 302:
       PMSGetOSMaxVer(info, major, minor, build);
       data["firmware"] = Firmware(major, minor, build);
@@ -114,7 +128,8 @@ bool PackageWebAPI::CheckPackageFileInfo(const char* path, PackageInfo& info, bo
       PMSGetOSMinVer(info, major, minor, build);
       data["firmware"] = Firmware(major, minor, build);
       return response->SetError(4538, data), false;
-    default: return response->SetError(4501, Json::Value()), false;
+    default:
+      return response->SetError(4501, Json::Value()), false;
   }
 }
 
@@ -128,7 +143,10 @@ void PackageWebAPI::Upload() {
   }
   int stored = upload.GetUploadFile(params["postParam"]);
   if (stored != 1) {
-    int code = stored == -13 ? 4502 : stored == -12 ? 4503 : (stored == -3 || stored == -2) ? 4520 : 108;
+    int code = stored == -13                    ? 4502
+               : stored == -12                  ? 4503
+               : (stored == -3 || stored == -2) ? 4520
+                                                : 108;
     response->SetError(code, Json::Value());
     return;
   }
@@ -144,7 +162,8 @@ void PackageWebAPI::Upload() {
 
 bool PackageWebAPI::UploadAndDescribe(const std::string& file, Json::Value& result) {
   PackageInfo info;
-  if (!pkgMgr.queryPackageFileInfoWithWizard(file, info, PKG_OP_NONE, request->GetUILanguage().c_str())) {
+  if (!pkgMgr.queryPackageFileInfoWithWizard(file, info, PKG_OP_NONE,
+                                             request->GetUILanguage().c_str())) {
     response->SetError(4521, Json::Value());
     return false;
   }
@@ -245,43 +264,80 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;
   bool ok = InstallPackageFileImpl(request->GetLoginUserName(), path, volume, 0, extra, type_flag,
-                                   request->GetUILanguage(), message, code, details, force, check_codesign);
+                                   request->GetUILanguage(), message, code, details, force,
+                                   check_codesign);
   Json::Value result(Json::objectValue);
   if (!message.empty()) result["message"] = message;
-  result["worker_message"] = details["workerMessage"].isArray() ? details["workerMessage"] : Json::Value(Json::arrayValue);
+  result["worker_message"] =
+      details["workerMessage"].isArray() ? details["workerMessage"] : Json::Value(Json::arrayValue);
   if (ok) {
-    if (details["installReboot"].isBool() && details["installReboot"].asBool()) result["reboot"] = true;
+    if (details["installReboot"].isBool() && details["installReboot"].asBool())
+      result["reboot"] = true;
     response->SetSuccess(result);
     return true;
   }
   int error = 4501;
   switch (code) {
-    case 255: error = 4545; break;
+    case 255:
+      error = 4545;
+      break;
     case 259:
       error = 4548;
       result["current_version"] = details["curVersion"].asString();
       result["require_version"] = details["insVersion"].asString();
       break;
-    case 261: error = 4521; break;
-    case 264: case 265: error = 4528; break;
+    case 261:
+      error = 4521;
+      break;
+    case 264:
+    case 265:
+      error = 4528;
+      break;
     case 267:
       error = 4546;
       result["current_version"] = details["curVersion"].asString();
       result["install_version"] = details["insVersion"].asString();
       break;
-    case 268: error = 4547; result["packages"] = JsonText(details["deppkg"]); break;
-    case 269: error = 4552; result["packages"] = JsonText(details["deppkg"]); break;
-    case 270: error = 4544; break;
-    case 274: error = 4549; break;
-    case 275: error = 4530; break;
-    case 276: error = 4540; break;
-    case 277: error = 4541; break;
-    case 279: error = 4520; break;
-    case 285: error = 4503; break;
-    case 297: error = 4502; break;
-    case 304: error = 4550; break;
-    case 305: error = 4542; break;
-    default: break;
+    case 268:
+      error = 4547;
+      result["packages"] = JsonText(details["deppkg"]);
+      break;
+    case 269:
+      error = 4552;
+      result["packages"] = JsonText(details["deppkg"]);
+      break;
+    case 270:
+      error = 4544;
+      break;
+    case 274:
+      error = 4549;
+      break;
+    case 275:
+      error = 4530;
+      break;
+    case 276:
+      error = 4540;
+      break;
+    case 277:
+      error = 4541;
+      break;
+    case 279:
+      error = 4520;
+      break;
+    case 285:
+      error = 4503;
+      break;
+    case 297:
+      error = 4502;
+      break;
+    case 304:
+      error = 4550;
+      break;
+    case 305:
+      error = 4542;
+      break;
+    default:
+      break;
   }
   response->SetError(error, Json::Value());
   response->SetError(response->GetError(), result);
@@ -290,7 +346,8 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
 
 void PackageWebAPI::CancelProgress() {
   NVX::TaskMgr mgr(kTaskOwner);
-  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, request->GetParam("taskid", "").asString()));
+  std::unique_ptr<NVX::Task> task(
+      GetTaskWithTaskMgr(mgr, request->GetParam("taskid", "").asString()));
   if (!task) {
     response->SetSuccess();
     return;

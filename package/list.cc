@@ -56,7 +56,8 @@ bool PackageWebAPI::IsBrickCached(const std::string& target, std::map<std::strin
 }
 
 void PackageWebAPI::List() {
-  uint64_t mask = PackageUtils::ParseAdditional(request->GetParam("additional", Json::Value(Json::arrayValue)));
+  uint64_t mask =
+      PackageUtils::ParseAdditional(request->GetParam("additional", Json::Value(Json::arrayValue)));
   AutoUpdateState autoupdate = ReadAutoUpdateState(mask);
   std::map<std::string, bool> bricks;
   Json::Value packages(Json::arrayValue);
@@ -86,10 +87,12 @@ void PackageWebAPI::Get() {
     response->SetError(4501, Json::Value());
     return;
   }
-  uint64_t mask = PackageUtils::ParseAdditional(request->GetParam("additional", Json::Value(Json::arrayValue)));
+  uint64_t mask =
+      PackageUtils::ParseAdditional(request->GetParam("additional", Json::Value(Json::arrayValue)));
   AutoUpdateState autoupdate = ReadAutoUpdateState(mask);
   PackageInfo info;
-  if (!pkgMgr.getPackageInfo(id, info, request->GetUILanguage(), ~0ULL) && pkgMgr.getResult() == 255) {
+  if (!pkgMgr.getPackageInfo(id, info, request->GetUILanguage(), ~0ULL) &&
+      pkgMgr.getResult() == 255) {
     response->SetError(4545, Json::Value());
     return;
   }

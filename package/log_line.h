@@ -3,9 +3,8 @@
 // ("misc", "install", ...), so an operator can find the line that wrote it.
 #pragma once
 
-#include <syslog.h>
-
 #include <string>
+#include <syslog.h>
 
 namespace KIVO_PACKAGE {
 
@@ -14,6 +13,6 @@ std::string LogSourceName(const char* file);
 
 }  // namespace KIVO_PACKAGE
 
-#define PKG_LOG_ERR(fmt, ...)                                                              \
+#define PKG_LOG_ERR(fmt, ...)                                                            \
   syslog(LOG_ERR, "%s:%d " fmt, KIVO_PACKAGE::LogSourceName(__FILE__).c_str(), __LINE__, \
          ##__VA_ARGS__)

@@ -28,8 +28,10 @@ void RunMember(APIRequest* request, APIResponse* response) {
 using KIVO_PACKAGE::PackageWebAPI;
 using KIVO_PACKAGE::RunMember;
 
-#define KIVO_HANDLER(name) \
-  KIVO_EXPORT void name(APIRequest* req, APIResponse* resp) { RunMember<&PackageWebAPI::name>(req, resp); }
+#define KIVO_HANDLER(name)                                    \
+  KIVO_EXPORT void name(APIRequest* req, APIResponse* resp) { \
+    RunMember<&PackageWebAPI::name>(req, resp);               \
+  }
 
 KIVO_HANDLER(List)
 KIVO_HANDLER(Get)

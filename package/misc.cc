@@ -1,13 +1,14 @@
 // Package logs, and deletion of temporary files.
 
 #include <limits.h>
-#include <stdlib.h>
 
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
 #include "log_line.h"
 #include "package_webapi.h"
 #include "storage/storage_config.h"
+
+#include <stdlib.h>
 
 namespace KIVO_PACKAGE {
 
@@ -51,7 +52,8 @@ bool PackageWebAPI::DeleteTmpFile(const char* path) {
   std::string given(path);
   size_t slash = given.rfind('/');
   std::string name = slash == std::string::npos ? given : given.substr(slash + 1);
-  std::string folder = RealPath(slash == std::string::npos ? "." : (slash == 0 ? "/" : given.substr(0, slash)));
+  std::string folder =
+      RealPath(slash == std::string::npos ? "." : (slash == 0 ? "/" : given.substr(0, slash)));
   if (folder.empty() || name.empty() || name == "." || name == "..") {
     PKG_LOG_ERR("[%s] is not a legal path point to a tmp directory", path);
     return false;

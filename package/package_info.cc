@@ -32,13 +32,22 @@ std::string RequestHost() {
 // The status the package tool's last result gives a package that does not run.
 const char* StoppedStatus(int result) {
   switch (result) {
-    case 255: return "non_installed";
-    case 256: case 263: return "NA";
-    case 150: case 258: return "broken";
-    case 259: return "version_limit";
-    case 265: return "builtin";
-    case 264: return "non_support";
-    default: return "stop";
+    case 255:
+      return "non_installed";
+    case 256:
+    case 263:
+      return "NA";
+    case 150:
+    case 258:
+      return "broken";
+    case 259:
+      return "version_limit";
+    case 265:
+      return "builtin";
+    case 264:
+      return "non_support";
+    default:
+      return "stop";
   }
 }
 
@@ -55,7 +64,8 @@ Json::Value LiveTaskData(NVX::TaskMgr& mgr, const std::string& id, const char* p
 
 }  // namespace
 
-void PackageWebAPI::DumpStatusInfo(const PackageInfo& info, uint64_t mask, Json::Value& additional) {
+void PackageWebAPI::DumpStatusInfo(const PackageInfo& info, uint64_t mask,
+                                   Json::Value& additional) {
   if (!(mask & (kUrl | kStatus))) return;
   const std::string id = info.getId();
   NVX::TaskMgr mgr(kTaskOwner);
@@ -66,9 +76,11 @@ void PackageWebAPI::DumpStatusInfo(const PackageInfo& info, uint64_t mask, Json:
   }
   Json::Value download = LiveTaskData(mgr, id, kDownloadPrefix);
   if (download["installing"].isBool() && download["installing"].asBool()) {
-    if (mask & kStatus) additional["status"] = download.isMember("status") ? download["status"] : "installing";
+    if (mask & kStatus)
+      additional["status"] = download.isMember("status") ? download["status"] : "installing";
     double progress = PMSGetProgress(id);
-    if ((mask & kInstallingProgress) && progress != -1.0) additional["installing_progress"] = progress;
+    if ((mask & kInstallingProgress) && progress != -1.0)
+      additional["installing_progress"] = progress;
     return;
   }
   if (!LiveTaskData(mgr, id, kUninstallPrefix).isNull()) {
@@ -83,22 +95,24 @@ void PackageWebAPI::DumpStatusInfo(const PackageInfo& info, uint64_t mask, Json:
       std::string protocol = info.get("adminprotocol").empty() ? "http" : info.get("adminprotocol");
       std::string path = info.get("adminurl");
       if (path.empty() || path[0] != '/') path = "/" + path;
-      additional["url"] = protocol + "://" + RequestHost() + ":" +
-                          std::to_string(info.getAdminPort()) + path;
+      additional["url"] =
+          protocol + "://" + RequestHost() + ":" + std::to_string(info.getAdminPort()) + path;
     }
     return;
   }
   if (mask & kStatus) additional["status"] = StoppedStatus(pkgMgr.getResult());
 }
 
-void PackageWebAPI::DumpUninstallPages(const PackageInfo& info, uint64_t mask, Json::Value& additional) {
+void PackageWebAPI::DumpUninstallPages(const PackageInfo& info, uint64_t mask,
+                                       Json::Value& additional) {
   if (!(mask & kUninstallPages) || !info.hasWizard(PKG_OP_UNINSTALL)) return;
   PackageInfo pages;
   if (!pkgMgr.readUIFile(PKG_OP_UNINSTALL, info, pages, request->GetUILanguage())) return;
   if (!pages.getUIFile().empty()) PackageUtils::DumpUIFIle(pages, additional["uninstall_pages"]);
 }
 
-void PackageWebAPI::DumpPkgInfo(const std::string& path, const PackageInfo& info, Json::Value& out) {
+void PackageWebAPI::DumpPkgInfo(const std::string& path, const PackageInfo& info,
+                                Json::Value& out) {
   out["path"] = path;
   out["id"] = info.getId();
   out["version"] = info.getVersion();

@@ -96,7 +96,8 @@ class PackageWebAPI {
                          const std::string& conflicts, Json::Value& result);
   bool CheckEnvServices(PackageManager& manager, const std::string& depsers, int version,
                         Json::Value& result);
-  bool CheckEnvDependencies(PackageManager& manager, const std::string& deppkgs, Json::Value& result);
+  bool CheckEnvDependencies(PackageManager& manager, const std::string& deppkgs,
+                            Json::Value& result);
   bool CheckEnvDependents(PackageManager& manager, const std::string& id, Json::Value& result);
   bool DeleteTmpFile(const char* path);
 

@@ -173,8 +173,9 @@ bool CheckIdArray(APIRequest* req, APIResponse* resp) {
 }
 
 bool CheckThumb(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp,
-               {{"name", Type::String, kOpt}, {"ver", Type::String, kOpt}, {"size", Type::Int, kOpt}})
+  return Check(
+             req, resp,
+             {{"name", Type::String, kOpt}, {"ver", Type::String, kOpt}, {"size", Type::Int, kOpt}})
       .TypesOk();
 }
 
@@ -294,8 +295,7 @@ bool CheckInstall(APIRequest* req, APIResponse* resp) {
 
 bool CheckFeasibility(APIRequest* req, APIResponse* resp) {
   Check c(req, resp, {{"type", Type::String, kReq}, {"packages", Type::Array, kReq}});
-  return c.TypesOk() &&
-         c.OneOf("type", "[\"install_check\",\"uninstall_check\",\"stop_check\"]");
+  return c.TypesOk() && c.OneOf("type", "[\"install_check\",\"uninstall_check\",\"stop_check\"]");
 }
 
 bool CheckList(APIRequest* req, APIResponse* resp) {
@@ -309,8 +309,7 @@ bool CheckGet(APIRequest* req, APIResponse* resp) {
 }
 
 bool CheckServerList(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp,
-               {{"blloadothers", Type::Bool, kOpt}, {"blforcereload", Type::Bool, kOpt}})
+  return Check(req, resp, {{"blloadothers", Type::Bool, kOpt}, {"blforcereload", Type::Bool, kOpt}})
       .TypesOk();
 }
 
@@ -354,8 +353,8 @@ const WEBAPI_CHECK_ROW gCheckTable[] = {
     {kInstallation, 1, "clean", CheckRequiredNotEmpty<kTaskId>, nullptr, nullptr},
     {kInstallation, 1, "cancel", CheckRequiredNotEmpty<kTaskid>, nullptr, nullptr},
     {kInstallation, 1, "delete", CheckRequiredNotEmpty<kPath>, nullptr, nullptr},
-    {"KIVO.Core.Package.Installation.Download", 1, "check", CheckRequiredNotEmpty<kTaskid>,
-     nullptr, nullptr},
+    {"KIVO.Core.Package.Installation.Download", 1, "check", CheckRequiredNotEmpty<kTaskid>, nullptr,
+     nullptr},
     {"KIVO.Core.Package.FakeIFrame", 1, "get", AlwaysAccept, nullptr, nullptr},
     {kPkg, 1, "feasibility_check", CheckFeasibility, nullptr, nullptr},
     {kPkg, 1, "list", CheckList, nullptr, nullptr},

@@ -22,14 +22,17 @@ void PackageWebAPI::Uninstall() {
     const std::string extra = request->GetParam("extra_values", "").asString();
     Json::Reader reader(Json::Features::strictMode());
     if (!extra.empty() && !reader.parse(extra, wizard)) {
-      PKG_LOG_ERR("Error: parsing error, reason = %s\n", reader.getFormattedErrorMessages().c_str());
+      PKG_LOG_ERR("Error: parsing error, reason = %s\n",
+                  reader.getFormattedErrorMessages().c_str());
       response->SetError(4561, Json::Value());
     } else {
       called = true;
-      bool ok = manager.uninstall(id, &wizard, request->GetUILanguage(), PKG_OP_UNINSTALL, false, user);
+      bool ok =
+          manager.uninstall(id, &wizard, request->GetUILanguage(), PKG_OP_UNINSTALL, false, user);
       result["message"] = PMSReadPackageLog(manager.getLogFilePath());
       result["worker_message"] = manager.getJsonParam("worker_msg");
-      if (!result["worker_message"].isArray()) result["worker_message"] = Json::Value(Json::arrayValue);
+      if (!result["worker_message"].isArray())
+        result["worker_message"] = Json::Value(Json::arrayValue);
       if (ok) {
         response->SetSuccess(result);
       } else if (manager.getResult() == 268) {
@@ -41,7 +44,8 @@ void PackageWebAPI::Uninstall() {
       }
     }
   }
-  if (called && !response->IsSuccess() && !result.empty()) response->SetError(response->GetError(), result);
+  if (called && !response->IsSuccess() && !result.empty())
+    response->SetError(response->GetError(), result);
   if (!manager.getLogFilePath().empty()) unlink(manager.getLogFilePath().c_str());
 }
 

@@ -8,6 +8,10 @@ cd "$(dirname "$0")/.."
 
 scripts/deps.sh
 
+# The committed .clang-format is the style; a change that drifts from it
+# fails here, before any build, so reviews never argue about layout.
+scripts/check-format.sh
+
 run_tests() {
   (cd "$BUILD_DIR" && ctest -j"$(nproc)" --output-on-failure --timeout 300)
 }

@@ -2,11 +2,10 @@
 // on packages installed by the package tool.
 
 #include <dirent.h>
+#include <memory>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
-
-#include <memory>
 
 #include <gtest/gtest.h>
 
@@ -40,16 +39,19 @@ class ControlTest : public ::testing::Test {
     p.daemon = false;
     if (!deps.empty()) p.info = {{"install_dep_packages", deps}};
     p.info["pidfile"] = "pid";
-    p.scripts = {{"start-stop-status",
-                  "case \"$1\" in\n"
-                  "start) " + std::string(fail_start ? "echo 'start refused' >&2; exit 1;;\n" :
-                  "echo start-$KIVO_PKG_NAME >> \"$KIVO_ROOT/tmp/order\"\n"
-                  "  echo \"$KIVO_PKG_NAME started\" >> \"$KIVO_WORKER_MSG\"\n"
-                  "  sleep 60 >/dev/null 2>&1 </dev/null & echo $! > \"$KIVO_PKG_VAR/pid\";;\n") +
-                  "stop) echo stop-$KIVO_PKG_NAME >> \"$KIVO_ROOT/tmp/order\"\n"
-                  "  kill $(cat \"$KIVO_PKG_VAR/pid\") 2>/dev/null; rm -f \"$KIVO_PKG_VAR/pid\";;\n"
-                  "status) [ -f \"$KIVO_PKG_VAR/pid\" ] && kill -0 $(cat \"$KIVO_PKG_VAR/pid\");;\n"
-                  "esac\n"}};
+    p.scripts = {
+        {"start-stop-status",
+         "case \"$1\" in\n"
+         "start) " +
+             std::string(fail_start ? "echo 'start refused' >&2; exit 1;;\n"
+                                    : "echo start-$KIVO_PKG_NAME >> \"$KIVO_ROOT/tmp/order\"\n"
+                                      "  echo \"$KIVO_PKG_NAME started\" >> \"$KIVO_WORKER_MSG\"\n"
+                                      "  sleep 60 >/dev/null 2>&1 </dev/null & echo $! > "
+                                      "\"$KIVO_PKG_VAR/pid\";;\n") +
+             "stop) echo stop-$KIVO_PKG_NAME >> \"$KIVO_ROOT/tmp/order\"\n"
+             "  kill $(cat \"$KIVO_PKG_VAR/pid\") 2>/dev/null; rm -f \"$KIVO_PKG_VAR/pid\";;\n"
+             "status) [ -f \"$KIVO_PKG_VAR/pid\" ] && kill -0 $(cat \"$KIVO_PKG_VAR/pid\");;\n"
+             "esac\n"}};
     std::vector<std::string> args = {"install", p.Build(dir_)};
     if (run) args.push_back("--run");
     std::string out;
@@ -147,7 +149,8 @@ TEST_F(ControlTest, BatchesFollowTheDependencyOrder) {
   Install("z-alone");
   for (const char* id : {"b-middle", "c-bottom"}) ASSERT_EQ(0, Kivoctl({"stop", id}));
   Order();
-  CgiAnswer start = Call(kControl, "start", {{"id", "[\"a-top\",\"c-bottom\",\"b-middle\",\"ghost\"]"}});
+  CgiAnswer start =
+      Call(kControl, "start", {{"id", "[\"a-top\",\"c-bottom\",\"b-middle\",\"ghost\"]"}});
   ASSERT_TRUE(start.Success()) << start.body;
   EXPECT_EQ("start-c-bottom\nstart-b-middle\nstart-a-top\n", Order());
   EXPECT_TRUE(start.Data()["a-top"]["data"]["worker_message"].isArray());
@@ -164,7 +167,8 @@ TEST_F(ControlTest, ABatchWithOneFailureReportsEachOutcome) {
   EXPECT_EQ(4580, start.Code()) << start.body;
   EXPECT_TRUE(start.Errors()["good"].isMember("data"));
   EXPECT_EQ(4580, start.Errors()["bad"]["code"].asInt());
-  EXPECT_NE(std::string::npos, start.Errors()["bad"]["errors"]["message"].asString().find("start refused"));
+  EXPECT_NE(std::string::npos,
+            start.Errors()["bad"]["errors"]["message"].asString().find("start refused"));
   // What succeeded stays done.
   EXPECT_EQ("start-good\n", Order());
   EXPECT_EQ(0, OperationLogs());
@@ -183,32 +187,40 @@ TEST_F(ControlTest, FeasibilityHardSoftAndFailure) {
   Install("base", "", true);
   Install("needs-base", "base", true);
   Install("quiet");
-  CgiAnswer ok = Call(kPkg, "feasibility_check", {{"type", "install_check"}, {"packages", "[\"new-one\"]"}});
+  CgiAnswer ok =
+      Call(kPkg, "feasibility_check", {{"type", "install_check"}, {"packages", "[\"new-one\"]"}});
   // Plenty of room on the test machine's volume: allowed, or a low-space advice.
-  if (!ok.Success()) EXPECT_EQ("soft", ok.Errors()["check_type"].asString()) << ok.body;
+  if (!ok.Success()) {
+    EXPECT_EQ("soft", ok.Errors()["check_type"].asString()) << ok.body;
+  }
   EXPECT_FALSE(ok.json.isMember("data"));
 
-  CgiAnswer hard = Call(kPkg, "feasibility_check", {{"type", "stop_check"}, {"packages", "[\"base\"]"}});
+  CgiAnswer hard =
+      Call(kPkg, "feasibility_check", {{"type", "stop_check"}, {"packages", "[\"base\"]"}});
   EXPECT_EQ(4556, hard.Code());
   EXPECT_EQ("hard", hard.Errors()["check_type"].asString());
   EXPECT_EQ("needs-base runs and needs base.", hard.Errors()["reasons"][0].asString());
 
   Kivoctl({"stop", "needs-base"});
-  CgiAnswer soft = Call(kPkg, "feasibility_check", {{"type", "stop_check"}, {"packages", "[\"base\"]"}});
+  CgiAnswer soft =
+      Call(kPkg, "feasibility_check", {{"type", "stop_check"}, {"packages", "[\"base\"]"}});
   EXPECT_EQ(4556, soft.Code());
   EXPECT_EQ("soft", soft.Errors()["check_type"].asString());
   EXPECT_EQ(1u, soft.Errors()["reasons"].size());
 
   int lock = PMSLockFile(root_.Path("/run/kivo/pkgtool/lock"), 1);
-  CgiAnswer busy = Call(kPkg, "feasibility_check", {{"type", "install_check"}, {"packages", "[\"x\"]"}});
+  CgiAnswer busy =
+      Call(kPkg, "feasibility_check", {{"type", "install_check"}, {"packages", "[\"x\"]"}});
   EXPECT_EQ("hard", busy.Errors()["check_type"].asString());
   PMSUnlockFile(lock);
 
-  CgiAnswer failure = Call(kPkg, "feasibility_check", {{"type", "uninstall_check"}, {"packages", "[\"../etc\"]"}});
+  CgiAnswer failure =
+      Call(kPkg, "feasibility_check", {{"type", "uninstall_check"}, {"packages", "[\"../etc\"]"}});
   EXPECT_EQ(4556, failure.Code());
   EXPECT_EQ("hard", failure.Errors()["check_type"].asString());
   EXPECT_TRUE(failure.Errors()["reasons"].empty());
-  EXPECT_EQ(4500, Call(kPkg, "feasibility_check", {{"type", "stop_check"}, {"packages", "[]"}}).Code());
+  EXPECT_EQ(4500,
+            Call(kPkg, "feasibility_check", {{"type", "stop_check"}, {"packages", "[]"}}).Code());
 }
 
 constexpr char kUninstall[] = "KIVO.Core.Package.Uninstallation";

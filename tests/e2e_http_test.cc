@@ -1,11 +1,11 @@
 // The web API over HTTP through lighttpd, as a browser or script reaches it.
 
-#include <gtest/gtest.h>
-
-#include <json/reader.h>
-
 #include <sys/wait.h>
 #include <unistd.h>
+
+#include <gtest/gtest.h>
+#include <json/reader.h>
+
 #include "klibc/atomic_file.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
@@ -34,7 +34,8 @@ HttpAnswer Curl(const std::vector<std::string>& args) {
   close(fds[1]);
   std::string raw;
   char buf[4096];
-  for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) > 0;) raw.append(buf, static_cast<size_t>(n));
+  for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) > 0;)
+    raw.append(buf, static_cast<size_t>(n));
   close(fds[0]);
   waitpid(pid, nullptr, 0);
   HttpAnswer answer;
@@ -57,9 +58,9 @@ TEST(EndToEndHttpTest, SignInQueryAndReadALogThroughLighttpd) {
   const std::string url = server.EntryURL();
   const std::string jar = root.Path("/cookies");
 
-  HttpAnswer login = Curl({"-c", jar, "--data",
-                           "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret",
-                           url});
+  HttpAnswer login =
+      Curl({"-c", jar, "--data",
+            "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret", url});
   ASSERT_TRUE(login.json["success"].asBool()) << login.head;
   EXPECT_NE(std::string::npos, login.head.find("application/json"));
   std::string token = login.json["data"]["token"].asString();
@@ -88,8 +89,9 @@ TEST(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
   ASSERT_TRUE(server.running());
   const std::string url = server.EntryURL();
   const std::string jar = root.Path("/cookies");
-  HttpAnswer login = Curl({"-c", jar, "--data",
-                           "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret", url});
+  HttpAnswer login =
+      Curl({"-c", jar, "--data",
+            "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret", url});
   std::string token = login.json["data"]["token"].asString();
   const std::string header = "X-KIVO-Token: " + token;
 
@@ -97,10 +99,12 @@ TEST(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
                         url + "?api=KIVO.Core.Package.Installation&version=1&method=upload"});
   ASSERT_TRUE(up.json["success"].asBool()) << up.head;
   std::string task = up.json["data"]["task_id"].asString();
-  HttpAnswer install = Curl({"-b", jar, "-H", header, "--data",
-                             "api=KIVO.Core.Package.Installation&version=1&method=install&task_id=" + task, url});
+  HttpAnswer install =
+      Curl({"-b", jar, "-H", header, "--data",
+            "api=KIVO.Core.Package.Installation&version=1&method=install&task_id=" + task, url});
   ASSERT_TRUE(install.json["success"].asBool()) << install.head;
-  HttpAnswer list = Curl({"-b", jar, "-H", header, url + "?api=KIVO.Core.Package&version=1&method=list"});
+  HttpAnswer list =
+      Curl({"-b", jar, "-H", header, url + "?api=KIVO.Core.Package&version=1&method=list"});
   EXPECT_EQ("http-app", list.json["data"]["packages"][0]["id"].asString());
   std::string big;
   ASSERT_TRUE(KIVOReadFile(root.Path("/var/packages/http-app/target/big.bin"), &big));

@@ -1,12 +1,11 @@
 // The web API host end to end as the web server runs it: entry.cgi with a
 // CGI environment on a temporary system root.
 
+#include <cstring>
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
-
-#include <cstring>
 
 #include <gtest/gtest.h>
 
@@ -47,7 +46,8 @@ TEST_F(HostTest, LoginGivesSessionCookieAndToken) {
   std::string sid = a.Data()["sid"].asString();
   EXPECT_EQ(32u, sid.size());
   EXPECT_EQ(32u, a.Data()["token"].asString().size());
-  EXPECT_NE(std::string::npos, a.head.find("Set-Cookie: id=" + sid + "; Path=/; HttpOnly; SameSite=Strict"));
+  EXPECT_NE(std::string::npos,
+            a.head.find("Set-Cookie: id=" + sid + "; Path=/; HttpOnly; SameSite=Strict"));
   EXPECT_NE(std::string::npos, a.head.find("Content-Type: application/json; charset=utf-8"));
 
   CgiAnswer wrong = Post("api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=nope");
@@ -86,17 +86,25 @@ TEST_F(HostTest, MalformedRequestsGetAClearAnswer) {
     CgiEnv env;
     std::string body;
   } cases[] = {
-      {{{"REQUEST_METHOD", "GET"}, {"QUERY_STRING", "api=KIVO.API.Info&version=1&method=que%zzry"}}, ""},
+      {{{"REQUEST_METHOD", "GET"}, {"QUERY_STRING", "api=KIVO.API.Info&version=1&method=que%zzry"}},
+       ""},
       {{{"REQUEST_METHOD", "GET"}, {"QUERY_STRING", "api=%"}}, ""},
-      {{{"REQUEST_METHOD", "DELETE"}, {"QUERY_STRING", "api=KIVO.API.Info&version=1&method=query"}}, ""},
-      {{{"REQUEST_METHOD", "POST"}, {"CONTENT_LENGTH", "100"},
-        {"CONTENT_TYPE", "application/x-www-form-urlencoded"}}, "api=KIVO.API.Info&version=1"},
+      {{{"REQUEST_METHOD", "DELETE"}, {"QUERY_STRING", "api=KIVO.API.Info&version=1&method=query"}},
+       ""},
+      {{{"REQUEST_METHOD", "POST"},
+        {"CONTENT_LENGTH", "100"},
+        {"CONTENT_TYPE", "application/x-www-form-urlencoded"}},
+       "api=KIVO.API.Info&version=1"},
       {{{"REQUEST_METHOD", "POST"}, {"CONTENT_LENGTH", "-5"}}, ""},
-      {{{"REQUEST_METHOD", "POST"}, {"CONTENT_LENGTH", "99999999999"},
-        {"CONTENT_TYPE", "application/x-www-form-urlencoded"}}, ""},
+      {{{"REQUEST_METHOD", "POST"},
+        {"CONTENT_LENGTH", "99999999999"},
+        {"CONTENT_TYPE", "application/x-www-form-urlencoded"}},
+       ""},
       {{{"REQUEST_METHOD", "POST"}, {"CONTENT_LENGTH", "3"}, {"CONTENT_TYPE", "text/xml"}}, "<a>"},
-      {{{"REQUEST_METHOD", "POST"}, {"CONTENT_LENGTH", "3"},
-        {"CONTENT_TYPE", "multipart/form-data; boundary=x"}}, "abc"},
+      {{{"REQUEST_METHOD", "POST"},
+        {"CONTENT_LENGTH", "3"},
+        {"CONTENT_TYPE", "multipart/form-data; boundary=x"}},
+       "abc"},
   };
   for (const Case& c : cases) {
     CgiAnswer a = RunEntryCgi(c.env, c.body);
@@ -114,7 +122,7 @@ TEST_F(HostTest, HostileValuesNeverBreakTheAnswer) {
   // Non-UTF-8 bytes, invalid JSON, a very long value and deep nesting all
   // reach the checker and handler as plain values; the answer stays JSON.
   for (const std::string& name : {std::string("\xFF\xFE\x80pkg"), std::string("[\"a\""),
-                                   std::string(1 << 20, 'x'), std::string(5000, '[')}) {
+                                  std::string(1 << 20, 'x'), std::string(5000, '[')}) {
     CgiAnswer a = admin.Call("KIVO.Core.Package.Log", "get", 1, {{"name", name}});
     EXPECT_EQ(0, a.exit_status);
     ASSERT_TRUE(a.Success()) << a.body.substr(0, 200);
@@ -153,8 +161,8 @@ TEST_F(HostTest, CookieSessionsNeedTheirTokenExceptForPagesLoadedByURL) {
       Get(kLogGet, {{"HTTP_COOKIE", cookie}, {"HTTP_X_KIVO_TOKEN", admin.token()}}).Success());
   // The inline-frame page passes authorization without the token and reaches
   // its handler (which answers for itself).
-  CgiAnswer frame = Get("api=KIVO.Core.Package.FakeIFrame&version=1&method=get",
-                        {{"HTTP_COOKIE", cookie}});
+  CgiAnswer frame =
+      Get("api=KIVO.Core.Package.FakeIFrame&version=1&method=get", {{"HTTP_COOKIE", cookie}});
   EXPECT_NE(105, frame.Code());
   EXPECT_NE(119, frame.Code());
 }
@@ -190,9 +198,10 @@ class HostFrameTest : public HostTest {
   }
   void TearDown() override { unsetenv("KIVO_MODULE_DIR"); }
   CgiAnswer Call(const std::string& method) {
-    return RunEntryCgi({{"REQUEST_METHOD", "GET"},
-                        {"KIVO_MODULE_DIR", getenv("KIVO_MODULE_DIR")},
-                        {"QUERY_STRING", "api=Test.Frame&version=1&method=" + method + "&_sid=" + sid_}});
+    return RunEntryCgi(
+        {{"REQUEST_METHOD", "GET"},
+         {"KIVO_MODULE_DIR", getenv("KIVO_MODULE_DIR")},
+         {"QUERY_STRING", "api=Test.Frame&version=1&method=" + method + "&_sid=" + sid_}});
   }
   void SignIn() { sid_ = ApiClient("admin", "secret").sid(); }
   std::string sid_;
@@ -245,7 +254,8 @@ TEST(ModuleTablesTest, LayoutOrderAndTerminators) {
     bool found = false;
     for (int j = 0; j < check_rows; ++j) {
       found |= strcmp(table[i].api, checks[j].api) == 0 &&
-               strcmp(table[i].method, checks[j].method) == 0 && table[i].version == checks[j].version;
+               strcmp(table[i].method, checks[j].method) == 0 &&
+               table[i].version == checks[j].version;
     }
     EXPECT_TRUE(found) << table[i].api << " " << table[i].method;
   }

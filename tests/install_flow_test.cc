@@ -1,12 +1,11 @@
 // Installing from a package file through the real host: upload, check,
 // install, status and cancel, clean and delete.
 
+#include <memory>
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <memory>
 
 #include <gtest/gtest.h>
 
@@ -54,7 +53,9 @@ class InstallFlowTest : public ::testing::Test {
   // Files left in the upload area.
   int Uploads() {
     std::string out;
-    RunProgram({"sh", "-c", "ls -A '" + root_.Path("/volume1/@tmp/upload") + "' 2>/dev/null | wc -l"}, &out);
+    RunProgram(
+        {"sh", "-c", "ls -A '" + root_.Path("/volume1/@tmp/upload") + "' 2>/dev/null | wc -l"},
+        &out);
     return std::atoi(out.c_str());
   }
   pid_t Spawn(const std::vector<std::string>& argv) {
@@ -100,12 +101,14 @@ TEST_F(InstallFlowTest, UploadCheckInstallStatusList) {
   EXPECT_EQ(1u, check.Data()["volume_count"].asUInt());
   EXPECT_FALSE(check.Data()["is_occupied"].asBool());
 
-  CgiAnswer install = Call("install", {{"task_id", task_id}, {"installrunpackage", "true"}, {"type", "1"}});
+  CgiAnswer install =
+      Call("install", {{"task_id", task_id}, {"installrunpackage", "true"}, {"type", "1"}});
   ASSERT_TRUE(install.Success()) << install.body;
   EXPECT_TRUE(install.Data()["worker_message"].isArray());
   EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(task_id));
   EXPECT_EQ(0, Uploads());  // the installed upload is gone too
-  EXPECT_TRUE(Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_test-app"}}).Data()["finished"].asBool());
+  EXPECT_TRUE(
+      Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_test-app"}}).Data()["finished"].asBool());
   CgiAnswer list = client().Call("KIVO.Core.Package", "list", 1, {{"additional", "[\"status\"]"}});
   EXPECT_EQ("running", list.Data()["packages"][0]["additional"]["status"].asString());
 }
@@ -181,10 +184,12 @@ TEST_F(InstallFlowTest, RefusalsAtUploadComeFromRealState) {
   big.id = "big";
   big.files = {{"zeros", std::string(4 << 20, '\0')}};  // 4 MiB unpacked, a few KiB packed
   std::string big_file = big.Build(dir_);
-  root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 3000000}]");
+  root_.Write("/etc/kivo/volumes.json",
+              "[{\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 3000000}]");
   EXPECT_EQ(4504, Upload(big_file).Code());
   root_.Write("/etc/kivo/volumes.json",
-              "[{\"path\": \"/volume1\", \"status\": \"normal\"}, {\"path\": \"/volume2\", \"status\": \"crashed\"}]");
+              "[{\"path\": \"/volume1\", \"status\": \"normal\"}, {\"path\": \"/volume2\", "
+              "\"status\": \"crashed\"}]");
   root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\npkg_def_volume=\"/volume2\"\n");
   EXPECT_EQ(4505, Upload(big_file).Code());
   root_.Write("/etc/kivo/volumes.json", "[]");
@@ -224,7 +229,8 @@ TEST_F(InstallFlowTest, CodeSignatureIsLenientAtUploadAndStrictAtInstall) {
   unsigned_app.id = "unsigned";
   CgiAnswer up2 = Upload(unsigned_app.Build(dir_));
   EXPECT_EQ(4531, up2.Data()["codesign_error"].asInt());
-  CgiAnswer lenient = Call("install", {{"task_id", up2.Data()["task_id"].asString()}, {"check_codesign", "false"}});
+  CgiAnswer lenient =
+      Call("install", {{"task_id", up2.Data()["task_id"].asString()}, {"check_codesign", "false"}});
   EXPECT_TRUE(lenient.Success()) << lenient.body;
 
   std::string tampered_file = dir_ + "/tampered.kpk";
@@ -239,7 +245,7 @@ TEST_F(InstallFlowTest, EnvironmentCheckVersionsServicesAndLock) {
   root_.Write("/etc/kivo/services.conf", "pgsql=\"stopped\"\nweb=\"stopped\"\nssh=\"running\"\n");
   CgiAnswer v1 = Call("check", {{"depsers", "web:ssh:pgsql"}}, 1);
   EXPECT_EQ(4525, v1.Code());
-  EXPECT_EQ(0x3u, v1.Errors()["services"].asUInt());  // pgsql and web bits
+  EXPECT_EQ(0x3u, v1.Errors()["services"].asUInt());   // pgsql and web bits
   EXPECT_FALSE(v1.Errors().isMember("volume_count"));  // the pgsql case drops the volume list
   CgiAnswer v2 = Call("check", {{"depsers", "web:ssh"}}, 2);
   EXPECT_EQ(4525, v2.Code());
@@ -250,8 +256,12 @@ TEST_F(InstallFlowTest, EnvironmentCheckVersionsServicesAndLock) {
   base.id = "base";
   ASSERT_EQ(0, Kivoctl({"install", base.Build(dir_), "--run"}));
   // Version 1 tests conflicts with the version "1" whatever "ver" says.
-  CgiAnswer conflict = Call("check", {{"id", "new"}, {"conflictpkgs", "{\"base\": {\"operator\": \">=\", \"version\": \"1\"}}"},
-                                      {"ver", "5"}}, 1);
+  CgiAnswer conflict =
+      Call("check",
+           {{"id", "new"},
+            {"conflictpkgs", "{\"base\": {\"operator\": \">=\", \"version\": \"1\"}}"},
+            {"ver", "5"}},
+           1);
   EXPECT_EQ(4524, conflict.Code());
   EXPECT_EQ("base", conflict.Errors()["packages"].asString());
   CgiAnswer deps = Call("check", {{"deppkgs", "{\"base\": {}, \"absent\": {}}"}}, 2);
@@ -292,7 +302,8 @@ TEST_F(InstallFlowTest, StatusAndCancelOfJobs) {
   job["pid"] = Spawn({"sleep", "60"});
   job["tmp_folder"] = folder;
   make_task("@KIVOPKG_DOWNLOAD_x", job, 0.5);
-  EXPECT_DOUBLE_EQ(0.5, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_x"}}).Data()["progress"].asDouble());
+  EXPECT_DOUBLE_EQ(
+      0.5, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_x"}}).Data()["progress"].asDouble());
   ASSERT_TRUE(Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_x"}}).Success());
   EXPECT_EQ(0, KLIBCProcAlive(job["pid"].asInt()));  // ended (a zombie until this test reaps it)
   EXPECT_FALSE(KLIBCFileExist(folder.c_str()));
@@ -302,11 +313,14 @@ TEST_F(InstallFlowTest, StatusAndCancelOfJobs) {
   job["pid"] = Spawn({"sleep", "60"});
   KIVOFSMkdirP(folder.c_str());
   make_task("@KIVOPKG_DOWNLOAD_y", job, 1.0);
-  EXPECT_DOUBLE_EQ(0.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
+  EXPECT_DOUBLE_EQ(
+      0.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
   root_.Write(folder.substr(root_.dir().size()) + "/@KIVOPKG_DOWNLOAD_y", "payload");
-  EXPECT_DOUBLE_EQ(1.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
+  EXPECT_DOUBLE_EQ(
+      1.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
   make_task("@KIVOPKG_DOWNLOAD_y", job, -1.0);
-  EXPECT_DOUBLE_EQ(0.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
+  EXPECT_DOUBLE_EQ(
+      0.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
   EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask("@KIVOPKG_DOWNLOAD_y"));
   EXPECT_FALSE(KLIBCFileExist(folder.c_str()));
 
@@ -350,7 +364,9 @@ TEST_F(InstallFlowTest, CleanAndGuardedDelete) {
   ASSERT_TRUE(Call("clean", {{"task_id", up.Data()["task_id"].asString()}}).Success());
   for (int i = 0; i < 100 && Uploads() > 0; ++i) usleep(20000);
   EXPECT_EQ(0, Uploads());
-  for (int i = 0; i < 100 && NVX::TaskMgr("@administrators").hasTask(up.Data()["task_id"].asString()); ++i) usleep(20000);
+  for (int i = 0;
+       i < 100 && NVX::TaskMgr("@administrators").hasTask(up.Data()["task_id"].asString()); ++i)
+    usleep(20000);
   EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(up.Data()["task_id"].asString()));
 
   root_.Write("/etc/keep", "precious");
@@ -359,8 +375,9 @@ TEST_F(InstallFlowTest, CleanAndGuardedDelete) {
   ASSERT_EQ(0, symlink(root_.Path("/etc").c_str(), root_.Path("/tmp/to-etc").c_str()));
   for (const std::string& hostile :
        {root_.Path("/tmp/../etc"), root_.Path("/tmp/../etc/keep"), root_.Path("/tmp/to-etc/keep"),
-        root_.Path("/tmp"), root_.Path("/tmp/"), root_.Path("/volume1/@tmp"), root_.Path("/volume1/public/x"),
-        std::string("/etc/passwd"), std::string("relative/path")}) {
+        root_.Path("/tmp"), root_.Path("/tmp/"), root_.Path("/volume1/@tmp"),
+        root_.Path("/volume1/public/x"), std::string("/etc/passwd"),
+        std::string("relative/path")}) {
     EXPECT_EQ(4501, Call("delete", {{"path", hostile}}).Code()) << hostile;
   }
   // A symlink inside the temporary folder goes, as a link; its target stays.
@@ -379,7 +396,8 @@ TEST_F(InstallFlowTest, CleanAndGuardedDelete) {
 }
 
 TEST_F(InstallFlowTest, InstallNamingAServerPackageIsNotAvailableYet) {
-  CgiAnswer a = Call("install", {{"name", "demo"}, {"url", "http://127.0.0.1/x.kpk"}, {"filesize", "10"}});
+  CgiAnswer a =
+      Call("install", {{"name", "demo"}, {"url", "http://127.0.0.1/x.kpk"}, {"filesize", "10"}});
   EXPECT_EQ(4501, a.Code());
   EXPECT_EQ("not_available", a.Errors()["reason"].asString());
   EXPECT_EQ(4501, Call("install", {{"task_id", "@KIVOPKG_UPLOAD_nothing"}}).Code());

@@ -1,11 +1,10 @@
 // "list" and "get" of KIVO.Core.Package through the real host, on packages
 // installed by the package tool.
 
+#include <memory>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <memory>
 
 #include <gtest/gtest.h>
 
@@ -38,7 +37,7 @@ class ListGetTest : public ::testing::Test {
       kill(pid, SIGKILL);
       waitpid(pid, nullptr, 0);
     }
-    for (const std::string& id : {"web-app", "beta-app", "plain"}) Kivoctl({"stop", id});
+    for (const char* id : {"web-app", "beta-app", "plain"}) Kivoctl({"stop", id});
   }
 
   void Install(const TestPackage& p, std::vector<std::string> extra = {}) {
@@ -106,11 +105,21 @@ TEST_F(ListGetTest, BaseMembersOnlyWithoutAdditional) {
 TEST_F(ListGetTest, EveryAdditionalMember) {
   TestPackage web;
   web.id = "web-app";
-  web.info = {{"adminport", "18095"}, {"adminurl", "/ui"}, {"checkport", "no"}, {"beta", "yes"},
-              {"description", "Serves pages"}, {"maintainer", "Ada"}, {"helpurl", "https://h"},
-              {"report_url", "https://r"}, {"silent_install", "yes"}, {"silent_uninstall", "yes"},
-              {"install_dep_services", "pgsql:web"}, {"ctl_uninstall", "yes"}, {"logfile", "web.log"},
-              {"support_center", "yes"}, {"nvx_apps", "web.App"}};
+  web.info = {{"adminport", "18095"},
+              {"adminurl", "/ui"},
+              {"checkport", "no"},
+              {"beta", "yes"},
+              {"description", "Serves pages"},
+              {"maintainer", "Ada"},
+              {"helpurl", "https://h"},
+              {"report_url", "https://r"},
+              {"silent_install", "yes"},
+              {"silent_uninstall", "yes"},
+              {"install_dep_services", "pgsql:web"},
+              {"ctl_uninstall", "yes"},
+              {"logfile", "web.log"},
+              {"support_center", "yes"},
+              {"nvx_apps", "web.App"}};
   web.members = {{"WIZARD_UIFILES/uninstall_uifile", "[{\"step_title\": \"Bye & thanks\"}]"},
                  {"LICENSE", "Be nice."}};
   Install(web, {"--run"});
@@ -119,7 +128,8 @@ TEST_F(ListGetTest, EveryAdditionalMember) {
   plain.info = {{"install_dep_packages", "web-app>=1.0"}};
   Install(plain);
 
-  CgiAnswer a = client().Call("KIVO.Core.Package", "get", 1, {{"id", "web-app"}, {"additional", kAllKeys}});
+  CgiAnswer a =
+      client().Call("KIVO.Core.Package", "get", 1, {{"id", "web-app"}, {"additional", kAllKeys}});
   ASSERT_TRUE(a.Success()) << a.body;
   const Json::Value& x = a.Data()["additional"];
   EXPECT_EQ("running", x["status"].asString());
@@ -135,13 +145,15 @@ TEST_F(ListGetTest, EveryAdditionalMember) {
   EXPECT_TRUE(x["startable"].asBool());
   EXPECT_TRUE(x["ctl_uninstall"].asBool());
   EXPECT_TRUE(x["is_uninstall_pages"].asBool());
-  EXPECT_EQ("%5B%7B%22step_title%22%3A%22Bye%20%26%20thanks%22%7D%5D", x["uninstall_pages"].asString());
+  EXPECT_EQ("%5B%7B%22step_title%22%3A%22Bye%20%26%20thanks%22%7D%5D",
+            x["uninstall_pages"].asString());
   EXPECT_EQ("web.App", x["nvx_apps"].asString());
   EXPECT_EQ("pgsql", x["start_dependent_services"][0].asString());
   EXPECT_EQ(2u, x["start_dependent_services"].size());
   EXPECT_FALSE(x["autoupdate"].asBool());
   EXPECT_FALSE(x.isMember("log_path"));  // get never writes it
-  EXPECT_EQ(0u, x["installed_info"]["path"].asString().find(root_.Path("/volume1/@appstore/web-app.")));
+  EXPECT_EQ(0u,
+            x["installed_info"]["path"].asString().find(root_.Path("/volume1/@appstore/web-app.")));
   EXPECT_FALSE(x["installed_info"]["is_brick"].asBool());
   EXPECT_EQ("http://nas.example:18095/ui", x["url"].asString());  // the host the request came to
 
@@ -151,7 +163,8 @@ TEST_F(ListGetTest, EveryAdditionalMember) {
   EXPECT_FALSE(p["beta"].asBool());
   EXPECT_EQ(">=", p["dependent_packages"]["web-app"]["operator"].asString());
   EXPECT_FALSE(p.isMember("url"));
-  EXPECT_EQ(root_.Path("/var/packages/web-app/var/web.log"), Find(list, "web-app")["additional"]["log_path"].asString());
+  EXPECT_EQ(root_.Path("/var/packages/web-app/var/web.log"),
+            Find(list, "web-app")["additional"]["log_path"].asString());
 }
 
 TEST_F(ListGetTest, SilentUninstallFollowsTheSilentInstallBit) {
@@ -164,7 +177,9 @@ TEST_F(ListGetTest, SilentUninstallFollowsTheSilentInstallBit) {
   EXPECT_FALSE(both["silent_install"].asBool());
   EXPECT_TRUE(both["silent_uninstall"].asBool());
   // Case does not matter for the names (the legacy API has no checker).
-  EXPECT_EQ("stop", Find(List("[\"STATUS\"]", "KIVO.Package"), "test-app")["additional"]["status"].asString());
+  EXPECT_EQ(
+      "stop",
+      Find(List("[\"STATUS\"]", "KIVO.Package"), "test-app")["additional"]["status"].asString());
 }
 
 TEST_F(ListGetTest, GetUnknownBrokenAndInitFailure) {
@@ -177,7 +192,8 @@ TEST_F(ListGetTest, GetUnknownBrokenAndInitFailure) {
   PackageInfo info;
   ASSERT_TRUE(pm.getPackageInfo("test-app", info));
   RunProgram({"rm", "-rf", info.getTarget()}, nullptr);
-  CgiAnswer broken = client().Call("KIVO.Core.Package", "get", 1, {{"id", "test-app"}, {"additional", "[\"status\"]"}});
+  CgiAnswer broken = client().Call("KIVO.Core.Package", "get", 1,
+                                   {{"id", "test-app"}, {"additional", "[\"status\"]"}});
   ASSERT_TRUE(broken.Success()) << broken.body;
   EXPECT_EQ("broken", broken.Data()["additional"]["status"].asString());
 }
@@ -185,7 +201,9 @@ TEST_F(ListGetTest, GetUnknownBrokenAndInitFailure) {
 TEST_F(ListGetTest, StatusFollowsLiveTasks) {
   TestPackage p;
   Install(p);
-  auto status = [this]() { return Find(List("[\"status\",\"installing_progress\"]"), "test-app")["additional"]; };
+  auto status = [this]() {
+    return Find(List("[\"status\",\"installing_progress\"]"), "test-app")["additional"];
+  };
   Json::Value data(Json::objectValue);
   data["status"] = "starting";
   data["pid"] = Sleeper();
@@ -231,11 +249,14 @@ TEST_F(ListGetTest, AutoUpdateFlagUnderEverySetting) {
   };
   root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
   EXPECT_EQ(std::make_pair(false, false), flags());  // automatic update off: even the chosen one
-  root_.Write("/etc/kivoinfo.conf", "enable_pkg_autoupdate_all=\"yes\"\npkg_autoupdate_all=\"no\"\n");
+  root_.Write("/etc/kivoinfo.conf",
+              "enable_pkg_autoupdate_all=\"yes\"\npkg_autoupdate_all=\"no\"\n");
   EXPECT_EQ(std::make_pair(true, false), flags());
-  root_.Write("/etc/kivoinfo.conf", "enable_pkg_autoupdate_all=\"yes\"\npkg_autoupdate_all=\"yes\"\n");
+  root_.Write("/etc/kivoinfo.conf",
+              "enable_pkg_autoupdate_all=\"yes\"\npkg_autoupdate_all=\"yes\"\n");
   EXPECT_EQ(std::make_pair(true, true), flags());
-  root_.Write("/etc/kivoinfo.conf", "enable_pkg_autoupdate_all=\"no\"\npkg_autoupdate_all=\"yes\"\n");
+  root_.Write("/etc/kivoinfo.conf",
+              "enable_pkg_autoupdate_all=\"no\"\npkg_autoupdate_all=\"yes\"\n");
   EXPECT_EQ(std::make_pair(false, false), flags());
 }
 

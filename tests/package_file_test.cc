@@ -40,16 +40,18 @@ class PackageFileTest : public ::testing::Test {
     std::string message;
     PKG_ERRCODE code = PKG_OK;
     Json::Value details;
-    InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true, true);
+    InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true,
+                           true);
     return code;
   }
   // Nothing of a refused package reached the system.
   void ExpectUntouched() {
     EXPECT_TRUE(PackageRegistry::List().empty());
     std::string out;
-    RunProgram({"find", root_.Path("/volume1"), root_.Path("/var/packages"), "-mindepth", "1",
-                "-not", "-name", ".records", "-not", "-name", "@appstore", "-not", "-name", "@appdata"},
-               &out);
+    RunProgram(
+        {"find", root_.Path("/volume1"), root_.Path("/var/packages"), "-mindepth", "1", "-not",
+         "-name", ".records", "-not", "-name", "@appstore", "-not", "-name", "@appdata"},
+        &out);
     EXPECT_EQ("", out);
   }
 
@@ -79,8 +81,9 @@ TEST_F(PackageFileTest, HostilePayloadsAreRefusedBeforeInstalling) {
   EXPECT_FALSE(KLIBCFileExist(root_.Path("/escape.txt").c_str()));
   EXPECT_FALSE(KLIBCFileExist(root_.Path("/tmp/escape.txt").c_str()));
   // Symlinks that stay inside are fine.
-  std::string fine = BuildRawPackage(dir_, "fine", {{"lib", 'd', 0755, ""}, {"lib/x", 'f', 0644, ""},
-                                                      {"current", 'l', 0777, "lib/x"}});
+  std::string fine = BuildRawPackage(
+      dir_, "fine",
+      {{"lib", 'd', 0755, ""}, {"lib/x", 'f', 0644, ""}, {"current", 'l', 0777, "lib/x"}});
   EXPECT_EQ(PKG_OK, Check(fine));
 }
 
@@ -106,8 +109,8 @@ TEST_F(PackageFileTest, DamagedFilesAreNotPackageFiles) {
   EXPECT_EQ(PKG_ERR_NOT_PACKAGE_FILE, Check(huge));
 
   std::string unknown = dir_ + "/unknown-member.kpk";
-  ASSERT_TRUE(PMSWritePackage({{"INFO", "package=\"u\"\nversion=\"1\"\n"}, {"../../x", "y"}}, payload, "",
-                              unknown, &error));
+  ASSERT_TRUE(PMSWritePackage({{"INFO", "package=\"u\"\nversion=\"1\"\n"}, {"../../x", "y"}},
+                              payload, "", unknown, &error));
   EXPECT_EQ(PKG_ERR_HOSTILE_MEMBER, Check(unknown));
   ExpectUntouched();
 }
@@ -166,7 +169,8 @@ TEST_F(PackageFileTest, SignaturesByTrustLevel) {
     KIVOReadFile(other, &data);
     size_t begin = data.find("-----BEGIN PGP SIGNATURE");
     size_t end = data.find("-----END PGP SIGNATURE-----") + 28;
-    ASSERT_TRUE(PMSAttachSignature(wrong_manifest, wrong_manifest, data.substr(begin, end - begin), &error));
+    ASSERT_TRUE(PMSAttachSignature(wrong_manifest, wrong_manifest, data.substr(begin, end - begin),
+                                   &error));
   }
 
   SetTrustLevel(0);

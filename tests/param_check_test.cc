@@ -43,11 +43,15 @@ constexpr char kPkg[] = "KIVO.Core.Package";
 constexpr char kInst[] = "KIVO.Core.Package.Installation";
 
 TEST_F(ParamCheckTest, AlwaysAcceptShape) {
-  for (const auto& row : std::vector<std::pair<std::string, std::string>>{
-           {"KIVO.Core.Package.Setting", "get"}, {"KIVO.Core.Package.Setting.Volume", "get"},
-           {"KIVO.Core.Package.Info", "get"}, {"KIVO.Core.Package.Feed", "list"},
-           {"KIVO.Core.Package.Feed.Keyring", "list"}, {kInst, "upload"},
-           {"KIVO.Core.Package.FakeIFrame", "get"}, {"KIVO.Core.Package.Server", "check"}}) {
+  for (const auto& row :
+       std::vector<std::pair<std::string, std::string>>{{"KIVO.Core.Package.Setting", "get"},
+                                                        {"KIVO.Core.Package.Setting.Volume", "get"},
+                                                        {"KIVO.Core.Package.Info", "get"},
+                                                        {"KIVO.Core.Package.Feed", "list"},
+                                                        {"KIVO.Core.Package.Feed.Keyring", "list"},
+                                                        {kInst, "upload"},
+                                                        {"KIVO.Core.Package.FakeIFrame", "get"},
+                                                        {"KIVO.Core.Package.Server", "check"}}) {
     ExpectAccepted(row.first, 1, row.second, {{"anything", "[1,2]"}, {"id", "{}"}});
   }
 }
@@ -74,9 +78,14 @@ TEST_F(ParamCheckTest, TypesOnlyShape) {
                 "type");  // step 2 (types) comes before step 3 (elements)
   ExpectRefused(set, 1, "set", {{"packages", "[1]"}}, "packages", "type");
   ExpectAccepted(set, 1, "set",
-                 {{"packages", "[\"a\"]"}, {"update_channel", "beta"}, {"enable_email", "true"},
-                  {"enable_nvx", "false"}, {"trust_level", "2"}, {"enable_autoupdate", "true"},
-                  {"autoupdateall", "false"}, {"default_vol", "/volume1"}});
+                 {{"packages", "[\"a\"]"},
+                  {"update_channel", "beta"},
+                  {"enable_email", "true"},
+                  {"enable_nvx", "false"},
+                  {"trust_level", "2"},
+                  {"enable_autoupdate", "true"},
+                  {"autoupdateall", "false"},
+                  {"default_vol", "/volume1"}});
   ExpectRefused("KIVO.Core.Package.Setting.Volume", 1, "set", {{"default_vol", "{}"}},
                 "default_vol", "type");
 
@@ -96,9 +105,14 @@ TEST_F(ParamCheckTest, TypesOnlyShape) {
   ExpectRefused(kInst, 1, "check", {{"deppkgs", "[]"}}, "deppkgs", "type");
   ExpectRefused(kInst, 1, "check", {{"blCheckDep", "yes"}, {"size", "x"}}, "size", "type");
   ExpectAccepted(kInst, 2, "check",
-                 {{"id", "[\"a\"]"}, {"depsers", "pgsql"}, {"deppkgs", "{\"b\":\"1.0\"}"},
-                  {"conflictpkgs", "{}"}, {"install_type", ""}, {"size", "10"},
-                  {"blCheckDep", "true"}, {"ver", "1.10"}});
+                 {{"id", "[\"a\"]"},
+                  {"depsers", "pgsql"},
+                  {"deppkgs", "{\"b\":\"1.0\"}"},
+                  {"conflictpkgs", "{}"},
+                  {"install_type", ""},
+                  {"size", "10"},
+                  {"blCheckDep", "true"},
+                  {"ver", "1.10"}});
 }
 
 TEST_F(ParamCheckTest, TypesAndConditionsShape) {
@@ -164,8 +178,8 @@ TEST_F(ParamCheckTest, InstallNamesItsSourceOneOfThreeWays) {
   ExpectRefused(kInst, 1, "install", {{"task_id", "t"}, {"name", ""}}, "name", "condition");
   ExpectRefused(kInst, 1, "install", {{"task_id", "t"}, {"url", ""}}, "url", "condition");
   ExpectRefused(kInst, 1, "install", {{"task_id", "t"}, {"filesize", "big"}}, "filesize", "type");
-  ExpectRefused(kInst, 1, "install", {{"task_id", "t"}, {"check_codesign", "no"}},
-                "check_codesign", "type");
+  ExpectRefused(kInst, 1, "install", {{"task_id", "t"}, {"check_codesign", "no"}}, "check_codesign",
+                "type");
   ExpectAccepted(kInst, 1, "install", {{"task_id", "@KIVOPKG_UPLOAD_1"}});
   ExpectAccepted(kInst, 1, "install", {{"path", "/volume1/p.kpk"}});
   ExpectAccepted(kInst, 1, "install",

@@ -54,7 +54,8 @@ class CrashTest : public ::testing::TestWithParam<const char*> {
       RunProgram({"ls", "-A", root_.Path(dir)}, &out);
       EXPECT_EQ(PackageRegistry::List().size(),
                 static_cast<size_t>(std::count(out.begin(), out.end(), '\n')))
-          << dir << ":\n" << out;
+          << dir << ":\n"
+          << out;
     }
   }
 

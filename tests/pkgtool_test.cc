@@ -2,13 +2,11 @@
 // install, upgrade, start, stop, uninstall, and the refusals that come from
 // the system's real state.
 
-#include <arpa/inet.h>
 #include <fcntl.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <sys/wait.h>
 #include <signal.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -19,6 +17,9 @@
 #include "pkgtool/registry.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
 
 namespace {
 
@@ -71,8 +72,9 @@ TEST_F(PackageToolTest, InstallStartStopUninstall) {
   TestPackage app;
   app.files = {{"bin/tool", "#!/bin/sh\necho tool\n"}, {"share/readme.txt", "hello\n"}};
   app.info = {{"logfile", "app.log"}, {"displayname", "Test App"}};
-  app.scripts = {{"postinst", "echo installed-$KIVO_PKG_VERSION > \"$KIVO_PKG_VAR/app.log\"\n"
-                              "echo 'Welcome to Test App' >> \"$KIVO_WORKER_MSG\"\n"}};
+  app.scripts = {{"postinst",
+                  "echo installed-$KIVO_PKG_VERSION > \"$KIVO_PKG_VAR/app.log\"\n"
+                  "echo 'Welcome to Test App' >> \"$KIVO_WORKER_MSG\"\n"}};
   ASSERT_EQ(0, Install(Build(app), {"--run"})) << out_;
   EXPECT_NE(std::string::npos, out_.find("Welcome to Test App"));
   EXPECT_EQ("test-app 1.0 running\n", Status("test-app"));
@@ -118,7 +120,8 @@ TEST_F(PackageToolTest, UpgradeKeepsDataAndFailedUpgradeKeepsTheOldVersionRunnin
   TestPackage v2 = v1;
   v2.version = "2.0";
   v2.files = {{"version.txt", "two\n"}};
-  v2.scripts = {{"postupgrade", "echo \"from $KIVO_PKG_OLD_VERSION\" >> \"$KIVO_PKG_VAR/data.txt\"\n"}};
+  v2.scripts = {
+      {"postupgrade", "echo \"from $KIVO_PKG_OLD_VERSION\" >> \"$KIVO_PKG_VAR/data.txt\"\n"}};
   ASSERT_EQ(0, Install(Build(v2))) << out_;
   EXPECT_EQ("2.0", InstalledVersion("test-app"));
   EXPECT_EQ("test-app 2.0 running\n", Status("test-app"));  // it ran, so it runs again
@@ -248,7 +251,8 @@ TEST_F(PackageToolTest, DeviceVolumesAndPorts) {
   root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"crashed\"}]");
   EXPECT_EQ(1, Install(file));
   EXPECT_NE(std::string::npos, out_.find("[296]")) << out_;
-  root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 1000}]");
+  root_.Write("/etc/kivo/volumes.json",
+              "[{\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 1000}]");
   EXPECT_EQ(1, Install(file));
   EXPECT_NE(std::string::npos, out_.find("[279]")) << out_;
   root_.Write("/etc/kivo/volumes.json", "[]");
@@ -313,8 +317,9 @@ TEST_F(PackageToolTest, WizardAnswersReachTheScripts) {
   TestPackage app;
   app.members = {{"WIZARD_UIFILES/install_uifile", "[{\"step_title\": \"Name\"}]"},
                  {"WIZARD_UIFILES/uninstall_uifile", "[{\"step_title\": \"Keep\"}]"}};
-  app.scripts = {{"postinst", "echo \"$KIVO_WIZARD_name\" > \"$KIVO_PKG_VAR/name\"\n"},
-                 {"preuninst", "cp \"$KIVO_WIZARD_VALUES\" \"$KIVO_ROOT/tmp/uninstall-answers.json\"\n"}};
+  app.scripts = {
+      {"postinst", "echo \"$KIVO_WIZARD_name\" > \"$KIVO_PKG_VAR/name\"\n"},
+      {"preuninst", "cp \"$KIVO_WIZARD_VALUES\" \"$KIVO_ROOT/tmp/uninstall-answers.json\"\n"}};
   ASSERT_EQ(0, Install(Build(app), {"--wizard", "{\"name\": \"Ada\", \"n\": 3}"})) << out_;
   std::string text;
   ASSERT_TRUE(KIVOReadFile(root_.Path("/var/packages/test-app/var/name"), &text));
@@ -337,8 +342,9 @@ TEST_F(PackageToolTest, WizardAnswersReachTheScripts) {
 TEST_F(PackageToolTest, StatusWithoutAPidFileAsksTheScript) {
   TestPackage app;
   app.daemon = false;
-  app.scripts = {{"start-stop-status", "case \"$1\" in status) [ -f \"$KIVO_PKG_VAR/on\" ];; "
-                                       "start) touch \"$KIVO_PKG_VAR/on\";; stop) rm -f \"$KIVO_PKG_VAR/on\";; esac\n"}};
+  app.scripts = {{"start-stop-status",
+                  "case \"$1\" in status) [ -f \"$KIVO_PKG_VAR/on\" ];; "
+                  "start) touch \"$KIVO_PKG_VAR/on\";; stop) rm -f \"$KIVO_PKG_VAR/on\";; esac\n"}};
   ASSERT_EQ(0, Install(Build(app))) << out_;
   EXPECT_EQ("test-app 1.0 stopped\n", Status("test-app"));
   ASSERT_EQ(0, Kivoctl({"start", "test-app"}));

@@ -1,11 +1,12 @@
 // The package tool's volume, temporary-space and progress functions on the
 // volume configuration of a temporary root.
 
+#include "pkgtool/pms.h"
+
 #include <gtest/gtest.h>
 
 #include "klibc/last_error.h"
 #include "pkgtool/package_manager.h"
-#include "pkgtool/pms.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
 

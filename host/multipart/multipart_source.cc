@@ -1,18 +1,17 @@
 #include "multipart_source.h"
 
-#include <dirent.h>
-#include <errno.h>
-#include <sys/stat.h>
-#include <fcntl.h>
-#include <unistd.h>
-
 #include <cstring>
 #include <ctime>
+#include <dirent.h>
+#include <errno.h>
 #include <exception>
+#include <fcntl.h>
 #include <istream>
 #include <memory>
 #include <streambuf>
 #include <string>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <vector>
 
 #include <Poco/Net/MessageHeader.h>

@@ -1,7 +1,5 @@
 #include "utils/package_utils.h"
 
-#include <strings.h>
-
 #include <cstdlib>
 #include <string>
 #include <vector>
@@ -11,6 +9,8 @@
 #include "pkgtool/package_manager.h"
 #include "pkgtool/pms.h"
 #include "webapi/cgi_encode.h"
+
+#include <strings.h>
 
 namespace PackageUtils {
 

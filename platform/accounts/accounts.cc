@@ -1,15 +1,14 @@
 #include "accounts/accounts.h"
 
-#include <crypt.h>
-#include <dlfcn.h>
-#include <grp.h>
-#include <pwd.h>
-#include <shadow.h>
-
 #include <algorithm>
+#include <crypt.h>
 #include <cstdio>
 #include <cstring>
+#include <dlfcn.h>
+#include <grp.h>
 #include <memory>
+#include <pwd.h>
+#include <shadow.h>
 #include <sstream>
 
 #include "klibc/atomic_file.h"
@@ -190,8 +189,8 @@ bool KIVOAccountSet(const std::string& account, const std::string& password,
     if (FieldOf(l, 0) == account) uid = FieldOf(l, 2);
   }
   if (uid.empty()) uid = std::to_string(NextFreeId(passwd, 1024));
-  Upsert(&passwd, account, account + ":x:" + uid + ":100::/var/services/homes/" + account +
-                               ":/sbin/nologin");
+  Upsert(&passwd, account,
+         account + ":x:" + uid + ":100::/var/services/homes/" + account + ":/sbin/nologin");
   Upsert(&shadow, account, account + ":" + hash + ":0:0:99999:7:::");
   for (const std::string& g : groups) {
     std::string line = g + ":x:" + std::to_string(NextFreeId(group, 1024)) + ":";

@@ -115,7 +115,8 @@ void Checker::Hard(const std::string& id, NVX::TaskMgr& mgr) {
   if (type_ == KIVO_FEASIBILITY_UNINSTALL) {
     for (const std::string& other : PMSInstalledDependents(id)) Add(other + " needs " + id + ".");
   } else {
-    for (const std::string& other : RunningDependents(id)) Add(other + " runs and needs " + id + ".");
+    for (const std::string& other : RunningDependents(id))
+      Add(other + " runs and needs " + id + ".");
   }
 }
 

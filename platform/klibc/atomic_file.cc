@@ -1,15 +1,14 @@
 #include "klibc/atomic_file.h"
 
+#include <algorithm>
+#include <cstdint>
+#include <cstring>
+#include <ctime>
 #include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
-
-#include <algorithm>
-#include <cstdint>
-#include <cstring>
-#include <ctime>
 
 #include "klibc/last_error.h"
 

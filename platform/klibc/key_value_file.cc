@@ -1,13 +1,12 @@
 #include "klibc/key_value_file.h"
 
-#include <fcntl.h>
-#include <sys/file.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <cctype>
 #include <cstring>
+#include <fcntl.h>
 #include <sstream>
+#include <sys/file.h>
+#include <unistd.h>
 
 #include "klibc/atomic_file.h"
 #include "klibc/last_error.h"

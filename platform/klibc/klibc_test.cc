@@ -1,9 +1,8 @@
+#include <cstring>
 #include <signal.h>
 #include <sys/wait.h>
-#include <unistd.h>
-
-#include <cstring>
 #include <thread>
+#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -91,7 +90,8 @@ TEST_F(KeyValueFileTest, ConcurrentWritersLoseNothing) {
   KeyValueMap all;
   ASSERT_TRUE(KIVOKeyValueLoad(Conf(), &all));
   for (int c = 0; c < 4; ++c) {
-    for (int i = 0; i < 25; ++i) EXPECT_EQ(1u, all.count("k" + std::to_string(c) + "_" + std::to_string(i)));
+    for (int i = 0; i < 25; ++i)
+      EXPECT_EQ(1u, all.count("k" + std::to_string(c) + "_" + std::to_string(i)));
   }
 }
 

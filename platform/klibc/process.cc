@@ -1,15 +1,14 @@
 #include "klibc/process.h"
 
+#include <cstring>
 #include <errno.h>
 #include <fcntl.h>
-#include <signal.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#include <cstring>
 #include <map>
 #include <mutex>
+#include <signal.h>
 #include <string>
+#include <sys/wait.h>
+#include <unistd.h>
 #include <vector>
 
 #include "klibc/last_error.h"

@@ -6,9 +6,8 @@
 // log) unless the caller reads it through KLIBCPopen.
 #pragma once
 
-#include <sys/types.h>
-
 #include <cstdio>
+#include <sys/types.h>
 
 // Runs `path` with up to four arguments (a null argument ends the list) and
 // waits for it. Returns its exit status (0..255), 128 + signal number when a

@@ -1,8 +1,7 @@
 // Starting, stopping and removing installed packages.
 
-#include <unistd.h>
-
 #include <memory>
+#include <unistd.h>
 
 #include "klibc/atomic_file.h"
 #include "pkgtool/lifecycle.h"

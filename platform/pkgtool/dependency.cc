@@ -111,8 +111,8 @@ std::set<std::string> PMSServiceSet(const std::string& text) {
 }
 
 const std::vector<std::string>& PMSKnownServices() {
-  static const std::vector<std::string> kServices = {"pgsql", "web", "ssh", "smb",
-                                                      "nfs",   "ftp", "mail", "vpn"};
+  static const std::vector<std::string> kServices = {"pgsql", "web", "ssh",  "smb",
+                                                     "nfs",   "ftp", "mail", "vpn"};
   return kServices;
 }
 

@@ -4,11 +4,10 @@
 // rename (registry.h). Until then the old version is untouched and runs; a
 // failure after it puts the old record back.
 
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <ctime>
 #include <memory>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include "klibc/atomic_file.h"
 #include "klibc/last_error.h"
@@ -185,8 +184,9 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
   PMSFaultPoint("staged");
   std::string error;
   const std::string id = info.getId();
-  code = reader->ReadPayload(PackageFileReader::Payload::Extract, s->target,
-                             [&id](double f) { PMSSetProgress(id, f * 0.9); }, &error);
+  code = reader->ReadPayload(
+      PackageFileReader::Payload::Extract, s->target,
+      [&id](double f) { PMSSetProgress(id, f * 0.9); }, &error);
   if (code != PKG_OK) return Refuse(code, error);
   PMSFaultPoint("extracted");
   return PKG_OK;
@@ -194,14 +194,16 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
 
 int Installer::RunScriptsAndPublish(const PackageInfo& info, Staging* s) {
   const std::string op_name = upgrade_ ? "upgrade" : "install";
-  auto env = PMSScriptEnv(info, s->record, op_name, *op_, job_.wizard, upgrade_ ? old_.getVersion() : "");
+  auto env =
+      PMSScriptEnv(info, s->record, op_name, *op_, job_.wizard, upgrade_ ? old_.getVersion() : "");
   if (upgrade_) {
     was_running_ = PMSIsRunning(info.getId(), old_);
     std::string old_record = PackageRegistry::RecordDir(info.getId());
     if (was_running_) ControlRecord(old_record, old_, "stop", *op_);
     if (!PMSRunPackageScript(s->record, "preupgrade", "", env, *op_)) {
       if (was_running_) ControlRecord(old_record, old_, "start", *op_);
-      return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "preupgrade failed; " + old_.getVersion() + " stays");
+      return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK,
+                    "preupgrade failed; " + old_.getVersion() + " stays");
     }
   } else if (!PMSRunPackageScript(s->record, "preinst", "", env, *op_)) {
     return Refuse(PKG_ERR_SCRIPT_FAILED, "preinst failed");
@@ -211,12 +213,14 @@ int Installer::RunScriptsAndPublish(const PackageInfo& info, Staging* s) {
     return Refuse(PKG_ERR_INTERNAL, "cannot publish the package record");
   }
   PMSFaultPoint("published");
-  if (PMSRunPackageScript(s->record, upgrade_ ? "postupgrade" : "postinst", "", env, *op_)) return PKG_OK;
+  if (PMSRunPackageScript(s->record, upgrade_ ? "postupgrade" : "postinst", "", env, *op_))
+    return PKG_OK;
   // The new version failed its last step: put back what was there before.
   if (upgrade_) {
     PackageRegistry::Publish(info.getId(), old_record_);
     if (was_running_) ControlRecord(PackageRegistry::RecordDir(info.getId()), old_, "start", *op_);
-    return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "postupgrade failed; " + old_.getVersion() + " was restored");
+    return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK,
+                  "postupgrade failed; " + old_.getVersion() + " was restored");
   }
   PackageRegistry::Unpublish(info.getId());
   return Refuse(PKG_ERR_SCRIPT_FAILED, "postinst failed");
@@ -251,8 +255,10 @@ int Installer::Run() {
   code = CheckVersions(info);
   op_.reset(new Operation(upgrade_ ? "upgrade" : "install", info.getId()));
   if (code != PKG_OK) return code;
-  if ((code = PMSCheckPackageFits(info, PKG_ERR_NOT_SUPPORTED, message_, details_)) != PKG_OK) return code;
-  if (job_.check_codesign && (code = SignatureVerdict(reader.header(), message_)) != PKG_OK) return code;
+  if ((code = PMSCheckPackageFits(info, PKG_ERR_NOT_SUPPORTED, message_, details_)) != PKG_OK)
+    return code;
+  if (job_.check_codesign && (code = SignatureVerdict(reader.header(), message_)) != PKG_OK)
+    return code;
   Staging staging;
   if ((code = Stage(&reader, info, &staging)) != PKG_OK) return code;
   if ((code = RunScriptsAndPublish(info, &staging)) != PKG_OK) return code;
@@ -293,9 +299,10 @@ int QueryFile(const std::string& path, PackageInfo& info, bool with_wizard, cons
 std::string CheckedMarker(const std::string& path, const PackageFileHeader& header) {
   struct stat st;
   if (stat(path.c_str(), &st) != 0) return "";
-  std::string identity = path + "\n" + std::to_string(st.st_ino) + " " + std::to_string(st.st_size) +
-                         " " + std::to_string(st.st_mtim.tv_sec) + "." + std::to_string(st.st_mtim.tv_nsec) +
-                         " " + PMSSha256Hex(header.manifest);
+  std::string identity = path + "\n" + std::to_string(st.st_ino) + " " +
+                         std::to_string(st.st_size) + " " + std::to_string(st.st_mtim.tv_sec) +
+                         "." + std::to_string(st.st_mtim.tv_nsec) + " " +
+                         PMSSha256Hex(header.manifest);
   return KIVORootPath("/run/kivo/pkgtool/checked/") + PMSSha256Hex(identity);
 }
 
@@ -312,12 +319,13 @@ void RememberChecked(const std::string& marker) {
 }
 
 bool CheckFile(const char* language, const std::string& path, std::string& message,
-                              PKG_ERRCODE& code, Json::Value& details, PackageInfo& info) {
+               PKG_ERRCODE& code, Json::Value& details, PackageInfo& info) {
   PackageFileReader reader;
   int result = reader.Open(path, &message);
   if (result == PKG_OK) {
     bool installed = PackageRegistry::IsInstalled(PackageInfo(reader.header().info).getId());
-    InfoFromHeader(path, reader.header(), installed ? PKG_OP_UPGRADE : PKG_OP_INSTALL, language, &info);
+    InfoFromHeader(path, reader.header(), installed ? PKG_OP_UPGRADE : PKG_OP_INSTALL, language,
+                   &info);
     std::string marker = CheckedMarker(path, reader.header());
     if (!PayloadCheckedBefore(marker)) {
       result = reader.ReadPayload(PackageFileReader::Payload::Check, "", nullptr, &message);

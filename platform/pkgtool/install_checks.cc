@@ -1,11 +1,9 @@
 #include "pkgtool/install_checks.h"
 
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <cstdlib>
+#include <sys/socket.h>
+#include <unistd.h>
 
 #include "klibc/last_error.h"
 #include "pkgtool/package_manager.h"
@@ -13,6 +11,8 @@
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
+
+#include <netinet/in.h>
 
 namespace {
 
@@ -25,7 +25,8 @@ bool PortInUse(int port) {
   addr.sin_addr.s_addr = htonl(INADDR_ANY);
   int one = 1;
   setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof(one));
-  bool in_use = bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 && errno == EADDRINUSE;
+  bool in_use =
+      bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 && errno == EADDRINUSE;
   close(fd);
   return in_use;
 }
@@ -53,12 +54,15 @@ int PMSCheckPackageFits(const PackageInfo& info, int arch_code, std::string* mes
                         Json::Value* details) {
   DeviceInfo device = KIVODeviceLoad();
   if (!ArchFits(info.get("arch"), device.arch)) {
-    return Refuse(arch_code, "made for " + info.get("arch") + ", this device is " + device.arch, message);
+    return Refuse(arch_code, "made for " + info.get("arch") + ", this device is " + device.arch,
+                  message);
   }
-  if (!info.get("os_min_ver").empty() && KIVOCompareOSVersion(device.os_version, info.get("os_min_ver")) < 0) {
+  if (!info.get("os_min_ver").empty() &&
+      KIVOCompareOSVersion(device.os_version, info.get("os_min_ver")) < 0) {
     return Refuse(PKG_ERR_OS_TOO_OLD, "needs OS " + info.get("os_min_ver") + " or later", message);
   }
-  if (!info.get("os_max_ver").empty() && KIVOCompareOSVersion(device.os_version, info.get("os_max_ver")) > 0) {
+  if (!info.get("os_max_ver").empty() &&
+      KIVOCompareOSVersion(device.os_version, info.get("os_max_ver")) > 0) {
     return Refuse(PKG_ERR_OS_TOO_NEW, "runs on OS up to " + info.get("os_max_ver"), message);
   }
   PackageManager pm;
@@ -86,7 +90,8 @@ int PMSCheckPackageFits(const PackageInfo& info, int arch_code, std::string* mes
   bool upgrade = PackageRegistry::IsInstalled(info.getId());
   if (info.getBool("checkport", true) && info.getAdminPort() && !upgrade &&
       PortInUse(info.getAdminPort())) {
-    return Refuse(PKG_ERR_PORT_IN_USE, "port " + std::to_string(info.getAdminPort()) + " is in use", message);
+    return Refuse(PKG_ERR_PORT_IN_USE, "port " + std::to_string(info.getAdminPort()) + " is in use",
+                  message);
   }
   return PKG_OK;
 }
@@ -103,8 +108,10 @@ int PMSChooseVolume(const PackageInfo& info, const std::string& requested, uint6
   if (wanted.empty() && !PMSGetPackageDefVol(wanted)) {
     // The default volume is set but cannot take the package; one that is
     // gone altogether leaves the choice to the first usable volume.
-    if (KLIBCErrGet() == KLIBC_ERR_VOLUME_CRASHED) return Refuse(PKG_ERR_VOLUME_CRASHED, "the default volume is crashed", message);
-    if (KLIBCErrGet() == KLIBC_ERR_NO_SPACE) return Refuse(PKG_ERR_NO_SPACE, "the default volume is full", message);
+    if (KLIBCErrGet() == KLIBC_ERR_VOLUME_CRASHED)
+      return Refuse(PKG_ERR_VOLUME_CRASHED, "the default volume is crashed", message);
+    if (KLIBCErrGet() == KLIBC_ERR_NO_SPACE)
+      return Refuse(PKG_ERR_NO_SPACE, "the default volume is full", message);
   }
   bool found = false;
   if (!wanted.empty()) {
@@ -119,8 +126,11 @@ int PMSChooseVolume(const PackageInfo& info, const std::string& requested, uint6
       }
     }
   }
-  if (!found) return Refuse(PKG_ERR_NO_VOLUME, "no usable volume" + (wanted.empty() ? "" : ": " + wanted), message);
-  if (out->status == "crashed") return Refuse(PKG_ERR_VOLUME_CRASHED, out->path + " is crashed", message);
+  if (!found)
+    return Refuse(PKG_ERR_NO_VOLUME, "no usable volume" + (wanted.empty() ? "" : ": " + wanted),
+                  message);
+  if (out->status == "crashed")
+    return Refuse(PKG_ERR_VOLUME_CRASHED, out->path + " is crashed", message);
   if (!out->usable()) return Refuse(PKG_ERR_NO_VOLUME, out->path + " is " + out->status, message);
   int64_t free_bytes = KIVOVolumeFreeBytes(*out);
   if (free_bytes < 0 || static_cast<uint64_t>(free_bytes) < needed_bytes) {

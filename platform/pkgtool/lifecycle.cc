@@ -1,15 +1,13 @@
 #include "pkgtool/lifecycle.h"
 
-#include <dirent.h>
-#include <limits.h>
-#include <signal.h>
-#include <stdlib.h>
-#include <unistd.h>
-
 #include <cctype>
 #include <cstdio>
 #include <cstring>
+#include <dirent.h>
+#include <limits.h>
 #include <set>
+#include <signal.h>
+#include <unistd.h>
 
 #include <json/writer.h>
 
@@ -19,6 +17,8 @@
 #include "pkgtool/registry.h"
 #include "pkgtool/script_runner.h"
 #include "storage/storage_config.h"
+
+#include <stdlib.h>
 
 namespace {
 
@@ -84,10 +84,10 @@ std::map<std::string, std::string> PMSScriptEnv(const PackageInfo& info, const s
   return env;
 }
 
-bool PMSRunPackageScript(const std::string& record, const std::string& name,
-                         const std::string& arg, const std::map<std::string, std::string>& env,
-                         const Operation& op) {
-  int status = PMSRunScript(record + "/scripts/" + name, arg, env, PMSScriptTimeout(), op.log_path());
+bool PMSRunPackageScript(const std::string& record, const std::string& name, const std::string& arg,
+                         const std::map<std::string, std::string>& env, const Operation& op) {
+  int status =
+      PMSRunScript(record + "/scripts/" + name, arg, env, PMSScriptTimeout(), op.log_path());
   if (status == SCRIPT_MISSING || status == 0) return true;
   if (status == SCRIPT_TIMED_OUT) {
     op.Log(name + " did not finish within " + std::to_string(PMSScriptTimeout()) +

@@ -20,16 +20,14 @@
 //   KIVO_WIZARD_<key> for each top-level answer that is a string, number or
 //   bool, KIVO_ROOT, PATH, LANG, HOME.
 std::map<std::string, std::string> PMSScriptEnv(const PackageInfo& info, const std::string& record,
-                                                const std::string& operation,
-                                                const Operation& op,
+                                                const std::string& operation, const Operation& op,
                                                 const Json::Value& wizard_values,
                                                 const std::string& old_version = "");
 
 // Runs `record`/scripts/`name` (missing scripts succeed) and logs how it
 // ended. True when it succeeded.
-bool PMSRunPackageScript(const std::string& record, const std::string& name,
-                         const std::string& arg, const std::map<std::string, std::string>& env,
-                         const Operation& op);
+bool PMSRunPackageScript(const std::string& record, const std::string& name, const std::string& arg,
+                         const std::map<std::string, std::string>& env, const Operation& op);
 
 // Publishes install progress of `id` (0.0 to 1.0) for PMSGetProgress.
 void PMSSetProgress(const std::string& id, double progress);

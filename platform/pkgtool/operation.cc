@@ -1,11 +1,10 @@
 #include "pkgtool/operation.h"
 
+#include <ctime>
 #include <fcntl.h>
+#include <sstream>
 #include <sys/random.h>
 #include <unistd.h>
-
-#include <ctime>
-#include <sstream>
 
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"

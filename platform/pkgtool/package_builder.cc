@@ -1,13 +1,12 @@
 #include "pkgtool/package_builder.h"
 
-#include <dirent.h>
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <cstring>
+#include <dirent.h>
+#include <fcntl.h>
 #include <map>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <vector>
 
 #include <archive.h>
@@ -44,7 +43,8 @@ void ListTree(const std::string& base, const std::string& rel, std::vector<std::
     std::string path = rel.empty() ? name : rel + "/" + name;
     out->push_back(path);
     struct stat st;
-    if (lstat((base + "/" + path).c_str(), &st) == 0 && S_ISDIR(st.st_mode)) ListTree(base, path, out);
+    if (lstat((base + "/" + path).c_str(), &st) == 0 && S_ISDIR(st.st_mode))
+      ListTree(base, path, out);
   }
 }
 
@@ -102,7 +102,8 @@ bool WritePayload(const std::string& dir, const std::string& out, int level, std
   ListTree(dir, "", &paths);
   for (size_t i = 0; ok && i < paths.size(); ++i) ok = AddPayloadEntry(a, dir, paths[i], error);
   ok = archive_write_close(a) == ARCHIVE_OK && ok;
-  if (!ok && error->empty()) *error = std::string("cannot write the payload: ") + archive_error_string(a);
+  if (!ok && error->empty())
+    *error = std::string("cannot write the payload: ") + archive_error_string(a);
   archive_write_free(a);
   return ok;
 }
@@ -125,7 +126,8 @@ bool CollectMembers(const std::string& source, std::map<std::string, std::string
     struct stat st;
     lstat((source + "/" + path).c_str(), &st);
     if (path == "package" || path.compare(0, 8, "package/") == 0 || S_ISDIR(st.st_mode)) continue;
-    if (!PMSIsPackageMemberName(path)) return Fail(error, "unexpected file in the package source: " + path);
+    if (!PMSIsPackageMemberName(path))
+      return Fail(error, "unexpected file in the package source: " + path);
     std::string data;
     if (!KIVOReadFile(source + "/" + path, &data)) return Fail(error, "cannot read " + path);
     (*members)[path] = data;
@@ -195,7 +197,8 @@ bool WriteOuter(const std::string& output, const std::map<std::string, std::stri
 std::string MakeManifest(const std::map<std::string, std::string>& members,
                          const std::string& payload_digest) {
   std::string manifest = "KIVO-MANIFEST 1\n";
-  for (const auto& m : members) manifest += "sha256 " + PMSSha256Hex(m.second) + " " + m.first + "\n";
+  for (const auto& m : members)
+    manifest += "sha256 " + PMSSha256Hex(m.second) + " " + m.first + "\n";
   return manifest + "sha256 " + payload_digest + " package.tgz\n";
 }
 

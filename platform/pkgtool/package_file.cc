@@ -1,12 +1,11 @@
 #include "pkgtool/package_file.h"
 
-#include <errno.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <cstring>
+#include <errno.h>
 #include <sstream>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <vector>
 
 #include <archive.h>
@@ -86,12 +85,12 @@ bool SymlinkStaysInside(const std::string& path, const std::string& target) {
 
 // Feeds package.tgz from the outer archive to the inner one, hashing it.
 struct PayloadSource {
-  struct archive* outer;
-  Sha256* sha;
-  uint64_t total;
+  struct archive* outer = nullptr;
+  Sha256* sha = nullptr;
+  uint64_t total = 0;
   uint64_t done = 0;
   std::vector<char> buffer = std::vector<char>(256 << 10);
-  const std::function<void(double)>* progress;
+  const std::function<void(double)>* progress = nullptr;
   double reported = 0;
   bool failed = false;  // the package file itself ended early or could not be read
 };
@@ -121,7 +120,8 @@ int CheckEntry(struct archive_entry* entry, const std::string& path, std::string
     return Fail(error, PKG_ERR_HOSTILE_MEMBER, "hard link in the payload: " + path);
   }
   if (type != AE_IFREG && type != AE_IFDIR && type != AE_IFLNK) {
-    return Fail(error, PKG_ERR_HOSTILE_MEMBER, "device node, fifo or socket in the payload: " + path);
+    return Fail(error, PKG_ERR_HOSTILE_MEMBER,
+                "device node, fifo or socket in the payload: " + path);
   }
   if (mode & (S_ISUID | S_ISGID)) {
     return Fail(error, PKG_ERR_HOSTILE_MEMBER, "setuid or setgid file in the payload: " + path);
@@ -135,7 +135,9 @@ int CheckEntry(struct archive_entry* entry, const std::string& path, std::string
   return PKG_OK;
 }
 
-int WriteErrorCode(int err) { return err == ENOSPC || err == EDQUOT ? PKG_ERR_NO_SPACE : PKG_ERR_EXTRACT; }
+int WriteErrorCode(int err) {
+  return err == ENOSPC || err == EDQUOT ? PKG_ERR_NO_SPACE : PKG_ERR_EXTRACT;
+}
 
 // Copies the current entry's data into `fd`, honouring sparse offsets.
 int CopyData(struct archive* in, int fd, const std::string& path, std::string* error) {
@@ -148,14 +150,16 @@ int CopyData(struct archive* in, int fd, const std::string& path, std::string* e
     while (size > 0) {
       ssize_t n = pwrite(fd, p, size, offset);
       if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) return Fail(error, WriteErrorCode(errno), "cannot write " + path + ": " + strerror(errno));
+      if (n <= 0)
+        return Fail(error, WriteErrorCode(errno), "cannot write " + path + ": " + strerror(errno));
       p += n;
       size -= static_cast<size_t>(n);
       offset += n;
     }
   }
   if (r != ARCHIVE_EOF) {
-    return Fail(error, PKG_ERR_EXTRACT, "payload damaged at " + path + ": " + archive_error_string(in));
+    return Fail(error, PKG_ERR_EXTRACT,
+                "payload damaged at " + path + ": " + archive_error_string(in));
   }
   return PKG_OK;
 }
@@ -174,11 +178,13 @@ int ExtractEntry(struct archive* in, struct archive_entry* entry, const std::str
     err = writer->CreateFile(path, mode | 0600, &fd);
     if (err == 0) {
       int code = CopyData(in, fd, path, error);
-      if (close(fd) != 0 && code == PKG_OK) code = Fail(error, WriteErrorCode(errno), "cannot write " + path);
+      if (close(fd) != 0 && code == PKG_OK)
+        code = Fail(error, WriteErrorCode(errno), "cannot write " + path);
       return code;
     }
   }
-  if (err != 0) return Fail(error, WriteErrorCode(err), "cannot create " + path + ": " + strerror(err));
+  if (err != 0)
+    return Fail(error, WriteErrorCode(err), "cannot create " + path + ": " + strerror(err));
   return PKG_OK;
 }
 
@@ -191,13 +197,13 @@ std::string PMSSha256Hex(const std::string& data) {
 }
 
 bool PMSIsPackageMemberName(const std::string& name) {
-  static const char* const kFixed[] = {"INFO", "MANIFEST", "signature.asc", "LICENSE",
-                                       "PACKAGE_ICON.PNG", "PACKAGE_ICON_256.PNG"};
+  static const char* const kFixed[] = {"INFO",    "MANIFEST",         "signature.asc",
+                                       "LICENSE", "PACKAGE_ICON.PNG", "PACKAGE_ICON_256.PNG"};
   for (const char* f : kFixed) {
     if (name == f) return true;
   }
-  static const char* const kScripts[] = {"preinst",    "postinst",    "preuninst",
-                                         "postuninst", "preupgrade", "postupgrade",
+  static const char* const kScripts[] = {"preinst",          "postinst",   "preuninst",
+                                         "postuninst",       "preupgrade", "postupgrade",
                                          "start-stop-status"};
   for (const char* s : kScripts) {
     if (name == std::string("scripts/") + s) return true;
@@ -249,7 +255,8 @@ int PackageFileReader::Open(const std::string& path, std::string* error) {
   outer_ = archive_read_new();
   archive_read_support_format_tar(outer_);
   if (archive_read_open_filename(outer_, path.c_str(), 64 << 10) != ARCHIVE_OK) {
-    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, std::string("cannot open: ") + archive_error_string(outer_));
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
+                std::string("cannot open: ") + archive_error_string(outer_));
   }
   struct archive_entry* entry;
   int r;
@@ -257,7 +264,8 @@ int PackageFileReader::Open(const std::string& path, std::string* error) {
     std::string name;
     const char* raw = archive_entry_pathname(entry);
     if (!raw || !NormalizeEntryPath(raw, &name)) {
-      return Fail(error, PKG_ERR_HOSTILE_MEMBER, std::string("member escapes the package: ") + (raw ? raw : ""));
+      return Fail(error, PKG_ERR_HOSTILE_MEMBER,
+                  std::string("member escapes the package: ") + (raw ? raw : ""));
     }
     mode_t type = archive_entry_filetype(entry);
     if (type == AE_IFDIR && (name == "scripts" || name == "WIZARD_UIFILES")) continue;
@@ -276,9 +284,11 @@ int PackageFileReader::Open(const std::string& path, std::string* error) {
     if (code != PKG_OK) return code;
   }
   if (r != ARCHIVE_OK && r != ARCHIVE_EOF) {
-    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, std::string("damaged archive: ") + archive_error_string(outer_));
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
+                std::string("damaged archive: ") + archive_error_string(outer_));
   }
-  if (!header_.members.count("INFO")) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no INFO member");
+  if (!header_.members.count("INFO"))
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no INFO member");
   if (header_.manifest.empty()) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no MANIFEST member");
   if (!at_payload_) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no package.tgz member");
   for (const auto& m : header_.members) {
@@ -295,11 +305,15 @@ int PackageFileReader::Open(const std::string& path, std::string* error) {
 }
 
 int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
-                                   const std::function<void(double)>& progress, std::string* error) {
+                                   const std::function<void(double)>& progress,
+                                   std::string* error) {
   if (!at_payload_) return Fail(error, PKG_ERR_INTERNAL, "payload read before Open or twice");
   at_payload_ = false;
   Sha256 sha;
-  PayloadSource src{outer_, &sha, header_.payload_size};
+  PayloadSource src;
+  src.outer = outer_;
+  src.sha = &sha;
+  src.total = header_.payload_size;
   src.progress = &progress;
   std::unique_ptr<TreeWriter> writer;
   if (mode == Payload::Extract) {
@@ -311,7 +325,8 @@ int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
   archive_read_support_format_tar(in);
   int code = PKG_OK;
   if (archive_read_open(in, &src, nullptr, ReadPayloadBlock, nullptr) != ARCHIVE_OK) {
-    code = Fail(error, PKG_ERR_EXTRACT, std::string("payload is not a tar.gz: ") + archive_error_string(in));
+    code = Fail(error, PKG_ERR_EXTRACT,
+                std::string("payload is not a tar.gz: ") + archive_error_string(in));
   }
   struct archive_entry* entry;
   int r = ARCHIVE_OK;
@@ -319,7 +334,8 @@ int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
     std::string path;
     const char* raw = archive_entry_pathname(entry);
     if (!raw || !NormalizeEntryPath(raw, &path)) {
-      code = Fail(error, PKG_ERR_HOSTILE_MEMBER, std::string("payload path escapes the package: ") + (raw ? raw : ""));
+      code = Fail(error, PKG_ERR_HOSTILE_MEMBER,
+                  std::string("payload path escapes the package: ") + (raw ? raw : ""));
       break;
     }
     if (path.empty()) continue;
@@ -327,7 +343,8 @@ int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
     if (code == PKG_OK && writer) code = ExtractEntry(in, entry, path, writer.get(), error);
   }
   if (code == PKG_OK && r != ARCHIVE_EOF) {
-    code = Fail(error, PKG_ERR_EXTRACT, std::string("payload damaged: ") + archive_error_string(in));
+    code =
+        Fail(error, PKG_ERR_EXTRACT, std::string("payload damaged: ") + archive_error_string(in));
   }
   archive_read_free(in);
   // The digest covers every byte of package.tgz, also any after the tar's
@@ -336,7 +353,8 @@ int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
   const void* rest;
   while (ReadPayloadBlock(nullptr, &src, &rest) > 0) {
   }
-  if (src.failed) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "the package file is truncated or damaged");
+  if (src.failed)
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "the package file is truncated or damaged");
   if (sha.FinishHex() != header_.digests[kPayload]) {
     return Fail(error, PKG_ERR_BAD_SIGNATURE, "package.tgz does not match MANIFEST");
   }

@@ -14,7 +14,8 @@ std::string SiblingLibrary() {
   }
   std::string self = info.dli_fname;
   size_t slash = self.rfind('/');
-  return slash == std::string::npos ? "libkivo_pkgfile.so" : self.substr(0, slash) + "/libkivo_pkgfile.so";
+  return slash == std::string::npos ? "libkivo_pkgfile.so"
+                                    : self.substr(0, slash) + "/libkivo_pkgfile.so";
 }
 
 }  // namespace
@@ -63,7 +64,8 @@ bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std
 bool InstallPackageFileImpl(const std::string& user, const std::string& path,
                             const std::string& volume, int reserved, const std::string& extraValues,
                             bool typeFlag, const std::string& language, std::string& message,
-                            PKG_ERRCODE& code, Json::Value& details, bool force, bool checkCodesign) {
+                            PKG_ERRCODE& code, Json::Value& details, bool force,
+                            bool checkCodesign) {
   const PackageFileOps* ops = PMSPackageFileOps(&message);
   if (!ops) {
     code = PKG_ERR_INTERNAL;

@@ -1,19 +1,17 @@
 #include "pkgtool/package_info.h"
 
-#include <strings.h>
-
 #include <algorithm>
 #include <cstdio>
-#include <cstring>
-
 #include <cstdlib>
+#include <cstring>
 
 #include "pkgtool/registry.h"
 
-const PMSWizardFile kPMSWizardFiles[3] = {
-    {"WIZARD_UIFILES/install_uifile", PKG_OP_INSTALL},
-    {"WIZARD_UIFILES/upgrade_uifile", PKG_OP_UPGRADE},
-    {"WIZARD_UIFILES/uninstall_uifile", PKG_OP_UNINSTALL}};
+#include <strings.h>
+
+const PMSWizardFile kPMSWizardFiles[3] = {{"WIZARD_UIFILES/install_uifile", PKG_OP_INSTALL},
+                                          {"WIZARD_UIFILES/upgrade_uifile", PKG_OP_UPGRADE},
+                                          {"WIZARD_UIFILES/uninstall_uifile", PKG_OP_UNINSTALL}};
 
 const char* PMSWizardMember(int op) {
   for (const PMSWizardFile& w : kPMSWizardFiles) {
@@ -87,14 +85,15 @@ std::string PMSCheckInfo(const KeyValueMap& info) {
     return it == info.end() ? std::string() : it->second;
   };
   if (!PMSIsValidPackageId(get("package"))) {
-    return "package: required, 1 to 64 characters of A-Z a-z 0-9 . _ + -, starting with a letter or digit";
+    return "package: required, 1 to 64 characters of A-Z a-z 0-9 . _ + -, starting with a letter "
+           "or digit";
   }
   if (!PMSIsValidVersion(get("version"))) {
     return "version: required, up to 32 characters of A-Z a-z 0-9 . _ + - with at least one digit";
   }
-  for (const char* key : {"beta", "startable", "silent_install", "silent_upgrade",
-                          "silent_uninstall", "install_reboot", "support_center", "ctl_uninstall",
-                          "checkport"}) {
+  for (const char* key :
+       {"beta", "startable", "silent_install", "silent_upgrade", "silent_uninstall",
+        "install_reboot", "support_center", "ctl_uninstall", "checkport"}) {
     if (!IsYesNo(get(key))) return std::string(key) + ": must be yes or no";
   }
   for (const char* key : {"os_min_ver", "os_max_ver"}) {
@@ -121,7 +120,8 @@ std::string PMSCheckInfo(const KeyValueMap& info) {
     DepPkgVector deps;
     size_t entries = text.empty() ? 0 : std::count(text.begin(), text.end(), ':') + 1;
     if (static_cast<size_t>(PMSExplodeDepPKGString(text, deps)) != entries) {
-      return std::string(key) + ": entries are id or id<op>version separated by ':' (op: = > >= < <= !=)";
+      return std::string(key) +
+             ": entries are id or id<op>version separated by ':' (op: = > >= < <= !=)";
     }
   }
   for (const auto& kv : info) {

@@ -1,13 +1,12 @@
 #include "pkgtool/package_manager.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <climits>
 #include <cstdlib>
+#include <fcntl.h>
 #include <functional>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"
@@ -51,7 +50,8 @@ bool PackageManager::init() {
   std::string dir = PackageRegistry::Dir();
   struct stat st;
   if (stat(dir.c_str(), &st) != 0) KIVOFSMkdirP(dir.c_str());
-  bool ok = stat(dir.c_str(), &st) == 0 && S_ISDIR(st.st_mode) && access(dir.c_str(), R_OK | X_OK) == 0;
+  bool ok =
+      stat(dir.c_str(), &st) == 0 && S_ISDIR(st.st_mode) && access(dir.c_str(), R_OK | X_OK) == 0;
   result_ = ok ? PKG_OK : PKG_ERR_REGISTRY;
   return ok;
 }
@@ -215,7 +215,8 @@ bool PackageManager::arePackagesInstallAndStart(const DepPkgVector& deps, Json::
   return notInstalled.empty() && stopped.empty();
 }
 
-bool PackageManager::areDependentPackageStop(const std::string& id, const char*, std::string& running) {
+bool PackageManager::areDependentPackageStop(const std::string& id, const char*,
+                                             std::string& running) {
   std::vector<std::string> names;
   for (const std::string& other : PMSInstalledDependents(id)) {
     PackageInfo info;
@@ -268,7 +269,8 @@ std::set<std::string> PackageManager::getServiceSetFromString(const char* servic
   return PMSServiceSet(services ? services : "");
 }
 
-std::set<std::string> PackageManager::checkServiceStarted(const std::set<std::string>& services) const {
+std::set<std::string> PackageManager::checkServiceStarted(
+    const std::set<std::string>& services) const {
   std::set<std::string> stopped;
   for (const std::string& s : services) {
     if (!KIVOServiceRunning(s)) stopped.insert(s);

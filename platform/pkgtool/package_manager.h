@@ -61,7 +61,8 @@ class PackageManager {
                                       PKG_INSTALLATION_TYPE type, const char* language);
   // Loads the installed package's wizard of operation `op` (PKG_OP_UNINSTALL
   // ...) in `language` into out.getUIFile(). False when it has none.
-  bool readUIFile(int op, const PackageInfo& package, PackageInfo& out, const std::string& language);
+  bool readUIFile(int op, const PackageInfo& package, PackageInfo& out,
+                  const std::string& language);
   // Whether the package runs. False when it cannot be told; then the result
   // says why (255 not installed, 258 broken, 264 not supported...).
   bool getServiceStatus(const PackageInfo& info, bool& running, bool checkBroken);
@@ -114,8 +115,8 @@ class PackageManager {
   bool serviceControl(int opType, const std::string& id, bool start, const std::string& language,
                       const std::string& user, void* list, bool checkDeps, bool recordState);
   // Removes `id`, handing the uninstall wizard's answers to its scripts.
-  bool uninstall(const std::string& id, const Json::Value* wizardValues, const std::string& language,
-                 int opType, bool force, const std::string& user);
+  bool uninstall(const std::string& id, const Json::Value* wizardValues,
+                 const std::string& language, int opType, bool force, const std::string& user);
 
   // The tool's exclusive lock, waiting at most `seconds`. False when another
   // process holds it.
@@ -155,7 +156,8 @@ bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std
 bool InstallPackageFileImpl(const std::string& user, const std::string& path,
                             const std::string& volume, int reserved, const std::string& extraValues,
                             bool typeFlag, const std::string& language, std::string& message,
-                            PKG_ERRCODE& code, Json::Value& details, bool force, bool checkCodesign);
+                            PKG_ERRCODE& code, Json::Value& details, bool force,
+                            bool checkCodesign);
 
 // The log text of a package log file; when it is larger than 1 MiB, its last
 // 1 MiB. "" when it cannot be read.

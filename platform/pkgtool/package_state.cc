@@ -1,16 +1,16 @@
 #include "pkgtool/package_state.h"
 
+#include <cstdlib>
 #include <limits.h>
-#include <stdlib.h>
 #include <sys/stat.h>
 #include <unistd.h>
-
-#include <cstdlib>
 
 #include "klibc/atomic_file.h"
 #include "klibc/process.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/script_runner.h"
+
+#include <stdlib.h>
 
 namespace {
 

@@ -1,15 +1,12 @@
 #include "pkgtool/pms.h"
 
+#include <cstdio>
 #include <fcntl.h>
 #include <limits.h>
-#include <stdlib.h>
+#include <sstream>
 #include <sys/file.h>
 #include <sys/random.h>
-#include <time.h>
 #include <unistd.h>
-
-#include <cstdio>
-#include <sstream>
 
 #include "klibc/atomic_file.h"
 #include "klibc/key_value_file.h"
@@ -17,6 +14,9 @@
 #include "klibc/sysroot.h"
 #include "pkgtool/registry.h"
 #include "storage/storage_config.h"
+
+#include <stdlib.h>
+#include <time.h>
 
 namespace {
 
@@ -80,8 +80,8 @@ bool PMSGetPackageVol(const std::string& id, std::string& volume) {
 bool PMSGetPackageDefVol(std::string& path) {
   char buf[256];
   path.clear();
-  if (KLIBCFileGetKeyValue(KIVORootPath("/etc/kivoinfo.conf").c_str(), kDefVolKey, buf,
-                           sizeof(buf), 0) <= 0) {
+  if (KLIBCFileGetKeyValue(KIVORootPath("/etc/kivoinfo.conf").c_str(), kDefVolKey, buf, sizeof(buf),
+                           0) <= 0) {
     return true;
   }
   VolumeConfig v;
@@ -101,7 +101,8 @@ bool PMSGetTmpDir(int64_t size, std::string& dir) {
   for (const VolumeConfig& v : KIVOVolumesLoad()) {
     int problem = VolumeProblem(v, size);
     full |= problem == KLIBC_ERR_NO_SPACE;
-    if (problem == 0 && MakeFreshDir(KIVORootPath(v.path + "/@tmp"), "kivo-pkg-", &dir)) return true;
+    if (problem == 0 && MakeFreshDir(KIVORootPath(v.path + "/@tmp"), "kivo-pkg-", &dir))
+      return true;
   }
   if (full) {
     KLIBCErrSet(KLIBC_ERR_NO_SPACE);
@@ -121,7 +122,8 @@ bool PMSCreateDownloadTmpDir(const std::string& volume, const std::string& name,
   for (const VolumeConfig& v : KIVOVolumesLoad()) {
     if (!volume.empty() && v.path != volume) continue;
     int problem = VolumeProblem(v, size);
-    if (problem == 0 && MakeFreshDir(KIVORootPath(v.path + "/@tmp"), "download-" + name + "-", &folder)) {
+    if (problem == 0 &&
+        MakeFreshDir(KIVORootPath(v.path + "/@tmp"), "download-" + name + "-", &folder)) {
       return true;
     }
     if (problem) KLIBCErrSet(problem);

@@ -1,13 +1,12 @@
 #include "pkgtool/registry.h"
 
+#include <algorithm>
+#include <cctype>
 #include <dirent.h>
+#include <sstream>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
-
-#include <algorithm>
-#include <cctype>
-#include <sstream>
 
 #include "klibc/sysroot.h"
 

@@ -1,17 +1,17 @@
 #include "pkgtool/script_runner.h"
 
+#include <cstdlib>
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
-#include <time.h>
 #include <unistd.h>
-
-#include <cstdlib>
 #include <vector>
 
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
+
+#include <time.h>
 
 namespace {
 
@@ -19,7 +19,8 @@ namespace {
                              const std::vector<std::string>& env, const std::string& log_path) {
   setsid();
   int in = open("/dev/null", O_RDONLY);
-  int out = open(log_path.empty() ? "/dev/null" : log_path.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
+  int out =
+      open(log_path.empty() ? "/dev/null" : log_path.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
   if (in >= 0) dup2(in, STDIN_FILENO);
   if (out >= 0) {
     dup2(out, STDOUT_FILENO);

@@ -65,7 +65,8 @@ int OutcomeOf(gpgme_signature_t sig) {
   if (sig->summary & GPGME_SIGSUM_KEY_REVOKED || status == GPG_ERR_CERT_REVOKED) {
     return PKG_ERR_REVOKED_KEY;
   }
-  if (status == GPG_ERR_BAD_SIGNATURE || sig->summary & GPGME_SIGSUM_RED) return PKG_ERR_BAD_SIGNATURE;
+  if (status == GPG_ERR_BAD_SIGNATURE || sig->summary & GPGME_SIGSUM_RED)
+    return PKG_ERR_BAD_SIGNATURE;
   if (status == GPG_ERR_NO_PUBKEY || sig->summary & GPGME_SIGSUM_KEY_MISSING) {
     return PKG_ERR_UNKNOWN_SIGNER;
   }

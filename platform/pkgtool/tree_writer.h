@@ -3,9 +3,8 @@
 // symlink written earlier can never redirect a later write.
 #pragma once
 
-#include <sys/types.h>
-
 #include <string>
+#include <sys/types.h>
 
 class TreeWriter {
  public:

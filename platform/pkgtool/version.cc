@@ -60,20 +60,28 @@ int PMSCompareVersion(const std::string& a, const std::string& b) {
 bool PMSVersionMatches(const std::string& a, PKG_VERSION_COMPOP op, const std::string& b) {
   int c = PMSCompareVersion(a, b);
   switch (op) {
-    case PKG_VER_EQ: return c == 0;
-    case PKG_VER_GT: return c > 0;
-    case PKG_VER_GE: return c >= 0;
-    case PKG_VER_LT: return c < 0;
-    case PKG_VER_LE: return c <= 0;
-    case PKG_VER_NE: return c != 0;
+    case PKG_VER_EQ:
+      return c == 0;
+    case PKG_VER_GT:
+      return c > 0;
+    case PKG_VER_GE:
+      return c >= 0;
+    case PKG_VER_LT:
+      return c < 0;
+    case PKG_VER_LE:
+      return c <= 0;
+    case PKG_VER_NE:
+      return c != 0;
   }
   return false;
 }
 
 bool PMSParseCompOp(const std::string& text, PKG_VERSION_COMPOP* op) {
-  static const struct { const char* text; PKG_VERSION_COMPOP op; } kOps[] = {
-      {"=", PKG_VER_EQ}, {">", PKG_VER_GT}, {">=", PKG_VER_GE},
-      {"<", PKG_VER_LT}, {"<=", PKG_VER_LE}, {"!=", PKG_VER_NE}};
+  static const struct {
+    const char* text;
+    PKG_VERSION_COMPOP op;
+  } kOps[] = {{"=", PKG_VER_EQ}, {">", PKG_VER_GT},  {">=", PKG_VER_GE},
+              {"<", PKG_VER_LT}, {"<=", PKG_VER_LE}, {"!=", PKG_VER_NE}};
   for (const auto& o : kOps) {
     if (text == o.text) {
       *op = o.op;
@@ -85,12 +93,18 @@ bool PMSParseCompOp(const std::string& text, PKG_VERSION_COMPOP* op) {
 
 const char* PMSCompOpText(PKG_VERSION_COMPOP op) {
   switch (op) {
-    case PKG_VER_EQ: return "=";
-    case PKG_VER_GT: return ">";
-    case PKG_VER_GE: return ">=";
-    case PKG_VER_LT: return "<";
-    case PKG_VER_LE: return "<=";
-    case PKG_VER_NE: return "!=";
+    case PKG_VER_EQ:
+      return "=";
+    case PKG_VER_GT:
+      return ">";
+    case PKG_VER_GE:
+      return ">=";
+    case PKG_VER_LT:
+      return "<";
+    case PKG_VER_LE:
+      return "<=";
+    case PKG_VER_NE:
+      return "!=";
   }
   return "";
 }

@@ -9,10 +9,10 @@ namespace {
 TEST(VersionTest, ComparesPartByPart) {
   EXPECT_LT(PMSCompareVersion("1.2.3-0045", "1.2.3-0046"), 0);
   EXPECT_LT(PMSCompareVersion("1.2.3-0099", "1.2.4-0001"), 0);
-  EXPECT_LT(PMSCompareVersion("1.9", "1.10"), 0);       // numbers, not text
-  EXPECT_EQ(PMSCompareVersion("1.2", "1.2.0"), 0);      // missing parts are 0
-  EXPECT_EQ(PMSCompareVersion("1.02", "1.2"), 0);       // leading zeros do not count
-  EXPECT_GT(PMSCompareVersion("1.2-0001", "1.2"), 0);   // a build number counts
+  EXPECT_LT(PMSCompareVersion("1.9", "1.10"), 0);           // numbers, not text
+  EXPECT_EQ(PMSCompareVersion("1.2", "1.2.0"), 0);          // missing parts are 0
+  EXPECT_EQ(PMSCompareVersion("1.02", "1.2"), 0);           // leading zeros do not count
+  EXPECT_GT(PMSCompareVersion("1.2-0001", "1.2"), 0);       // a build number counts
   EXPECT_LT(PMSCompareVersion("3.0.0-beta1", "3.0.0"), 0);  // pre-releases come first
   EXPECT_LT(PMSCompareVersion("3.0.0-beta1", "3.0.0-beta2"), 0);
   EXPECT_GT(PMSCompareVersion("2.0", "1.99999999999999999999999"), 0);  // no overflow

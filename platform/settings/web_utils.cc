@@ -28,8 +28,7 @@ bool LoadJsonFile(const std::string& path, Json::Value& out) {
 
 bool SaveJsonFile(const std::string& path, const Json::Value& value) {
   size_t slash = path.rfind('/');
-  if (slash != std::string::npos && slash > 0 &&
-      KIVOFSMkdirP(path.substr(0, slash).c_str()) != 0) {
+  if (slash != std::string::npos && slash > 0 && KIVOFSMkdirP(path.substr(0, slash).c_str()) != 0) {
     return false;
   }
   Json::StreamWriterBuilder builder;

@@ -1,17 +1,15 @@
 #include "storage/storage_config.h"
 
+#include <algorithm>
+#include <cstdio>
+#include <cstring>
+#include <mutex>
 #include <sys/stat.h>
 #include <sys/statvfs.h>
 
-#include <algorithm>
-#include <cstring>
-#include <mutex>
-
-#include <cstdio>
-
+#include "klibc/atomic_file.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
-#include "klibc/atomic_file.h"
 #include "webapi/webapi_util.h"
 
 namespace {
@@ -20,14 +18,16 @@ std::vector<VolumeConfig> ParseVolumes(const std::string& path) {
   std::vector<VolumeConfig> volumes;
   Json::Value list;
   std::string text;
-  if (!KIVOReadFile(path, &text, 1 << 20) || !WebAPIUtil::ParseJson(text, list) || !list.isArray()) {
+  if (!KIVOReadFile(path, &text, 1 << 20) || !WebAPIUtil::ParseJson(text, list) ||
+      !list.isArray()) {
     return volumes;
   }
   for (const Json::Value& v : list) {
     if (!v.isObject() || !v["path"].isString()) continue;
     VolumeConfig volume;
     volume.path = v["path"].asString();
-    if (volume.path.empty() || volume.path[0] != '/' || volume.path.find("..") != std::string::npos) {
+    if (volume.path.empty() || volume.path[0] != '/' ||
+        volume.path.find("..") != std::string::npos) {
       continue;
     }
     volume.status = v["status"].isString() ? v["status"].asString() : "normal";
@@ -53,8 +53,9 @@ std::vector<VolumeConfig> KIVOVolumesLoad() {
   struct stat st;
   if (stat(path.c_str(), &st) != 0) return {};
   std::lock_guard<std::mutex> lock(mutex);
-  if (cache.path != path || cache.st.st_ino != st.st_ino || cache.st.st_mtim.tv_nsec != st.st_mtim.tv_nsec ||
-      cache.st.st_mtime != st.st_mtime || cache.st.st_size != st.st_size) {
+  if (cache.path != path || cache.st.st_ino != st.st_ino ||
+      cache.st.st_mtim.tv_nsec != st.st_mtim.tv_nsec || cache.st.st_mtime != st.st_mtime ||
+      cache.st.st_size != st.st_size) {
     cache.volumes = ParseVolumes(path);
     cache.path = path;
     cache.st = st;
@@ -172,7 +173,8 @@ bool Volume::VolumeListGet(Json::Value& out, bool with_unusable) {
     entry["status"] = v.status;
     entry["size_free_byte"] = std::to_string(std::max<int64_t>(0, KIVOVolumeFreeBytes(v)));
     uint64_t total = statvfs(KIVORootPath(v.path).c_str(), &fs) == 0
-                         ? static_cast<uint64_t>(fs.f_blocks) * fs.f_frsize : 0;
+                         ? static_cast<uint64_t>(fs.f_blocks) * fs.f_frsize
+                         : 0;
     if (v.cap_bytes > 0 && v.cap_bytes < total) total = v.cap_bytes;
     entry["size_total_byte"] = std::to_string(total);
     entry["is_brick"] = v.brick;

@@ -1,14 +1,13 @@
 #include "taskmgr/task.h"
 
+#include <ctime>
+#include <mutex>
 #include <sys/random.h>
 #include <unistd.h>
 
-#include <ctime>
-#include <mutex>
-
 #include <json/writer.h>
-#include "taskmgr/sqlite_api.h"
 
+#include "taskmgr/sqlite_api.h"
 #include "taskmgr/task_store.h"
 #include "webapi/webapi_util.h"
 
@@ -28,7 +27,8 @@ class Statement {
   Statement& operator=(const Statement&) = delete;
 
   Statement& Bind(int i, const std::string& text) {
-    if (stmt_) Sqlite()->bind_text(stmt_, i, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
+    if (stmt_)
+      Sqlite()->bind_text(stmt_, i, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
     return *this;
   }
   Statement& Bind(int i, long long value) {
@@ -59,10 +59,18 @@ bool WriteProperty(TaskStore& db, const std::string& owner, const std::string& i
                    const std::string& name, bool unset, const Json::Value& value) {
   if (unset) {
     return Statement(db, "DELETE FROM properties WHERE owner=? AND id=? AND name=?")
-        .Bind(1, owner).Bind(2, id).Bind(3, name).Run();
+        .Bind(1, owner)
+        .Bind(2, id)
+        .Bind(3, name)
+        .Run();
   }
-  return Statement(db, "INSERT OR REPLACE INTO properties (owner, id, name, value) VALUES (?,?,?,?)")
-      .Bind(1, owner).Bind(2, id).Bind(3, name).Bind(4, Serialize(value)).Run();
+  return Statement(db,
+                   "INSERT OR REPLACE INTO properties (owner, id, name, value) VALUES (?,?,?,?)")
+      .Bind(1, owner)
+      .Bind(2, id)
+      .Bind(3, name)
+      .Bind(4, Serialize(value))
+      .Run();
 }
 
 }  // namespace
@@ -123,12 +131,18 @@ bool Task::endUpdate() {
 
 bool Task::setFinishValue(bool finished) {
   return Statement(*store_, "UPDATE tasks SET finished=? WHERE owner=? AND id=?")
-      .Bind(1, finished ? 1LL : 0LL).Bind(2, owner_).Bind(3, id_).Run();
+      .Bind(1, finished ? 1LL : 0LL)
+      .Bind(2, owner_)
+      .Bind(3, id_)
+      .Run();
 }
 
 bool Task::finish(bool ok) {
   return Statement(*store_, "UPDATE tasks SET finished=1, ok=? WHERE owner=? AND id=?")
-      .Bind(1, ok ? 1LL : 0LL).Bind(2, owner_).Bind(3, id_).Run();
+      .Bind(1, ok ? 1LL : 0LL)
+      .Bind(2, owner_)
+      .Bind(3, id_)
+      .Run();
 }
 
 bool Task::isFinished() {
@@ -140,9 +154,13 @@ bool Task::isFinished() {
 bool Task::remove() {
   if (!store_->Exec("BEGIN IMMEDIATE")) return false;
   bool ok = Statement(*store_, "DELETE FROM properties WHERE owner=? AND id=?")
-                .Bind(1, owner_).Bind(2, id_).Run() &&
+                .Bind(1, owner_)
+                .Bind(2, id_)
+                .Run() &&
             Statement(*store_, "DELETE FROM tasks WHERE owner=? AND id=?")
-                .Bind(1, owner_).Bind(2, id_).Run();
+                .Bind(1, owner_)
+                .Bind(2, id_)
+                .Run();
   if (ok) return store_->Exec("COMMIT");
   store_->Exec("ROLLBACK");
   return false;
@@ -190,11 +208,18 @@ Task* TaskMgr::getTask(const std::string& id) {
 Task* TaskMgr::createTask(const std::string& id) {
   if (id.empty() || !store_->db()) return nullptr;
   if (!store_->Exec("BEGIN IMMEDIATE")) return nullptr;
-  bool ok = Statement(*store_, "DELETE FROM properties WHERE owner=? AND id=?")
-                .Bind(1, owner_).Bind(2, id).Run() &&
-            Statement(*store_,
-                      "INSERT OR REPLACE INTO tasks (owner, id, finished, ok, created) VALUES (?,?,0,0,?)")
-                .Bind(1, owner_).Bind(2, id).Bind(3, static_cast<long long>(time(nullptr))).Run();
+  bool ok =
+      Statement(*store_, "DELETE FROM properties WHERE owner=? AND id=?")
+          .Bind(1, owner_)
+          .Bind(2, id)
+          .Run() &&
+      Statement(
+          *store_,
+          "INSERT OR REPLACE INTO tasks (owner, id, finished, ok, created) VALUES (?,?,0,0,?)")
+          .Bind(1, owner_)
+          .Bind(2, id)
+          .Bind(3, static_cast<long long>(time(nullptr)))
+          .Run();
   if (!ok || !store_->Exec("COMMIT")) {
     store_->Exec("ROLLBACK");
     return nullptr;

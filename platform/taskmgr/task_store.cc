@@ -3,10 +3,9 @@
 #include <syslog.h>
 #include <unistd.h>
 
-#include "taskmgr/sqlite_api.h"
-
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"
+#include "taskmgr/sqlite_api.h"
 
 namespace NVX {
 

@@ -1,10 +1,9 @@
 // The SQLite database behind the task manager. Internal to platform/taskmgr.
 #pragma once
 
-#include <sys/types.h>
-
 #include <map>
 #include <string>
+#include <sys/types.h>
 
 struct sqlite3;
 struct sqlite3_stmt;

@@ -1,9 +1,8 @@
 #include "taskmgr/task.h"
 
+#include <memory>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <memory>
 
 #include <gtest/gtest.h>
 

@@ -38,8 +38,7 @@ class APIRequest {
                                      APIParamValidator validator = nullptr) const;
   APIParameter<Json::Value> GetAndCheckObject(const std::string& name, PARAM_NECESSITY necessity,
                                               APIParamValidator validator = nullptr) const;
-  APIParameter<Json::Value> GetAndCheckUnitArray(const std::string& name,
-                                                 PARAM_NECESSITY necessity,
+  APIParameter<Json::Value> GetAndCheckUnitArray(const std::string& name, PARAM_NECESSITY necessity,
                                                  APIParamValidator validator = nullptr) const;
 
   // Plain reading: the decoded value, or `def` when the parameter is absent.

@@ -31,4 +31,6 @@ Json::Value Envelope(bool answered, int code, Json::Value data) {
 
 Json::Value APIResponse::ToEnvelope() const { return Envelope(answered_, error_code_, data_); }
 
-Json::Value APIResponse::TakeEnvelope() { return Envelope(answered_, error_code_, std::move(data_)); }
+Json::Value APIResponse::TakeEnvelope() {
+  return Envelope(answered_, error_code_, std::move(data_));
+}

@@ -2,9 +2,8 @@
 // frame (no answer, an exception, a forked child that returns, raw output),
 // so the tests can see how the host copes.
 
-#include <unistd.h>
-
 #include <cstdio>
+#include <unistd.h>
 
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
@@ -38,12 +37,9 @@ bool RefuseAll(APIRequest*, APIResponse* response) {
 }
 
 const WEBAPI_TABLE_ROW gTable[] = {
-    {"Test.Frame", 1, "silent", Silent},
-    {"Test.Frame", 1, "throws", Throws},
-    {"Test.Frame", 1, "fork", ForkReturns},
-    {"Test.Frame", 1, "raw", Raw},
-    {"Test.Frame", 1, "refused", Silent},
-    {nullptr, 0, nullptr, nullptr},
+    {"Test.Frame", 1, "silent", Silent},    {"Test.Frame", 1, "throws", Throws},
+    {"Test.Frame", 1, "fork", ForkReturns}, {"Test.Frame", 1, "raw", Raw},
+    {"Test.Frame", 1, "refused", Silent},   {nullptr, 0, nullptr, nullptr},
 };
 
 const WEBAPI_CHECK_ROW gCheckTable[] = {

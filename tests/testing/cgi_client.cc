@@ -1,11 +1,10 @@
 #include "testing/cgi_client.h"
 
+#include <cstdlib>
 #include <fcntl.h>
+#include <memory>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <cstdlib>
-#include <memory>
 
 #include <json/reader.h>
 
@@ -98,8 +97,11 @@ std::string EncodeForm(const Params& params) {
 }
 
 ApiClient::ApiClient(const std::string& account, const std::string& password) {
-  std::string body = EncodeForm({{"api", "KIVO.API.Auth"}, {"method", "login"}, {"version", "1"},
-                                 {"account", account}, {"passwd", password}});
+  std::string body = EncodeForm({{"api", "KIVO.API.Auth"},
+                                 {"method", "login"},
+                                 {"version", "1"},
+                                 {"account", account},
+                                 {"passwd", password}});
   CgiAnswer a = RunEntryCgi({{"REQUEST_METHOD", "POST"},
                              {"CONTENT_TYPE", "application/x-www-form-urlencoded"},
                              {"CONTENT_LENGTH", std::to_string(body.size())}},
@@ -129,12 +131,12 @@ std::string MultipartBody(const Params& fields, const std::string& file_name,
   *content_type = "multipart/form-data; boundary=" + boundary;
   std::string body;
   for (const auto& f : fields) {
-    body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"" + f.first + "\"\r\n\r\n" +
-            f.second + "\r\n";
+    body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"" + f.first +
+            "\"\r\n\r\n" + f.second + "\r\n";
   }
-  body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"file\"; filename=\"" + file_name +
-          "\"\r\nContent-Type: application/octet-stream\r\n\r\n" + content + "\r\n--" + boundary +
-          "--\r\n";
+  body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"file\"; filename=\"" +
+          file_name + "\"\r\nContent-Type: application/octet-stream\r\n\r\n" + content + "\r\n--" +
+          boundary + "--\r\n";
   return body;
 }
 
@@ -145,14 +147,16 @@ CgiAnswer ApiClient::Upload(const std::string& api, const std::string& method, i
   char buf[65536];
   for (size_t n; f && (n = fread(buf, 1, sizeof(buf), f)) > 0;) content.append(buf, n);
   if (f) fclose(f);
-  std::string body = MultipartBody(fields, path.substr(path.rfind('/') + 1), content, &content_type);
-  return RunEntryCgi({{"REQUEST_METHOD", "POST"},
-                      {"QUERY_STRING", EncodeForm({{"api", api}, {"method", method},
-                                                   {"version", std::to_string(version)}})},
-                      {"CONTENT_TYPE", content_type},
-                      {"CONTENT_LENGTH", std::to_string(body.size())},
-                      {"HTTP_COOKIE", "id=" + sid_},
-                      {"HTTP_X_KIVO_TOKEN", token_},
-                      {"HTTP_HOST", "nas.example:5000"}},
-                     body);
+  std::string body =
+      MultipartBody(fields, path.substr(path.rfind('/') + 1), content, &content_type);
+  return RunEntryCgi(
+      {{"REQUEST_METHOD", "POST"},
+       {"QUERY_STRING",
+        EncodeForm({{"api", api}, {"method", method}, {"version", std::to_string(version)}})},
+       {"CONTENT_TYPE", content_type},
+       {"CONTENT_LENGTH", std::to_string(body.size())},
+       {"HTTP_COOKIE", "id=" + sid_},
+       {"HTTP_X_KIVO_TOKEN", token_},
+       {"HTTP_HOST", "nas.example:5000"}},
+      body);
 }

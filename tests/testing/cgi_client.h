@@ -10,9 +10,9 @@
 #include <json/value.h>
 
 struct CgiAnswer {
-  std::string head;   // header lines
-  std::string body;   // raw body
-  Json::Value json;   // the body parsed, null when it is not JSON
+  std::string head;  // header lines
+  std::string body;  // raw body
+  Json::Value json;  // the body parsed, null when it is not JSON
   int exit_status = -1;
 
   bool Success() const { return json["success"].asBool(); }

@@ -24,13 +24,15 @@ TestKeys::TestKeys(const std::string& dir) : home_(dir + "/test-gnupg") {
 }
 
 std::string TestKeys::Create(const std::string& uid, bool expired) {
-  std::vector<std::string> args = {"gpg", "--homedir", home_, "--batch", "--quiet", "--passphrase", ""};
+  std::vector<std::string> args = {"gpg",     "--homedir",    home_, "--batch",
+                                   "--quiet", "--passphrase", ""};
   if (expired) args.insert(args.end(), {"--faked-system-time", kPast});
   args.insert(args.end(), {"--quick-gen-key", uid, "ed25519", "sign", expired ? "1d" : "never"});
   std::string out;
   EXPECT_EQ(0, RunProgram(args, &out)) << out;
-  EXPECT_EQ(0, RunProgram({"sh", "-c", "gpg --homedir '" + home_ + "' --batch --with-colons --list-keys '" +
-                                           uid + "' 2>/dev/null | awk -F: '/^fpr/ {print $10; exit}'"},
+  EXPECT_EQ(0, RunProgram({"sh", "-c",
+                           "gpg --homedir '" + home_ + "' --batch --with-colons --list-keys '" +
+                               uid + "' 2>/dev/null | awk -F: '/^fpr/ {print $10; exit}'"},
                           &out));
   return Trim(out);
 }
@@ -46,16 +48,20 @@ void TestKeys::Revoke(const std::string& fpr) {
   std::string path = home_ + "/revoke.asc";
   ASSERT_TRUE(KIVOWriteFileAtomic(path, cert.substr(at), SyncToDisk::No));
   std::string out;
-  EXPECT_EQ(0, RunProgram({"gpg", "--homedir", home_, "--batch", "--quiet", "--import", path}, &out)) << out;
+  EXPECT_EQ(0,
+            RunProgram({"gpg", "--homedir", home_, "--batch", "--quiet", "--import", path}, &out))
+      << out;
 }
 
 void TestKeys::Trust(const std::string& fpr) const {
   std::string key = home_ + "/" + fpr + ".asc", out;
-  EXPECT_EQ(0, RunProgram({"sh", "-c", "gpg --homedir '" + home_ + "' --batch --armor --export " + fpr +
-                                           " > '" + key + "'"},
+  EXPECT_EQ(0, RunProgram({"sh", "-c",
+                           "gpg --homedir '" + home_ + "' --batch --armor --export " + fpr +
+                               " > '" + key + "'"},
                           &out));
-  EXPECT_EQ(0, RunProgram({"gpg", "--homedir", PMSKeyringHome(), "--batch", "--quiet", "--import", key},
-                          &out))
+  EXPECT_EQ(
+      0, RunProgram({"gpg", "--homedir", PMSKeyringHome(), "--batch", "--quiet", "--import", key},
+                    &out))
       << out;
 }
 
@@ -67,7 +73,8 @@ void TestKeys::Sign(const std::string& package, const std::string& fpr, bool exp
   ASSERT_TRUE(KIVOWriteFileAtomic(manifest, reader.header().manifest, SyncToDisk::No));
   std::vector<std::string> args = {"gpg", "--homedir", home_, "--batch", "--quiet", "--yes"};
   if (expired) args.insert(args.end(), {"--faked-system-time", kPast});
-  args.insert(args.end(), {"--local-user", fpr, "--armor", "--detach-sign", "--output", sig, manifest});
+  args.insert(args.end(),
+              {"--local-user", fpr, "--armor", "--detach-sign", "--output", sig, manifest});
   ASSERT_EQ(0, RunProgram(args, &out)) << out;
   std::string signature;
   ASSERT_TRUE(KIVOReadFile(sig, &signature));

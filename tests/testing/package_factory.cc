@@ -1,11 +1,10 @@
 #include "testing/package_factory.h"
 
+#include <cstdlib>
 #include <fcntl.h>
 #include <sys/sysmacros.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <cstdlib>
 
 #include <archive.h>
 #include <archive_entry.h>
@@ -46,7 +45,8 @@ std::string TestPackage::Build(const std::string& dir) const {
   for (const auto& f : files) Write(src + "/package/" + f.first, f.second);
   std::map<std::string, std::string> all_scripts = scripts;
   if (daemon) all_scripts.emplace("start-stop-status", kDaemonScript);
-  for (const auto& s : all_scripts) Write(src + "/scripts/" + s.first, "#!/bin/sh\n" + s.second, 0755);
+  for (const auto& s : all_scripts)
+    Write(src + "/scripts/" + s.first, "#!/bin/sh\n" + s.second, 0755);
   for (const auto& m : members) Write(src + "/" + m.first, m.second);
   std::string out = dir + "/" + id + "-" + version + ".kpk";
   std::string error;
@@ -67,8 +67,12 @@ std::string BuildRawPackage(const std::string& dir, const std::string& id,
     archive_entry_set_perm(entry, e.mode);
     std::string data = e.type == 'f' ? "content of " + e.path + "\n" : "";
     switch (e.type) {
-      case 'f': archive_entry_set_filetype(entry, AE_IFREG); break;
-      case 'd': archive_entry_set_filetype(entry, AE_IFDIR); break;
+      case 'f':
+        archive_entry_set_filetype(entry, AE_IFREG);
+        break;
+      case 'd':
+        archive_entry_set_filetype(entry, AE_IFDIR);
+        break;
       case 'l':
         archive_entry_set_filetype(entry, AE_IFLNK);
         archive_entry_set_symlink(entry, e.target.c_str());
@@ -117,7 +121,8 @@ int RunProgram(const std::vector<std::string>& argv, std::string* out,
   close(fds[1]);
   std::string text;
   char buf[4096];
-  for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) > 0;) text.append(buf, static_cast<size_t>(n));
+  for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) > 0;)
+    text.append(buf, static_cast<size_t>(n));
   close(fds[0]);
   int status = 0;
   waitpid(pid, &status, 0);

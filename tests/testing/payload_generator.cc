@@ -40,4 +40,3 @@ uint64_t GeneratePayload(const std::string& dir, uint64_t total) {
   }
   return written;
 }
-

@@ -1,6 +1,5 @@
 #include "testing/temp_root.h"
 
-#include <stdlib.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -9,6 +8,8 @@
 #include "klibc/atomic_file.h"
 #include "klibc/process.h"
 #include "tools/kivoctl/root_setup.h"
+
+#include <stdlib.h>
 
 std::string BuildDir() {
   const char* dir = getenv("KIVO_BUILD_DIR");

@@ -1,7 +1,5 @@
 #include "testing/web_server.h"
 
-#include <arpa/inet.h>
-#include <netinet/in.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
@@ -10,6 +8,9 @@
 #include "klibc/atomic_file.h"
 #include "testing/temp_root.h"
 #include "tools/kivoctl/web_config.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
 
 namespace {
 

@@ -2,10 +2,9 @@
 // time, for end-to-end tests and benchmarks. Stopped when destroyed.
 #pragma once
 
-#include <sys/types.h>
-
 #include <cstddef>
 #include <string>
+#include <sys/types.h>
 
 class WebServer {
  public:

@@ -6,12 +6,11 @@
 //   kivoctl build|sign|inspect ...            (package authors)
 //   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
 
-#include <unistd.h>
-
 #include <cstdio>
 #include <cstdlib>
 #include <iostream>
 #include <string>
+#include <unistd.h>
 #include <vector>
 
 #include "accounts/accounts.h"

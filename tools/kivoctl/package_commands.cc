@@ -1,10 +1,9 @@
 #include "tools/kivoctl/package_commands.h"
 
-#include <unistd.h>
-
 #include <algorithm>
 #include <cstdlib>
 #include <iostream>
+#include <unistd.h>
 
 #include <json/writer.h>
 
@@ -66,8 +65,9 @@ int Report(PackageManager& pm, bool ok, const std::string& what) {
   for (const Json::Value& m : pm.getJsonParam("worker_msg")) std::cout << m.asString() << "\n";
   if (ok) return 0;
   std::string detail = pm.getMapParam("deppkg");
-  return Fail(what + ": " + PMSResultText(pm.getResult()) + (detail.empty() ? "" : " (" + detail + ")") +
-              " [" + std::to_string(pm.getResult()) + "]");
+  return Fail(what + ": " + PMSResultText(pm.getResult()) +
+              (detail.empty() ? "" : " (" + detail + ")") + " [" + std::to_string(pm.getResult()) +
+              "]");
 }
 
 int Usage(const std::string& usage) {
@@ -82,7 +82,8 @@ int KivoctlBuild(const std::vector<std::string>& args) {
   if (pos.size() != 2) return Usage("kivoctl build SOURCE-FOLDER OUTPUT.kpk [--level 1-9]");
   BuildOptions options;
   options.compression_level = std::atoi(Option(args, "--level", "6").c_str());
-  if (options.compression_level < 1 || options.compression_level > 9) return Fail("--level takes 1 to 9");
+  if (options.compression_level < 1 || options.compression_level > 9)
+    return Fail("--level takes 1 to 9");
   std::string error;
   if (!PMSBuildPackage(pos[0], pos[1], options, &error)) return Fail(pos[0] + ": " + error);
   std::cout << "built " << pos[1] << "\n";
@@ -113,7 +114,8 @@ int KivoctlInspect(const std::vector<std::string>& args) {
   out["members"] = Json::Value(Json::arrayValue);
   for (const auto& d : reader.header().digests) out["members"].append(d.first);
   std::string signer, sig_error;
-  int outcome = PMSCheckSignature(reader.header().manifest, reader.header().signature, &signer, &sig_error);
+  int outcome =
+      PMSCheckSignature(reader.header().manifest, reader.header().signature, &signer, &sig_error);
   out["signature"]["result"] = outcome;
   out["signature"]["text"] = PMSResultText(outcome);
   if (!signer.empty()) out["signature"]["key"] = signer;
@@ -126,17 +128,18 @@ int KivoctlInspect(const std::vector<std::string>& args) {
 int KivoctlInstall(const std::vector<std::string>& args) {
   std::vector<std::string> pos = Positional(args, {"--volume", "--wizard"});
   if (pos.size() != 1) {
-    return Usage("kivoctl install FILE.kpk [--volume /volumeN] [--wizard JSON] [--run] "
-                "[--no-codesign] [--no-force]");
+    return Usage(
+        "kivoctl install FILE.kpk [--volume /volumeN] [--wizard JSON] [--run] "
+        "[--no-codesign] [--no-force]");
   }
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;
   const char* user = getenv("USER");
-  bool ok = InstallPackageFileImpl(user ? user : "root", pos[0], Option(args, "--volume"), 0,
-                                   Option(args, "--wizard"), Flag(args, "--run"), "enu", message,
-                                   code, details, !Flag(args, "--no-force"),
-                                   !Flag(args, "--no-codesign"));
+  bool ok =
+      InstallPackageFileImpl(user ? user : "root", pos[0], Option(args, "--volume"), 0,
+                             Option(args, "--wizard"), Flag(args, "--run"), "enu", message, code,
+                             details, !Flag(args, "--no-force"), !Flag(args, "--no-codesign"));
   if (!message.empty()) std::cerr << message << (message.back() == '\n' ? "" : "\n");
   for (const Json::Value& m : details["workerMessage"]) std::cout << m.asString() << "\n";
   if (!ok) return Fail(pos[0] + ": " + PMSResultText(code) + " [" + std::to_string(code) + "]");
@@ -170,11 +173,13 @@ int KivoctlStatus(const std::vector<std::string>& args) {
   PackageManager pm;
   PackageInfo info;
   if (!pm.init() || !pm.getPackageInfo(args[0], info)) {
-    return Fail(args[0] + ": " + PMSResultText(pm.getResult()) + " [" + std::to_string(pm.getResult()) + "]");
+    return Fail(args[0] + ": " + PMSResultText(pm.getResult()) + " [" +
+                std::to_string(pm.getResult()) + "]");
   }
   bool running = false;
   pm.getServiceStatus(info, running, true);
-  std::cout << args[0] << " " << info.getVersion() << " " << (running ? "running" : "stopped") << "\n";
+  std::cout << args[0] << " " << info.getVersion() << " " << (running ? "running" : "stopped")
+            << "\n";
   return 0;
 }
 

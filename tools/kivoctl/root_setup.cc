@@ -7,16 +7,16 @@
 namespace {
 
 const char* const kFolders[] = {
-    "etc/kivo",                // platform configuration
-    "usr/kivo/etc/packages",   // the feed list and package center files
-    "usr/kivo/bin",            // platform scripts
-    "var/packages",            // the installed-package registry
-    "var/log/packages",        // package operation logs
-    "run/kivo/sessions",       // signed-in sessions
-    "tmp",                     // temporary files of uploads and downloads
-    "volume1",                 // the first data volume
-    "usr/kivo/www",            // the web server's document root
-    "run/kivo/pkgtool",        // the package tool's lock and progress
+    "etc/kivo",               // platform configuration
+    "usr/kivo/etc/packages",  // the feed list and package center files
+    "usr/kivo/bin",           // platform scripts
+    "var/packages",           // the installed-package registry
+    "var/log/packages",       // package operation logs
+    "run/kivo/sessions",      // signed-in sessions
+    "tmp",                    // temporary files of uploads and downloads
+    "volume1",                // the first data volume
+    "usr/kivo/www",           // the web server's document root
+    "run/kivo/pkgtool",       // the package tool's lock and progress
 };
 
 struct DefaultFile {
@@ -38,7 +38,8 @@ const DefaultFile kFiles[] = {
      "enable_pkg_autoupdate_all=\"no\"\n",
      0644},
     {"etc/kivo/volumes.json",
-     "[\n  {\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 0, \"brick\": false}\n]\n",
+     "[\n  {\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 0, \"brick\": "
+     "false}\n]\n",
      0644},
     {"etc/kivo/device.conf",
      "# What this appliance is.\n"

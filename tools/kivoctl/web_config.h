@@ -5,8 +5,8 @@
 #include <string>
 
 struct WebConfigOptions {
-  std::string root;        // the system root (KIVO_ROOT of the CGI)
-  std::string entry_cgi;   // absolute path of entry.cgi
+  std::string root;       // the system root (KIVO_ROOT of the CGI)
+  std::string entry_cgi;  // absolute path of entry.cgi
   std::string address = "127.0.0.1";
   int port = 5000;
 };
