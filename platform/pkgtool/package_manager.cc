@@ -20,7 +20,6 @@
 namespace {
 
 constexpr off_t kLogReadLimit = 1 << 20;
-constexpr int kLockWaitSeconds = 3;
 
 std::string RealPath(const std::string& path) {
   char buf[PATH_MAX];
