@@ -1,9 +1,11 @@
 #include "host/host_api.h"
 
+#include <cstdlib>
 #include <syslog.h>
 
 #include "accounts/accounts.h"
 #include "host/host_config.h"
+#include "host/login_throttle.h"
 
 namespace {
 
@@ -48,19 +50,73 @@ bool RequireString(const APIRequest& request, const char* name, std::string* out
   return true;
 }
 
-void Login(const APIRequest& request, APIResponse* response) {
+// Web servers and proxies log request lines, so a password must never travel
+// in one: sign-in takes only a POST with its fields in the body.
+bool IsPostedSignIn(const CgiRequest& cgi) {
+  if (cgi.method != "POST") return false;
+  for (const auto& field : cgi.query) {
+    if (field.first == "account" || field.first == "passwd") return false;
+  }
+  return true;
+}
+
+const char* LoggedName(const std::string& account) {
+  return KIVOAccountNameValid(account) ? account.c_str() : "(invalid name)";
+}
+
+// Counts the attempt in the back-off; false (with the answer set) when the
+// caller must wait or the attempt cannot be recorded.
+bool AdmitSignIn(LoginThrottle* throttle, const std::string& account, const std::string& address,
+                 APIResponse* response) {
+  long retry_after = 0;
+  switch (throttle->Admit(account, address, &retry_after)) {
+    case LoginAdmission::Admitted:
+      return true;
+    case LoginAdmission::Throttled: {
+      syslog(LOG_WARNING, "%s:%d sign-in for [%s] from %s held back for %lds", "host_api", __LINE__,
+             LoggedName(account), address.c_str(), retry_after);
+      Json::Value data = Reason("too many failed sign-ins; try again later");
+      data["retry_after"] = static_cast<Json::Int64>(retry_after);
+      response->SetError(kErrSignInThrottled, data);
+      return false;
+    }
+    case LoginAdmission::Unavailable:
+      break;
+  }
+  syslog(LOG_ERR, "%s:%d cannot record sign-in attempts", "host_api", __LINE__);
+  response->SetError(kErrUnknown, Reason("cannot record the sign-in attempt"));
+  return false;
+}
+
+void Login(const CgiRequest& cgi, const APIRequest& request, APIResponse* response) {
+  if (!IsPostedSignIn(cgi)) {
+    response->SetError(kErrBadRequest,
+                       Reason("sign in by POST, with account and passwd in the body"));
+    return;
+  }
   std::string account, password;
   if (!RequireString(request, "account", &account, response) ||
       !RequireString(request, "passwd", &password, response)) {
     return;
   }
+  const HostConfig config = LoadHostConfig();
+  const std::string address = LoginAddressKey(getenv("REMOTE_ADDR"));
+  LoginThrottle throttle(config.login);
+  if (!AdmitSignIn(&throttle, account, address, response)) return;
   if (!KIVOAccountCheckPassword(account, password)) {
-    syslog(LOG_WARNING, "%s:%d failed sign-in for account [%s]", "host_api", __LINE__,
-           KIVOAccountNameValid(account) ? account.c_str() : "(invalid name)");
+    syslog(LOG_WARNING, "%s:%d failed sign-in for account [%s] from %s", "host_api", __LINE__,
+           LoggedName(account), address.c_str());
+    // The attempt is counted already; only its wait would start earlier.
+    if (!throttle.Failed(account, address))
+      syslog(LOG_ERR, "%s:%d cannot record a failed sign-in", "host_api", __LINE__);
     response->SetError(kErrWrongPassword, Reason("wrong account or password"));
     return;
   }
-  SessionStore store(LoadSessionLimits());
+  if (!throttle.Succeeded(account, address)) {
+    syslog(LOG_ERR, "%s:%d cannot clear the failed sign-ins of [%s]", "host_api", __LINE__,
+           account.c_str());
+  }
+  SessionStore store(config.session);
   Session session;
   if (!store.Create(account, &session)) {
     syslog(LOG_ERR, "%s:%d cannot store a session for [%s]", "host_api", __LINE__, account.c_str());
@@ -134,7 +190,7 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
   } else if (api == kInfoAPI) {
     InfoQuery(*modules, response);
   } else if (method == "login") {
-    Login(*request, response);
+    Login(cgi, *request, response);
   } else {
     Logout(cgi, *request, response);
   }

@@ -1,7 +1,9 @@
 // The host's own APIs and the sign-in rules that guard the modules' APIs.
 //
 //  "KIVO.API.Info" "query"   every API with its lowest and highest version
-//  "KIVO.API.Auth" "login"   account + passwd -> {"sid", "token"} and cookie id=<sid>
+//  "KIVO.API.Auth" "login"   account + passwd -> {"sid", "token"} and cookie id=<sid>;
+//                            only by POST with both in the body, throttled after
+//                            failures (host/login_throttle.h)
 //  "KIVO.API.Auth" "logout"  ends the calling session
 #pragma once
 
@@ -25,6 +27,7 @@ enum HostError {
   kErrNotSignedIn = 119,
   kErrParameter = 120,
   kErrWrongPassword = 400,
+  kErrSignInThrottled = 407,  // too many failed sign-ins; "retry_after" seconds
 };
 
 // True when `api` is served by the host itself.

@@ -23,6 +23,12 @@ HostConfig LoadHostConfig() {
   config.session.idle_timeout =
       ReadNumber(conf, "session_idle_timeout", config.session.idle_timeout);
   config.session.max_age = ReadNumber(conf, "session_max_age", config.session.max_age);
+  config.session.max_per_account =
+      ReadNumber(conf, "session_max_per_account", config.session.max_per_account);
+  LoginLimits& login = config.login;
+  login.free_failures = ReadNumber(conf, "login_free_failures", login.free_failures);
+  login.backoff_base = ReadNumber(conf, "login_backoff_base", login.backoff_base);
+  login.backoff_max = ReadNumber(conf, "login_backoff_max", login.backoff_max);
   config.max_upload_bytes = static_cast<uint64_t>(
       ReadNumber(conf, "max_upload_bytes", static_cast<long long>(config.max_upload_bytes)));
   return config;

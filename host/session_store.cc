@@ -1,19 +1,29 @@
 #include "host/session_store.h"
 
+#include <algorithm>
 #include <cstdlib>
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
+#include <utility>
+#include <vector>
 
+#include "host/file_lock.h"
 #include "klibc/atomic_file.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
 
+#include <time.h>
+
 namespace {
 
 constexpr size_t kIdBytes = 16;
+// Guards the per-account limit: held from writing a new session until the
+// account's oldest ones beyond the limit are gone. (Not an id, so never
+// taken for a session.)
+constexpr char kLockName[] = ".lock";
 // A used session's file time is refreshed at most this often, so most
 // requests only read.
 constexpr long kTouchInterval = 30;
@@ -57,15 +67,43 @@ void SessionStore::RemoveExpired() {
   closedir(dir);
 }
 
+void SessionStore::EndOldestOf(const std::string& user) {
+  // (creation in nanoseconds, id) of each of the user's sessions.
+  std::vector<std::pair<long long, std::string>> sessions;
+  DIR* dir = opendir(dir_.c_str());
+  if (!dir) return;
+  while (struct dirent* entry = readdir(dir)) {
+    KeyValueMap fields;
+    if (!IsWellFormedId(entry->d_name) || !KIVOKeyValueLoad(PathOf(entry->d_name), &fields) ||
+        fields["user"] != user) {
+      continue;
+    }
+    sessions.emplace_back(std::strtoll(fields["created_ns"].c_str(), nullptr, 10), entry->d_name);
+  }
+  closedir(dir);
+  if (sessions.size() <= static_cast<size_t>(limits_.max_per_account)) return;
+  std::sort(sessions.begin(), sessions.end());
+  size_t excess = sessions.size() - static_cast<size_t>(limits_.max_per_account);
+  for (size_t i = 0; i < excess; ++i) unlink(PathOf(sessions[i].second).c_str());
+}
+
 bool SessionStore::Create(const std::string& user, Session* out) {
   RemoveExpired();
   if (!RandomHex(kIdBytes, &out->id) || !RandomHex(kIdBytes, &out->token)) return false;
   out->user = user;
   if (KIVOFSMkdirP(dir_.c_str(), 0700) != 0) return false;
+  FileLock lock(dir_ + "/" + kLockName);
+  if (!lock.held()) return false;
+  struct timespec now;
+  clock_gettime(CLOCK_REALTIME, &now);
+  long long now_ns = static_cast<long long>(now.tv_sec) * 1000000000LL + now.tv_nsec;
   std::string content = KIVOKeyValueLine("user", user) + "\n" +
                         KIVOKeyValueLine("token", out->token) + "\n" +
-                        KIVOKeyValueLine("created", std::to_string(time(nullptr))) + "\n";
-  return KIVOWriteFileAtomic(PathOf(out->id), content, SyncToDisk::No, 0600);
+                        KIVOKeyValueLine("created", std::to_string(now.tv_sec)) + "\n" +
+                        KIVOKeyValueLine("created_ns", std::to_string(now_ns)) + "\n";
+  if (!KIVOWriteFileAtomic(PathOf(out->id), content, SyncToDisk::No, 0600)) return false;
+  EndOldestOf(user);
+  return true;
 }
 
 SessionLookup SessionStore::Find(const std::string& id, Session* out) {

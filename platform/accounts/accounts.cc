@@ -69,6 +69,28 @@ std::string StoredHash(const std::string& account) {
   return hash;
 }
 
+// Locked ("!..."), disabled ("*") and empty hashes never match.
+bool IsUsableHash(const std::string& hash) {
+  return !hash.empty() && hash[0] != '!' && hash[0] != '*';
+}
+
+std::string NewSetting() {
+  char salt[CRYPT_GENSALT_OUTPUT_SIZE];
+  if (!Crypt().gensalt || !Crypt().gensalt("$y$", 0, nullptr, 0, salt, sizeof(salt))) return "";
+  return salt;
+}
+
+// What a password is hashed with when the account cannot sign in: the first
+// usable hash of the shadow file (its method, cost and salt, so the work is
+// that of a real account's check), else a fresh setting as new passwords get.
+std::string StandInSetting() {
+  UniqueFile sp = OpenRootFile("/etc/shadow");
+  for (struct spwd* s; sp && (s = fgetspent(sp.get()));) {
+    if (s->sp_pwdp && IsUsableHash(s->sp_pwdp)) return s->sp_pwdp;
+  }
+  return NewSetting();
+}
+
 std::vector<std::string> ReadLines(const char* fixed) {
   std::vector<std::string> lines;
   std::string text;
@@ -115,11 +137,11 @@ unsigned NextFreeId(const std::vector<std::string>& lines, unsigned first) {
 }
 
 std::string HashPassword(const std::string& password) {
-  char salt[CRYPT_GENSALT_OUTPUT_SIZE];
-  if (!Crypt().gensalt || !Crypt().gensalt("$y$", 0, nullptr, 0, salt, sizeof(salt))) return "";
+  std::string setting = NewSetting();
+  if (setting.empty()) return "";
   struct crypt_data data;
   memset(&data, 0, sizeof(data));
-  const char* hash = CryptR(password, salt, &data);
+  const char* hash = CryptR(password, setting.c_str(), &data);
   return hash && hash[0] != '*' ? hash : "";
 }
 
@@ -145,14 +167,15 @@ bool KIVOAccountNameValid(const std::string& name) {
 }
 
 bool KIVOAccountCheckPassword(const std::string& account, const std::string& password) {
-  if (!KIVOAccountNameValid(account)) return false;
-  std::string hash = StoredHash(account);
-  // Locked ("!..."), disabled ("*") and empty hashes never match.
-  if (hash.empty() || hash[0] == '!' || hash[0] == '*') return false;
+  std::string hash = KIVOAccountNameValid(account) ? StoredHash(account) : "";
+  bool usable = IsUsableHash(hash);
+  // A name that cannot sign in costs the same hashing as one that can, so the
+  // time of the answer does not tell which accounts exist.
+  std::string setting = usable ? hash : StandInSetting();
   struct crypt_data data;
   memset(&data, 0, sizeof(data));
-  const char* computed = CryptR(password, hash.c_str(), &data);
-  return computed && computed[0] != '*' && hash == computed;
+  const char* computed = CryptR(password, setting.c_str(), &data);
+  return usable && computed && computed[0] != '*' && hash == computed;
 }
 
 bool KIVOAccountInGroup(const std::string& account, const std::string& group) {

@@ -1,0 +1,233 @@
+#include "host/login_throttle.h"
+
+#include <algorithm>
+#include <climits>
+#include <cstring>
+#include <functional>
+#include <syslog.h>
+
+#include <json/value.h>
+#include <json/writer.h>
+
+#include "accounts/accounts.h"
+#include "host/file_lock.h"
+#include "klibc/atomic_file.h"
+#include "klibc/sysroot.h"
+#include "settings/web_utils.h"
+
+#include <arpa/inet.h>
+#include <time.h>
+
+namespace {
+
+// The state file:
+//   {"addresses": {ADDR: {"last": MS, "failures": {ACCOUNT: N, ...}}},
+//    "accounts":  {ACCOUNT: {"last": MS, "addresses": {ADDR: MS, ...}}}}
+// ACCOUNT "" gathers the failures on names that are not account names.
+constexpr char kAddresses[] = "addresses";
+constexpr char kAccounts[] = "accounts";
+constexpr char kLast[] = "last";
+constexpr char kFailures[] = "failures";
+
+// Larger settings (a back-off beyond a day, more free failures than a day has
+// seconds) mean nothing more and would overflow the arithmetic.
+constexpr long kMaxSetting = 86400;
+constexpr long long kForgetAfterMs = 24LL * 3600 * 1000;
+// Bounds that keep the file small whatever an attacker sends.
+constexpr unsigned kMaxAddresses = 4096;
+constexpr unsigned kMaxAccounts = 4096;
+constexpr unsigned kMaxAccountsPerAddress = 16;
+constexpr unsigned kMaxAddressesPerAccount = 64;
+
+long long NowMs() {
+  struct timespec ts;
+  clock_gettime(CLOCK_REALTIME, &ts);
+  return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
+}
+
+long long LastOf(const Json::Value& record) { return record[kLast].asInt64(); }
+
+// Removes the oldest members of `map` (by their "last", or their own value
+// when it is a number) until it holds at most `max`.
+void KeepNewest(Json::Value* map, unsigned max) {
+  while (map->size() > max) {
+    std::string oldest;
+    long long oldest_ms = LLONG_MAX;
+    for (const std::string& key : map->getMemberNames()) {
+      const Json::Value& v = (*map)[key];
+      long long ms = v.isObject() ? LastOf(v) : v.asInt64();
+      if (ms <= oldest_ms) oldest = key, oldest_ms = ms;
+    }
+    map->removeMember(oldest);
+  }
+}
+
+void ForgetQuiet(Json::Value* map, long long now) {
+  for (const std::string& key : map->getMemberNames()) {
+    if (now - LastOf((*map)[key]) > kForgetAfterMs) map->removeMember(key);
+  }
+}
+
+long long AddressFailures(const Json::Value& address) {
+  long long sum = 0;
+  for (const Json::Value& n : address[kFailures]) sum += n.asInt64();
+  return sum;
+}
+
+class ThrottleState {
+ public:
+  ThrottleState(const LoginLimits& limits, long long now) : limits_(limits), now_(now) {}
+
+  // A missing or damaged file is an empty state: the file is ours alone and
+  // the next write replaces it.
+  void Load(const std::string& path) {
+    if (!WebUtils::LoadJsonFile(path, state_) || !state_.isObject()) {
+      if (KLIBCFileExist(path.c_str()))
+        syslog(LOG_WARNING, "%s:%d unreadable %s, starting afresh", "login_throttle", __LINE__,
+               path.c_str());
+      state_ = Json::Value(Json::objectValue);
+    }
+    for (const char* part : {kAddresses, kAccounts}) {
+      if (!state_[part].isObject()) state_[part] = Json::Value(Json::objectValue);
+      ForgetQuiet(&state_[part], now_);
+    }
+  }
+
+  bool Save(const std::string& path) const {
+    Json::StreamWriterBuilder builder;
+    builder["indentation"] = "";
+    // The file lives in the run folder and is rebuilt by failures alone, so
+    // it is not worth a sync to disk at every sign-in.
+    return KIVOWriteFileAtomic(path, Json::writeString(builder, state_), SyncToDisk::No, 0600);
+  }
+
+  // Milliseconds until `address` and `account` may be tried; 0 when now.
+  long long WaitMs(const std::string& account, const std::string& address) const {
+    long long wait = WaitAfter(state_[kAddresses][address], AddressFailures);
+    if (account.empty()) return wait;
+    return std::max(wait, WaitAfter(state_[kAccounts][account], [](const Json::Value& a) {
+                      return static_cast<long long>(a[kAddresses].size());
+                    }));
+  }
+
+  void CountFailure(const std::string& account, const std::string& address) {
+    Json::Value& a = state_[kAddresses][address];
+    a[kLast] = Json::Int64(now_);
+    Json::Value& failures = a[kFailures];
+    if (!failures.isMember(account) && failures.size() >= kMaxAccountsPerAddress) {
+      // Too many names from one address: the rest are counted together.
+      failures[""] = failures[""].asInt64() + 1;
+    } else {
+      failures[account] = failures[account].asInt64() + 1;
+    }
+    KeepNewest(&state_[kAddresses], kMaxAddresses);
+    if (account.empty()) return;
+    Json::Value& acc = state_[kAccounts][account];
+    acc[kLast] = Json::Int64(now_);
+    acc[kAddresses][address] = Json::Int64(now_);
+    KeepNewest(&acc[kAddresses], kMaxAddressesPerAccount);
+    KeepNewest(&state_[kAccounts], kMaxAccounts);
+  }
+
+  // Starts the waits of `address` and `account` anew: a failure is known
+  // only once its password has been checked, a while after it was counted.
+  void StampFailure(const std::string& account, const std::string& address) {
+    Json::Value& a = state_[kAddresses][address];
+    if (a.isObject()) a[kLast] = Json::Int64(now_);
+    if (account.empty() || !state_[kAccounts][account].isObject()) return;
+    state_[kAccounts][account][kLast] = Json::Int64(now_);
+  }
+
+  void ForgetFailures(const std::string& account, const std::string& address) {
+    state_[kAccounts].removeMember(account);
+    Json::Value& a = state_[kAddresses][address];
+    a[kFailures].removeMember(account);
+    if (AddressFailures(a) == 0) state_[kAddresses].removeMember(address);
+  }
+
+ private:
+  // The wait a record imposes: none for its first free failures, then the
+  // base doubled per failure beyond them, capped.
+  template <typename CountFn>
+  long long WaitAfter(const Json::Value& record, CountFn count_of) const {
+    if (!record.isObject()) return 0;
+    long long beyond = count_of(record) - limits_.free_failures;
+    if (beyond < 0) return 0;
+    const long long cap_ms = limits_.backoff_max * 1000LL;
+    long long delay_ms = limits_.backoff_base * 1000LL;
+    for (long long i = 0; i < beyond && delay_ms < cap_ms; ++i) delay_ms *= 2;
+    delay_ms = std::min(delay_ms, cap_ms);
+    return std::max(0LL, LastOf(record) + delay_ms - now_);
+  }
+
+  const LoginLimits& limits_;
+  long long now_;
+  Json::Value state_;
+};
+
+// Applies `change` to the state under the lock and writes it back.
+bool UpdateState(const LoginLimits& limits, const std::string& lock_path,
+                 const std::string& state_path, const std::function<void(ThrottleState*)>& change) {
+  FileLock lock(lock_path);
+  if (!lock.held()) return false;
+  ThrottleState state(limits, NowMs());
+  state.Load(state_path);
+  change(&state);
+  return state.Save(state_path);
+}
+
+}  // namespace
+
+LoginThrottle::LoginThrottle(LoginLimits limits)
+    : limits_{std::min(limits.free_failures, kMaxSetting),
+              std::min(limits.backoff_base, kMaxSetting),
+              std::min(limits.backoff_max, kMaxSetting)},
+      state_path_(KIVORootPath("/run/kivo/login-throttle.json")),
+      lock_path_(KIVORootPath("/run/kivo/login-throttle.lock")) {}
+
+LoginAdmission LoginThrottle::Admit(const std::string& account, const std::string& address,
+                                    long* retry_after_seconds) {
+  *retry_after_seconds = 0;
+  if (KIVOFSMkdirP(KIVORootPath("/run/kivo").c_str(), 0755) != 0)
+    return LoginAdmission::Unavailable;
+  FileLock lock(lock_path_);
+  if (!lock.held()) return LoginAdmission::Unavailable;
+  ThrottleState state(limits_, NowMs());
+  state.Load(state_path_);
+  const std::string name = KIVOAccountNameValid(account) ? account : "";
+  long long wait_ms = state.WaitMs(name, address);
+  if (wait_ms > 0) {
+    *retry_after_seconds = static_cast<long>((wait_ms + 999) / 1000);
+    return LoginAdmission::Throttled;
+  }
+  state.CountFailure(name, address);
+  return state.Save(state_path_) ? LoginAdmission::Admitted : LoginAdmission::Unavailable;
+}
+
+bool LoginThrottle::Failed(const std::string& account, const std::string& address) {
+  const std::string name = KIVOAccountNameValid(account) ? account : "";
+  return UpdateState(limits_, lock_path_, state_path_,
+                     [&](ThrottleState* state) { state->StampFailure(name, address); });
+}
+
+bool LoginThrottle::Succeeded(const std::string& account, const std::string& address) {
+  return UpdateState(limits_, lock_path_, state_path_,
+                     [&](ThrottleState* state) { state->ForgetFailures(account, address); });
+}
+
+std::string LoginAddressKey(const char* remote_addr) {
+  if (!remote_addr) return "unknown";
+  unsigned char bytes[16];
+  char text[INET6_ADDRSTRLEN];
+  if (inet_pton(AF_INET, remote_addr, bytes) == 1) {
+    return inet_ntop(AF_INET, bytes, text, sizeof(text)) ? text : "unknown";
+  }
+  if (inet_pton(AF_INET6, remote_addr, bytes) != 1) return "unknown";
+  static const unsigned char kMapped[12] = {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0xff, 0xff};
+  if (memcmp(bytes, kMapped, sizeof(kMapped)) == 0) {
+    return inet_ntop(AF_INET, bytes + 12, text, sizeof(text)) ? text : "unknown";
+  }
+  memset(bytes + 8, 0, 8);
+  if (!inet_ntop(AF_INET6, bytes, text, sizeof(text))) return "unknown";
+  return std::string(text) + "/64";
+}
