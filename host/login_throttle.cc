@@ -45,7 +45,25 @@ long long NowMs() {
   return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
 }
 
-long long LastOf(const Json::Value& record) { return record[kLast].asInt64(); }
+// The file is ours, but a damaged one must not throw: a value that is not a
+// whole number reads as 0.
+long long IntOf(const Json::Value& v) { return v.isInt64() ? v.asInt64() : 0; }
+
+long long LastOf(const Json::Value& record) {
+  return std::clamp(IntOf(record[kLast]), 0LL, 1LL << 50);  // keeps sums in range
+}
+
+// Drops members that are not objects, and makes `field` of each an object.
+void KeepObjects(Json::Value* map, const char* field) {
+  for (const std::string& key : map->getMemberNames()) {
+    Json::Value& record = (*map)[key];
+    if (!record.isObject()) {
+      map->removeMember(key);
+    } else if (!record[field].isObject()) {
+      record[field] = Json::Value(Json::objectValue);
+    }
+  }
+}
 
 // Removes the oldest members of `map` (by their "last", or their own value
 // when it is a number) until it holds at most `max`.
@@ -55,7 +73,7 @@ void KeepNewest(Json::Value* map, unsigned max) {
     long long oldest_ms = LLONG_MAX;
     for (const std::string& key : map->getMemberNames()) {
       const Json::Value& v = (*map)[key];
-      long long ms = v.isObject() ? LastOf(v) : v.asInt64();
+      long long ms = v.isObject() ? LastOf(v) : IntOf(v);
       if (ms <= oldest_ms) oldest = key, oldest_ms = ms;
     }
     map->removeMember(oldest);
@@ -70,7 +88,7 @@ void ForgetQuiet(Json::Value* map, long long now) {
 
 long long AddressFailures(const Json::Value& address) {
   long long sum = 0;
-  for (const Json::Value& n : address[kFailures]) sum += n.asInt64();
+  for (const Json::Value& n : address[kFailures]) sum += std::clamp(IntOf(n), 0LL, 1LL << 32);
   return sum;
 }
 
@@ -89,6 +107,7 @@ class ThrottleState {
     }
     for (const char* part : {kAddresses, kAccounts}) {
       if (!state_[part].isObject()) state_[part] = Json::Value(Json::objectValue);
+      KeepObjects(&state_[part], part == kAddresses ? kFailures : kAddresses);
       ForgetQuiet(&state_[part], now_);
     }
   }
@@ -116,9 +135,9 @@ class ThrottleState {
     Json::Value& failures = a[kFailures];
     if (!failures.isMember(account) && failures.size() >= kMaxAccountsPerAddress) {
       // Too many names from one address: the rest are counted together.
-      failures[""] = failures[""].asInt64() + 1;
+      failures[""] = Json::Int64(IntOf(failures[""]) + 1);
     } else {
-      failures[account] = failures[account].asInt64() + 1;
+      failures[account] = Json::Int64(IntOf(failures[account]) + 1);
     }
     KeepNewest(&state_[kAddresses], kMaxAddresses);
     if (account.empty()) return;
@@ -132,10 +151,11 @@ class ThrottleState {
   // Starts the waits of `address` and `account` anew: a failure is known
   // only once its password has been checked, a while after it was counted.
   void StampFailure(const std::string& account, const std::string& address) {
-    Json::Value& a = state_[kAddresses][address];
-    if (a.isObject()) a[kLast] = Json::Int64(now_);
-    if (account.empty() || !state_[kAccounts][account].isObject()) return;
-    state_[kAccounts][account][kLast] = Json::Int64(now_);
+    Json::Value& addresses = state_[kAddresses];
+    if (addresses.isMember(address)) addresses[address][kLast] = Json::Int64(now_);
+    Json::Value& accounts = state_[kAccounts];
+    if (!account.empty() && accounts.isMember(account))
+      accounts[account][kLast] = Json::Int64(now_);
   }
 
   void ForgetFailures(const std::string& account, const std::string& address) {
@@ -157,7 +177,8 @@ class ThrottleState {
     long long delay_ms = limits_.backoff_base * 1000LL;
     for (long long i = 0; i < beyond && delay_ms < cap_ms; ++i) delay_ms *= 2;
     delay_ms = std::min(delay_ms, cap_ms);
-    return std::max(0LL, LastOf(record) + delay_ms - now_);
+    // Clamped, so that a clock set back cannot make the wait longer.
+    return std::clamp(LastOf(record) + delay_ms - now_, 0LL, delay_ms);
   }
 
   const LoginLimits& limits_;

@@ -141,6 +141,21 @@ TEST_F(AuthTest, RacingGuessesAreCountedBeforeTheirPasswordIsChecked) {
   EXPECT_EQ(9, std::count(codes.begin(), codes.end(), kThrottled));
 }
 
+TEST_F(AuthTest, ADamagedAttemptsFileIsStartedAfresh) {
+  Configure("login_free_failures=\"1\"\nlogin_backoff_base=\"60\"\n");
+  const std::string file = "/run/kivo/login-throttle.json";
+  for (const std::string& damage :
+       {std::string("{\"addresses\""), std::string("[1, 2]"),
+        std::string("{\"addresses\": {\"192.0.2.10\": \"x\", \"192.0.2.11\": {\"last\": "
+                    "\"soon\", \"failures\": {\"admin\": 9223372036854775807, \"ops\": "
+                    "\"many\"}}}, \"accounts\": {\"admin\": []}}")}) {
+    root_.Write(file, damage);
+    EXPECT_TRUE(SignIn("admin", "secret").Success()) << damage;
+    EXPECT_EQ(kWrongPassword, SignIn("admin", "guess", "192.0.2.11").Code()) << damage;
+    ExpectThrottled(SignIn("admin", "secret", "192.0.2.11"), 60);
+  }
+}
+
 // The median wall time of `sign_in`, in seconds.
 template <typename Fn>
 double MedianSeconds(Fn sign_in, std::vector<double>* samples) {
