@@ -3,7 +3,7 @@
 # (with the committed .clang-format) would make of it. --fix rewrites them.
 set -euo pipefail
 cd "$(dirname "$0")/.."
-mapfile -t files < <(find bench host package platform tests tools -name '*.cc' -o -name '*.h' | sort)
+mapfile -t files < <(find bench fuzz host package platform tests tools -name '*.cc' -o -name '*.h' | sort)
 if [ "${1:-}" = --fix ]; then
   clang-format -i "${files[@]}"
   exit 0

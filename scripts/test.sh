@@ -2,7 +2,8 @@
 # Installs what is missing (as root), builds, and runs every test: once in
 # build/, then again under AddressSanitizer and UndefinedBehaviorSanitizer in
 # build-asan/. KIVO_SANITIZE=0 skips the second run, KIVO_SANITIZE=only runs
-# just that one.
+# just that one. Last, a short fuzz run of the readers of untrusted input
+# (fuzz/run.sh, clang, build-fuzz/); KIVO_FUZZ=0 skips it.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -26,4 +27,8 @@ if [ "${KIVO_SANITIZE:-1}" != 0 ]; then
   export UBSAN_OPTIONS=halt_on_error=1:print_stacktrace=1
   scripts/build.sh -DKIVO_SANITIZE=ON
   run_tests
+fi
+if [ "${KIVO_FUZZ:-1}" != 0 ]; then
+  # Saved reproducers first, then about 20 s per target; a crash fails here.
+  fuzz/run.sh 20
 fi
