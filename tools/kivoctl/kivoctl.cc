@@ -3,7 +3,8 @@
 //   kivoctl init-root DIR
 //   kivoctl [--root DIR] user-add NAME [--password PW | --password-stdin] [--group G]...
 //   kivoctl [--root DIR] web-config [--port N] [--address A] [--cgi PATH]
-//   kivoctl build|sign|inspect ...            (package authors)
+//   kivoctl [--root DIR] server-config [--vendor URL] [--company-info URL]
+//   kivoctl build|sign|inspect|index ...      (package authors)
 //   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
 
 #include <cstdio>
@@ -14,6 +15,7 @@
 #include <vector>
 
 #include "accounts/accounts.h"
+#include "tools/kivoctl/catalogue_index.h"
 #include "tools/kivoctl/package_commands.h"
 #include "tools/kivoctl/root_setup.h"
 #include "tools/kivoctl/web_config.h"
@@ -33,11 +35,17 @@ const char kUsage[] =
     "                           print the lighttpd configuration that serves the\n"
     "                           root's web API (default 127.0.0.1:5000, the entry.cgi\n"
     "                           beside this program)\n"
+    "  server-config [--vendor URL] [--company-info URL]\n"
+    "                           set the vendor's catalogue and company-information\n"
+    "                           addresses (etc/kivo/pkgserver.conf) and print them\n"
     "\n"
     "package authors:\n"
     "  build SOURCE OUT.kpk [--level N]   build a package file from a source folder\n"
     "  sign FILE.kpk --homedir GNUPGHOME --key KEY [--output OUT.kpk]\n"
     "  inspect FILE.kpk                   INFO, members and signature as JSON\n"
+    "  index FOLDER --base-url URL [--recommend ID]...\n"
+    "                                     write FOLDER/catalogue.json (and icons/) from\n"
+    "                                     its package files: a static package server\n"
     "\n"
     "operators (on the system root):\n"
     "  install FILE.kpk [--volume V] [--wizard JSON] [--run] [--no-codesign] [--no-force]\n"
@@ -135,6 +143,8 @@ int main(int argc, char** argv) {
   if (command == "init-root") return InitRoot(args);
   if (command == "user-add") return UserAdd(args);
   if (command == "web-config") return WebConfig(args);
+  if (command == "server-config") return KivoctlServerConfig(args);
+  if (command == "index") return KivoctlIndex(args);
   if (command == "build") return KivoctlBuild(args);
   if (command == "sign") return KivoctlSign(args);
   if (command == "inspect") return KivoctlInspect(args);

@@ -63,6 +63,11 @@ const DefaultFile kFiles[] = {
      "session_idle_timeout=\"1800\"\n"
      "session_max_age=\"86400\"\n",
      0644},
+    {"etc/kivo/pkgserver.conf",
+     "# Package servers (docs/package-server.md). kivoctl server-config changes them.\n"
+     "vendor_url=\"https://packages.kivo.invalid/catalogue.json\"\n"
+     "company_info_url=\"https://www.kivo.invalid/company-info\"\n",
+     0644},
     {"usr/kivo/etc/packages/feeds", "[]\n", 0644},
 };
 

@@ -1,0 +1,236 @@
+#include "pkgserver/catalogue.h"
+
+#include <cctype>
+#include <cstdio>
+#include <ctime>
+#include <memory>
+#include <syslog.h>
+#include <vector>
+
+#include <json/reader.h>
+#include <json/writer.h>
+
+#include "klibc/atomic_file.h"
+#include "klibc/key_value_file.h"
+#include "klibc/sysroot.h"
+#include "pkgserver/server_config.h"
+#include "pkgserver/server_net.h"
+#include "pkgtool/version.h"
+#include "settings/web_utils.h"
+
+#define CATALOGUE_LOG(fmt, ...) syslog(LOG_ERR, "%s:%d " fmt, "catalogue", __LINE__, ##__VA_ARGS__)
+
+namespace KIVOPackageServer {
+
+namespace {
+
+std::string CacheDir() { return KIVORootPath("/var/cache/kivo/pkgserver"); }
+
+// FNV-1a: a stable file name per server and language.
+std::string CacheKey(const std::string& url, const std::string& language) {
+  uint64_t h = 1469598103934665603ULL;
+  for (unsigned char c : url + "\n" + language) h = (h ^ c) * 1099511628211ULL;
+  char name[32];
+  snprintf(name, sizeof(name), "%016llx", static_cast<unsigned long long>(h));
+  return name;
+}
+
+// The server's address with what the appliance is appended.
+std::string QueryUrl(const std::string& url, const std::string& language,
+                     const Json::Value& extra) {
+  KeyValueMap device, info;
+  KIVOKeyValueLoad(KIVORootPath("/etc/kivo/device.conf"), &device);
+  KIVOKeyValueLoad(KIVORootPath("/etc/kivoinfo.conf"), &info);
+  std::string q = url + (url.find('?') == std::string::npos ? "?" : "&");
+  q += "language=" + PMSUrlEncode(language) + "&arch=" + PMSUrlEncode(device["arch"]) +
+       "&os_version=" + PMSUrlEncode(device["os_version"]) +
+       "&channel=" + PMSUrlEncode(info["package_update_channel"]);
+  if (extra.isObject()) {
+    for (const std::string& key : extra.getMemberNames()) {
+      if (extra[key].isString())
+        q += "&" + PMSUrlEncode(key) + "=" + PMSUrlEncode(extra[key].asString());
+    }
+  }
+  return q;
+}
+
+struct CachedCatalogue {
+  Json::Value meta;  // "url", "etag", "last_modified", "fetched"
+  std::string body;
+};
+
+bool ReadCache(const std::string& path, CachedCatalogue* cached) {
+  std::string text;
+  if (!KIVOReadFile(path, &text)) return false;
+  size_t newline = text.find('\n');
+  if (newline == std::string::npos) return false;
+  Json::CharReaderBuilder builder;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  if (!reader->parse(text.data(), text.data() + newline, &cached->meta, nullptr) ||
+      !cached->meta.isObject()) {
+    return false;
+  }
+  cached->body = text.substr(newline + 1);
+  return true;
+}
+
+void WriteCache(const std::string& path, const CachedCatalogue& cached) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "";
+  KIVOFSMkdirP(CacheDir().c_str());
+  KIVOWriteFileAtomic(path, Json::writeString(builder, cached.meta) + "\n" + cached.body,
+                      SyncToDisk::No);
+}
+
+bool ParseAnswer(const std::string& body, Json::Value& answer) {
+  Json::CharReaderBuilder builder;
+  builder["collectComments"] = false;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value value;
+  if (!reader->parse(body.data(), body.data() + body.size(), &value, nullptr)) return false;
+  if (!value.isObject() && !value.isArray()) return false;
+  answer = std::move(value);
+  return true;
+}
+
+// The server's answer as text, from the cache or the server.
+bool FetchText(const std::string& url, const std::string& language, bool force,
+               const Json::Value& extra, std::string& body) {
+  if (!PMSIsServerUrl(url)) {
+    CATALOGUE_LOG("%s: not an http or https address", url.c_str());
+    return false;
+  }
+  PkgServerConfig config = PMSLoadServerConfig();
+  const std::string path = CacheDir() + "/" + CacheKey(QueryUrl(url, language, extra), language);
+  CachedCatalogue cached;
+  bool have = !force && ReadCache(path, &cached);
+  long age = have ? static_cast<long>(time(nullptr)) - cached.meta["fetched"].asInt64() : 0;
+  if (have && age >= 0 && age < config.catalogue_max_age_s) {
+    body = std::move(cached.body);
+    return true;
+  }
+  std::string error;
+  const PackageServerNetOps* net = PMSServerNetOps(&error);
+  if (!net) {
+    CATALOGUE_LOG("%s: %s", url.c_str(), error.c_str());
+    return false;
+  }
+  HttpFetch fetch;
+  fetch.url = QueryUrl(url, language, extra);
+  if (have) {
+    fetch.if_none_match = cached.meta["etag"].asString();
+    fetch.if_modified_since = cached.meta["last_modified"].asString();
+  }
+  if (!net->fetch(config.CatalogueLimits(), fetch)) {
+    CATALOGUE_LOG("%s: %s", url.c_str(), fetch.error.c_str());
+    return false;
+  }
+  if (have && fetch.status == 304) {
+    cached.meta["fetched"] = static_cast<Json::Int64>(time(nullptr));
+    WriteCache(path, cached);
+    body = std::move(cached.body);
+    return true;
+  }
+  Json::Value parsed;
+  if (fetch.status != 200) {
+    CATALOGUE_LOG("%s: the server answered HTTP %ld", url.c_str(), fetch.status);
+    return false;
+  }
+  if (!ParseAnswer(fetch.body, parsed)) {
+    CATALOGUE_LOG("%s: the answer is not a JSON catalogue", url.c_str());
+    return false;
+  }
+  CachedCatalogue fresh;
+  fresh.meta["url"] = url;
+  fresh.meta["language"] = language;
+  fresh.meta["etag"] = fetch.etag;
+  fresh.meta["last_modified"] = fetch.last_modified;
+  fresh.meta["fetched"] = static_cast<Json::Int64>(time(nullptr));
+  fresh.body = fetch.body;
+  WriteCache(path, fresh);
+  body = std::move(fetch.body);
+  return true;
+}
+
+bool QueryServer(const std::string& url, bool force, const std::string& language,
+                 Json::Value& answer) {
+  std::string body;
+  if (!FetchText(url, language, force, Json::Value(), body)) return false;
+  if (ParseAnswer(body, answer)) return true;
+  CATALOGUE_LOG("%s: the cached answer is not a JSON catalogue", url.c_str());
+  return false;
+}
+
+std::string Text(const Json::Value& v) { return v.isString() ? v.asString() : ""; }
+
+std::vector<std::string> FeedUrls() {
+  Json::Value feeds;
+  std::vector<std::string> urls;
+  if (!WebUtils::LoadJsonFile(KIVORootPath("/usr/kivo/etc/packages/feeds"), feeds) ||
+      !feeds.isArray()) {
+    return urls;
+  }
+  for (const Json::Value& feed : feeds) {
+    if (feed.isObject() && feed["feed"].isString()) urls.push_back(feed["feed"].asString());
+  }
+  return urls;
+}
+
+}  // namespace
+
+const Json::Value* PMSCatalogueEntries(const Json::Value& answer) {
+  if (answer.isArray()) return &answer;
+  if (answer.isObject() && answer["packages"].isArray()) return &answer["packages"];
+  return nullptr;
+}
+
+bool PMSQueryKivoPkgServer(bool forceReload, const char* language, Json::Value& answer) {
+  PkgServerConfig config = PMSLoadServerConfig();
+  if (config.vendor_url.empty()) {
+    CATALOGUE_LOG("no vendor_url in %s", PMSServerConfigPath().c_str());
+    return false;
+  }
+  return QueryServer(config.vendor_url, forceReload, language ? language : "", answer);
+}
+
+bool PMSQueryOtherPkgServer(bool forceReload, const char* language, Json::Value& answer) {
+  answer = Json::Value(Json::arrayValue);
+  std::vector<std::string> urls = FeedUrls();
+  bool any = urls.empty();
+  for (const std::string& url : urls) {
+    Json::Value one;
+    if (!QueryServer(url, forceReload, language ? language : "", one)) continue;
+    const Json::Value* entries = PMSCatalogueEntries(one);
+    if (!entries) {
+      CATALOGUE_LOG("%s: neither an array nor an object with \"packages\"", url.c_str());
+      continue;
+    }
+    any = true;
+    for (const Json::Value& entry : *entries) answer.append(entry);
+  }
+  return any;
+}
+
+bool PMSQueryPkgServer(const char* language, std::string& answer, const std::string& feed,
+                       bool forceReload, const Json::Value& extra) {
+  return FetchText(feed, language ? language : "", forceReload, extra, answer);
+}
+
+bool PMSFindServerEntry(const std::string& name, bool isKivo, const std::string& language,
+                        Json::Value& entry) {
+  Json::Value answer;
+  bool ok = isKivo ? PMSQueryKivoPkgServer(false, language.c_str(), answer)
+                   : PMSQueryOtherPkgServer(false, language.c_str(), answer);
+  const Json::Value* entries = ok ? PMSCatalogueEntries(answer) : nullptr;
+  if (!entries) return false;
+  bool found = false;
+  for (const Json::Value& e : *entries) {
+    if (!e.isObject() || !e["package"].isString() || e["package"].asString() != name) continue;
+    if (found && PMSCompareVersion(Text(e["version"]), Text(entry["version"])) <= 0) continue;
+    entry = e;
+    found = true;
+  }
+  return found;
+}
+
+}  // namespace KIVOPackageServer

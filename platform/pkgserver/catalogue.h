@@ -1,0 +1,45 @@
+// Catalogues of package servers: the vendor's server (vendor_url of
+// pkgserver.conf) and the feeds of "/usr/kivo/etc/packages/feeds". The format
+// is docs/package-server.md's.
+//
+// A catalogue is asked for with a GET of the server's address plus the query
+// parameters language, arch, os_version and channel (a static file ignores
+// them). Answers are cached under the root per server and language
+// ("/var/cache/kivo/pkgserver"); a cached copy younger than
+// catalogue_max_age is used as it is, an older one is revalidated with
+// If-None-Match / If-Modified-Since (a 304 keeps it). A forced reload asks
+// without conditions. Only answers that parse as a JSON object or array are
+// cached or returned. Every failure is logged with the server and the reason.
+#pragma once
+
+#include <string>
+
+#include <json/value.h>
+
+namespace KIVOPackageServer {
+
+// The vendor's catalogue in `language` into `answer`. False when no server
+// is configured or it gave no usable answer.
+bool PMSQueryKivoPkgServer(bool forceReload, const char* language, Json::Value& answer);
+
+// The catalogues of every feed merged into one array of entries (an answer
+// object contributes its "packages"). True with an empty array when there
+// are no feeds; false only when every feed failed.
+bool PMSQueryOtherPkgServer(bool forceReload, const char* language, Json::Value& answer);
+
+// One server's answer as text, for the feed probe. `forceReload` bypasses
+// the cache; `extra` (an object of further query parameters) may be null or
+// empty. False when the server gave no usable answer.
+bool PMSQueryPkgServer(const char* language, std::string& answer, const std::string& feed,
+                       bool forceReload, const Json::Value& extra);
+
+// The entries of a catalogue answer: its "packages" (object form) or the
+// answer itself (array form); null for anything else.
+const Json::Value* PMSCatalogueEntries(const Json::Value& answer);
+
+// The entry of package `name` from the vendor's (isKivo) or the feeds'
+// cached-or-fetched catalogue; the highest version when several match.
+bool PMSFindServerEntry(const std::string& name, bool isKivo, const std::string& language,
+                        Json::Value& entry);
+
+}  // namespace KIVOPackageServer

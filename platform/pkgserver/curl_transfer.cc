@@ -1,0 +1,371 @@
+// The transfers of server_net.h on libcurl; built into
+// libkivo_pkgserver_net.so, which the light library loads on first use.
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <memory>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <curl/curl.h>
+
+#include "pkgserver/server_net.h"
+
+#include <openssl/evp.h>
+#include <strings.h>
+
+namespace {
+
+constexpr char kUserAgent[] = "KIVO-PackageCenter/1";
+constexpr long kReceiveBuffer = 256 * 1024;
+
+struct CurlDeleter {
+  void operator()(CURL* c) const { curl_easy_cleanup(c); }
+};
+struct SlistDeleter {
+  void operator()(curl_slist* l) const { curl_slist_free_all(l); }
+};
+struct DigestDeleter {
+  void operator()(EVP_MD_CTX* c) const { EVP_MD_CTX_free(c); }
+};
+using CurlHandle = std::unique_ptr<CURL, CurlDeleter>;
+using HeaderList = std::unique_ptr<curl_slist, SlistDeleter>;
+using Digest = std::unique_ptr<EVP_MD_CTX, DigestDeleter>;
+
+bool GlobalInit() {
+  static const bool ok = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
+  return ok;
+}
+
+// The settings every transfer shares: protocols, redirects, time bounds.
+CurlHandle NewHandle(const std::string& url, const HttpLimits& limits) {
+  if (!GlobalInit()) return nullptr;
+  CurlHandle c(curl_easy_init());
+  if (!c) return nullptr;
+  CURL* h = c.get();
+  curl_easy_setopt(h, CURLOPT_URL, url.c_str());
+  curl_easy_setopt(h, CURLOPT_PROTOCOLS_STR, "http,https");
+  curl_easy_setopt(h, CURLOPT_REDIR_PROTOCOLS_STR, "http,https");
+  curl_easy_setopt(h, CURLOPT_FOLLOWLOCATION, 1L);
+  curl_easy_setopt(h, CURLOPT_MAXREDIRS, static_cast<long>(kMaxRedirects));
+  curl_easy_setopt(h, CURLOPT_NOSIGNAL, 1L);
+  curl_easy_setopt(h, CURLOPT_NOPROXY, "localhost,127.0.0.1,::1");
+  curl_easy_setopt(h, CURLOPT_USERAGENT, kUserAgent);
+  curl_easy_setopt(h, CURLOPT_CONNECTTIMEOUT, limits.connect_timeout_s);
+  if (limits.total_timeout_s > 0) curl_easy_setopt(h, CURLOPT_TIMEOUT, limits.total_timeout_s);
+  if (limits.stall_timeout_s > 0) {
+    curl_easy_setopt(h, CURLOPT_LOW_SPEED_LIMIT, 1L);
+    curl_easy_setopt(h, CURLOPT_LOW_SPEED_TIME, limits.stall_timeout_s);
+  }
+  curl_easy_setopt(h, CURLOPT_BUFFERSIZE, kReceiveBuffer);
+  return c;
+}
+
+long Status(CURL* h) {
+  long status = 0;
+  curl_easy_getinfo(h, CURLINFO_RESPONSE_CODE, &status);
+  return status;
+}
+
+// The value of header line `line` when it is `name`, trimmed; else "".
+std::string HeaderValue(const char* line, size_t size, const char* name) {
+  size_t n = strlen(name);
+  if (size <= n || strncasecmp(line, name, n) != 0 || line[n] != ':') return "";
+  std::string value(line + n + 1, size - n - 1);
+  size_t b = value.find_first_not_of(" \t"), e = value.find_last_not_of(" \t\r\n");
+  return b == std::string::npos ? "" : value.substr(b, e - b + 1);
+}
+
+// --- Fetch into memory -----------------------------------------------------
+
+struct FetchState {
+  HttpFetch* fetch;
+  uint64_t max_bytes;
+  bool too_large = false;
+};
+
+size_t FetchBody(char* data, size_t size, size_t n, void* user) {
+  auto* s = static_cast<FetchState*>(user);
+  size_t bytes = size * n;
+  if (s->max_bytes && s->fetch->body.size() + bytes > s->max_bytes) {
+    s->too_large = true;
+    return 0;  // aborts the transfer
+  }
+  s->fetch->body.append(data, bytes);
+  return bytes;
+}
+
+size_t FetchHeader(char* line, size_t size, size_t n, void* user) {
+  auto* s = static_cast<FetchState*>(user);
+  size_t bytes = size * n;
+  // A redirect's headers come first; only the last answer's count.
+  if (bytes > 5 && strncmp(line, "HTTP/", 5) == 0) {
+    s->fetch->etag.clear();
+    s->fetch->last_modified.clear();
+    s->fetch->body.clear();
+  }
+  std::string v = HeaderValue(line, bytes, "ETag");
+  if (!v.empty()) s->fetch->etag = v;
+  v = HeaderValue(line, bytes, "Last-Modified");
+  if (!v.empty()) s->fetch->last_modified = v;
+  return bytes;
+}
+
+bool Fetch(const HttpLimits& limits, HttpFetch& fetch) {
+  CurlHandle c = NewHandle(fetch.url, limits);
+  if (!c) return (fetch.error = "cannot set up the transfer"), false;
+  CURL* h = c.get();
+  FetchState state{&fetch, limits.max_bytes};
+  HeaderList headers;
+  if (!fetch.if_none_match.empty())
+    headers.reset(
+        curl_slist_append(headers.release(), ("If-None-Match: " + fetch.if_none_match).c_str()));
+  if (!fetch.if_modified_since.empty())
+    headers.reset(curl_slist_append(headers.release(),
+                                    ("If-Modified-Since: " + fetch.if_modified_since).c_str()));
+  if (headers) curl_easy_setopt(h, CURLOPT_HTTPHEADER, headers.get());
+  if (!fetch.form.empty()) curl_easy_setopt(h, CURLOPT_POSTFIELDS, fetch.form.c_str());
+  curl_easy_setopt(h, CURLOPT_ACCEPT_ENCODING, "");
+  curl_easy_setopt(h, CURLOPT_WRITEFUNCTION, FetchBody);
+  curl_easy_setopt(h, CURLOPT_WRITEDATA, &state);
+  curl_easy_setopt(h, CURLOPT_HEADERFUNCTION, FetchHeader);
+  curl_easy_setopt(h, CURLOPT_HEADERDATA, &state);
+  CURLcode rc = curl_easy_perform(h);
+  fetch.status = Status(h);
+  if (state.too_large) {
+    fetch.error = "answer larger than " + std::to_string(limits.max_bytes) + " bytes";
+    return false;
+  }
+  if (rc != CURLE_OK) {
+    fetch.error = curl_easy_strerror(rc);
+    return false;
+  }
+  return true;
+}
+
+// --- Download into a file --------------------------------------------------
+
+std::string Hex(const unsigned char* digest, unsigned size) {
+  static const char kDigits[] = "0123456789abcdef";
+  std::string out;
+  for (unsigned i = 0; i < size; ++i) {
+    out += kDigits[digest[i] >> 4];
+    out += kDigits[digest[i] & 15];
+  }
+  return out;
+}
+
+class FileSink {
+ public:
+  FileSink(HttpDownload& d) : d_(d) {}
+  ~FileSink() {
+    if (fd_ >= 0) close(fd_);
+  }
+  FileSink(const FileSink&) = delete;
+  FileSink& operator=(const FileSink&) = delete;
+
+  bool Open() {
+    fd_ = open(d_.path.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+    if (fd_ < 0) return false;
+    struct stat st;
+    if (fstat(fd_, &st) != 0) return false;
+    if (d_.want_md5) md5_.reset(EVP_MD_CTX_new());
+    if (d_.want_sha256) sha256_.reset(EVP_MD_CTX_new());
+    return ResetDigests() && HashExisting(static_cast<uint64_t>(st.st_size));
+  }
+  // Drops everything received so far (the server ignored the range).
+  bool StartOver() {
+    have_ = 0;
+    return ftruncate(fd_, 0) == 0 && lseek(fd_, 0, SEEK_SET) == 0 && ResetDigests();
+  }
+  bool Write(const char* data, size_t size) {
+    for (size_t done = 0; done < size;) {
+      ssize_t n = ::write(fd_, data + done, size - done);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) return false;
+      done += static_cast<size_t>(n);
+    }
+    Hash(data, size);
+    have_ += size;
+    return true;
+  }
+  uint64_t have() const { return have_; }
+  void Finish() {
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    unsigned size = 0;
+    if (md5_ && EVP_DigestFinal_ex(md5_.get(), digest, &size)) d_.md5_hex = Hex(digest, size);
+    if (sha256_ && EVP_DigestFinal_ex(sha256_.get(), digest, &size))
+      d_.sha256_hex = Hex(digest, size);
+  }
+
+ private:
+  bool ResetDigests() {
+    return (!md5_ || EVP_DigestInit_ex(md5_.get(), EVP_md5(), nullptr)) &&
+           (!sha256_ || EVP_DigestInit_ex(sha256_.get(), EVP_sha256(), nullptr));
+  }
+  void Hash(const char* data, size_t size) {
+    if (md5_) EVP_DigestUpdate(md5_.get(), data, size);
+    if (sha256_) EVP_DigestUpdate(sha256_.get(), data, size);
+  }
+  // Bytes left by an earlier attempt count once the server resumes after them.
+  bool HashExisting(uint64_t size) {
+    char buffer[64 * 1024];
+    while (have_ < size) {
+      ssize_t n = pread(fd_, buffer, sizeof(buffer), static_cast<off_t>(have_));
+      if (n <= 0) return false;
+      Hash(buffer, static_cast<size_t>(n));
+      have_ += static_cast<uint64_t>(n);
+    }
+    return lseek(fd_, 0, SEEK_END) >= 0;
+  }
+
+  HttpDownload& d_;
+  int fd_ = -1;
+  uint64_t have_ = 0;
+  Digest md5_, sha256_;
+};
+
+struct Attempt {
+  HttpDownload* d;
+  FileSink* sink;
+  const HttpLimits* limits;
+  CURL* handle;
+  uint64_t offset;  // what the range asked to start at
+  uint64_t total = 0;
+  bool checked_status = false;
+  bool too_large = false;
+  bool disk_failed = false;
+  bool bad_status = false;
+};
+
+// The first body bytes of an answer: is it the file, and from where?
+bool AcceptAnswer(Attempt* a) {
+  a->checked_status = true;
+  long status = Status(a->handle);
+  a->d->status = status;
+  if (status == 200 && a->offset > 0) return a->sink->StartOver();
+  if (status == 200 || (status == 206 && a->offset > 0)) return true;
+  a->bad_status = true;
+  return false;
+}
+
+size_t DownloadBody(char* data, size_t size, size_t n, void* user) {
+  auto* a = static_cast<Attempt*>(user);
+  size_t bytes = size * n;
+  if (!a->checked_status && !AcceptAnswer(a)) return 0;
+  if (a->limits->max_bytes && a->sink->have() + bytes > a->limits->max_bytes) {
+    a->too_large = true;
+    return 0;
+  }
+  if (!a->sink->Write(data, bytes)) {
+    a->disk_failed = true;
+    return 0;
+  }
+  return bytes;
+}
+
+int DownloadProgress(void* user, curl_off_t total, curl_off_t now, curl_off_t, curl_off_t) {
+  auto* a = static_cast<Attempt*>(user);
+  HttpDownload* d = a->d;
+  if (d->canceled && d->canceled(d->context)) return 1;
+  if (total > 0) a->total = a->offset + static_cast<uint64_t>(total);
+  if (d->progress && a->checked_status) {
+    uint64_t expected = a->limits->max_bytes ? a->limits->max_bytes : a->total;
+    d->progress(d->context, a->sink->have(), expected);
+  }
+  (void)now;
+  return 0;
+}
+
+// Errors after which the same request may succeed if made again.
+bool Retryable(CURLcode rc) {
+  switch (rc) {
+    case CURLE_COULDNT_CONNECT:
+    case CURLE_PARTIAL_FILE:
+    case CURLE_RECV_ERROR:
+    case CURLE_SEND_ERROR:
+    case CURLE_GOT_NOTHING:
+    case CURLE_OPERATION_TIMEDOUT:
+      return true;
+    default:
+      return false;
+  }
+}
+
+// One request for the rest of the file. The curl result code.
+CURLcode RunAttempt(const HttpLimits& limits, HttpDownload& d, FileSink& sink, Attempt& a) {
+  CurlHandle c = NewHandle(d.url, limits);
+  if (!c) return CURLE_FAILED_INIT;
+  CURL* h = c.get();
+  a.handle = h;
+  std::string range = std::to_string(a.offset) + "-";
+  if (a.offset > 0) curl_easy_setopt(h, CURLOPT_RANGE, range.c_str());
+  curl_easy_setopt(h, CURLOPT_WRITEFUNCTION, DownloadBody);
+  curl_easy_setopt(h, CURLOPT_WRITEDATA, &a);
+  curl_easy_setopt(h, CURLOPT_NOPROGRESS, 0L);
+  curl_easy_setopt(h, CURLOPT_XFERINFOFUNCTION, DownloadProgress);
+  curl_easy_setopt(h, CURLOPT_XFERINFODATA, &a);
+  CURLcode rc = curl_easy_perform(h);
+  if (rc == CURLE_OK && !a.checked_status && !AcceptAnswer(&a)) rc = CURLE_WRITE_ERROR;
+  return rc;
+}
+
+using Outcome = HttpDownload::Outcome;
+
+// Sets the outcome of a failed attempt; true when another attempt may help.
+bool Judge(CURLcode rc, const Attempt& a, HttpDownload& d) {
+  if (a.too_large) {
+    d.outcome = Outcome::kTooLarge;
+    d.error =
+        "the server sent more than the announced " + std::to_string(a.limits->max_bytes) + " bytes";
+  } else if (a.disk_failed) {
+    d.outcome = Outcome::kDisk;
+    d.error = std::string("cannot write the file: ") + strerror(errno);
+  } else if (a.bad_status) {
+    d.outcome = Outcome::kHttpStatus;
+    d.error = "the server answered HTTP " + std::to_string(d.status);
+  } else if (rc == CURLE_ABORTED_BY_CALLBACK) {
+    d.outcome = Outcome::kCanceled;
+    d.error = "canceled";
+  } else {
+    d.outcome = Outcome::kNetwork;
+    d.error = curl_easy_strerror(rc);
+    return Retryable(rc);
+  }
+  return false;
+}
+
+bool Download(const HttpLimits& limits, HttpDownload& d) {
+  FileSink sink(d);
+  if (!sink.Open()) {
+    d.outcome = Outcome::kDisk;
+    d.error = std::string("cannot open the file: ") + strerror(errno);
+    return false;
+  }
+  for (int attempt = 0;; ++attempt) {
+    Attempt a{&d, &sink, &limits, nullptr, sink.have()};
+    CURLcode rc = RunAttempt(limits, d, sink, a);
+    d.bytes = sink.have();
+    if (rc == CURLE_OK) {
+      sink.Finish();
+      d.outcome = Outcome::kOk;
+      return true;
+    }
+    if (!Judge(rc, a, d) || attempt >= d.retries) return false;
+    if (d.canceled && d.canceled(d.context)) {
+      d.outcome = Outcome::kCanceled;
+      return false;
+    }
+    usleep(200000 * static_cast<useconds_t>(attempt + 1));
+  }
+}
+
+const PackageServerNetOps kOps = {Fetch, Download};
+
+}  // namespace
+
+extern "C" __attribute__((visibility("default"))) const PackageServerNetOps*
+KivoPackageServerNet() {
+  return &kOps;
+}

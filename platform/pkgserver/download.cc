@@ -1,0 +1,258 @@
+#include "pkgserver/download.h"
+
+#include <algorithm>
+#include <csignal>
+#include <ctime>
+#include <memory>
+#include <syslog.h>
+#include <unistd.h>
+
+#include "klibc/process.h"
+#include "klibc/sysroot.h"
+#include "pkgserver/catalogue.h"
+#include "pkgserver/server_config.h"
+#include "pkgserver/server_net.h"
+#include "pkgtool/package_manager.h"
+#include "pkgtool/pms.h"
+
+#include <strings.h>
+
+#define DOWNLOAD_LOG(fmt, ...) syslog(LOG_ERR, "%s:%d " fmt, "pkgdownload", __LINE__, ##__VA_ARGS__)
+
+namespace KIVOPackageServer {
+
+namespace {
+
+// Set by SIGTERM in a worker (RegisterCancel); nothing else writes it.
+volatile sig_atomic_t g_canceled = 0;
+
+void OnTerm(int) { g_canceled = 1; }
+
+constexpr double kProgressInterval = 0.25;  // seconds between progress writes
+
+double Now() {
+  struct timespec t;
+  clock_gettime(CLOCK_MONOTONIC, &t);
+  return static_cast<double>(t.tv_sec) + t.tv_nsec / 1e9;
+}
+
+// Writes to the task unless it is gone: a cancel removes the task, and a
+// write afterwards would leave stray properties behind.
+bool TaskExists(NVX::Task* task) {
+  NVX::TaskMgr mgr(task->getOwner());
+  return mgr.hasTask(task->getTaskId());
+}
+
+struct ProgressWriter {
+  NVX::Task* task;
+  double last = 0;
+
+  static void Report(void* context, uint64_t have, uint64_t total) {
+    auto* self = static_cast<ProgressWriter*>(context);
+    double now = Now();
+    if (total == 0 || now - self->last < kProgressInterval) return;
+    self->last = now;
+    // 1.0 means "complete and checked"; until then stay below it.
+    double fraction = std::min(0.99, static_cast<double>(have) / static_cast<double>(total));
+    if (TaskExists(self->task)) self->task->setProperty("progress", fraction);
+  }
+  static bool Canceled(void*) { return isCanceled(); }
+};
+
+void Fail(NVX::Task* task, int code, const std::string& message, int result = 0) {
+  if (isCanceled() || !TaskExists(task)) return;
+  Json::Value data = task->getProperty("data");
+  if (!data.isObject()) data = Json::Value(Json::objectValue);
+  data["status"] = "failed";
+  data["installing"] = false;
+  data["error"]["code"] = code;
+  data["error"]["message"] = message;
+  if (result) data["error"]["result"] = result;
+  task->beginUpdate();
+  task->setProperty("data", data);
+  task->setProperty("progress", -1.0);
+  task->endUpdate();
+  task->finish(false);
+}
+
+// One update of "status" and "installing" (and "progress" when given).
+void SetStatus(NVX::Task* task, const char* status, bool installing, double progress = -2.0) {
+  Json::Value data = task->getProperty("data");
+  if (!data.isObject()) data = Json::Value(Json::objectValue);
+  data["status"] = status;
+  data["installing"] = installing;
+  data["pid"] = static_cast<int>(getpid());
+  task->beginUpdate();
+  task->setProperty("data", data);
+  if (progress >= 0) task->setProperty("progress", progress);
+  task->endUpdate();
+}
+
+// The sha256 a catalogue gives for `link`, "" when none does.
+std::string CatalogueSha256(const std::string& name, const std::string& link,
+                            const std::string& language) {
+  for (bool vendor : {true, false}) {
+    Json::Value entry;
+    if (PMSFindServerEntry(name, vendor, language, entry) && entry["link"].isString() &&
+        entry["link"].asString() == link && entry["sha256"].isString()) {
+      return entry["sha256"].asString();
+    }
+  }
+  return "";
+}
+
+bool SameHex(const std::string& a, const std::string& b) {
+  return a.size() == b.size() && strcasecmp(a.c_str(), b.c_str()) == 0;
+}
+
+// The transfer itself; on failure the task says why.
+bool Transfer(NVX::Task* task, const std::string& name, const std::string& link,
+              const std::string& md5, const std::string& sha256, uint64_t size,
+              const std::string& path) {
+  std::string error;
+  const PackageServerNetOps* net = PMSServerNetOps(&error);
+  if (!net) return Fail(task, PMS_DL_ERR_NETWORK, error), false;
+  PkgServerConfig config = PMSLoadServerConfig();
+  ProgressWriter writer{task};
+  HttpDownload d;
+  d.url = link;
+  d.path = path;
+  d.retries = config.download_retries;
+  d.want_md5 = !md5.empty();
+  d.want_sha256 = !sha256.empty();
+  d.progress = ProgressWriter::Report;
+  d.canceled = ProgressWriter::Canceled;
+  d.context = &writer;
+  if (net->download(config.DownloadLimits(size), d)) {
+    if (d.want_md5 && !SameHex(md5, d.md5_hex))
+      return Fail(task, PMS_DL_ERR_CHECKSUM,
+                  "the file's md5 " + d.md5_hex + " differs from the catalogue's " + md5),
+             false;
+    if (d.want_sha256 && !SameHex(sha256, d.sha256_hex))
+      return Fail(task, PMS_DL_ERR_CHECKSUM,
+                  "the file's sha256 " + d.sha256_hex + " differs from the catalogue's " + sha256),
+             false;
+    if (size && d.bytes != size)
+      return Fail(task, d.bytes > size ? PMS_DL_ERR_TOO_LARGE : PMS_DL_ERR_NETWORK,
+                  "the file has " + std::to_string(d.bytes) + " bytes, the catalogue says " +
+                      std::to_string(size)),
+             false;
+    return true;
+  }
+  DOWNLOAD_LOG("%s from %s: %s", name.c_str(), link.c_str(), d.error.c_str());
+  using O = HttpDownload::Outcome;
+  int code = d.outcome == O::kHttpStatus ? PMS_DL_ERR_HTTP
+             : d.outcome == O::kTooLarge ? PMS_DL_ERR_TOO_LARGE
+             : d.outcome == O::kDisk     ? PMS_DL_ERR_DISK
+                                         : PMS_DL_ERR_NETWORK;
+  Fail(task, code, "download of " + link + " failed: " + d.error);
+  return false;
+}
+
+}  // namespace
+
+bool IsInstalling(const std::string& name) {
+  NVX::TaskMgr mgr("@administrators");
+  std::unique_ptr<NVX::Task> task(mgr.getTask("@KIVOPKG_DOWNLOAD_" + name));
+  if (!task || task->isFinished()) return false;
+  Json::Value data = task->getProperty("data");
+  return data.isObject() && data["pid"].isInt() && KLIBCProcAlive(data["pid"].asInt()) == 1;
+}
+
+bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const std::string& link,
+                  const std::string& folder, bool quickInstall, pid_t pid) {
+  if (!task) return false;
+  Json::Value data(Json::objectValue);
+  data["id"] = name;
+  data["name"] = name;
+  data["taskid"] = task->getTaskId();
+  data["pid"] = static_cast<int>(pid);
+  data["link"] = link;
+  data["size"] = static_cast<Json::UInt64>(size);
+  data["tmp_folder"] = folder;
+  data["blqinst"] = quickInstall;
+  data["installing"] = false;
+  data["status"] = "downloading";
+  if (!task->setFinishValue(false)) return false;
+  task->beginUpdate();
+  task->setProperty("progress", 0.0);
+  task->setProperty("data", data);
+  return task->endUpdate();
+}
+
+void RegisterCancel() {
+  g_canceled = 0;
+  struct sigaction action = {};
+  action.sa_handler = OnTerm;
+  sigemptyset(&action.sa_mask);
+  sigaction(SIGTERM, &action, nullptr);
+}
+
+bool isCanceled() { return g_canceled != 0; }
+
+bool DownloadPackage(NVX::Task* task, const std::string& user, const std::string& name,
+                     const std::string& link, const std::string& checksum, bool quickInstall,
+                     const std::string& folder, const std::string& language,
+                     std::string& resultPath) {
+  if (!task) return false;
+  Json::Value data = task->getProperty("data");
+  uint64_t size = data["size"].isUInt64() ? data["size"].asUInt64() : 0;
+  if (link.empty() || !PMSIsServerUrl(link)) {
+    Fail(task, PMS_DL_ERR_REQUEST, "no http or https link for " + name);
+    PMSRemoveDownloadDir(folder);
+    return false;
+  }
+  resultPath = folder + "/" + task->getTaskId();
+  std::string sha256 = CatalogueSha256(name, link, language);
+  if (!Transfer(task, name, link, checksum, sha256, size, resultPath) || isCanceled()) {
+    PMSRemoveDownloadDir(folder);
+    return false;
+  }
+  if (!TaskExists(task)) return false;
+  SetStatus(task, "downloaded", false, 1.0);
+  // A quick install goes on in this task; a plain download is complete.
+  if (!quickInstall) task->finish(true);
+  return true;
+}
+
+bool Install(NVX::Task* task, const std::string& user, const std::string& volume,
+             const std::string& name, const std::string& folder, bool run,
+             const std::string& wizardValues, bool typeFlag, const std::string& language) {
+  if (!task) return false;
+  const std::string path = folder + "/" + task->getTaskId();
+  SetStatus(task, PMSCheckPackage(name) ? "upgrading" : "installing", true);
+  std::string message;
+  PKG_ERRCODE code = PKG_OK;
+  Json::Value details;
+  bool ok = InstallPackageFileImpl(user, path, volume, 0, wizardValues, run, language, message,
+                                   code, details, typeFlag, true);
+  PMSRemoveDownloadDir(folder);
+  if (!ok) {
+    DOWNLOAD_LOG("install of %s failed: %s [%d]", name.c_str(), message.c_str(),
+                 static_cast<int>(code));
+    Fail(task, PMS_DL_ERR_INSTALL, message.empty() ? "the install failed" : message,
+         static_cast<int>(code));
+    return false;
+  }
+  SetStatus(task, "installed", false);
+  task->finish(true);
+  return true;
+}
+
+bool PMSRemoveDownloadDir(const std::string& folder) {
+  // Only "<root>/<volume>/@tmp/download-<name>-XXXXXX" folders, nothing else.
+  size_t slash = folder.rfind('/');
+  if (folder.empty() || folder[0] != '/' || slash == std::string::npos ||
+      folder.find("/../") != std::string::npos || folder.find("/./") != std::string::npos ||
+      folder.compare(slash + 1, 9, "download-") != 0 || slash < 5 ||
+      folder.compare(slash - 5, 5, "/@tmp") != 0 || folder.find('\0') != std::string::npos) {
+    DOWNLOAD_LOG("refusing to remove %s: not a download folder", folder.c_str());
+    return false;
+  }
+  const std::string root = KIVOSysRoot();
+  if (!root.empty() && folder.compare(0, root.size() + 1, root + "/") != 0) return false;
+  if (access(folder.c_str(), F_OK) != 0) return true;
+  return KLIBCExec("/bin/rm", "-rf", folder.c_str(), nullptr, nullptr) == 0;
+}
+
+}  // namespace KIVOPackageServer
