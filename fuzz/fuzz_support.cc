@@ -35,6 +35,14 @@ namespace {
 
 int RemoveOne(const char* path, const struct stat*, int, struct FTW*) { return remove(path); }
 
+// nftw passes no user data, and FuzzCountFiles is the only caller.
+thread_local int files_seen = 0;
+
+int CountOne(const char*, const struct stat*, int type, struct FTW*) {
+  if (type != FTW_D && type != FTW_DP && type != FTW_DNR) ++files_seen;
+  return 0;
+}
+
 // The scratch folders this process made, removed at a normal exit. Only
 // written while a target initialises, before libFuzzer runs any input.
 std::vector<std::string>& ScratchFolders() {
@@ -76,4 +84,10 @@ std::string FuzzListFolder(const std::string& dir) {
   std::string list;
   for (const std::string& name : names) list += (list.empty() ? "" : " ") + name;
   return list;
+}
+
+int FuzzCountFiles(const std::string& dir) {
+  files_seen = 0;
+  nftw(dir.c_str(), CountOne, 16, FTW_PHYS);
+  return files_seen;
 }

@@ -27,3 +27,6 @@ bool FuzzRemoveTree(const std::string& path);
 
 // The names in folder `dir` ("." and ".." left out), sorted.
 std::string FuzzListFolder(const std::string& dir);
+
+// How many files (anything but folders) the tree at `dir` holds.
+int FuzzCountFiles(const std::string& dir);

@@ -47,12 +47,14 @@ for target in "${TARGETS[@]}"; do
   for dir in "$PWD"/fuzz/seeds/"$target" "$BUILD/fuzz/seeds/$target"; do
     [ -d "$dir" ] && seeds+=("$dir")
   done
+  dict=()
+  [ -f "$PWD/fuzz/$target.dict" ] && dict=(-dict="$PWD/fuzz/$target.dict")
   echo "== $target: fuzzing for ${SECONDS_EACH}s"
   # Run from the build's fuzz folder: with -jobs, libFuzzer writes a log per
   # job into the current folder.
   # shellcheck disable=SC2086 # FUZZ_FLAGS is a list of flags
   if ! (cd "$BUILD/fuzz" && "$program" -max_total_time="$SECONDS_EACH" -timeout=10 \
-    -rss_limit_mb=2048 -print_final_stats=1 -artifact_prefix="$crashes/" ${FUZZ_FLAGS:-} \
+    -rss_limit_mb=2048 -print_final_stats=1 -artifact_prefix="$crashes/" "${dict[@]}" ${FUZZ_FLAGS:-} \
     "$corpus" "${seeds[@]}" >"$BUILD/fuzz/$target.log" 2>&1); then
     tail -n 60 "$BUILD/fuzz/$target.log" >&2
     failed+=("$target")
