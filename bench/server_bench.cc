@@ -1,0 +1,192 @@
+// Package server figures:
+//  1. "Server" "list" through lighttpd for catalogues of 500 and 2,000
+//     entries merged with 300 installed packages, from the cache and with
+//     "blforcereload" (p50, p99, and the cost per entry);
+//  2. the download of a 1 GiB package from a loopback lighttpd by the
+//     download worker (md5 and sha256 checked) against `curl -o` of the same
+//     file, and the worker's peak memory for 64 MiB and 1 GiB.
+//
+//   server_bench [requests per case] [download MiB]   (default 20, 1024)
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <memory>
+#include <string>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <vector>
+
+#include "klibc/atomic_file.h"
+#include "pkgserver/download.h"
+#include "pkgtool/package_manager.h"
+#include "pkgtool/pms.h"
+#include "taskmgr/task.h"
+#include "testing/cgi_client.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+#include "testing/web_server.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+double Ms(Clock::time_point since) {
+  return std::chrono::duration<double, std::milli>(Clock::now() - since).count();
+}
+
+void InstallMany(const std::string& dir, int count) {
+  for (int i = 0; i < count; ++i) {
+    TestPackage p;
+    p.id = "bench-" + std::to_string(i);
+    p.daemon = false;
+    p.info = {{"adminport", "18000"}, {"checkport", "no"}};
+    std::string file = p.Build(dir), message;
+    PKG_ERRCODE code;
+    Json::Value details;
+    if (!InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true,
+                                false)) {
+      fprintf(stderr, "install of %s failed: %s\n", p.id.c_str(), message.c_str());
+      exit(1);
+    }
+    unlink(file.c_str());
+  }
+}
+
+// A catalogue of `entries` packages; the first ones are the installed
+// bench-N at a newer version.
+std::string Catalogue(int entries) {
+  std::string out = "{\"packages\": [";
+  for (int i = 0; i < entries; ++i) {
+    std::string id = "bench-" + std::to_string(i);
+    out += std::string(i ? "," : "") + "{\"package\": \"" + id +
+           "\", \"version\": \"2.0\", \"dname\": \"Bench " + std::to_string(i) +
+           "\", \"desc\": \"A package of the benchmark catalogue with a description of "
+           "ordinary length.\", \"link\": \"http://127.0.0.1/feed/" +
+           id +
+           ".kpk\", \"md5\": \"0123456789abcdef0123456789abcdef\", \"size\": 123456, "
+           "\"deppkgs\": \"bench-0>=1.0\", \"conflictpkgs\": \"\", \"beta\": false}";
+  }
+  return out + "], \"recommend\": [\"bench-1\", \"bench-2\"], \"keyrings\": []}";
+}
+
+struct Percentiles {
+  double p50, p99;
+};
+
+Percentiles Time(int port, const std::string& target, const std::string& headers, int n) {
+  LoopbackGet(port, target, headers);  // warm-up (and the first fetch)
+  std::vector<double> ms;
+  for (int r = 0; r < n; ++r) {
+    Clock::time_point t = Clock::now();
+    LoopbackGet(port, target, headers);
+    ms.push_back(Ms(t));
+  }
+  std::sort(ms.begin(), ms.end());
+  return {ms[ms.size() / 2], ms[std::min(ms.size() - 1, ms.size() * 99 / 100)]};
+}
+
+void ListFigures(int requests) {
+  TempRoot root;
+  root.AddAccount("admin", "secret", {"administrators"});
+  KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+  std::string dir = root.Path("/tmp/src");
+  KIVOFSMkdirP(dir.c_str());
+  InstallMany(dir, 300);
+  ApiClient admin("admin", "secret");
+  WebServer server(root.dir());
+  const std::string headers =
+      "Cookie: id=" + admin.sid() + "\r\nX-KIVO-Token: " + admin.token() + "\r\n";
+  const std::string target = "/webapi/entry.cgi?api=KIVO.Core.Package.Server&version=1&method=list";
+  printf("Server list, 300 installed packages, through lighttpd\n");
+  printf("%8s %14s %14s %14s %14s %16s\n", "entries", "cached p50", "cached p99", "reload p50",
+         "reload p99", "cached ms/entry");
+  for (int entries : {500, 2000}) {
+    root.Write("/usr/kivo/www/feed/catalogue.json", Catalogue(entries));
+    root.Write("/etc/kivo/pkgserver.conf",
+               "vendor_url=\"http://127.0.0.1:" + std::to_string(server.port()) +
+                   "/feed/catalogue.json\"\n"
+                   "catalogue_max_age=\"3600\"\n");
+    Percentiles reload = Time(server.port(), target + "&blforcereload=true", headers, requests);
+    Percentiles cached = Time(server.port(), target, headers, requests);
+    printf("%8d %11.1f ms %11.1f ms %11.1f ms %11.1f ms %16.4f\n", entries, cached.p50, cached.p99,
+           reload.p50, reload.p99, cached.p50 / entries);
+    fflush(stdout);
+  }
+}
+
+std::string Digest(const char* tool, const std::string& path) {
+  std::string out;
+  RunProgram({tool, path}, &out);
+  return out.substr(0, out.find(' '));
+}
+
+// Runs one download in a child (as the worker does) and reports its time
+// and peak memory.
+void WorkerDownload(const std::string& url, const std::string& md5, const char* label) {
+  int fds[2];
+  if (pipe(fds) != 0) return;
+  Clock::time_point t = Clock::now();
+  pid_t pid = fork();
+  if (pid == 0) {
+    std::string folder;
+    std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", "@KIVOPKG_DOWNLOAD_bigpkg"));
+    bool ok =
+        PMSCreateDownloadTmpDir("", "bigpkg", 0, folder) &&
+        KIVOPackageServer::InitDownload(task.get(), "bigpkg", 0, url, folder, false, getpid());
+    std::string path;
+    ok = ok && KIVOPackageServer::DownloadPackage(task.get(), "root", "bigpkg", url, md5, false,
+                                                  folder, "enu", path);
+    if (!ok)
+      fprintf(stderr, "download failed: %s\n", task->getProperty("data").toStyledString().c_str());
+    KIVOPackageServer::PMSRemoveDownloadDir(folder);
+    _exit(ok ? 0 : 1);
+  }
+  int status = 0;
+  struct rusage usage;
+  wait4(pid, &status, 0, &usage);
+  double ms = Ms(t);
+  printf("%-28s %9.0f ms  peak memory %6.1f MiB%s\n", label, ms, usage.ru_maxrss / 1024.0,
+         WIFEXITED(status) && WEXITSTATUS(status) == 0 ? "" : "  (FAILED)");
+  close(fds[0]);
+  close(fds[1]);
+}
+
+void DownloadFigures(int mib) {
+  TempRoot root;
+  WebServer server(root.dir());
+  const std::string feed = root.Path("/usr/kivo/www/feed");
+  KIVOFSMkdirP(feed.c_str());
+  const std::string big = feed + "/bigpkg.kpk", small = feed + "/smallpkg.kpk";
+  RunProgram({"sh", "-c",
+              "head -c " + std::to_string(mib) + "M /dev/urandom > " + big + " && head -c 64M " +
+                  big + " > " + small},
+             nullptr);
+  const std::string base = "http://127.0.0.1:" + std::to_string(server.port()) + "/feed/";
+  const std::string md5 = Digest("md5sum", big), sha256 = Digest("sha256sum", big);
+  root.Write("/usr/kivo/www/feed/catalogue.json",
+             "[{\"package\": \"bigpkg\", \"version\": \"1.0\", \"link\": \"" + base +
+                 "bigpkg.kpk\", \"md5\": \"" + md5 + "\", \"sha256\": \"" + sha256 + "\"}]");
+  root.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + base + "catalogue.json\"\n");
+  printf("\nDownload of %d MiB from lighttpd on loopback\n", mib);
+  RunProgram({"cat", big}, nullptr);  // the file in the page cache for both
+  Clock::time_point t = Clock::now();
+  RunProgram({"curl", "-s", "-o", root.Path("/volume1/curl.out"), base + "bigpkg.kpk"}, nullptr);
+  double curl_ms = Ms(t);
+  unlink(root.Path("/volume1/curl.out").c_str());
+  printf("%-28s %9.0f ms\n", "curl -o", curl_ms);
+  WorkerDownload(base + "bigpkg.kpk", md5, "worker (md5 + sha256)");
+  WorkerDownload(base + "smallpkg.kpk", "", "worker, 64 MiB, no digest");
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  int requests = argc > 1 ? std::max(1, atoi(argv[1])) : 20;
+  int mib = argc > 2 ? std::max(64, atoi(argv[2])) : 1024;
+  UseBuildDirOfThisProgram();
+  ListFigures(requests);
+  DownloadFigures(mib);
+  return 0;
+}
