@@ -1,19 +1,27 @@
-// The status of a running install or download.
+// Downloads from a package server: the download task and its worker, the
+// check of a downloaded file, and the status of a running install or
+// download.
 
+#include "pkgserver/download.h"
+
+#include <cstdlib>
+#include <fcntl.h>
 #include <memory>
 #include <unistd.h>
 
+#include "error_codes.h"
+#include "klibc/last_error.h"
 #include "klibc/process.h"
+#include "log_line.h"
 #include "package_webapi.h"
+#include "pkgserver/server_record.h"
 #include "pkgtool/pms.h"
+#include "pkgtool/registry.h"
 #include "task_record.h"
 
 namespace KIVO_PACKAGE {
 
-namespace {
-
-// A download's progress of exactly 1.0 counts only once its file is there.
-double DownloadProgress(NVX::Task& task, const Json::Value& data) {
+double PackageWebAPI::DownloadTaskProgress(NVX::Task& task, const Json::Value& data) {
   double progress = task.getDoubleProperty("progress", 0.0);
   if (progress == 1.0) {
     std::string file = data["tmp_folder"].asString() + "/" + task.getTaskId();
@@ -21,8 +29,6 @@ double DownloadProgress(NVX::Task& task, const Json::Value& data) {
   }
   return progress < 0 ? 0.0 : progress;
 }
-
-}  // namespace
 
 void PackageWebAPI::ReadProgress() {
   NVX::TaskMgr mgr(kTaskOwner);
@@ -45,7 +51,7 @@ void PackageWebAPI::ReadProgress() {
     double progress = data.isMember("id") ? PMSGetProgress(data["id"].asString()) : -1.0;
     if (progress != -1.0) data["progress"] = progress;
   } else {
-    data["progress"] = DownloadProgress(*task, data);
+    data["progress"] = DownloadTaskProgress(*task, data);
   }
   if (data["blqinst"].isBool() && data["blqinst"].asBool()) {
     bool gone =
@@ -62,6 +68,215 @@ void PackageWebAPI::ReadProgress() {
     }
   }
   response->SetSuccess(data);
+}
+
+namespace {
+
+// The platform's last-error number for a worker that could not be forked.
+constexpr int kForkFailed = 0x9700;
+
+// A flag parameter: true, "true" or a nonzero number; `def` when absent.
+bool FlagParamOr(APIRequest* request, const char* name, bool def) {
+  if (!request->HasParam(name)) return def;
+  Json::Value v = request->GetParam(name, def);
+  if (v.isBool()) return v.asBool();
+  if (v.isIntegral()) return v.asInt64() != 0;
+  return v.isString() && (v.asString() == "true" || v.asString() == "1");
+}
+
+// A size parameter sent as a number or as decimal text; 0 when it is neither.
+uint64_t SizeParam(const Json::Value& v) {
+  if (v.isUInt64()) return v.asUInt64();
+  if (!v.isString()) return 0;
+  long long size = std::strtoll(v.asString().c_str(), nullptr, 10);
+  return size > 0 ? static_cast<uint64_t>(size) : 0;
+}
+
+// The API error for the platform's last error after a failed download start.
+int DownloadStartError(int last_error) {
+  switch (last_error) {
+    case KLIBC_ERR_NO_SPACE:
+      return kErrNoSpace;
+    case KLIBC_ERR_LOCK:
+      return kErrBusy;
+    case KLIBC_ERR_VOLUME_CRASHED:
+    case KLIBC_ERR_VOLUME_NOT_FOUND:
+      return kErrNoVolume;
+    case KLIBC_ERR_NO_TMP_DIR:
+      return kErrNoTmpDir;
+    default:
+      return kErrFailed;
+  }
+}
+
+// A worker that outlives the request lets go of the request's pipes, or the
+// web server would keep the request open until the download ends.
+void DetachFromRequest() {
+  int null = open("/dev/null", O_RDWR | O_CLOEXEC);
+  for (int fd = 0; fd < 3; ++fd) dup2(null, fd);
+  if (null > 2) close(null);
+}
+
+}  // namespace
+
+bool PackageWebAPI::DeterminePackageInfo(DownloadRequest& d) const {
+  d.name = request->GetParam("name", "").asString();
+  d.quick_install = FlagParamOr(request, "blqinst", false);
+  d.install_and_run = FlagParamOr(request, "installrunpackage", false);
+  d.volume = request->GetParam("volume_path", "").asString();
+  d.wizard_values = request->GetParam("customuivalues", "").asString();
+  if (!PMSIsValidPackageId(d.name)) {
+    Json::Value details(Json::objectValue);
+    details["name"] = "name";
+    details["reason"] = "not a package id";
+    response->SetError(kErrBadParameter, details);
+    return false;
+  }
+  if (request->HasParam("url")) {
+    d.link = request->GetParam("url", "").asString();
+    d.checksum = request->GetParam("checksum", "").asString();
+    d.size = SizeParam(request->GetParam("filesize", "0"));
+    d.type_flag = request->GetParam("type", 0).isIntegral() && request->GetParam("type", 0).asInt();
+    return true;
+  }
+  PackageInfo installed;
+  PackageManager manager;
+  if (manager.getInstallPackageInfo(d.name, installed) &&
+      (manager.getPkgRoughStatus(d.name) & 4) != 0 &&
+      PMSThirdPartyCheckLimit(d.name, installed.getVersion()) == 0 &&
+      KIVOPackageServer::PMSGetPkgFromServer(request->GetUILanguage(), installed)) {
+    d.link = installed.get("link");
+    d.checksum = installed.get("checksum");
+    d.size = SizeParam(Json::Value(installed.get("size")));
+    d.type_flag = std::atoi(installed.get("type").c_str()) != 0;
+    return true;
+  }
+  Json::Value record;
+  if (!KIVOPackageServer::GetPackageInfoFromServer(
+          d.name, record, FlagParamOr(request, "is_kivo", true), request->GetUILanguage())) {
+    PKG_LOG_ERR("Failed to get package info for '%s' from server", d.name.c_str());
+    response->SetError(kErrFailed, Json::Value());
+    return false;
+  }
+  d.link = record["link"].isString() ? record["link"].asString() : "";
+  d.checksum = record["md5"].isString() ? record["md5"].asString() : "";
+  d.size = record["size"].isUInt64() ? record["size"].asUInt64() : 0;
+  d.type_flag = record["type"].isInt() && record["type"].asInt() != 0;
+  return true;
+}
+
+pid_t PackageWebAPI::ForkProcess(NVX::Task* task, Json::Value& result, const std::string& name,
+                                 uint64_t size, const std::string& link, const std::string& folder,
+                                 bool quickInstall) {
+  if (name.empty() || !task || link.empty() || folder.empty()) return -1;
+  pid_t pid = KLIBCProcFork();
+  if (pid < 0) {
+    task->remove();
+    KLIBCErrSetEx(kForkFailed, __FILE__, __LINE__);
+    return -1;
+  }
+  if (pid == 0) {
+    DetachFromRequest();
+    KIVOPackageServer::RegisterCancel();
+    task->waitForDataReady("data", 60);
+    return 0;
+  }
+  if (KIVOPackageServer::InitDownload(task, name, size, link, folder, quickInstall, pid)) {
+    result["taskid"] = task->getTaskId();
+    result["progress"] = "0.00001";  // a string, as clients have always received it
+  }
+  return pid;
+}
+
+bool PackageWebAPI::DownloadAndInstallPackage(const DownloadRequest& d, Json::Value& result) {
+  NVX::TaskMgr mgr(kTaskOwner);
+  const std::string task_id = kDownloadPrefix + d.name;
+  if (KIVOPackageServer::IsInstalling(d.name) && mgr.hasTask(task_id)) {
+    std::unique_ptr<NVX::Task> running(GetTaskWithTaskMgr(mgr, task_id));
+    Json::Value data = running ? running->getProperty("data") : Json::Value();
+    if (running && !data.isNull()) {
+      result["data"] = data;
+      result["progress"] = running->getDoubleProperty("progress", 0);
+      return true;
+    }
+    if (running) running->remove();
+  }
+  std::string folder;
+  if (!PMSCreateDownloadTmpDir(d.volume, d.name, static_cast<int64_t>(d.size), folder))
+    return false;
+  std::unique_ptr<NVX::Task> task(GetNewTask(kTaskOwner, task_id.c_str()));
+  if (!task) {
+    PKG_LOG_ERR("Failed to create task with task id '%s'", task_id.c_str());
+    KIVOPackageServer::PMSRemoveDownloadDir(folder);
+    return false;
+  }
+  pid_t pid = ForkProcess(task.get(), result, d.name, d.size, d.link, folder, d.quick_install);
+  if (pid < 0) {
+    KIVOPackageServer::PMSRemoveDownloadDir(folder);
+    return false;
+  }
+  if (pid > 0) return true;
+  // The worker: it never answers the request.
+  setsid();
+  std::string path;
+  const std::string user = request->GetLoginUserName(), language = request->GetUILanguage();
+  bool ok = KIVOPackageServer::DownloadPackage(task.get(), user, d.name, d.link, d.checksum,
+                                               d.quick_install, folder, language, path);
+  if (ok && !KIVOPackageServer::isCanceled() && d.quick_install) {
+    (void)KIVOPackageServer::Install(task.get(), user, d.volume, d.name, folder, d.install_and_run,
+                                     d.wizard_values, d.type_flag, language);
+  }
+  task.reset();
+  _exit(0);
+}
+
+void PackageWebAPI::Download() {
+  DownloadRequest d;
+  if (!DeterminePackageInfo(d)) return;
+  Json::Value result(Json::objectValue);
+  KLIBCErrClear();
+  if (DownloadAndInstallPackage(d, result)) {
+    response->SetSuccess(result);
+    return;
+  }
+  response->SetError(DownloadStartError(KLIBCErrGet()), Json::Value());
+}
+
+void PackageWebAPI::CheckDownloadPkgInfo() {
+  NVX::TaskMgr mgr(kTaskOwner);
+  std::unique_ptr<NVX::Task> task(
+      GetTaskWithTaskMgr(mgr, request->GetParam("taskid", Json::Value()).asString()));
+  if (!task) {
+    response->SetError(kErrFailed, Json::Value());
+    return;
+  }
+  Json::Value data = task->getProperty("data");
+  if (data.isNull()) {
+    response->SetError(kErrFailed, Json::Value());
+    return;
+  }
+  const std::string path = (data["tmp_folder"].isString() ? data["tmp_folder"].asString() : "") +
+                           "/" + task->getTaskId();
+  PackageInfo info;
+  Json::Value result(Json::objectValue);
+  bool ok = false;
+  if (access(path.c_str(), F_OK) != 0) {
+    response->SetError(kErrFailed, Json::Value());
+  } else if (!pkgMgr.queryPackageFileInfoWithWizard(path, info, PKG_OP_NONE,
+                                                    request->GetUILanguage().c_str())) {
+    response->SetError(kErrNotPackageFile, Json::Value());
+  } else {
+    ok = CheckPackageFileInfo(path.c_str(), info, false, result);
+  }
+  if (!ok) {
+    // A download that cannot be installed is of no use: it goes, with its task.
+    if (data["tmp_folder"].isString())
+      KIVOPackageServer::PMSRemoveDownloadDir(data["tmp_folder"].asString());
+    task->remove();
+    return;
+  }
+  DumpPkgInfo(path, info, result);
+  response->SetSuccess(result);
 }
 
 }  // namespace KIVO_PACKAGE

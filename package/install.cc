@@ -199,7 +199,7 @@ void PackageWebAPI::Install() {
   std::string path = request->GetParam("path", "").asString();
   NVX::TaskMgr mgr(kTaskOwner);
   if (request->HasParam("name")) {
-    AnswerNotAvailable("Install from a package server");
+    Download();
     return;
   }
   std::unique_ptr<NVX::Task> upload;

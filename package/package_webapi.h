@@ -8,6 +8,7 @@
 #include <map>
 
 #include "pkgtool/package_manager.h"
+#include "taskmgr/task.h"
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
 
@@ -100,6 +101,24 @@ class PackageWebAPI {
                             Json::Value& result);
   bool CheckEnvDependents(PackageManager& manager, const std::string& id, Json::Value& result);
   bool DeleteTmpFile(const char* path);
+
+  // Download and install from a package server (download.cc), and the
+  // catalogue (server.cc).
+  struct DownloadRequest {
+    std::string name, link, checksum, volume, wizard_values;
+    uint64_t size = 0;
+    bool quick_install = false, install_and_run = false, type_flag = false;
+  };
+  void Download();
+  bool DeterminePackageInfo(DownloadRequest& d) const;
+  bool DownloadAndInstallPackage(const DownloadRequest& d, Json::Value& result);
+  pid_t ForkProcess(NVX::Task* task, Json::Value& result, const std::string& name, uint64_t size,
+                    const std::string& link, const std::string& folder, bool quickInstall);
+  // The progress a download task reports: 1.0 only once its file is there,
+  // never below 0.
+  static double DownloadTaskProgress(NVX::Task& task, const Json::Value& data);
+  bool AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, Json::Value& entry);
+  void AnnotateDownload(NVX::TaskMgr& mgr, Json::Value& entry);
 
   // Start and stop (control.cc).
   void StartStop(bool start);

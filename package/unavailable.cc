@@ -19,9 +19,6 @@ void PackageWebAPI::AnswerNotAvailable(const char* member) {
 #define KIVO_NOT_AVAILABLE(name) \
   void PackageWebAPI::name() { AnswerNotAvailable(#name); }
 
-KIVO_NOT_AVAILABLE(CheckDownloadPkgInfo)
-KIVO_NOT_AVAILABLE(ListServerPackage)
-KIVO_NOT_AVAILABLE(CheckUpdate)
 KIVO_NOT_AVAILABLE(LoadFeedList)
 KIVO_NOT_AVAILABLE(EditFeedList)
 KIVO_NOT_AVAILABLE(AddFeedList)

@@ -1,0 +1,208 @@
+// The package servers' catalogue through the real host, against catalogues
+// that kivoctl index built and a loopback server serves: merged with the
+// installed state, array and object forms, feeds, malformed and misbehaving
+// servers, caching with conditional requests, and the update badge.
+
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include "klibc/atomic_file.h"
+#include "pkgtool/registry.h"
+#include "taskmgr/task.h"
+#include "testing/catalogue_feed.h"
+#include "testing/cgi_client.h"
+#include "testing/http_test_server.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+#include "testing/web_server.h"
+
+namespace {
+
+constexpr char kServer[] = "KIVO.Core.Package.Server";
+
+class ServerCatalogueTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_.AddAccount("admin", "secret", {"administrators"});
+    root_.Write("/etc/kivoinfo.conf",
+                "pkg_source_trust_level=\"1\"\n"
+                "package_update_channel=\"beta\"\n");
+    Configure(feed_.Url());
+  }
+  void TearDown() override {
+    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
+  }
+  void Configure(const std::string& vendor, const std::string& more = "") {
+    root_.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + vendor +
+                                                "\"\nconnect_timeout=\"2\"\n"
+                                                "catalogue_timeout=\"2\"\n"
+                                                "catalogue_max_bytes=\"1048576\"\n" +
+                                                more);
+  }
+  const ApiClient& client() {
+    if (!client_) client_.reset(new ApiClient("admin", "secret"));
+    return *client_;
+  }
+  CgiAnswer List(const Params& params = {}) { return client().Call(kServer, "list", 1, params); }
+  // The listed entry of `id`.
+  static Json::Value Find(const CgiAnswer& a, const std::string& id) {
+    for (const Json::Value& e : a.Data()["data"]) {
+      if (e["id"].asString() == id) return e;
+    }
+    return Json::Value();
+  }
+
+  TempRoot root_;
+  HttpTestServer server_;
+  CatalogueFeed feed_{server_, root_.Path("/feed"), "/feed"};
+  std::unique_ptr<ApiClient> client_;
+};
+
+TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations) {
+  TestPackage a;
+  a.id = "app-a";
+  a.info = {{"adminport", "8123"}, {"adminurl", "ui"}, {"adminprotocol", "https"}};
+  TestPackage installed_a = a;
+  ASSERT_EQ(0, Kivoctl({"install", installed_a.Build(root_.Path("/tmp")), "--run"}));
+  a.version = "2.0";
+  feed_.Add(a);
+  TestPackage b;
+  b.id = "app-b";
+  b.info = {{"install_dep_packages", "app-a>=1.0"}, {"beta", "yes"}};
+  feed_.Add(b);
+  TestPackage c;
+  c.id = "app-c";
+  feed_.Add(c);
+  ASSERT_TRUE(feed_.Index());
+  feed_.catalogue()["packages"].append("not an entry");
+  feed_.catalogue()["packages"].append(Json::Value(Json::objectValue));
+  feed_.catalogue()["recommend"] = Json::Value(Json::arrayValue);
+  for (const char* id : {"app-b", "gone", "app-a"}) feed_.catalogue()["recommend"].append(id);
+  feed_.Publish();
+  root_.Write("/usr/kivo/etc/packages/restricted", "app-c 1.0\n");
+  // A finished download of app-b whose file has gone meanwhile.
+  std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", "@KIVOPKG_DOWNLOAD_app-b"));
+  Json::Value data(Json::objectValue);
+  data["tmp_folder"] = root_.Path("/volume1/@tmp/download-app-b-gone");
+  data["pid"] = 0;
+  task->setProperty("data", data);
+  task->setProperty("progress", 1.0);
+
+  CgiAnswer list = List();
+  ASSERT_TRUE(list.Success()) << list.body;
+  EXPECT_EQ(2u, list.Data()["total"].asUInt());
+  EXPECT_TRUE(list.Data()["blupgrade"].asBool());
+  Json::Value ea = Find(list, "app-a"), eb = Find(list, "app-b");
+  EXPECT_TRUE(ea["blupgrade"].asBool());
+  EXPECT_EQ("kivo", ea["source"].asString());
+  EXPECT_EQ("running", ea["status"].asString());
+  ASSERT_EQ(1u, ea["url"].size()) << ea.toStyledString();
+  EXPECT_EQ("https://nas.example:8123/ui", ea["url"][0].asString());
+  EXPECT_FALSE(eb["blupgrade"].asBool());
+  EXPECT_FALSE(eb.isMember("status"));
+  EXPECT_TRUE(eb["beta"].asBool());
+  EXPECT_TRUE(eb["deppkgs"].isMember("app-a")) << eb["deppkgs"].toStyledString();
+  EXPECT_EQ(0.0, eb["progress"].asDouble());  // 1.0 without its file
+  EXPECT_TRUE(eb["info"].isObject());
+  const Json::Value& rec = list.Data()["recommend"];
+  ASSERT_EQ(2u, rec.size());
+  EXPECT_EQ("app-b", rec[0]["id"].asString());
+  EXPECT_EQ("app-a", rec[1]["id"].asString());
+  // What the appliance is travels with the request.
+  std::string query = server_.LastQuery("/feed/catalogue.json");
+  EXPECT_NE(std::string::npos, query.find("language=")) << query;
+  EXPECT_NE(std::string::npos, query.find("channel=beta")) << query;
+
+  // The same version installed: no upgrade anywhere.
+  feed_.Entry("app-a")["version"] = "1.0";
+  feed_.Publish();
+  list = List({{"blforcereload", "true"}});
+  EXPECT_FALSE(Find(list, "app-a")["blupgrade"].asBool());
+  EXPECT_FALSE(list.Data()["blupgrade"].asBool());
+
+  EXPECT_TRUE(client().Call(kServer, "check", 1).Success());
+  std::string badge;
+  ASSERT_TRUE(KIVOReadFile(root_.Path("/var/cache/kivo/pkgserver/upgrade_badge.json"), &badge));
+  EXPECT_NE(std::string::npos, badge.find("\"count\" : 0")) << badge;
+}
+
+TEST_F(ServerCatalogueTest, FeedsMergeArrayAndObjectFormsWithoutRecommendations) {
+  TestPackage a;
+  a.id = "feed-a";
+  feed_.Add(a);
+  ASSERT_TRUE(feed_.Index());
+  feed_.Publish();
+  HttpRoute array;
+  array.body = "[{\"package\": \"feed-b\", \"version\": \"1.0\", \"link\": \"" +
+               server_.Url("/b.kpk") + "\"}]";
+  server_.Set("/array.json", array);
+  root_.Write("/usr/kivo/etc/packages/feeds",
+              "[{\"feed\": \"" + feed_.Url() + "\", \"name\": \"one\"}, {\"feed\": \"" +
+                  server_.Url("/array.json") + "\"}, {\"feed\": \"" + server_.Url("/missing.json") +
+                  "\"}]");
+  CgiAnswer list = List({{"blloadothers", "true"}});
+  ASSERT_TRUE(list.Success()) << list.body;
+  EXPECT_EQ(2u, list.Data()["total"].asUInt());
+  EXPECT_EQ("others", Find(list, "feed-b")["source"].asString());
+  EXPECT_FALSE(list.Data().isMember("recommend"));
+}
+
+TEST_F(ServerCatalogueTest, MalformedOrMisbehavingServersGiveNoResult) {
+  const std::pair<std::string, int> kAnswers[] = {
+      {"this is not json", 200},    {"{\"packages\": []}", 200},  // no "recommend"
+      {"{\"recommend\": []}", 200},                               // no "packages"
+      {"\"a string\"", 200},        {"{\"packages\": [], \"recommend\": []}", 404},
+  };
+  for (const auto& [body, status] : kAnswers) {
+    feed_.PublishRaw(body, status);
+    CgiAnswer list = List({{"blforcereload", "true"}});
+    EXPECT_FALSE(list.Success()) << body << " -> " << list.body;
+  }
+  HttpRoute endless;
+  endless.endless = true;
+  server_.Set("/endless.json", endless);
+  HttpRoute slow;
+  slow.delay_ms = 3000;
+  slow.body = "[]";
+  server_.Set("/slow.json", slow);
+  for (const char* path : {"/endless.json", "/slow.json"}) {
+    Configure(server_.Url(path));
+    EXPECT_FALSE(List().Success()) << path;
+  }
+  Configure("http://127.0.0.1:" + std::to_string(FreeLoopbackPort()) + "/down.json");
+  EXPECT_FALSE(List().Success());
+  Configure("file:///etc/passwd");
+  EXPECT_FALSE(List().Success());
+  // A redirect to another protocol is not followed.
+  HttpRoute redirect;
+  redirect.status = 302;
+  redirect.location = "file:///etc/passwd";
+  server_.Set("/redirect.json", redirect);
+  Configure(server_.Url("/redirect.json"));
+  EXPECT_FALSE(List().Success());
+}
+
+TEST_F(ServerCatalogueTest, CachedCatalogueIsRevalidatedWithConditionalRequests) {
+  TestPackage a;
+  a.id = "cached-a";
+  feed_.Add(a);
+  ASSERT_TRUE(feed_.Index());
+  feed_.Publish("\"v1\"");
+  Configure(feed_.Url(), "catalogue_max_age=\"1\"\n");
+  const std::string path = "/feed/catalogue.json";
+  ASSERT_TRUE(List().Success());
+  ASSERT_TRUE(List().Success());
+  EXPECT_EQ(1, server_.Requests(path));  // the second came from the cache
+  sleep(1);
+  CgiAnswer revalidated = List();
+  ASSERT_TRUE(revalidated.Success()) << revalidated.body;
+  EXPECT_EQ(2, server_.Requests(path));
+  EXPECT_NE(std::string::npos, server_.LastHeaders(path).find("If-None-Match: \"v1\""));
+  EXPECT_EQ(1u, revalidated.Data()["total"].asUInt());  // from the 304
+  ASSERT_TRUE(List({{"blforcereload", "true"}}).Success());
+  EXPECT_EQ(3, server_.Requests(path));
+  EXPECT_EQ(std::string::npos, server_.LastHeaders(path).find("If-None-Match"));
+}
+
+}  // namespace

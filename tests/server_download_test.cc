@@ -1,0 +1,267 @@
+// Downloading and installing from a package server through the real host:
+// a worker process per download, progress polled through "status", the
+// quick install, a second request while one runs, cancel, checksums, a
+// server that drops the connection or sends too much, and the download
+// check.
+
+#include <dirent.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include "klibc/process.h"
+#include "pkgtool/registry.h"
+#include "taskmgr/task.h"
+#include "testing/catalogue_feed.h"
+#include "testing/cgi_client.h"
+#include "testing/http_test_server.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+
+namespace {
+
+constexpr char kInst[] = "KIVO.Core.Package.Installation";
+constexpr char kTask[] = "@KIVOPKG_DOWNLOAD_dl-app";
+
+// Bytes that do not compress, so the package file is as large as its payload.
+std::string Noise(size_t size) {
+  std::string out(size, '\0');
+  uint32_t x = 2463534242u;
+  for (char& c : out) {
+    x ^= x << 13, x ^= x >> 17, x ^= x << 5;
+    c = static_cast<char>(x);
+  }
+  return out;
+}
+
+class ServerDownloadTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_.AddAccount("admin", "secret", {"administrators"});
+    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
+    root_.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + feed_.Url() +
+                                                "\"\nconnect_timeout=\"2\"\n"
+                                                "download_stall_timeout=\"2\"\n");
+    TestPackage app;
+    app.id = "dl-app";
+    app.daemon = false;
+    app.files = {{"data.bin", Noise(256 * 1024)}};
+    feed_.Add(app);
+    ASSERT_TRUE(feed_.Index());
+    feed_.Publish();
+  }
+  void TearDown() override {
+    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
+  }
+  const ApiClient& client() {
+    if (!client_) client_.reset(new ApiClient("admin", "secret"));
+    return *client_;
+  }
+  CgiAnswer Call(const std::string& method, const Params& params) {
+    return client().Call(kInst, method, 1, params);
+  }
+  CgiAnswer Status() { return Call("status", {{"task_id", kTask}}); }
+  // Polls "status" until the task is finished (or 10 s pass); the largest
+  // progress below 1.0 seen on the way goes to *moving.
+  CgiAnswer WaitFinished(double* moving = nullptr) {
+    CgiAnswer s;
+    for (int i = 0; i < 200; ++i) {
+      s = Status();
+      double p = s.Data()["progress"].asDouble();
+      if (moving && p > 0 && p < 1.0) *moving = std::max(*moving, p);
+      if (s.Data()["finished"].asBool()) break;
+      usleep(50000);
+    }
+    return s;
+  }
+  // Download folders left on the volume.
+  int DownloadFolders() {
+    int n = 0;
+    if (DIR* d = opendir(root_.Path("/volume1/@tmp").c_str())) {
+      while (dirent* e = readdir(d)) n += std::string(e->d_name).rfind("download-", 0) == 0;
+      closedir(d);
+    }
+    return n;
+  }
+  // Serves the changed catalogue; the appliance keeps the one it has for a
+  // while, so it is told to ask again at once.
+  void Republish() {
+    feed_.Publish();
+    ASSERT_TRUE(client()
+                    .Call("KIVO.Core.Package.Server", "list", 1, {{"blforcereload", "true"}})
+                    .Success());
+  }
+  void Slow() {
+    HttpRoute slow;
+    slow.slow_chunk = 16 * 1024;
+    slow.chunk_delay_ms = 40;
+    feed_.SetFileRoute("dl-app", slow);
+  }
+
+  TempRoot root_;
+  HttpTestServer server_;
+  CatalogueFeed feed_{server_, root_.Path("/feed"), "/feed"};
+  std::unique_ptr<ApiClient> client_;
+};
+
+TEST_F(ServerDownloadTest, DownloadShowsProgressThenChecksAndInstalls) {
+  Slow();
+  CgiAnswer start = Call("install", {{"name", "dl-app"}});
+  ASSERT_TRUE(start.Success()) << start.body;
+  EXPECT_EQ(kTask, start.Data()["taskid"].asString());
+  EXPECT_EQ("0.00001", start.Data()["progress"].asString());
+  // The catalogue shows the running download.
+  CgiAnswer list = client().Call("KIVO.Core.Package.Server", "list", 1);
+  ASSERT_TRUE(list.Success()) << list.body;
+  EXPECT_EQ("downloading", list.Data()["data"][0]["info"]["status"].asString());
+  double moving = 0;
+  CgiAnswer done = WaitFinished(&moving);
+  EXPECT_GT(moving, 0.0);
+  EXPECT_EQ(1.0, done.Data()["progress"].asDouble()) << done.body;
+  EXPECT_EQ("downloaded", done.Data()["status"].asString());
+  const std::string file = done.Data()["tmp_folder"].asString() + "/" + kTask;
+  EXPECT_EQ(0, access(file.c_str(), F_OK));
+
+  for (int i = 0; i < 2; ++i) {  // a successful check can be repeated
+    CgiAnswer check =
+        client().Call("KIVO.Core.Package.Installation.Download", "check", 1, {{"taskid", kTask}});
+    ASSERT_TRUE(check.Success()) << check.body;
+    EXPECT_EQ("dl-app", check.Data()["id"].asString());
+    EXPECT_EQ("non_installed", check.Data()["status"].asString());
+  }
+  CgiAnswer install = Call("install", {{"path", file}});
+  ASSERT_TRUE(install.Success()) << install.body;
+  EXPECT_TRUE(PackageRegistry::IsInstalled("dl-app"));
+}
+
+TEST_F(ServerDownloadTest, QuickInstallEndsInTheListAndLeavesNoFile) {
+  CgiAnswer start = Call("install", {{"name", "dl-app"}, {"blqinst", "true"}});
+  ASSERT_TRUE(start.Success()) << start.body;
+  CgiAnswer done = WaitFinished();
+  EXPECT_TRUE(done.Data()["finished"].asBool()) << done.body;
+  EXPECT_TRUE(PackageRegistry::IsInstalled("dl-app"));
+  EXPECT_EQ(0, DownloadFolders());
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(kTask));
+  CgiAnswer list = client().Call("KIVO.Core.Package", "list", 1);
+  EXPECT_EQ("dl-app", list.Data()["packages"][0]["id"].asString());
+}
+
+TEST_F(ServerDownloadTest, SecondRequestReportsTheRunningDownloadAndCancelCleansUp) {
+  Slow();
+  CgiAnswer first = Call("install", {{"name", "dl-app"}});
+  ASSERT_TRUE(first.Success()) << first.body;
+  CgiAnswer second = Call("install", {{"name", "dl-app"}});
+  ASSERT_TRUE(second.Success()) << second.body;
+  EXPECT_EQ(kTask, second.Data()["data"]["taskid"].asString());
+  EXPECT_TRUE(second.Data().isMember("progress"));
+  int pid = second.Data()["data"]["pid"].asInt();
+  EXPECT_EQ(1, DownloadFolders());
+  CgiAnswer cancel = Call("cancel", {{"taskid", kTask}});
+  ASSERT_TRUE(cancel.Success()) << cancel.body;
+  EXPECT_NE(1, KLIBCProcAlive(pid));
+  EXPECT_EQ(0, DownloadFolders());
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(kTask));
+}
+
+TEST_F(ServerDownloadTest, ChecksumMismatchAndOversizeFailInWordsAndLeaveNothing) {
+  struct Case {
+    const char* key;
+    Json::Value value;
+    int code;
+    const char* says;
+  };
+  const Case kCases[] = {
+      {"md5", "0123456789abcdef0123456789abcdef", 4, "md5"},
+      {"sha256", std::string(64, 'a'), 4, "sha256"},
+      {"size", 1000, 3, "more than"},
+  };
+  for (const Case& c : kCases) {
+    Json::Value saved = feed_.Entry("dl-app");
+    feed_.Entry("dl-app")[c.key] = c.value;
+    Republish();
+    ASSERT_TRUE(Call("install", {{"name", "dl-app"}}).Success());
+    CgiAnswer s = WaitFinished();
+    EXPECT_EQ(c.code, s.Data()["error"]["code"].asInt()) << c.key << ": " << s.body;
+    EXPECT_NE(std::string::npos, s.Data()["error"]["message"].asString().find(c.says)) << s.body;
+    EXPECT_EQ("failed", s.Data()["status"].asString());
+    EXPECT_EQ(0, DownloadFolders()) << c.key;
+    feed_.Entry("dl-app") = saved;
+  }
+}
+
+TEST_F(ServerDownloadTest, DroppedConnectionResumesFromTheBytesOnDisk) {
+  HttpRoute drop;
+  drop.drop_after = 100 * 1024;
+  drop.drop_times = 1;
+  feed_.SetFileRoute("dl-app", drop);
+  ASSERT_TRUE(Call("install", {{"name", "dl-app"}, {"blqinst", "true"}}).Success());
+  WaitFinished();
+  EXPECT_TRUE(PackageRegistry::IsInstalled("dl-app"));
+  const std::string path =
+      "/feed/" + feed_.FilePath("dl-app").substr(feed_.FilePath("dl-app").rfind('/') + 1);
+  EXPECT_EQ(2, server_.Requests(path));
+  EXPECT_NE(std::string::npos, server_.LastHeaders(path).find("Range: bytes=102400-"))
+      << server_.LastHeaders(path);
+}
+
+TEST_F(ServerDownloadTest, DeadLinkAndClientLinkFailOrSucceedWithoutTheCatalogue) {
+  HttpRoute gone;
+  gone.status = 404;
+  gone.body = "gone";
+  feed_.SetFileRoute("dl-app", gone);
+  ASSERT_TRUE(Call("install", {{"name", "dl-app"}}).Success());
+  CgiAnswer s = WaitFinished();
+  EXPECT_EQ(2, s.Data()["error"]["code"].asInt()) << s.body;
+  EXPECT_NE(std::string::npos, s.Data()["error"]["message"].asString().find("404"));
+  EXPECT_EQ(0, DownloadFolders());
+
+  // A link of the client's own: the catalogue is not asked.
+  HttpRoute direct;
+  direct.body = feed_.FileBody("dl-app");
+  server_.Set("/direct.kpk", direct);
+  int asked = server_.Requests("/feed/catalogue.json");
+  CgiAnswer start = Call("install", {{"name", "dl-app"},
+                                     {"url", server_.Url("/direct.kpk")},
+                                     {"filesize", std::to_string(feed_.FileBody("dl-app").size())},
+                                     {"blqinst", "true"}});
+  ASSERT_TRUE(start.Success()) << start.body;
+  WaitFinished();
+  EXPECT_TRUE(PackageRegistry::IsInstalled("dl-app"));
+  EXPECT_EQ(asked, server_.Requests("/feed/catalogue.json"));
+
+  CgiAnswer unknown = Call("install", {{"name", "no-such-app"}});
+  EXPECT_EQ(4501, unknown.Code()) << unknown.body;
+  CgiAnswer hostile = Call("install", {{"name", "../etc"}});
+  EXPECT_EQ(4500, hostile.Code()) << hostile.body;
+}
+
+TEST_F(ServerDownloadTest, DownloadCheckRemovesWhatCannotBeInstalled) {
+  const char kApi[] = "KIVO.Core.Package.Installation.Download";
+  EXPECT_EQ(4501, client().Call(kApi, "check", 1, {{"taskid", "@KIVOPKG_DOWNLOAD_none"}}).Code());
+
+  // Bytes that are not a package file, announced with their own checksums.
+  const std::string junk = Noise(5000);
+  HttpRoute route;
+  route.body = junk;
+  feed_.SetFileRoute("dl-app", route);
+  feed_.Entry("dl-app")["size"] = static_cast<Json::UInt64>(junk.size());
+  feed_.Entry("dl-app").removeMember("md5");
+  feed_.Entry("dl-app").removeMember("sha256");
+  Republish();
+  ASSERT_TRUE(Call("install", {{"name", "dl-app"}}).Success());
+  CgiAnswer done = WaitFinished();
+  ASSERT_EQ(1.0, done.Data()["progress"].asDouble()) << done.body;
+  EXPECT_EQ(4521, client().Call(kApi, "check", 1, {{"taskid", kTask}}).Code());
+  EXPECT_EQ(0, DownloadFolders());
+  EXPECT_EQ(4501, client().Call(kApi, "check", 1, {{"taskid", kTask}}).Code());
+
+  // A finished download whose folder was cleaned meanwhile.
+  std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", kTask));
+  Json::Value data(Json::objectValue);
+  data["tmp_folder"] = root_.Path("/volume1/@tmp/download-dl-app-gone");
+  task->setProperty("data", data);
+  EXPECT_EQ(4501, client().Call(kApi, "check", 1, {{"taskid", kTask}}).Code());
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(kTask));
+}
+
+}  // namespace
