@@ -16,7 +16,7 @@ class LogGetTest : public ::testing::Test {
   // A registry record as the package tool leaves it.
   void Install(const std::string& id, const std::string& info) {
     root_.Write("/var/packages/" + id + "/INFO", "package=\"" + id + "\"\n" + info);
-    KIVOFSMkdirP(root_.Path("/var/packages/" + id + "/var").c_str());
+    ASSERT_EQ(0, KIVOFSMkdirP(root_.Path("/var/packages/" + id + "/var").c_str()));
   }
 
   CgiAnswer GetLog(const std::string& name) {
@@ -67,7 +67,7 @@ TEST_F(LogGetTest, LargeLogGivesItsRecentEnd) {
 
 TEST_F(LogGetTest, UnreadableRegistryIsAGeneralFailure) {
   ApiClient admin("admin", "secret");
-  KLIBCExec("/bin/rm", "-rf", root_.Path("/var/packages").c_str(), nullptr, nullptr);
+  ASSERT_EQ(0, KLIBCExec("/bin/rm", "-rf", root_.Path("/var/packages").c_str(), nullptr, nullptr));
   root_.Write("/var/packages", "not a folder");
   CgiAnswer a = admin.Call("KIVO.Core.Package.Log", "get", 1, {{"name", "x"}});
   EXPECT_EQ(4501, a.Code()) << a.body;

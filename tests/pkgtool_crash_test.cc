@@ -16,7 +16,7 @@ class CrashTest : public ::testing::TestWithParam<const char*> {
   void SetUp() override {
     root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
     dir_ = root_.Path("/tmp/packages");
-    KIVOFSMkdirP(dir_.c_str());
+    ASSERT_EQ(0, KIVOFSMkdirP(dir_.c_str()));
     v1_.files = {{"version.txt", "1\n"}};
     v2_ = v1_;
     v2_.version = "2.0";

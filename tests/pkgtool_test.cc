@@ -29,7 +29,7 @@ class PackageToolTest : public ::testing::Test {
     // Unsigned test packages are accepted; signatures have tests of their own.
     root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
     dir_ = root_.Path("/tmp/packages");
-    KIVOFSMkdirP(dir_.c_str());
+    ASSERT_EQ(0, KIVOFSMkdirP(dir_.c_str()));
   }
   void TearDown() override {
     for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});

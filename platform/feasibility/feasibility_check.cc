@@ -68,8 +68,7 @@ class Checker {
   void Soft(const std::string& id);
   int count() const { return count_; }
   void Add(const std::string& reason) {
-    KLIBCSzListPush(reasons_, reason.c_str());
-    ++count_;
+    if (KLIBCSzListPush(reasons_, reason.c_str()) == 0) ++count_;
   }
 
  private:
@@ -82,7 +81,9 @@ class Checker {
 
 void Checker::InstallVolume(const std::string& id, bool hard) {
   std::string path;
-  if (!PMSGetPackageVol(id, path)) PMSGetPackageDefVol(path);
+  // Neither an installed version's volume nor a usable default leaves the
+  // path empty: the first usable volume is taken below.
+  if (!PMSGetPackageVol(id, path) && !PMSGetPackageDefVol(path)) path.clear();
   VolumeConfig volume;
   bool found = !path.empty() && KIVOVolumeFind(path, &volume);
   if (!found) {

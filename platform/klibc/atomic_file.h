@@ -13,12 +13,13 @@ enum class SyncToDisk { No, Yes };
 // Returns false and sets the last error (KLIBC_ERR_NO_SPACE when the disk is
 // full, KLIBC_ERR_FILE_WRITE otherwise) when anything fails; the old file is
 // then untouched and no temporary file is left behind.
-bool KIVOWriteFileAtomic(const std::string& path, const std::string& content,
-                         SyncToDisk sync = SyncToDisk::Yes, unsigned mode = 0644);
+[[nodiscard]] bool KIVOWriteFileAtomic(const std::string& path, const std::string& content,
+                                       SyncToDisk sync = SyncToDisk::Yes, unsigned mode = 0644);
 
 // Reads the whole file into `*content`, at most `limit` bytes from its start.
 // Returns false and sets the last error when it cannot be opened or read.
-bool KIVOReadFile(const std::string& path, std::string* content, size_t limit = SIZE_MAX);
+[[nodiscard]] bool KIVOReadFile(const std::string& path, std::string* content,
+                                size_t limit = SIZE_MAX);
 
 // True when `path` names an existing file system object (any type).
 bool KLIBCFileExist(const char* path);
@@ -28,4 +29,4 @@ bool KLIBCFileExist(const char* path);
 int KIVORemoveFilesOlderThan(const std::string& dir, const std::string& prefix, long age_seconds);
 
 // mkdir -p with `mode` for the folders it creates. 0 on success, -1 on failure.
-int KIVOFSMkdirP(const char* path, unsigned mode = 0755);
+[[nodiscard]] int KIVOFSMkdirP(const char* path, unsigned mode = 0755);

@@ -15,7 +15,7 @@ using KeyValueMap = std::map<std::string, std::string>;
 
 // Reads every key of `path` into `*out` (a later line wins over an earlier one).
 // Returns false and sets the last error when the file cannot be read.
-bool KIVOKeyValueLoad(const std::string& path, KeyValueMap* out);
+[[nodiscard]] bool KIVOKeyValueLoad(const std::string& path, KeyValueMap* out);
 
 // Parses key/value text (the content of such a file).
 KeyValueMap KIVOKeyValueParse(const std::string& text);
@@ -23,7 +23,8 @@ KeyValueMap KIVOKeyValueParse(const std::string& text);
 // Sets `key` to `value` in `path`, creating the file when missing and keeping
 // every other line as it was. Keys are [A-Za-z0-9_.-]+; values hold no newline.
 // Returns false and sets the last error on bad input or a failed write.
-bool KIVOKeyValueSet(const std::string& path, const std::string& key, const std::string& value);
+[[nodiscard]] bool KIVOKeyValueSet(const std::string& path, const std::string& key,
+                                   const std::string& value);
 
 // Formats one line, quoting and escaping the value.
 std::string KIVOKeyValueLine(const std::string& key, const std::string& value);
@@ -33,9 +34,11 @@ std::string KIVOKeyValueLine(const std::string& key, const std::string& value);
 // Copies the value of `key` into `buf` (NUL-terminated, cut to size - 1).
 // Returns the length copied (so > 0 when a non-empty value was read), 0 when
 // the key is missing or empty, -1 when the file cannot be read.
-int KLIBCFileGetKeyValue(const char* file, const char* key, char* buf, int size, int flags);
+[[nodiscard]] int KLIBCFileGetKeyValue(const char* file, const char* key, char* buf, int size,
+                                       int flags);
 // 1 when `key` holds exactly `value`, 0 when not, -1 when the file cannot be read.
-int KLIBCFileCheckKeyValue(const char* file, const char* key, const char* value, int flags);
+[[nodiscard]] int KLIBCFileCheckKeyValue(const char* file, const char* key, const char* value,
+                                         int flags);
 // Sets a key of the platform's own settings file "/etc/kivoinfo.conf" (under
 // the system root). 0 on success, -1 on failure with the last error set.
-int KLIBCINFOSetKeyValue(const char* key, const char* value);
+[[nodiscard]] int KLIBCINFOSetKeyValue(const char* key, const char* value);

@@ -20,7 +20,7 @@ using PKLIBSZLIST = KLIBSZLIST*;
 PKLIBSZLIST KLIBCSzListAlloc(int capacity);
 void KLIBCSzListFree(PKLIBSZLIST list);
 // Appends a copy of `value`. 0 on success, -1 on bad input.
-int KLIBCSzListPush(PKLIBSZLIST* list, const char* value);
+[[nodiscard]] int KLIBCSzListPush(PKLIBSZLIST* list, const char* value);
 // The i-th entry, or null when `i` is out of range.
 const char* KLIBCSzListGet(PKLIBSZLIST list, int i);
 
@@ -33,6 +33,6 @@ using PKLIBSZHASH = KLIBSZHASH*;
 PKLIBSZHASH KLIBCSzHashAlloc(int capacity);
 void KLIBCSzHashFree(PKLIBSZHASH hash);
 // 0 on success, -1 on bad input.
-int KLIBCSzHashSetValue(PKLIBSZHASH* hash, const char* key, const char* value);
+[[nodiscard]] int KLIBCSzHashSetValue(PKLIBSZHASH* hash, const char* key, const char* value);
 // The value of `key`, or null when absent.
 const char* KLIBCSzHashGetValue(PKLIBSZHASH hash, const char* key);

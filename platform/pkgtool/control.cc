@@ -1,21 +1,25 @@
 // Starting, stopping and removing installed packages.
 
+#include <cerrno>
+#include <cstring>
 #include <memory>
 #include <unistd.h>
+#include <utility>
 
 #include "klibc/atomic_file.h"
 #include "pkgtool/lifecycle.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
+#include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "taskmgr/task.h"
 
 namespace {
 
-constexpr int kLockWaitSeconds = 3;
-
 // The task that shows readers an operation on `id` is under way, with this
-// process as its worker; removed when the operation ends.
+// process as its worker; removed when the operation ends. A task whose data
+// cannot be written is removed at once: a reader must never find a task
+// that says nothing about its worker.
 class OperationTask {
  public:
   OperationTask(const std::string& id, const char* prefix, const char* status) {
@@ -24,15 +28,20 @@ class OperationTask {
     Json::Value data(Json::objectValue);
     data["status"] = status;
     data["pid"] = static_cast<int>(getpid());
-    task_->setProperty("data", data);
+    if (!task_->setProperty("data", data)) End();
   }
-  ~OperationTask() {
-    if (task_) task_->remove();
-  }
+  ~OperationTask() { End(); }
   OperationTask(const OperationTask&) = delete;
   OperationTask& operator=(const OperationTask&) = delete;
 
  private:
+  void End() {
+    // The task only informs readers; if the store refuses the removal, a
+    // reader finds a task whose worker is gone and reads it as ended.
+    if (task_) static_cast<void>(task_->remove());
+    task_.reset();
+  }
+
   std::unique_ptr<NVX::Task> task_;
 };
 
@@ -42,11 +51,61 @@ std::string JoinIds(const std::vector<std::string>& ids) {
   return out;
 }
 
+// Removes what an uninstalled package leaves after its published name is
+// gone: payload, data folder, record. Each folder is removed only inside
+// the folder that owns it. False (after logging what stays) when something
+// could not be removed; the package is uninstalled all the same, and the
+// next operation's clean-up retries the record and the payload.
+bool RemoveUnpublished(const std::string& record, const Operation& op) {
+  char target[4096], data[4096];
+  ssize_t t = readlink((record + "/target").c_str(), target, sizeof(target) - 1);
+  ssize_t d = readlink((record + "/var").c_str(), data, sizeof(data) - 1);
+  bool ok = true;
+  for (auto link :
+       {std::make_pair(std::string(target, t > 0 ? static_cast<size_t>(t) : 0), "@appstore"),
+        std::make_pair(std::string(data, d > 0 ? static_cast<size_t>(d) : 0), "@appdata")}) {
+    if (link.first.empty()) continue;
+    if (!PMSRemoveTree(PMSVolumeFolderHolding(link.first, link.second), link.first)) {
+      op.Log("cannot remove " + link.first);
+      ok = false;
+    }
+  }
+  if (!PMSRemoveTree(PackageRegistry::RecordsDir(), record)) {
+    op.Log("cannot remove " + record);
+    ok = false;
+  }
+  return ok;
+}
+
 }  // namespace
 
-int PackageManager::LoadAndLock(const std::string& id, PackageInfo* info) {
-  if (!PMSLoadInstalled(id, info)) return PKG_ERR_NOT_INSTALLED;
-  return ExLock(kLockWaitSeconds) ? PKG_OK : PKG_ERR_BUSY;
+int PackageManager::LockAndLoad(const std::string& id, PackageInfo* info) {
+  if (!PMSIsValidPackageId(id)) return PKG_ERR_NOT_INSTALLED;
+  // The record is read only once the lock is held: read before, it may be
+  // the state another operation is about to change.
+  if (!ExLock(PMSLockWaitSeconds())) return PKG_ERR_BUSY;
+  return PMSLoadInstalled(id, info) ? PKG_OK : PKG_ERR_NOT_INSTALLED;
+}
+
+int PackageManager::CheckCanRun(const PackageInfo& info, const Operation& op,
+                                Json::Value* services) {
+  for (const std::string& s : checkServiceStarted(PMSServiceSet(info.getServiceString()))) {
+    services->append(s);
+  }
+  if (!services->empty()) return PKG_ERR_SERVICE_NOT_RUNNING;
+  Json::Value missing;
+  std::string stopped;
+  if (arePackagesInstallAndStart(info.getDependencies(), missing, stopped, nullptr)) return PKG_OK;
+  op.Log("needed packages missing or stopped: " + missing.toStyledString() + stopped);
+  return result_ == PKG_ERR_VERSION_LIMIT ? PKG_ERR_VERSION_LIMIT : PKG_ERR_DEPENDENCY;
+}
+
+int PackageManager::CheckCanStop(const std::string& id, const Operation& op) {
+  std::string running;
+  if (areDependentPackageStop(id, nullptr, running)) return PKG_OK;
+  map_params_["deppkg"] = running;
+  op.Log("running packages depend on " + id + ": " + running);
+  return PKG_ERR_DEPENDENTS_RUNNING;
 }
 
 bool PackageManager::serviceControl(int opType, const std::string& id, bool start,
@@ -55,28 +114,9 @@ bool PackageManager::serviceControl(int opType, const std::string& id, bool star
   Operation op(start ? "start" : "stop", PMSIsValidPackageId(id) ? id : "invalid");
   Json::Value services(Json::arrayValue);
   PackageInfo info;
-  int result = LoadAndLock(id, &info);
-  if (result != PKG_OK) {
-    // Nothing to do: not installed, or the tool is busy.
-  } else if (start && checkDeps) {
-    for (const std::string& s : checkServiceStarted(PMSServiceSet(info.getServiceString()))) {
-      services.append(s);
-    }
-    Json::Value missing;
-    std::string stopped;
-    if (!services.empty()) {
-      result = PKG_ERR_SERVICE_NOT_RUNNING;
-    } else if (!arePackagesInstallAndStart(info.getDependencies(), missing, stopped, nullptr)) {
-      result = result_ == PKG_ERR_VERSION_LIMIT ? PKG_ERR_VERSION_LIMIT : PKG_ERR_DEPENDENCY;
-      op.Log("needed packages missing or stopped: " + missing.toStyledString() + stopped);
-    }
-  } else if (!start && checkDeps) {
-    std::string running;
-    if (!areDependentPackageStop(id, nullptr, running)) {
-      result = PKG_ERR_DEPENDENTS_RUNNING;
-      map_params_["deppkg"] = running;
-      op.Log("running packages depend on " + id + ": " + running);
-    }
+  int result = LockAndLoad(id, &info);
+  if (result == PKG_OK && checkDeps) {
+    result = start ? CheckCanRun(info, op, &services) : CheckCanStop(id, op);
   }
   std::string record = PMSIsValidPackageId(id) ? PackageRegistry::RecordDir(id) : "";
   if (result == PKG_OK && info.isStartable()) {
@@ -86,17 +126,24 @@ bool PackageManager::serviceControl(int opType, const std::string& id, bool star
       result = PKG_ERR_SCRIPT_FAILED;
     }
   }
-  if (result == PKG_OK && recordState) {
-    if (start) {
-      KIVOWriteFileAtomic(record + "/enabled", "", SyncToDisk::No);
-    } else {
-      unlink((record + "/enabled").c_str());
-    }
+  if (result == PKG_OK && recordState && !RecordEnabled(record, start, op)) {
+    result = PKG_ERR_INTERNAL;
   }
   UnLock();
   auto params = map_params_;
   setOutcome(result, op.log_path(), op.WorkerMessages(), params, services);
   return result == PKG_OK;
+}
+
+bool PackageManager::RecordEnabled(const std::string& record, bool enabled, const Operation& op) {
+  const std::string marker = record + "/enabled";
+  bool ok = enabled ? KIVOWriteFileAtomic(marker, "", SyncToDisk::No)
+                    : unlink(marker.c_str()) == 0 || errno == ENOENT;
+  if (!ok) {
+    op.Log(std::string(enabled ? "started" : "stopped") +
+           ", but cannot record whether the package is meant to run");
+  }
+  return ok;
 }
 
 bool PackageManager::uninstall(const std::string& id, const Json::Value* wizardValues,
@@ -105,9 +152,9 @@ bool PackageManager::uninstall(const std::string& id, const Json::Value* wizardV
   Operation op("uninstall", PMSIsValidPackageId(id) ? id : "invalid");
   std::map<std::string, std::string> params;
   PackageInfo info;
-  int result = LoadAndLock(id, &info);
+  int result = LockAndLoad(id, &info);
   if (result == PKG_OK) {
-    PMSRecoverLeftovers();
+    if (!PMSRecoverLeftovers()) op.Log("some leftovers of earlier operations stay");
     std::vector<std::string> dependents = PMSInstalledDependents(id);
     if (!dependents.empty() && !force) {
       params["deppkg"] = JoinIds(dependents);
@@ -117,27 +164,37 @@ bool PackageManager::uninstall(const std::string& id, const Json::Value* wizardV
   }
   if (result == PKG_OK) {
     OperationTask task(id, "@KIVOPKG_UNINSTALL_", "uninstalling");
-    std::string published = PackageRegistry::RecordDir(id);
-    std::string record = PackageRegistry::Dir() + "/" + PackageRegistry::PublishedRecord(id);
-    Json::Value wizard = wizardValues ? *wizardValues : Json::Value();
-    auto env = PMSScriptEnv(info, record, "uninstall", op, wizard);
-    if (PMSIsRunning(id, info)) PMSRunPackageScript(record, "start-stop-status", "stop", env, op);
-    if (!PMSRunPackageScript(record, "preuninst", "", env, op)) {
-      result = PKG_ERR_SCRIPT_FAILED;
-    } else {
-      PMSFaultPoint("uninstall_before_unpublish");
-      PackageRegistry::Unpublish(id);
-      PMSFaultPoint("unpublished");
-      PMSRunPackageScript(record, "postuninst", "", env, op);
-      char data[4096];
-      ssize_t n = readlink((record + "/var").c_str(), data, sizeof(data) - 1);
-      PMSRemoveTree(info.getTarget());
-      if (n > 0) PMSRemoveTree(std::string(data, static_cast<size_t>(n)));
-      PMSRemoveTree(record);
-      PMSFaultPoint("uninstall_done");
-    }
+    result = RemovePackage(id, info, wizardValues ? *wizardValues : Json::Value(), op);
   }
   UnLock();
   setOutcome(result, op.log_path(), op.WorkerMessages(), params, Json::Value(Json::arrayValue));
   return result == PKG_OK;
+}
+
+int PackageManager::RemovePackage(const std::string& id, const PackageInfo& info,
+                                  const Json::Value& wizard, const Operation& op) {
+  // Read under the lock that LockAndLoad took: the record this call removes.
+  const std::string record = PackageRegistry::PublishedRecordPath(id);
+  if (record.empty()) {
+    op.Log(id + " is not published as a record of its own; nothing was removed");
+    return PKG_ERR_INTERNAL;
+  }
+  auto env = PMSScriptEnv(info, record, "uninstall", op, wizard);
+  if (PMSIsRunning(id, info) &&
+      !PMSRunPackageScript(record, "start-stop-status", "stop", env, op)) {
+    op.Log(id + " did not stop; it stays installed");
+    return PKG_ERR_SCRIPT_FAILED;
+  }
+  if (!PMSRunPackageScript(record, "preuninst", "", env, op)) return PKG_ERR_SCRIPT_FAILED;
+  PMSFaultPoint("uninstall_before_unpublish");
+  if (!PackageRegistry::Unpublish(id)) {
+    op.Log(std::string("cannot remove the published name of ") + id + ": " + strerror(errno));
+    return PKG_ERR_INTERNAL;
+  }
+  PMSFaultPoint("unpublished");
+  // The package is uninstalled from here on; what follows cannot undo that.
+  if (!PMSRunPackageScript(record, "postuninst", "", env, op)) op.Log("postuninst failed");
+  if (!RemoveUnpublished(record, op)) op.Log("uninstalled; some of its files stay");
+  PMSFaultPoint("uninstall_done");
+  return PKG_OK;
 }

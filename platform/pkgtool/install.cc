@@ -25,8 +25,6 @@
 
 namespace {
 
-constexpr int kLockWaitSeconds = 3;
-
 // Fills `info` from a package file's header members.
 void InfoFromHeader(const std::string& path, const PackageFileHeader& header,
                     PKG_INSTALLATION_TYPE wizard, const char* language, PackageInfo* info) {
@@ -59,20 +57,27 @@ int SignatureVerdict(const PackageFileHeader& header, std::string* message) {
 }
 
 // Everything a staged install creates, removed again unless committed.
+// Each folder is removed only strictly inside the folder that owns it, so a
+// staging that failed before its names were made removes nothing.
 struct Staging {
   std::string id;
   std::string record_name;
-  std::string record;  // <root>/var/packages/.records/<name>
-  std::string target;  // <root>/<volume>/@appstore/<name>
-  std::string data;    // <root>/<volume>/@appdata/<id>
+  std::string record;   // <root>/var/packages/.records/<name>
+  std::string store;    // <root>/<volume>/@appstore
+  std::string target;   // <store>/<name>
+  std::string appdata;  // <root>/<volume>/@appdata
+  std::string data;     // <appdata>/<id>
   bool created_data = false;
   bool committed = false;
 
   ~Staging() {
     if (committed) return;
-    PMSRemoveTree(record);
-    PMSRemoveTree(target);
-    if (created_data) PMSRemoveTree(data);
+    // A folder that stays is no package's: the next operation's clean-up
+    // removes the record and the payload; a data folder made for nothing is
+    // empty but for what preinst wrote.
+    static_cast<void>(PMSRemoveTree(PackageRegistry::RecordsDir(), record));
+    static_cast<void>(PMSRemoveTree(store, target));
+    if (created_data) static_cast<void>(PMSRemoveTree(appdata, data));
   }
 };
 
@@ -85,7 +90,7 @@ bool WriteRecordMembers(const PackageFileHeader& header, const KeyValueMap& info
   for (const auto& m : header.members) {
     if (m.first == "INFO") continue;
     std::string path = s.record + "/" + m.first;
-    KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str());
+    if (KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str()) != 0) return false;
     unsigned mode = m.first.compare(0, 8, "scripts/") == 0 ? 0755 : 0644;
     if (!KIVOWriteFileAtomic(path, m.second, SyncToDisk::No, mode)) return false;
   }
@@ -124,7 +129,16 @@ class Installer {
   int CheckVersions(const PackageInfo& info);
   int Stage(PackageFileReader* reader, const PackageInfo& info, Staging* s);
   int RunScriptsAndPublish(const PackageInfo& info, Staging* s);
+  // preinst; or, for an upgrade, stopping the old version and preupgrade.
+  int PrepareInstall(const std::map<std::string, std::string>& env, Staging* s);
+  int PrepareUpgrade(const PackageInfo& info, const std::map<std::string, std::string>& env,
+                     Staging* s);
+  // After a failed postupgrade/postinst: the old record published again (or
+  // the new one withdrawn), and an answer that says what really happened.
+  int RollBackUpgrade(const PackageInfo& info, Staging* s);
+  int WithdrawInstall(const PackageInfo& info, Staging* s);
   int Finish(const PackageInfo& info, Staging* s);
+  [[nodiscard]] bool RemoveOldVersion();
 
   const InstallJob& job_;
   std::string* message_;
@@ -141,6 +155,11 @@ int Installer::CheckVersions(const PackageInfo& info) {
   upgrade_ = PMSLoadInstalled(info.getId(), &old_);
   if (!upgrade_) return PKG_OK;
   old_record_ = PackageRegistry::PublishedRecord(info.getId());
+  // A roll-back republishes this name and the clean-up removes it: both need
+  // a record of the registry's own making.
+  if (!PackageRegistry::IsRecordNameOf(info.getId(), old_record_)) {
+    return Refuse(PKG_ERR_BROKEN, "the installed record of " + info.getId() + " is not a record");
+  }
   (*details_)["curVersion"] = old_.getVersion();
   (*details_)["insVersion"] = info.getVersion();
   if (!job_.force && PMSCompareVersion(info.getVersion(), old_.getVersion()) <= 0) {
@@ -166,11 +185,15 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
   uint64_t needed = PMSNeededBytes(info, reader->header().payload_size);
   int code = PMSChooseVolume(info, job_.volume, needed, &volume, &text);
   if (code != PKG_OK) return Refuse(code, text);
+  const std::string record_name = PackageRegistry::NewRecordName(info.getId());
+  if (record_name.empty()) return Refuse(PKG_ERR_INTERNAL, "cannot make a fresh record name");
   s->id = info.getId();
-  s->record_name = PackageRegistry::NewRecordName(info.getId());
-  s->record = PackageRegistry::RecordsDir() + "/" + s->record_name;
-  s->target = KIVORootPath(volume.path + "/@appstore/" + s->record_name);
-  s->data = KIVORootPath(volume.path + "/@appdata/" + info.getId());
+  s->record_name = record_name;
+  s->record = PackageRegistry::RecordsDir() + "/" + record_name;
+  s->store = KIVORootPath(volume.path + "/@appstore");
+  s->target = s->store + "/" + record_name;
+  s->appdata = KIVORootPath(volume.path + "/@appdata");
+  s->data = s->appdata + "/" + info.getId();
   s->created_data = !KLIBCFileExist(s->data.c_str());
   KeyValueMap installed = reader->header().info;
   installed["install_volume"] = volume.path;
@@ -193,21 +216,10 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
 }
 
 int Installer::RunScriptsAndPublish(const PackageInfo& info, Staging* s) {
-  const std::string op_name = upgrade_ ? "upgrade" : "install";
-  auto env =
-      PMSScriptEnv(info, s->record, op_name, *op_, job_.wizard, upgrade_ ? old_.getVersion() : "");
-  if (upgrade_) {
-    was_running_ = PMSIsRunning(info.getId(), old_);
-    std::string old_record = PackageRegistry::RecordDir(info.getId());
-    if (was_running_) ControlRecord(old_record, old_, "stop", *op_);
-    if (!PMSRunPackageScript(s->record, "preupgrade", "", env, *op_)) {
-      if (was_running_) ControlRecord(old_record, old_, "start", *op_);
-      return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK,
-                    "preupgrade failed; " + old_.getVersion() + " stays");
-    }
-  } else if (!PMSRunPackageScript(s->record, "preinst", "", env, *op_)) {
-    return Refuse(PKG_ERR_SCRIPT_FAILED, "preinst failed");
-  }
+  auto env = PMSScriptEnv(info, s->record, upgrade_ ? "upgrade" : "install", *op_, job_.wizard,
+                          upgrade_ ? old_.getVersion() : "");
+  int code = upgrade_ ? PrepareUpgrade(info, env, s) : PrepareInstall(env, s);
+  if (code != PKG_OK) return code;
   PMSFaultPoint("before_publish");
   if (!PackageRegistry::Publish(info.getId(), ".records/" + s->record_name)) {
     return Refuse(PKG_ERR_INTERNAL, "cannot publish the package record");
@@ -216,32 +228,79 @@ int Installer::RunScriptsAndPublish(const PackageInfo& info, Staging* s) {
   if (PMSRunPackageScript(s->record, upgrade_ ? "postupgrade" : "postinst", "", env, *op_))
     return PKG_OK;
   // The new version failed its last step: put back what was there before.
-  if (upgrade_) {
-    PackageRegistry::Publish(info.getId(), old_record_);
-    if (was_running_) ControlRecord(PackageRegistry::RecordDir(info.getId()), old_, "start", *op_);
-    return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK,
-                  "postupgrade failed; " + old_.getVersion() + " was restored");
+  return upgrade_ ? RollBackUpgrade(info, s) : WithdrawInstall(info, s);
+}
+
+int Installer::PrepareInstall(const std::map<std::string, std::string>& env, Staging* s) {
+  if (PMSRunPackageScript(s->record, "preinst", "", env, *op_)) return PKG_OK;
+  return Refuse(PKG_ERR_SCRIPT_FAILED, "preinst failed");
+}
+
+int Installer::PrepareUpgrade(const PackageInfo& info,
+                              const std::map<std::string, std::string>& env, Staging* s) {
+  was_running_ = PMSIsRunning(info.getId(), old_);
+  const std::string old_record = PackageRegistry::RecordDir(info.getId());
+  if (was_running_ && !ControlRecord(old_record, old_, "stop", *op_)) {
+    return Refuse(PKG_ERR_SCRIPT_FAILED,
+                  old_.getVersion() + " did not stop; it stays installed and running");
   }
-  PackageRegistry::Unpublish(info.getId());
+  if (PMSRunPackageScript(s->record, "preupgrade", "", env, *op_)) return PKG_OK;
+  if (was_running_ && !ControlRecord(old_record, old_, "start", *op_)) {
+    return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "preupgrade failed; " + old_.getVersion() +
+                                                   " stays installed but did not start again");
+  }
+  return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "preupgrade failed; " + old_.getVersion() + " stays");
+}
+
+int Installer::RollBackUpgrade(const PackageInfo& info, Staging* s) {
+  if (!PackageRegistry::Publish(info.getId(), old_record_)) {
+    // The new version is the one published: keep its folders, or the
+    // published name would lead nowhere.
+    s->committed = true;
+    return Refuse(PKG_ERR_SCRIPT_FAILED, "postupgrade failed, and " + old_.getVersion() +
+                                             " could not be put back; " + info.getVersion() +
+                                             " stays installed");
+  }
+  if (was_running_ &&
+      !ControlRecord(PackageRegistry::RecordDir(info.getId()), old_, "start", *op_)) {
+    return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "postupgrade failed; " + old_.getVersion() +
+                                                   " was restored but did not start again");
+  }
+  return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK,
+                "postupgrade failed; " + old_.getVersion() + " was restored");
+}
+
+int Installer::WithdrawInstall(const PackageInfo& info, Staging* s) {
+  if (!PackageRegistry::Unpublish(info.getId())) {
+    s->committed = true;  // still published: its folders must stay
+    return Refuse(PKG_ERR_SCRIPT_FAILED,
+                  "postinst failed, and the package could not be withdrawn; it stays installed");
+  }
   return Refuse(PKG_ERR_SCRIPT_FAILED, "postinst failed");
 }
 
 int Installer::Finish(const PackageInfo& info, Staging* s) {
   s->committed = true;
   if (job_.run_after || was_running_) {
-    if (ControlRecord(s->record, info, "start", *op_)) {
-      KIVOWriteFileAtomic(s->record + "/enabled", "", SyncToDisk::No);
-    } else {
+    if (!ControlRecord(s->record, info, "start", *op_)) {
       op_->Log("installed, but the package did not start");
+    } else if (!KIVOWriteFileAtomic(s->record + "/enabled", "", SyncToDisk::No)) {
+      op_->Log("started, but cannot record that the package is meant to run");
     }
   }
-  // The old version's record and files are no longer reachable.
-  if (upgrade_ && old_record_.compare(0, 9, ".records/") == 0) {
-    PMSRemoveTree(PackageRegistry::Dir() + "/" + old_record_);
-    if (!old_.getTarget().empty()) PMSRemoveTree(old_.getTarget());
-  }
+  // The old version's record and files are no longer reachable; what cannot
+  // be removed now, the next operation's clean-up removes.
+  if (upgrade_ && !RemoveOldVersion()) op_->Log("some files of the previous version stay");
   PMSFaultPoint("done");
   return PKG_OK;
+}
+
+bool Installer::RemoveOldVersion() {
+  bool ok =
+      PMSRemoveTree(PackageRegistry::RecordsDir(), PackageRegistry::Dir() + "/" + old_record_);
+  const std::string& target = old_.getTarget();
+  if (!target.empty()) ok &= PMSRemoveTree(PMSVolumeFolderHolding(target, "@appstore"), target);
+  return ok;
 }
 
 int Installer::Run() {
@@ -251,6 +310,11 @@ int Installer::Run() {
   if (code != PKG_OK) return Refuse(code, error);
   PackageInfo info;
   InfoFromHeader(job_.path, reader.header(), PKG_OP_NONE, nullptr, &info);
+  // The id names folders and the registry entry: it is checked here even
+  // though the package file's reader checks it too.
+  if (!PMSIsValidPackageId(info.getId())) {
+    return Refuse(PKG_ERR_BAD_ID, "the package id is not valid");
+  }
   id_ = info.getId();
   code = CheckVersions(info);
   op_.reset(new Operation(upgrade_ ? "upgrade" : "install", info.getId()));
@@ -313,9 +377,11 @@ bool PayloadCheckedBefore(const std::string& marker) {
 void RememberChecked(const std::string& marker) {
   if (marker.empty()) return;
   std::string dir = marker.substr(0, marker.rfind('/'));
-  KIVOFSMkdirP(dir.c_str());
+  if (KIVOFSMkdirP(dir.c_str()) != 0) return;
   KIVORemoveFilesOlderThan(dir, "", 24 * 3600);
-  KIVOWriteFileAtomic(marker, "", SyncToDisk::No);
+  // The marker only saves the install a second look at the payload: without
+  // it the install checks the payload once more.
+  static_cast<void>(KIVOWriteFileAtomic(marker, "", SyncToDisk::No));
 }
 
 bool CheckFile(const char* language, const std::string& path, std::string& message,
@@ -358,15 +424,19 @@ bool InstallFile(const std::string& user, const std::string& path, const std::st
     return false;
   }
   PackageManager lock_holder;
-  if (!lock_holder.ExLock(kLockWaitSeconds)) {
+  if (!lock_holder.ExLock(PMSLockWaitSeconds())) {
     code = PKG_ERR_BUSY;
     message = PMSResultText(PKG_ERR_BUSY);
     return false;
   }
-  PMSRecoverLeftovers();
+  bool recovered = PMSRecoverLeftovers();
   Installer installer(job, &message, &details);
   int result = installer.Run();
   installer.Report();
+  if (!recovered) {
+    message += std::string(message.empty() ? "" : "\n") +
+               "some leftovers of earlier operations could not be removed";
+  }
   code = static_cast<PKG_ERRCODE>(result);
   return result == PKG_OK;
 }

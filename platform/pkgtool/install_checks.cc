@@ -104,7 +104,8 @@ uint64_t PMSNeededBytes(const PackageInfo& info, uint64_t payload_size) {
 int PMSChooseVolume(const PackageInfo& info, const std::string& requested, uint64_t needed_bytes,
                     VolumeConfig* out, std::string* message) {
   std::string wanted = requested;
-  if (wanted.empty()) PMSGetPackageVol(info.getId(), wanted);
+  // An installed version keeps its volume; a new package has none yet.
+  if (wanted.empty() && !PMSGetPackageVol(info.getId(), wanted)) wanted.clear();
   if (wanted.empty() && !PMSGetPackageDefVol(wanted)) {
     // The default volume is set but cannot take the package; one that is
     // gone altogether leaves the choice to the first usable volume.

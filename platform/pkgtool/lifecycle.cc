@@ -1,12 +1,14 @@
 #include "pkgtool/lifecycle.h"
 
 #include <cctype>
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <dirent.h>
 #include <limits.h>
 #include <set>
 #include <signal.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <json/writer.h>
@@ -71,9 +73,14 @@ std::map<std::string, std::string> PMSScriptEnv(const PackageInfo& info, const s
   if (!old_version.empty()) env["KIVO_PKG_OLD_VERSION"] = old_version;
   if (wizard_values.isObject()) {
     std::string path = op.worker_message_path() + ".wizard.json";
-    KIVOWriteFileAtomic(path, Json::writeString(Json::StreamWriterBuilder(), wizard_values),
-                        SyncToDisk::No, 0600);
-    env["KIVO_WIZARD_VALUES"] = path;
+    // Scripts read the answers from the file; without it they only get the
+    // variables below, and the log says so.
+    if (KIVOWriteFileAtomic(path, Json::writeString(Json::StreamWriterBuilder(), wizard_values),
+                            SyncToDisk::No, 0600)) {
+      env["KIVO_WIZARD_VALUES"] = path;
+    } else {
+      op.Log("cannot write the wizard answers for the scripts");
+    }
     for (const std::string& key : wizard_values.getMemberNames()) {
       const Json::Value& v = wizard_values[key];
       if (IsEnvKey(key) && (v.isString() || v.isNumeric() || v.isBool())) {
@@ -102,10 +109,12 @@ bool PMSRunPackageScript(const std::string& record, const std::string& name, con
 
 void PMSSetProgress(const std::string& id, double progress) {
   std::string path = ProgressPath(id);
-  KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str());
+  if (KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str()) != 0) return;
   char text[32];
   snprintf(text, sizeof(text), "%.4f\n", progress);
-  KIVOWriteFileAtomic(path, text, SyncToDisk::No);
+  // Progress is a hint for readers (see the header): a failed write keeps the
+  // last figure and must not fail the install.
+  static_cast<void>(KIVOWriteFileAtomic(path, text, SyncToDisk::No));
 }
 
 void PMSClearProgress(const std::string& id) { unlink(ProgressPath(id).c_str()); }
@@ -115,11 +124,22 @@ void PMSFaultPoint(const char* step) {
   if (fault && strcmp(fault, step) == 0) kill(getpid(), SIGKILL);
 }
 
-void PMSRemoveTree(const std::string& path) {
-  if (!path.empty() && path != "/") KLIBCExec("/bin/rm", "-rf", path.c_str(), nullptr, nullptr);
+bool PMSRemoveTree(const std::string& owner, const std::string& path) {
+  if (!PMSIsStrictlyInside(path, owner)) return false;
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0) return errno == ENOENT;
+  return KLIBCExec("/bin/rm", "-rf", "--", path.c_str(), nullptr) == 0;
 }
 
-void PMSRecoverLeftovers() {
+std::string PMSVolumeFolderHolding(const std::string& path, const char* kind) {
+  for (const VolumeConfig& volume : KIVOVolumesLoad()) {
+    std::string folder = KIVORootPath(volume.path + "/" + kind);
+    if (PMSIsStrictlyInside(path, folder)) return folder;
+  }
+  return "";
+}
+
+bool PMSRecoverLeftovers() {
   std::set<std::string> live_records, live_targets;
   for (const std::string& id : PackageRegistry::List()) {
     std::string record = PackageRegistry::PublishedRecord(id);
@@ -127,22 +147,26 @@ void PMSRecoverLeftovers() {
     std::string target = RealPath(PackageRegistry::RecordDir(id) + "/target");
     if (!target.empty()) live_targets.insert(target);
   }
+  bool all_removed = true;
   std::string records = PackageRegistry::RecordsDir();
   for (const std::string& name : ListDir(records)) {
-    if (!live_records.count(name)) PMSRemoveTree(records + "/" + name);
+    if (!live_records.count(name)) all_removed &= PMSRemoveTree(records, records + "/" + name);
   }
   for (const std::string& name : ListDir(PackageRegistry::Dir())) {
     std::string path = PackageRegistry::Dir() + "/" + name;
     bool half_published = name.compare(0, 9, ".publish-") == 0;
     bool dangling = name[0] != '.' && !PackageRegistry::PublishedRecord(name).empty() &&
                     !PackageRegistry::IsInstalled(name);
-    if (half_published || dangling) unlink(path.c_str());
+    if ((half_published || dangling) && unlink(path.c_str()) != 0) all_removed = false;
   }
   for (const VolumeConfig& volume : KIVOVolumesLoad()) {
     std::string store = KIVORootPath(volume.path + "/@appstore");
     for (const std::string& name : ListDir(store)) {
       std::string path = RealPath(store + "/" + name);
-      if (!path.empty() && !live_targets.count(path)) PMSRemoveTree(store + "/" + name);
+      if (!path.empty() && !live_targets.count(path)) {
+        all_removed &= PMSRemoveTree(store, store + "/" + name);
+      }
     }
   }
+  return all_removed;
 }

@@ -26,10 +26,13 @@ std::map<std::string, std::string> PMSScriptEnv(const PackageInfo& info, const s
 
 // Runs `record`/scripts/`name` (missing scripts succeed) and logs how it
 // ended. True when it succeeded.
-bool PMSRunPackageScript(const std::string& record, const std::string& name, const std::string& arg,
-                         const std::map<std::string, std::string>& env, const Operation& op);
+[[nodiscard]] bool PMSRunPackageScript(const std::string& record, const std::string& name,
+                                       const std::string& arg,
+                                       const std::map<std::string, std::string>& env,
+                                       const Operation& op);
 
-// Publishes install progress of `id` (0.0 to 1.0) for PMSGetProgress.
+// Publishes install progress of `id` (0.0 to 1.0) for PMSGetProgress. The
+// figure is a hint for readers: a write that fails leaves the last one.
 void PMSSetProgress(const std::string& id, double progress);
 void PMSClearProgress(const std::string& id);
 
@@ -39,8 +42,17 @@ void PMSFaultPoint(const char* step);
 
 // Removes records and payload folders that no published record reaches,
 // and half-made temporary names: what an interrupted operation leaves.
-// Must run under the tool's exclusive lock.
-void PMSRecoverLeftovers();
+// Must run under the tool's exclusive lock. False when something could not
+// be removed (it is tried again by the next operation).
+[[nodiscard]] bool PMSRecoverLeftovers();
 
-// rm -rf through the platform's exec call.
-void PMSRemoveTree(const std::string& path);
+// rm -rf `path`, the one way the package tool removes a folder: only when
+// `path` lies strictly inside `owner` (PMSIsStrictlyInside); anything else is
+// refused without touching the disk. True when `path` is gone afterwards.
+[[nodiscard]] bool PMSRemoveTree(const std::string& owner, const std::string& path);
+
+// The `kind` folder ("@appstore" or "@appdata") of the configured volume
+// that holds `path` strictly inside it, "<root>/<volume>/<kind>"; "" when no
+// volume's folder of that kind holds it. The owner to check a payload or
+// data folder against before it is removed.
+std::string PMSVolumeFolderHolding(const std::string& path, const char* kind);

@@ -3,31 +3,28 @@
 #include <ctime>
 #include <fcntl.h>
 #include <sstream>
-#include <sys/random.h>
 #include <unistd.h>
 
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"
+#include "pkgtool/registry.h"
 
 namespace {
 
+// Tells this operation's files from every other's, even when the system
+// has no random bytes to give.
 std::string Nonce() {
-  unsigned char bytes[6] = {0};
-  getrandom(bytes, sizeof(bytes), 0);
-  static const char kHex[] = "0123456789abcdef";
-  std::string s;
-  for (unsigned char b : bytes) {
-    s += kHex[b >> 4];
-    s += kHex[b & 15];
-  }
-  return s;
+  std::string nonce = PMSRandomHex(6);
+  return nonce.empty() ? std::to_string(getpid()) + "-" + std::to_string(time(nullptr)) : nonce;
 }
 
 }  // namespace
 
 Operation::Operation(const std::string& kind, const std::string& id) {
   std::string dir = KIVORootPath("/var/log/packages");
-  KIVOFSMkdirP(dir.c_str());
+  // Without the folder the log cannot be opened: Log() then drops lines and
+  // readers find an empty log, which is all that can be offered.
+  static_cast<void>(KIVOFSMkdirP(dir.c_str()));
   std::string base = dir + "/" + kind + "-" + id + "-" + Nonce();
   log_path_ = base + ".log";
   worker_path_ = base + ".msg";

@@ -48,9 +48,9 @@ PackageManager::~PackageManager() { UnLock(); }
 bool PackageManager::init() {
   std::string dir = PackageRegistry::Dir();
   struct stat st;
-  if (stat(dir.c_str(), &st) != 0) KIVOFSMkdirP(dir.c_str());
-  bool ok =
-      stat(dir.c_str(), &st) == 0 && S_ISDIR(st.st_mode) && access(dir.c_str(), R_OK | X_OK) == 0;
+  bool ok = (stat(dir.c_str(), &st) == 0 || KIVOFSMkdirP(dir.c_str()) == 0) &&
+            stat(dir.c_str(), &st) == 0 && S_ISDIR(st.st_mode) &&
+            access(dir.c_str(), R_OK | X_OK) == 0;
   result_ = ok ? PKG_OK : PKG_ERR_REGISTRY;
   return ok;
 }

@@ -19,6 +19,7 @@
 #include <json/value.h>
 
 #include "pkgtool/dependency.h"
+#include "pkgtool/operation.h"
 #include "pkgtool/package_info.h"
 #include "pkgtool/result_codes.h"
 
@@ -31,7 +32,7 @@ class PackageManager {
 
   // Makes sure the registry can be read (creating it on a fresh system).
   // False, with result 263, when it cannot.
-  bool init();
+  [[nodiscard]] bool init();
 
   int getResult() const { return result_; }
   // The result, and for 260 the services that are not running (array).
@@ -43,29 +44,30 @@ class PackageManager {
   // for the callers' sake; every package is listed.
   std::vector<std::string> enumPackages(const std::string& language = "", uint64_t mask = ~0ULL);
   // Every installed package's record, by id.
-  bool enumPackageInfoMap(std::map<std::string, PackageInfo>& out, const std::string& language,
-                          uint64_t mask);
+  [[nodiscard]] bool enumPackageInfoMap(std::map<std::string, PackageInfo>& out,
+                                        const std::string& language, uint64_t mask);
   // The installed record of `id`. False with 255 when not installed. A
   // package whose installed files are gone is read all the same (its status
   // says broken).
-  bool getPackageInfo(const std::string& id, PackageInfo& info, const std::string& language = "",
-                      uint64_t mask = ~0ULL);
-  bool getInstallPackageInfo(const std::string& id, PackageInfo& info) {
+  [[nodiscard]] bool getPackageInfo(const std::string& id, PackageInfo& info,
+                                    const std::string& language = "", uint64_t mask = ~0ULL);
+  [[nodiscard]] bool getInstallPackageInfo(const std::string& id, PackageInfo& info) {
     return getPackageInfo(id, info);
   }
   // Reads a package file's INFO (and with the wizard, its install or
   // upgrade wizard in `language`). False with 261 when it is not one.
-  bool queryPackageFileInfo(const std::string& path, PackageInfo& info, PKG_INSTALLATION_TYPE type,
-                            const char* language);
-  bool queryPackageFileInfoWithWizard(const std::string& path, PackageInfo& info,
-                                      PKG_INSTALLATION_TYPE type, const char* language);
+  [[nodiscard]] bool queryPackageFileInfo(const std::string& path, PackageInfo& info,
+                                          PKG_INSTALLATION_TYPE type, const char* language);
+  [[nodiscard]] bool queryPackageFileInfoWithWizard(const std::string& path, PackageInfo& info,
+                                                    PKG_INSTALLATION_TYPE type,
+                                                    const char* language);
   // Loads the installed package's wizard of operation `op` (PKG_OP_UNINSTALL
   // ...) in `language` into out.getUIFile(). False when it has none.
-  bool readUIFile(int op, const PackageInfo& package, PackageInfo& out,
-                  const std::string& language);
+  [[nodiscard]] bool readUIFile(int op, const PackageInfo& package, PackageInfo& out,
+                                const std::string& language);
   // Whether the package runs. False when it cannot be told; then the result
   // says why (255 not installed, 258 broken, 264 not supported...).
-  bool getServiceStatus(const PackageInfo& info, bool& running, bool checkBroken);
+  [[nodiscard]] bool getServiceStatus(const PackageInfo& info, bool& running, bool checkBroken);
   // Flags of an installed package: bit 0 installed, bit 1 running, bit 2 broken.
   unsigned getPkgRoughStatus(const std::string& id);
   // The package's own log file (INFO "logfile", in its data folder). With
@@ -86,7 +88,7 @@ class PackageManager {
   // Every installed package, each after the packages it depends on... in
   // reverse: dependents first, so stopping in this order is safe and
   // starting goes in the reverse order.
-  bool getDependencyOrder(std::vector<std::string>& order);
+  [[nodiscard]] bool getDependencyOrder(std::vector<std::string>& order);
   // True when every entry is installed at an accepted version and running
   // (a package without a service only needs to be installed).
   // Otherwise `notInstalled` (array) gets the entries missing or at a refused
@@ -112,15 +114,17 @@ class PackageManager {
   // --- Changing ------------------------------------------------------------
 
   // Starts or stops `id` through its start-stop-status script.
-  bool serviceControl(int opType, const std::string& id, bool start, const std::string& language,
-                      const std::string& user, void* list, bool checkDeps, bool recordState);
+  [[nodiscard]] bool serviceControl(int opType, const std::string& id, bool start,
+                                    const std::string& language, const std::string& user,
+                                    void* list, bool checkDeps, bool recordState);
   // Removes `id`, handing the uninstall wizard's answers to its scripts.
-  bool uninstall(const std::string& id, const Json::Value* wizardValues,
-                 const std::string& language, int opType, bool force, const std::string& user);
+  [[nodiscard]] bool uninstall(const std::string& id, const Json::Value* wizardValues,
+                               const std::string& language, int opType, bool force,
+                               const std::string& user);
 
   // The tool's exclusive lock, waiting at most `seconds`. False when another
   // process holds it.
-  bool ExLock(int seconds);
+  [[nodiscard]] bool ExLock(int seconds);
   void UnLock();
 
   // For the install functions of install.cc.
@@ -128,9 +132,22 @@ class PackageManager {
                   const std::map<std::string, std::string>& params, const Json::Value& services);
 
  private:
-  // The installed record of `id`, with the exclusive lock taken: PKG_OK,
-  // 255 or 275.
-  int LoadAndLock(const std::string& id, PackageInfo* info);
+  // Takes the exclusive lock, then reads the installed record of `id`:
+  // PKG_OK, 255 (invalid id or not installed) or 275 (busy). The lock stays
+  // held whatever the answer.
+  int LockAndLoad(const std::string& id, PackageInfo* info);
+  // What a start needs: its services running (else 260, named in
+  // `services`), the packages it needs installed and running (else 268, or
+  // 259 for a refused version).
+  int CheckCanRun(const PackageInfo& info, const Operation& op, Json::Value* services);
+  // 269 when running packages depend on `id` (named in "deppkg").
+  int CheckCanStop(const std::string& id, const Operation& op);
+  // Writes or removes the record's "enabled" marker; logs a failure.
+  [[nodiscard]] bool RecordEnabled(const std::string& record, bool enabled, const Operation& op);
+  // The uninstall proper, under the lock: stop, preuninst, unpublish (the
+  // commit), postuninst, removal of the folders.
+  int RemovePackage(const std::string& id, const PackageInfo& info, const Json::Value& wizard,
+                    const Operation& op);
 
   int result_ = 0;
   int lock_fd_ = -1;
@@ -146,18 +163,20 @@ class PackageManager {
 // it may be installed; else `code` is the result code, `message` says why,
 // and `details` holds "serviceNoStarted", "unStartPkgList", "packages",
 // "instPackageList" where they apply.
-bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std::string& message,
-                              PKG_ERRCODE& code, Json::Value& details, PackageInfo& info);
+[[nodiscard]] bool CheckPackageFileInfoImpl(const char* language, const std::string& path,
+                                            std::string& message, PKG_ERRCODE& code,
+                                            Json::Value& details, PackageInfo& info);
 
 // Installs or upgrades the package file `path` onto `volume` ("" for the
 // default volume). `extraValues` is the wizard's JSON text; `typeFlag` true
 // starts the package when installed. `details` receives "workerMessage",
 // "installReboot", "curVersion"/"insVersion" and "deppkg" where they apply.
-bool InstallPackageFileImpl(const std::string& user, const std::string& path,
-                            const std::string& volume, int reserved, const std::string& extraValues,
-                            bool typeFlag, const std::string& language, std::string& message,
-                            PKG_ERRCODE& code, Json::Value& details, bool force,
-                            bool checkCodesign);
+[[nodiscard]] bool InstallPackageFileImpl(const std::string& user, const std::string& path,
+                                          const std::string& volume, int reserved,
+                                          const std::string& extraValues, bool typeFlag,
+                                          const std::string& language, std::string& message,
+                                          PKG_ERRCODE& code, Json::Value& details, bool force,
+                                          bool checkCodesign);
 
 // The log text of a package log file; when it is larger than 1 MiB, its last
 // 1 MiB. "" when it cannot be read.

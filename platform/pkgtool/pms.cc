@@ -170,7 +170,7 @@ std::string PMSGetInstallImage(const std::string& id, int size) {
 }
 
 int PMSLockFile(const std::string& path, int seconds) {
-  KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str());
+  if (KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str()) != 0) return -1;
   int fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
   if (fd < 0) return -1;
   struct timespec start;
@@ -178,7 +178,9 @@ int PMSLockFile(const std::string& path, int seconds) {
   while (flock(fd, LOCK_EX | LOCK_NB) != 0) {
     struct timespec now;
     clock_gettime(CLOCK_MONOTONIC, &now);
-    if (now.tv_sec - start.tv_sec >= seconds) {
+    long long waited_ms =
+        (now.tv_sec - start.tv_sec) * 1000LL + (now.tv_nsec - start.tv_nsec) / 1000000;
+    if (waited_ms >= seconds * 1000LL) {
       close(fd);
       KLIBCErrSet(KLIBC_ERR_LOCK);
       return -1;
@@ -191,3 +193,15 @@ int PMSLockFile(const std::string& path, int seconds) {
 void PMSUnlockFile(int fd) {
   if (fd >= 0) close(fd);
 }
+
+int PMSToolSetting(const std::string& key, int def, int min) {
+  KeyValueMap conf;
+  if (!KIVOKeyValueLoad(KIVORootPath("/etc/kivo/pkgtool.conf"), &conf)) return def;
+  const std::string& text = conf[key];
+  char* end = nullptr;
+  long value = std::strtol(text.c_str(), &end, 10);
+  if (text.empty() || *end != '\0' || value < min || value > INT_MAX) return def;
+  return static_cast<int>(value);
+}
+
+int PMSLockWaitSeconds() { return PMSToolSetting("lock_wait", 3, 0); }

@@ -13,25 +13,25 @@ int PMSCheckPackage(const std::string& id);
 std::string PMSGetPackageTarget(const PackageInfo& info);
 // The volume the installed package `id` lives on ("/volume1"). False when
 // it is not installed.
-bool PMSGetPackageVol(const std::string& id, std::string& volume);
+[[nodiscard]] bool PMSGetPackageVol(const std::string& id, std::string& volume);
 
 // The default install volume ("pkg_def_volume" of /etc/kivoinfo.conf).
 // True with "" when none is set; false when the one set is missing
 // (last error 0x0600), crashed (0x8400) or full (0x2900).
-bool PMSGetPackageDefVol(std::string& path);
+[[nodiscard]] bool PMSGetPackageDefVol(std::string& path);
 // Stores `path` as the default volume ("" clears it). False when the volume
 // is unknown (0x0600), crashed (0x8400), full (0x2900) or the settings file
 // cannot be written.
-bool PMSSavePackageDefVolPath(const std::string& path);
+[[nodiscard]] bool PMSSavePackageDefVolPath(const std::string& path);
 
 // A temporary folder with room for `size` bytes: "@tmp/kivo-pkg" of the
 // first usable volume with room, else the root's "/tmp". False with last
 // error 0x2900 (no room anywhere) or 0xDD00 (no temporary folder at all).
-bool PMSGetTmpDir(int64_t size, std::string& dir);
+[[nodiscard]] bool PMSGetTmpDir(int64_t size, std::string& dir);
 // Creates a fresh download folder for `name` on `volume` (or any volume with
 // room for `size` bytes when empty). False with the last error set.
-bool PMSCreateDownloadTmpDir(const std::string& volume, const std::string& name, int64_t size,
-                             std::string& folder);
+[[nodiscard]] bool PMSCreateDownloadTmpDir(const std::string& volume, const std::string& name,
+                                           int64_t size, std::string& folder);
 
 // INFO "ctl_uninstall": the package controls its own uninstall.
 bool PMSGetCtlUninstall(const PackageInfo& info);
@@ -47,7 +47,16 @@ double PMSGetProgress(const std::string& id);
 // The path of the package's icon (size 72 or 256), "" when it has none.
 std::string PMSGetInstallImage(const std::string& id, int size);
 
-// An exclusive advisory lock on `path`, waiting at most `seconds`. The
-// descriptor to pass to PMSUnlockFile, or -1 when it could not be taken.
-int PMSLockFile(const std::string& path, int seconds);
+// An exclusive advisory lock on `path`, waiting at most `seconds` (0: one
+// try). The descriptor to pass to PMSUnlockFile, or -1 (last error
+// KLIBC_ERR_LOCK) when it could not be taken.
+[[nodiscard]] int PMSLockFile(const std::string& path, int seconds);
 void PMSUnlockFile(int fd);
+
+// A whole-number setting of the tool's settings file /etc/kivo/pkgtool.conf:
+// `def` when it is missing, not a number, or below `min`.
+int PMSToolSetting(const std::string& key, int def, int min);
+// How long a changing operation waits for the tool's lock before it answers
+// 275: "lock_wait" of /etc/kivo/pkgtool.conf (seconds, 0 = no wait), 3 by
+// default.
+int PMSLockWaitSeconds();

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cctype>
+#include <cerrno>
 #include <dirent.h>
 #include <sstream>
 #include <sys/random.h>
@@ -41,47 +42,70 @@ std::vector<std::string> List() {
 }
 
 std::string PublishedRecord(const std::string& id) {
+  if (!PMSIsValidPackageId(id)) return "";
   char buf[512];
   ssize_t n = readlink(RecordDir(id).c_str(), buf, sizeof(buf) - 1);
   if (n <= 0) return "";
   return std::string(buf, static_cast<size_t>(n));
 }
 
-bool Publish(const std::string& id, const std::string& record) {
-  std::string tmp = Dir() + "/.publish-" + id;
-  unlink(tmp.c_str());
-  if (symlink(record.c_str(), tmp.c_str()) != 0) return false;
-  if (rename(tmp.c_str(), RecordDir(id).c_str()) != 0) {
-    unlink(tmp.c_str());
-    return false;
-  }
-  // The rename is the commit; make it survive a power cut as well.
+bool IsRecordNameOf(const std::string& id, const std::string& record) {
+  const std::string prefix = ".records/" + id + ".";
+  return PMSIsValidPackageId(id) && record.size() > prefix.size() &&
+         record.compare(0, prefix.size(), prefix) == 0 &&
+         PMSIsStrictlyInside(Dir() + "/" + record, RecordsDir()) &&
+         record.find('/', prefix.size()) == std::string::npos;
+}
+
+std::string PublishedRecordPath(const std::string& id) {
+  std::string record = PublishedRecord(id);
+  return IsRecordNameOf(id, record) ? Dir() + "/" + record : "";
+}
+
+namespace {
+
+// Makes a change of the registry folder's names survive a power cut.
+void SyncDir() {
   if (DIR* d = opendir(Dir().c_str())) {
     fsync(dirfd(d));
     closedir(d);
   }
+}
+
+}  // namespace
+
+bool Publish(const std::string& id, const std::string& record) {
+  if (!IsRecordNameOf(id, record)) {
+    errno = EINVAL;
+    return false;
+  }
+  std::string tmp = Dir() + "/.publish-" + id;
+  unlink(tmp.c_str());
+  if (symlink(record.c_str(), tmp.c_str()) != 0) return false;
+  // The rename is the commit.
+  if (rename(tmp.c_str(), RecordDir(id).c_str()) != 0) {
+    int saved = errno;
+    unlink(tmp.c_str());
+    errno = saved;
+    return false;
+  }
+  SyncDir();
   return true;
 }
 
 bool Unpublish(const std::string& id) {
-  bool ok = unlink(RecordDir(id).c_str()) == 0;
-  if (DIR* d = opendir(Dir().c_str())) {
-    fsync(dirfd(d));
-    closedir(d);
+  if (!PMSIsValidPackageId(id)) {
+    errno = EINVAL;
+    return false;
   }
-  return ok;
+  if (unlink(RecordDir(id).c_str()) != 0) return false;
+  SyncDir();
+  return true;
 }
 
 std::string NewRecordName(const std::string& id) {
-  unsigned char bytes[6];
-  if (getrandom(bytes, sizeof(bytes), 0) != sizeof(bytes)) return "";
-  static const char kHex[] = "0123456789abcdef";
-  std::string name = id + ".";
-  for (unsigned char b : bytes) {
-    name += kHex[b >> 4];
-    name += kHex[b & 15];
-  }
-  return name;
+  std::string nonce = PMSRandomHex(6);
+  return nonce.empty() ? "" : id + "." + nonce;
 }
 
 }  // namespace PackageRegistry
@@ -103,4 +127,22 @@ bool PMSIsContainedRelativePath(const std::string& rel) {
     if (part.empty() || part == "." || part == "..") return false;
   }
   return rel.back() != '/';
+}
+
+bool PMSIsStrictlyInside(const std::string& path, const std::string& owner) {
+  if (owner.empty() || owner[0] != '/' || owner.back() == '/') return false;
+  return path.size() > owner.size() + 1 && path.compare(0, owner.size(), owner) == 0 &&
+         path[owner.size()] == '/' && PMSIsContainedRelativePath(path.substr(owner.size() + 1));
+}
+
+std::string PMSRandomHex(size_t bytes) {
+  std::string raw(bytes, '\0');
+  if (getrandom(&raw[0], bytes, 0) != static_cast<ssize_t>(bytes)) return "";
+  static const char kHex[] = "0123456789abcdef";
+  std::string hex;
+  for (unsigned char b : raw) {
+    hex += kHex[b >> 4];
+    hex += kHex[b & 15];
+  }
+  return hex;
 }

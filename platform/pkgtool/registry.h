@@ -30,20 +30,32 @@ std::string RecordDir(const std::string& id);
 // "<root>/var/packages/.records".
 std::string RecordsDir();
 // True when a record with an INFO file is published for `id`.
-bool IsInstalled(const std::string& id);
+[[nodiscard]] bool IsInstalled(const std::string& id);
 // Reads the published record's INFO.
-bool ReadInfo(const std::string& id, KeyValueMap* info);
+[[nodiscard]] bool ReadInfo(const std::string& id, KeyValueMap* info);
 // Installed package ids, sorted.
 std::vector<std::string> List();
-// The record folder name `id` is published as (".records/<id>.<n>"), "" if none.
+// The record folder name `id` is published as (".records/<id>.<n>"), "" if
+// none. Only the link is read: the record may be gone or incomplete.
 std::string PublishedRecord(const std::string& id);
-// Publishes `record` (a name under .records) as `id`, replacing any earlier
-// record in one rename. False with errno on failure.
-bool Publish(const std::string& id, const std::string& record);
+// The record folder `id` is published as ("<root>/var/packages/.records/
+// <id>.<n>"), or "" when `id` is not published as a record of its own: an
+// invalid id, no link, or a link that leads anywhere else. A caller that is
+// about to remove the record must hold the tool's lock while it reads this.
+std::string PublishedRecordPath(const std::string& id);
+// True when `record` is a name that may be published for `id`:
+// ".records/<id>.<something>", one folder strictly inside the records folder.
+bool IsRecordNameOf(const std::string& id, const std::string& record);
+// Publishes `record` (a name under .records, see IsRecordNameOf) as `id`,
+// replacing any earlier record in one rename. False with errno on failure,
+// or when the id or the record name is not valid (nothing is changed then).
+[[nodiscard]] bool Publish(const std::string& id, const std::string& record);
 // Removes the published name of `id` (the record folder stays for clean-up).
-bool Unpublish(const std::string& id);
-// A fresh record name for `id`: "<id>.<random>".
-std::string NewRecordName(const std::string& id);
+// False when `id` is invalid or there was no published name to remove.
+[[nodiscard]] bool Unpublish(const std::string& id);
+// A fresh record name for `id`: "<id>.<random>". "" when no random bytes
+// could be had; a caller must not build a path from an empty name.
+[[nodiscard]] std::string NewRecordName(const std::string& id);
 
 }  // namespace PackageRegistry
 
@@ -54,3 +66,14 @@ bool PMSIsValidPackageId(const std::string& id);
 // True when `rel` is a relative path that stays inside its base folder
 // lexically: not empty, not absolute, no "." or ".." component.
 bool PMSIsContainedRelativePath(const std::string& rel);
+
+// True when `path` lies strictly inside the folder `owner`, judged on the
+// text alone: `owner` is a non-empty absolute path and `path` is `owner`, a
+// slash and a contained relative path (see above). Every destructive step of
+// the package tool (rm -rf, a rename over a name) checks its path with this
+// against the folder it owns, so an empty or damaged name can never widen
+// the step to the owner itself or to anything beside it.
+bool PMSIsStrictlyInside(const std::string& path, const std::string& owner);
+
+// `bytes` random bytes as lower-case hex; "" when the system has none to give.
+std::string PMSRandomHex(size_t bytes);

@@ -8,8 +8,7 @@
 #include <unistd.h>
 #include <vector>
 
-#include "klibc/key_value_file.h"
-#include "klibc/sysroot.h"
+#include "pkgtool/pms.h"
 
 #include <time.h>
 
@@ -84,9 +83,4 @@ int PMSRunScript(const std::string& script, const std::string& arg,
   return 128 + WTERMSIG(status);
 }
 
-int PMSScriptTimeout() {
-  KeyValueMap conf;
-  if (!KIVOKeyValueLoad(KIVORootPath("/etc/kivo/pkgtool.conf"), &conf)) return 120;
-  int seconds = std::atoi(conf["script_timeout"].c_str());
-  return seconds > 0 ? seconds : 120;
-}
+int PMSScriptTimeout() { return PMSToolSetting("script_timeout", 120, 1); }

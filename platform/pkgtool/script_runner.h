@@ -15,9 +15,9 @@ enum ScriptStatus {
 
 // Runs `script` with the single argument `arg` (may be empty) and exactly
 // the environment `env`, waiting at most `timeout_seconds`.
-int PMSRunScript(const std::string& script, const std::string& arg,
-                 const std::map<std::string, std::string>& env, int timeout_seconds,
-                 const std::string& log_path);
+[[nodiscard]] int PMSRunScript(const std::string& script, const std::string& arg,
+                               const std::map<std::string, std::string>& env, int timeout_seconds,
+                               const std::string& log_path);
 
 // The script time limit: "script_timeout" of /etc/kivo/pkgtool.conf (seconds),
 // 120 by default.

@@ -103,9 +103,10 @@ bool KIVOParseOSVersion(const std::string& text, int* major, int* minor, int* bu
 }
 
 int KIVOCompareOSVersion(const std::string& a, const std::string& b) {
+  // A malformed version compares as 0.0-0, below every real one.
   int a1 = 0, a2 = 0, a3 = 0, b1 = 0, b2 = 0, b3 = 0;
-  KIVOParseOSVersion(a, &a1, &a2, &a3);
-  KIVOParseOSVersion(b, &b1, &b2, &b3);
+  if (!KIVOParseOSVersion(a, &a1, &a2, &a3)) a1 = a2 = a3 = 0;
+  if (!KIVOParseOSVersion(b, &b1, &b2, &b3)) b1 = b2 = b3 = 0;
   if (a1 != b1) return a1 < b1 ? -1 : 1;
   if (a2 != b2) return a2 < b2 ? -1 : 1;
   if (a3 != b3) return a3 < b3 ? -1 : 1;

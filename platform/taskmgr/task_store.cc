@@ -60,7 +60,8 @@ sqlite3* TaskStore::db() {
   Close();
   pid_ = getpid();
   path_ = path;
-  KIVOFSMkdirP(dir.c_str());
+  // A folder that cannot be made shows as the open failure below.
+  static_cast<void>(KIVOFSMkdirP(dir.c_str()));
   if (Sqlite()->open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) !=
       SQLITE_OK) {
     syslog(LOG_ERR, "%s:%d cannot open %s: %s", "task_store", __LINE__, path.c_str(),

@@ -20,7 +20,7 @@ std::string Trim(std::string s) {
 }  // namespace
 
 TestKeys::TestKeys(const std::string& dir) : home_(dir + "/test-gnupg") {
-  KIVOFSMkdirP(home_.c_str(), 0700);
+  EXPECT_EQ(0, KIVOFSMkdirP(home_.c_str(), 0700)) << home_;
 }
 
 std::string TestKeys::Create(const std::string& uid, bool expired) {

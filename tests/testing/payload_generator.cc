@@ -4,6 +4,8 @@
 #include <cstring>
 #include <vector>
 
+#include <gtest/gtest.h>
+
 #include "klibc/atomic_file.h"
 
 namespace {
@@ -19,7 +21,7 @@ void WriteFile(const std::string& path, size_t size, uint64_t* seed) {
   }
   static const char kText[] = "The quick brown fox jumps over the lazy dog 0123456789.\n";
   for (size_t i = size / 2; i < size; ++i) buf[i] = kText[i % (sizeof(kText) - 1)];
-  KIVOWriteFileAtomic(path, std::string(buf.data(), size), SyncToDisk::No);
+  EXPECT_TRUE(KIVOWriteFileAtomic(path, std::string(buf.data(), size), SyncToDisk::No)) << path;
 }
 
 }  // namespace
@@ -33,7 +35,7 @@ uint64_t GeneratePayload(const std::string& dir, uint64_t total) {
     size_t size = kSizes[n % 6];
     if (written + size > total) size = total - written;
     std::string sub = dir + "/d" + std::to_string(n % 37);
-    KIVOFSMkdirP(sub.c_str());
+    EXPECT_EQ(0, KIVOFSMkdirP(sub.c_str())) << sub;
     WriteFile(sub + "/f" + std::to_string(n), size, &seed);
     written += size;
     ++n;

@@ -34,11 +34,13 @@ TempRoot::TempRoot() {
   setenv("KIVO_ROOT", dir_.c_str(), 1);
 }
 
-TempRoot::~TempRoot() { KLIBCExec("/bin/rm", "-rf", dir_.c_str(), nullptr, nullptr); }
+TempRoot::~TempRoot() {
+  EXPECT_EQ(0, KLIBCExec("/bin/rm", "-rf", dir_.c_str(), nullptr, nullptr)) << dir_;
+}
 
 void TempRoot::Write(const std::string& fixed, const std::string& content) const {
   std::string path = Path(fixed);
-  KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str());
+  ASSERT_EQ(0, KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str())) << path;
   ASSERT_TRUE(KIVOWriteFileAtomic(path, content, SyncToDisk::No)) << path;
 }
 
