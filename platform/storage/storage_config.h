@@ -31,7 +31,7 @@ struct VolumeConfig {
 // or unreadable.
 std::vector<VolumeConfig> KIVOVolumesLoad();
 // The volume whose path is `path` or holds it ("/volume1/x" -> "/volume1").
-bool KIVOVolumeFind(const std::string& path, VolumeConfig* out);
+[[nodiscard]] bool KIVOVolumeFind(const std::string& path, VolumeConfig* out);
 // Free bytes of the volume (statvfs of its folder under the root, capped).
 // -1 when the folder cannot be measured.
 int64_t KIVOVolumeFreeBytes(const VolumeConfig& volume);
@@ -47,14 +47,14 @@ DeviceInfo KIVODeviceLoad();
 bool KIVOServiceRunning(const std::string& name);
 
 // "7.2-0064" -> 7, 2, 64. False when malformed.
-bool KIVOParseOSVersion(const std::string& text, int* major, int* minor, int* build);
+[[nodiscard]] bool KIVOParseOSVersion(const std::string& text, int* major, int* minor, int* build);
 // <0, 0, >0 comparing two OS versions as (major, minor, build).
 int KIVOCompareOSVersion(const std::string& a, const std::string& b);
 
 // The volume part of a real path under the system root
 // ("<root>/volume1/@appstore/x" -> "/volume1") into `volume`. 0 on success,
 // -1 when the path lies on no configured volume.
-int VolumePathParseEx(const std::string& path, std::string& volume);
+[[nodiscard]] int VolumePathParseEx(const std::string& path, std::string& volume);
 // 1 when the volume holding the real path `path` serves as a cluster file
 // system brick, 0 when not, -1 when the path lies on no volume.
 int KIVOVolumeIsUsedByGlusterFs(const std::string& path);
@@ -68,13 +68,13 @@ struct KIVOMountVolInfo {
   uint64_t free_bytes = 0;  // free space (statvfs, capped)
 };
 // 0 and `info` filled, or -1 when `path` is no configured volume.
-int KIVOMountVolInfoGet(const char* path, KIVOMountVolInfo* info);
+[[nodiscard]] int KIVOMountVolInfoGet(const char* path, KIVOMountVolInfo* info);
 
 // The temporary folder of the shared folder that holds the real path
 // `path` ("<root>/volume1/<share>/x"): the volume's "@tmp" folder, where
 // uploads and downloads are kept. Written to `buf` (NUL-terminated); the
 // length, or -1 when `path` lies on no volume or `buf` is too small.
-int KIVOShareTmpPathGet(const char* path, char* buf, int size);
+[[nodiscard]] int KIVOShareTmpPathGet(const char* path, char* buf, int size);
 
 namespace KIVO {
 namespace PXS {
@@ -88,7 +88,7 @@ class Volume {
   // out["volumes"] = [{"volume_path", "status", "size_free_byte",
   // "size_total_byte", "is_brick"}], out["volume_count"]. False when the
   // storage configuration cannot be read.
-  bool VolumeListGet(Json::Value& out, bool with_unusable);
+  [[nodiscard]] bool VolumeListGet(Json::Value& out, bool with_unusable);
 
  private:
   // Every kind of listing is the same so far; the flags are kept for when

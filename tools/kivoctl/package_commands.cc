@@ -70,6 +70,13 @@ int Report(PackageManager& pm, bool ok, const std::string& what) {
               "]");
 }
 
+// "running" or "stopped"; "broken" when its installed files are gone.
+std::string RunState(PackageManager& pm, const PackageInfo& info) {
+  bool running = false;
+  if (pm.getServiceStatus(info, running, true)) return running ? "running" : "stopped";
+  return pm.getResult() == PKG_ERR_BROKEN ? "broken" : PMSResultText(pm.getResult());
+}
+
 int Usage(const std::string& usage) {
   std::cerr << "kivoctl: usage: " << usage << "\n";
   return 2;
@@ -176,10 +183,7 @@ int KivoctlStatus(const std::vector<std::string>& args) {
     return Fail(args[0] + ": " + PMSResultText(pm.getResult()) + " [" +
                 std::to_string(pm.getResult()) + "]");
   }
-  bool running = false;
-  pm.getServiceStatus(info, running, true);
-  std::cout << args[0] << " " << info.getVersion() << " " << (running ? "running" : "stopped")
-            << "\n";
+  std::cout << args[0] << " " << info.getVersion() << " " << RunState(pm, info) << "\n";
   return 0;
 }
 
@@ -188,10 +192,9 @@ int KivoctlList(const std::vector<std::string>& args) {
   if (!pm.init()) return Fail("the package registry cannot be read");
   for (const std::string& id : pm.enumPackages()) {
     PackageInfo info;
-    bool running = false;
-    pm.getPackageInfo(id, info);
-    pm.getServiceStatus(info, running, true);
-    std::cout << id << " " << info.getVersion() << " " << (running ? "running" : "stopped") << "\n";
+    // A package removed since the listing is not listed.
+    if (!pm.getPackageInfo(id, info)) continue;
+    std::cout << id << " " << info.getVersion() << " " << RunState(pm, info) << "\n";
   }
   return 0;
 }
@@ -199,7 +202,7 @@ int KivoctlList(const std::vector<std::string>& args) {
 int KivoctlLog(const std::vector<std::string>& args) {
   if (args.size() != 1) return Usage("kivoctl log ID");
   PackageManager pm;
-  pm.init();
+  if (!pm.init()) return Fail("the package registry cannot be read");
   std::string path = pm.getPackageLog(args[0]);
   if (pm.getResult() == PKG_ERR_NOT_INSTALLED) return Fail(args[0] + " is not installed");
   std::cout << (path.empty() ? "" : PMSReadPackageLog(path));
