@@ -395,11 +395,11 @@ TEST_F(InstallFlowTest, CleanAndGuardedDelete) {
   EXPECT_TRUE(KLIBCFileExist(root_.Path("/etc/passwd").c_str()));
 }
 
-TEST_F(InstallFlowTest, InstallNamingAServerPackageIsNotAvailableYet) {
+TEST_F(InstallFlowTest, InstallNamingAServerPackageStartsADownload) {
   CgiAnswer a =
       Call("install", {{"name", "demo"}, {"url", "http://127.0.0.1/x.kpk"}, {"filesize", "10"}});
-  EXPECT_EQ(4501, a.Code());
-  EXPECT_EQ("not_available", a.Errors()["reason"].asString());
+  ASSERT_TRUE(a.Success()) << a.body;
+  EXPECT_EQ("@KIVOPKG_DOWNLOAD_demo", a.Data()["taskid"].asString());
   EXPECT_EQ(4501, Call("install", {{"task_id", "@KIVOPKG_UPLOAD_nothing"}}).Code());
 }
 
