@@ -21,7 +21,7 @@ class PackageFileTest : public ::testing::Test {
  protected:
   void SetUp() override {
     dir_ = root_.Path("/tmp/packages");
-    KIVOFSMkdirP(dir_.c_str());
+    ASSERT_EQ(0, KIVOFSMkdirP(dir_.c_str()));
     SetTrustLevel(1);
   }
   void SetTrustLevel(int level) {
@@ -33,15 +33,17 @@ class PackageFileTest : public ::testing::Test {
     PKG_ERRCODE code = PKG_OK;
     Json::Value details;
     PackageInfo info;
-    CheckPackageFileInfoImpl("enu", file, message, code, details, info);
+    bool ok = CheckPackageFileInfoImpl("enu", file, message, code, details, info);
+    EXPECT_EQ(ok, code == PKG_OK) << message;
     return code;
   }
   int Install(const std::string& file) {
     std::string message;
     PKG_ERRCODE code = PKG_OK;
     Json::Value details;
-    InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true,
-                           true);
+    bool ok = InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details,
+                                     true, true);
+    EXPECT_EQ(ok, code == PKG_OK) << message;
     return code;
   }
   // Nothing of a refused package reached the system.
@@ -94,15 +96,15 @@ TEST_F(PackageFileTest, DamagedFilesAreNotPackageFiles) {
   ASSERT_TRUE(KIVOReadFile(good, &data));
 
   std::string truncated = dir_ + "/truncated.kpk";
-  KIVOWriteFileAtomic(truncated, data.substr(0, data.size() / 2), SyncToDisk::No);
+  ASSERT_TRUE(KIVOWriteFileAtomic(truncated, data.substr(0, data.size() / 2), SyncToDisk::No));
   EXPECT_EQ(PKG_ERR_NOT_PACKAGE_FILE, Check(truncated));
   std::string garbage = dir_ + "/garbage.kpk";
-  KIVOWriteFileAtomic(garbage, std::string(5000, '\x42'), SyncToDisk::No);
+  ASSERT_TRUE(KIVOWriteFileAtomic(garbage, std::string(5000, '\x42'), SyncToDisk::No));
   EXPECT_EQ(PKG_ERR_NOT_PACKAGE_FILE, Check(garbage));
   EXPECT_EQ(PKG_ERR_NOT_PACKAGE_FILE, Check(dir_ + "/missing.kpk"));
 
   std::string payload = dir_ + "/p.tgz";
-  KIVOWriteFileAtomic(payload, "", SyncToDisk::No);
+  ASSERT_TRUE(KIVOWriteFileAtomic(payload, "", SyncToDisk::No));
   std::string error, huge = dir_ + "/huge-info.kpk";
   std::string info = "package=\"huge\"\nversion=\"1\"\n# " + std::string(70 << 10, 'x') + "\n";
   ASSERT_TRUE(PMSWritePackage({{"INFO", info}}, payload, "", huge, &error)) << error;
@@ -115,20 +117,109 @@ TEST_F(PackageFileTest, DamagedFilesAreNotPackageFiles) {
   ExpectUntouched();
 }
 
-TEST_F(PackageFileTest, TamperedPayloadIsABadSignature) {
+TEST_F(PackageFileTest, AnyMemberChangedAfterSigningIsABadSignature) {
+  TestKeys keys(root_.Path("/tmp"));
+  std::string publisher = keys.Create("Publisher <publisher@test.invalid>");
+  keys.Trust(publisher);
+  SetTrustLevel(0);
   TestPackage app;
   app.files = {{"big.txt", std::string(20000, 'a')}};
+  app.scripts = {{"postinst", "exit 0\n"}};
   std::string file = app.Build(dir_);
+  keys.Sign(file, publisher);
+  ASSERT_EQ(PKG_OK, Check(file));
   std::string data;
   ASSERT_TRUE(KIVOReadFile(file, &data));
+  // Each change keeps every length, so the archive stays a sound tar and
+  // only the member's content differs from what was signed.
+  auto tamper = [&](const std::string& name, size_t at, char value) {
+    std::string bytes = data;
+    bytes[at] = value;
+    std::string out = dir_ + "/tampered-" + name + ".kpk";
+    EXPECT_TRUE(KIVOWriteFileAtomic(out, bytes, SyncToDisk::No));
+    return out;
+  };
+  size_t version = data.find("version=\"1.0\"");
+  size_t script = data.find("exit 0");
   size_t payload = data.find("\x1f\x8b\x08", data.find("package.tgz"));
+  ASSERT_NE(std::string::npos, version);
+  ASSERT_NE(std::string::npos, script);
   ASSERT_NE(std::string::npos, payload);
-  data[payload + 40] ^= 0x55;
-  std::string tampered = dir_ + "/tampered.kpk";
-  KIVOWriteFileAtomic(tampered, data, SyncToDisk::No);
-  EXPECT_EQ(PKG_ERR_BAD_SIGNATURE, Check(tampered));
-  EXPECT_EQ(PKG_ERR_BAD_SIGNATURE, Install(tampered));
+  for (const std::string& tampered :
+       {tamper("info", version + 9, '2'), tamper("script", script + 5, '1'),
+        tamper("payload", payload + 40, static_cast<char>(data[payload + 40] ^ 0x55))}) {
+    EXPECT_EQ(PKG_ERR_BAD_SIGNATURE, Check(tampered)) << tampered;
+    EXPECT_EQ(PKG_ERR_BAD_SIGNATURE, Install(tampered)) << tampered;
+    std::string out;
+    EXPECT_EQ(1, Kivoctl({"inspect", tampered}, &out));
+    EXPECT_NE(std::string::npos, out.find("[289]")) << out;
+  }
   ExpectUntouched();
+}
+
+TEST_F(PackageFileTest, PermissionBitsAreKept) {
+  std::string file = BuildRawPackage(dir_, "modes",
+                                     {{"shared", 'd', 01777, ""},
+                                      {"shared/open", 'f', 0666, ""},
+                                      {"private", 'd', 0700, ""},
+                                      {"private/tool", 'f', 0750, ""},
+                                      {"readonly", 'f', 0444, ""}});
+  ASSERT_EQ(PKG_OK, Install(file));
+  std::string target = PackageRegistry::RecordDir("modes") + "/target/";
+  auto mode = [&](const std::string& path) {
+    struct stat st;
+    EXPECT_EQ(0, lstat((target + path).c_str(), &st)) << path;
+    return st.st_mode & 07777;
+  };
+  EXPECT_EQ(01777u, mode("shared"));
+  EXPECT_EQ(0666u, mode("shared/open"));
+  EXPECT_EQ(0700u, mode("private"));
+  EXPECT_EQ(0750u, mode("private/tool"));
+  EXPECT_EQ(0644u, mode("readonly"));  // the owner may always write
+}
+
+// Runs `kivoctl build` as an unprivileged user when this test is root, so
+// that a file without permissions really cannot be opened.
+int BuildAsUser(const std::string& src, const std::string& out, std::string* output) {
+  std::vector<std::string> argv = {BuildDir() + "/bin/kivoctl", "build", src, out};
+  if (getuid() == 0)
+    argv.insert(argv.begin(), {"setpriv", "--reuid=65534", "--regid=65534", "--clear-groups"});
+  return RunProgram(argv, output);
+}
+
+TEST_F(PackageFileTest, BuildFailsWhenAFileCannotBeRead) {
+  // A folder of its own that the unprivileged user may enter and write.
+  std::string dir = root_.Path("/tmp/build-as-user");
+  ASSERT_EQ(0, KIVOFSMkdirP(dir.c_str()));
+  ASSERT_EQ(0, chmod(root_.dir().c_str(), 0755));
+  ASSERT_EQ(0, chmod(root_.Path("/tmp").c_str(), 0755));
+  ASSERT_EQ(0, chmod(dir.c_str(), 0777));
+  TestPackage app;
+  app.files = {{"readable", "fine\n"}, {"secret", "no one may read this\n"}};
+  app.members = {{"LICENSE", "Use it well.\n"}};
+  std::string good = app.Build(dir);
+  ASSERT_EQ(0, chmod(good.c_str(), 0666));
+  std::string src = dir + "/src-" + app.id + "-" + app.version;
+  ASSERT_EQ(0, RunProgram({"chmod", "-R", "a+rwX", src}, nullptr));
+  std::string out, built = dir + "/rebuilt.kpk";
+  ASSERT_EQ(0, BuildAsUser(src, built, &out)) << out;
+  ASSERT_EQ(0, unlink(built.c_str()));
+
+  for (const std::string& unreadable : {src + "/package/secret", src + "/LICENSE"}) {
+    ASSERT_EQ(0, chmod(unreadable.c_str(), 0));
+    EXPECT_EQ(1, BuildAsUser(src, built, &out)) << unreadable;
+    EXPECT_NE(std::string::npos, out.find("cannot")) << out;
+    EXPECT_FALSE(KLIBCFileExist(built.c_str())) << unreadable;
+    std::string listing;
+    RunProgram({"sh", "-c", "ls '" + dir + "' | grep -v '^src-' | grep -v '.kpk$'"}, &listing);
+    EXPECT_EQ("", listing) << "temporary files left: " << listing;
+    ASSERT_EQ(0, chmod(unreadable.c_str(), 0644));
+  }
+  // A folder that cannot be listed is not an empty one.
+  ASSERT_EQ(0, chmod((src + "/package").c_str(), 0311));
+  EXPECT_EQ(1, BuildAsUser(src, built, &out));
+  EXPECT_NE(std::string::npos, out.find("cannot read the folder")) << out;
+  EXPECT_FALSE(KLIBCFileExist(built.c_str()));
 }
 
 TEST_F(PackageFileTest, SignaturesByTrustLevel) {
@@ -166,7 +257,7 @@ TEST_F(PackageFileTest, SignaturesByTrustLevel) {
     std::string other = package("other");
     keys.Sign(other, good);
     std::string data;
-    KIVOReadFile(other, &data);
+    ASSERT_TRUE(KIVOReadFile(other, &data));
     size_t begin = data.find("-----BEGIN PGP SIGNATURE");
     size_t end = data.find("-----END PGP SIGNATURE-----") + 28;
     ASSERT_TRUE(PMSAttachSignature(wrong_manifest, wrong_manifest, data.substr(begin, end - begin),
@@ -209,12 +300,14 @@ TEST_F(PackageFileTest, BuildTellsTheAuthorWhatIsWrong) {
       {"package=\"a\"\nversion=\"1\"\nadminport=\"99999\"\n", "adminport"},
       {"package=\"a\"\nversion=\"1\"\nlogfile=\"../../etc/shadow\"\n", "logfile"},
       {"package=\"a\"\nversion=\"1\"\ninstall_dep_packages=\"b>>1\"\n", "install_dep_packages"},
+      {"package=\"a\"\nversion=\"1\"\nextractsize=\"lots\"\n", "extractsize: must be a number"},
+      {"package=\"a\"\nversion=\"1\"\ndescription=\"\x1b[2J\"\n", "description: holds a control"},
   };
   for (const Case& c : cases) {
     std::string src = dir_ + "/bad-src";
     RunProgram({"rm", "-rf", src}, nullptr);
     root_.Write(src.substr(root_.dir().size()) + "/INFO", c.info);
-    KIVOFSMkdirP((src + "/package").c_str());
+    ASSERT_EQ(0, KIVOFSMkdirP((src + "/package").c_str()));
     std::string error;
     EXPECT_FALSE(PMSBuildPackage(src, dir_ + "/bad.kpk", BuildOptions(), &error));
     EXPECT_NE(std::string::npos, error.find(c.expected)) << c.info << " -> " << error;

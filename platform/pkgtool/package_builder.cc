@@ -3,7 +3,9 @@
 #include <algorithm>
 #include <cstring>
 #include <dirent.h>
+#include <errno.h>
 #include <fcntl.h>
+#include <functional>
 #include <map>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -16,6 +18,7 @@
 #include "klibc/key_value_file.h"
 #include "pkgtool/package_file.h"
 #include "pkgtool/package_info.h"
+#include "pkgtool/result_codes.h"
 #include "pkgtool/sha256.h"
 #include "pkgtool/signature.h"
 #include "webapi/webapi_util.h"
@@ -28,103 +31,162 @@ bool Fail(std::string* error, const std::string& text) {
 }
 
 // Every path below `dir` (relative to `base`), folders before their files,
-// in name order so that builds are reproducible.
-void ListTree(const std::string& base, const std::string& rel, std::vector<std::string>* out) {
+// in name order so that builds are reproducible. False with `*error` when a
+// folder cannot be listed: a build that skipped it would miss files.
+bool ListTree(const std::string& base, const std::string& rel, std::vector<std::string>* out,
+              std::string* error) {
   std::string dir = rel.empty() ? base : base + "/" + rel;
   DIR* d = opendir(dir.c_str());
-  if (!d) return;
+  if (!d) return Fail(error, "cannot read the folder " + dir + ": " + strerror(errno));
   std::vector<std::string> names;
+  errno = 0;
   while (struct dirent* e = readdir(d)) {
     if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) names.push_back(e->d_name);
   }
+  int err = errno;
   closedir(d);
+  if (err != 0) return Fail(error, "cannot read the folder " + dir + ": " + strerror(err));
   std::sort(names.begin(), names.end());
   for (const std::string& name : names) {
     std::string path = rel.empty() ? name : rel + "/" + name;
     out->push_back(path);
     struct stat st;
-    if (lstat((base + "/" + path).c_str(), &st) == 0 && S_ISDIR(st.st_mode))
-      ListTree(base, path, out);
+    if (lstat((base + "/" + path).c_str(), &st) != 0)
+      return Fail(error, "cannot read " + base + "/" + path + ": " + strerror(errno));
+    if (S_ISDIR(st.st_mode) && !ListTree(base, path, out, error)) return false;
+  }
+  return true;
+}
+
+// Reads `fd` to its end in blocks, handing each to `consume`. False with
+// `*error` on a read error (which is not the end of the file) or when
+// `consume` refuses a block.
+bool ReadAll(int fd, const std::string& what,
+             const std::function<bool(const char*, size_t)>& consume, std::string* error) {
+  std::vector<char> buf(1 << 20);
+  for (;;) {
+    ssize_t n = read(fd, buf.data(), buf.size());
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return Fail(error, "cannot read " + what + ": " + strerror(errno));
+    if (n == 0) return true;
+    if (!consume(buf.data(), static_cast<size_t>(n))) return false;
   }
 }
 
-// Writes one file's bytes (from `src_fd`) into the archive, hashing them.
-bool CopyInto(struct archive* a, int src_fd, Sha256* sha) {
-  std::vector<char> buf(1 << 20);
-  for (ssize_t n; (n = read(src_fd, buf.data(), buf.size())) > 0;) {
-    if (sha) sha->Update(buf.data(), static_cast<size_t>(n));
-    if (archive_write_data(a, buf.data(), static_cast<size_t>(n)) != n) return false;
-  }
-  return true;
+// Writes the file open on `src_fd`, whose entry said `size` bytes, into the
+// archive. A file that grew or shrank meanwhile fails the build: tar would
+// pad or cut it silently.
+bool CopyInto(struct archive* a, int src_fd, const std::string& what, int64_t size,
+              std::string* error) {
+  int64_t copied = 0;
+  bool ok = ReadAll(
+      src_fd, what,
+      [&](const char* data, size_t n) {
+        copied += static_cast<int64_t>(n);
+        if (copied > size) return Fail(error, what + " changed while it was read");
+        if (archive_write_data(a, data, n) == static_cast<la_ssize_t>(n)) return true;
+        return Fail(error, "cannot write " + what + " into the archive: " + PMSArchiveError(a));
+      },
+      error);
+  if (ok && copied != size) return Fail(error, what + " changed while it was read");
+  return ok;
+}
+
+bool AddFileEntry(struct archive* a, struct archive_entry* entry, const std::string& full,
+                  const struct stat& st, std::string* error) {
+  int fd = open(full.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  if (fd < 0) return Fail(error, "cannot open " + full + ": " + strerror(errno));
+  archive_entry_set_filetype(entry, AE_IFREG);
+  archive_entry_set_size(entry, st.st_size);
+  bool ok = archive_write_header(a, entry) == ARCHIVE_OK ||
+            Fail(error, "cannot add " + full + ": " + PMSArchiveError(a));
+  ok = ok && CopyInto(a, fd, full, st.st_size, error);
+  close(fd);
+  return ok;
+}
+
+bool AddSymlinkEntry(struct archive* a, struct archive_entry* entry, const std::string& full,
+                     std::string* error) {
+  char target[4096];
+  ssize_t n = readlink(full.c_str(), target, sizeof(target) - 1);
+  if (n < 0) return Fail(error, "cannot read the symlink " + full + ": " + strerror(errno));
+  target[n] = '\0';
+  archive_entry_set_filetype(entry, AE_IFLNK);
+  archive_entry_set_symlink(entry, target);
+  return archive_write_header(a, entry) == ARCHIVE_OK ||
+         Fail(error, "cannot add " + full + ": " + PMSArchiveError(a));
 }
 
 bool AddPayloadEntry(struct archive* a, const std::string& base, const std::string& path,
                      std::string* error) {
   std::string full = base + "/" + path;
   struct stat st;
-  if (lstat(full.c_str(), &st) != 0) return Fail(error, "cannot read " + full);
+  if (lstat(full.c_str(), &st) != 0)
+    return Fail(error, "cannot read " + full + ": " + strerror(errno));
   struct archive_entry* entry = archive_entry_new();
   archive_entry_set_pathname(entry, path.c_str());
-  archive_entry_set_perm(entry, st.st_mode & 0777);
+  if (st.st_mode & (S_ISUID | S_ISGID))
+    return Fail(error, "setuid or setgid file (never installed): package/" + path);
+  archive_entry_set_perm(entry, st.st_mode & 01777);
   archive_entry_set_mtime(entry, st.st_mtime, 0);
-  bool ok = true;
+  bool ok = false;
   if (S_ISDIR(st.st_mode)) {
     archive_entry_set_filetype(entry, AE_IFDIR);
-    ok = archive_write_header(a, entry) == ARCHIVE_OK;
+    ok = archive_write_header(a, entry) == ARCHIVE_OK ||
+         Fail(error, "cannot add " + full + ": " + PMSArchiveError(a));
   } else if (S_ISLNK(st.st_mode)) {
-    char target[4096];
-    ssize_t n = readlink(full.c_str(), target, sizeof(target) - 1);
-    target[n > 0 ? n : 0] = '\0';
-    archive_entry_set_filetype(entry, AE_IFLNK);
-    archive_entry_set_symlink(entry, target);
-    ok = archive_write_header(a, entry) == ARCHIVE_OK;
+    ok = AddSymlinkEntry(a, entry, full, error);
   } else if (S_ISREG(st.st_mode)) {
-    archive_entry_set_filetype(entry, AE_IFREG);
-    archive_entry_set_size(entry, st.st_size);
-    int fd = open(full.c_str(), O_RDONLY | O_CLOEXEC);
-    ok = fd >= 0 && archive_write_header(a, entry) == ARCHIVE_OK && CopyInto(a, fd, nullptr);
-    if (fd >= 0) close(fd);
+    ok = AddFileEntry(a, entry, full, st, error);
   } else {
     ok = Fail(error, "not a file, folder or symlink: package/" + path);
   }
   archive_entry_free(entry);
-  if (!ok && error->empty()) *error = "cannot add package/" + path + ": " + archive_error_string(a);
   return ok;
 }
 
-bool WritePayload(const std::string& dir, const std::string& out, int level, std::string* error) {
+bool WritePayload(const std::string& dir, const std::vector<std::string>& paths,
+                  const std::string& out, int level, std::string* error) {
   struct archive* a = archive_write_new();
+  if (!a) return Fail(error, "out of memory");
   archive_write_set_format_pax_restricted(a);
   archive_write_add_filter_gzip(a);
   archive_write_set_filter_option(a, "gzip", "compression-level", std::to_string(level).c_str());
-  bool ok = archive_write_open_filename(a, out.c_str()) == ARCHIVE_OK;
-  std::vector<std::string> paths;
-  ListTree(dir, "", &paths);
+  bool ok = archive_write_open_filename(a, out.c_str()) == ARCHIVE_OK ||
+            Fail(error, "cannot write " + out + ": " + PMSArchiveError(a));
   for (size_t i = 0; ok && i < paths.size(); ++i) ok = AddPayloadEntry(a, dir, paths[i], error);
-  ok = archive_write_close(a) == ARCHIVE_OK && ok;
-  if (!ok && error->empty())
-    *error = std::string("cannot write the payload: ") + archive_error_string(a);
+  if (ok && archive_write_close(a) != ARCHIVE_OK)
+    ok = Fail(error, "cannot write the payload: " + PMSArchiveError(a));
   archive_write_free(a);
   return ok;
 }
 
-std::string FileDigest(const std::string& path) {
-  Sha256 sha;
+bool FileDigest(const std::string& path, std::string* hex, std::string* error) {
   int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-  std::vector<char> buf(1 << 20);
-  for (ssize_t n; fd >= 0 && (n = read(fd, buf.data(), buf.size())) > 0;) sha.Update(buf.data(), n);
-  if (fd >= 0) close(fd);
-  return sha.FinishHex();
+  if (fd < 0) return Fail(error, "cannot open " + path + ": " + strerror(errno));
+  Sha256 sha;
+  bool ok = ReadAll(
+      fd, path,
+      [&sha](const char* data, size_t n) {
+        sha.Update(data, n);
+        return true;
+      },
+      error);
+  close(fd);
+  if (!ok) return false;
+  *hex = sha.FinishHex();
+  return !hex->empty() || Fail(error, "cannot compute SHA-256 of " + path);
 }
 
 // The package's members other than the payload, by name, read from `source`.
 bool CollectMembers(const std::string& source, std::map<std::string, std::string>* members,
                     std::string* error) {
   std::vector<std::string> paths;
-  ListTree(source, "", &paths);
+  if (!ListTree(source, "", &paths, error)) return false;
   for (const std::string& path : paths) {
     struct stat st;
-    lstat((source + "/" + path).c_str(), &st);
+    if (lstat((source + "/" + path).c_str(), &st) != 0)
+      return Fail(error, "cannot read " + path + ": " + strerror(errno));
     if (path == "package" || path.compare(0, 8, "package/") == 0 || S_ISDIR(st.st_mode)) continue;
     if (!PMSIsPackageMemberName(path))
       return Fail(error, "unexpected file in the package source: " + path);
@@ -157,28 +219,33 @@ bool AddMember(struct archive* a, const std::string& name, const std::string& da
   return ok;
 }
 
-bool AddPayloadMember(struct archive* a, const std::string& payload_path) {
+bool AddPayloadMember(struct archive* a, const std::string& payload_path, std::string* error) {
   struct stat st;
   int fd = open(payload_path.c_str(), O_RDONLY | O_CLOEXEC);
-  if (fd < 0 || fstat(fd, &st) != 0) return false;
+  if (fd < 0) return Fail(error, "cannot open " + payload_path + ": " + strerror(errno));
   struct archive_entry* entry = archive_entry_new();
   archive_entry_set_pathname(entry, "package.tgz");
   archive_entry_set_filetype(entry, AE_IFREG);
   archive_entry_set_perm(entry, 0644);
-  archive_entry_set_size(entry, st.st_size);
-  bool ok = archive_write_header(a, entry) == ARCHIVE_OK && CopyInto(a, fd, nullptr);
+  bool ok = fstat(fd, &st) == 0 || Fail(error, "cannot read " + payload_path);
+  if (ok) archive_entry_set_size(entry, st.st_size);
+  ok = ok && (archive_write_header(a, entry) == ARCHIVE_OK ||
+              Fail(error, "cannot write package.tgz: " + PMSArchiveError(a)));
+  ok = ok && CopyInto(a, fd, payload_path, st.st_size, error);
   archive_entry_free(entry);
   close(fd);
   return ok;
 }
 
 // Writes the outer archive: INFO, MANIFEST, signature.asc, the other
-// members, package.tgz last. Written beside `output` and renamed into place.
+// members, package.tgz last. Written beside `output` and renamed into place;
+// on failure nothing is left.
 bool WriteOuter(const std::string& output, const std::map<std::string, std::string>& members,
                 const std::string& manifest, const std::string& signature,
                 const std::string& payload_path, std::string* error) {
   std::string tmp = output + ".part";
   struct archive* a = archive_write_new();
+  if (!a) return Fail(error, "out of memory");
   archive_write_set_format_pax_restricted(a);
   bool ok = archive_write_open_filename(a, tmp.c_str()) == ARCHIVE_OK &&
             AddMember(a, "INFO", members.at("INFO")) && AddMember(a, "MANIFEST", manifest) &&
@@ -186,10 +253,13 @@ bool WriteOuter(const std::string& output, const std::map<std::string, std::stri
   for (auto it = members.begin(); ok && it != members.end(); ++it) {
     if (it->first != "INFO") ok = AddMember(a, it->first, it->second);
   }
-  ok = ok && AddPayloadMember(a, payload_path) && archive_write_close(a) == ARCHIVE_OK;
-  if (!ok) *error = std::string("cannot write ") + output + ": " + archive_error_string(a);
+  if (!ok) *error = "cannot write " + output + ": " + PMSArchiveError(a);
+  ok = ok && AddPayloadMember(a, payload_path, error);
+  if (ok && archive_write_close(a) != ARCHIVE_OK)
+    ok = Fail(error, "cannot write " + output + ": " + PMSArchiveError(a));
   archive_write_free(a);
-  if (ok && rename(tmp.c_str(), output.c_str()) != 0) ok = Fail(error, "cannot rename " + tmp);
+  if (ok && rename(tmp.c_str(), output.c_str()) != 0)
+    ok = Fail(error, "cannot rename " + tmp + ": " + strerror(errno));
   if (!ok) unlink(tmp.c_str());
   return ok;
 }
@@ -205,15 +275,17 @@ std::string MakeManifest(const std::map<std::string, std::string>& members,
 // Pulls the raw payload of a package file out into `payload_path`.
 bool ExtractRawPayload(const std::string& input, const std::string& payload_path) {
   struct archive* a = archive_read_new();
+  if (!a) return false;
   archive_read_support_format_tar(a);
   bool ok = false;
   if (archive_read_open_filename(a, input.c_str(), 64 << 10) == ARCHIVE_OK) {
     struct archive_entry* entry;
     while (archive_read_next_header(a, &entry) == ARCHIVE_OK) {
-      if (strcmp(archive_entry_pathname(entry), "package.tgz") != 0) continue;
+      const char* name = archive_entry_pathname(entry);
+      if (!name || strcmp(name, "package.tgz") != 0) continue;
       int fd = open(payload_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
       ok = fd >= 0 && archive_read_data_into_fd(a, fd) == ARCHIVE_OK;
-      if (fd >= 0) close(fd);
+      if (fd >= 0 && close(fd) != 0) ok = false;
       break;
     }
   }
@@ -221,16 +293,49 @@ bool ExtractRawPayload(const std::string& input, const std::string& payload_path
   return ok;
 }
 
-// Bytes of the regular files below `dir`.
-uint64_t TreeBytes(const std::string& dir) {
-  std::vector<std::string> paths;
-  ListTree(dir, "", &paths);
-  uint64_t total = 0;
+// The room the payload below `dir` takes unpacked, counted entry by entry
+// as the package-file reader counts it against extractsize.
+bool PayloadRoom(const std::string& dir, const std::vector<std::string>& paths, uint64_t* bytes,
+                 std::string* error) {
+  *bytes = 0;
   for (const std::string& path : paths) {
     struct stat st;
-    if (lstat((dir + "/" + path).c_str(), &st) == 0 && S_ISREG(st.st_mode)) total += st.st_size;
+    if (lstat((dir + "/" + path).c_str(), &st) != 0)
+      return Fail(error, "cannot read package/" + path + ": " + strerror(errno));
+    bool regular = S_ISREG(st.st_mode);
+    *bytes += PMSPayloadEntryBytes(regular, regular ? static_cast<uint64_t>(st.st_size) : 0);
   }
-  return total;
+  return true;
+}
+
+// The payload's files, and INFO's extractsize when the author gave none.
+bool ListPayload(const std::string& dir, std::map<std::string, std::string>* members,
+                 std::vector<std::string>* paths, std::string* error) {
+  struct stat st;
+  if (stat(dir.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
+    return Fail(error, "the package source has no package/ folder (the payload)");
+  }
+  uint64_t room = 0;
+  if (!ListTree(dir, "", paths, error) || !PayloadRoom(dir, *paths, &room, error)) return false;
+  // The installer reserves this room and holds the payload to it.
+  if (!KIVOKeyValueParse((*members)["INFO"]).count("extractsize")) {
+    std::string kib = std::to_string((room + 1023) / 1024);
+    (*members)["INFO"] += KIVOKeyValueLine("extractsize", kib) + "\n";
+  }
+  return true;
+}
+
+// Reads the built file back as an installer would: a build the reader
+// refuses is a failed build, not a package.
+bool VerifyBuilt(const std::string& output, std::string* error) {
+  PackageFileReader reader;
+  std::string problem;
+  int code = reader.Open(output, &problem);
+  if (code == PKG_OK)
+    code = reader.ReadPayload(PackageFileReader::Payload::Check, "", nullptr, &problem);
+  if (code == PKG_OK) return true;
+  unlink(output.c_str());
+  return Fail(error, "the built package would be refused: " + problem);
 }
 
 }  // namespace
@@ -238,29 +343,25 @@ uint64_t TreeBytes(const std::string& dir) {
 bool PMSBuildPackage(const std::string& source, const std::string& output,
                      const BuildOptions& options, std::string* error) {
   std::map<std::string, std::string> members;
-  if (!CollectMembers(source, &members, error)) return false;
-  struct stat st;
-  if (stat((source + "/package").c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
-    return Fail(error, "the package source has no package/ folder (the payload)");
-  }
-  // The installer needs to know the room the payload takes unpacked.
-  if (!KIVOKeyValueParse(members["INFO"]).count("extractsize")) {
-    uint64_t kib = (TreeBytes(source + "/package") + 1023) / 1024;
-    members["INFO"] += KIVOKeyValueLine("extractsize", std::to_string(kib)) + "\n";
+  std::vector<std::string> paths;
+  if (!CollectMembers(source, &members, error) ||
+      !ListPayload(source + "/package", &members, &paths, error)) {
+    return false;
   }
   std::string payload = output + ".payload";
-  bool ok = WritePayload(source + "/package", payload, options.compression_level, error) &&
+  bool ok = WritePayload(source + "/package", paths, payload, options.compression_level, error) &&
             PMSWritePackage(members, payload, "", output, error);
   unlink(payload.c_str());
-  return ok;
+  return ok && VerifyBuilt(output, error);
 }
 
 bool PMSWritePackage(const std::map<std::string, std::string>& members,
                      const std::string& payload_path, const std::string& signature,
                      const std::string& output, std::string* error) {
   if (!members.count("INFO")) return Fail(error, "no INFO member");
-  return WriteOuter(output, members, MakeManifest(members, FileDigest(payload_path)), signature,
-                    payload_path, error);
+  std::string digest;
+  return FileDigest(payload_path, &digest, error) &&
+         WriteOuter(output, members, MakeManifest(members, digest), signature, payload_path, error);
 }
 
 bool PMSAttachSignature(const std::string& input, const std::string& output,

@@ -1,8 +1,10 @@
 #include "pkgtool/package_file.h"
 
 #include <algorithm>
+#include <cstdlib>
 #include <cstring>
 #include <errno.h>
+#include <set>
 #include <sstream>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -11,6 +13,7 @@
 #include <archive.h>
 #include <archive_entry.h>
 
+#include "pkgtool/package_info.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
 #include "pkgtool/sha256.h"
@@ -19,9 +22,10 @@
 namespace {
 
 constexpr int kFormatVersion = 1;
-constexpr int64_t kMaxInfoBytes = 64 << 10;
+constexpr size_t kMaxInfoBytes = 64 << 10;
 constexpr int64_t kMaxMemberBytes = 8 << 20;
 constexpr size_t kMaxHeaderBytes = 32 << 20;
+constexpr uint64_t kBlockBytes = 4096;
 constexpr char kPayload[] = "package.tgz";
 
 int Fail(std::string* error, int code, const std::string& text) {
@@ -48,7 +52,10 @@ int ParseManifest(const std::string& text, std::map<std::string, std::string>* d
     if (!(fields >> algorithm >> hex >> name) || algorithm != "sha256" || hex.size() != 64) {
       return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "MANIFEST line not understood: " + line);
     }
-    (*digests)[name] = hex;
+    // A second digest for one name would let two different members pass.
+    if (!digests->emplace(name, hex).second) {
+      return Fail(error, PKG_ERR_HOSTILE_MEMBER, "MANIFEST lists " + name + " twice");
+    }
   }
   return PKG_OK;
 }
@@ -83,6 +90,15 @@ bool SymlinkStaysInside(const std::string& path, const std::string& target) {
   return true;
 }
 
+// INFO's extractsize in bytes. It is required: without a declaration there
+// is nothing to hold the payload to. Checked as text by PMSCheckInfo.
+bool DeclaredExtractBytes(const KeyValueMap& info, uint64_t* bytes) {
+  auto it = info.find("extractsize");
+  if (it == info.end() || it->second.empty()) return false;
+  *bytes = std::strtoull(it->second.c_str(), nullptr, 10) * 1024;
+  return true;
+}
+
 // Feeds package.tgz from the outer archive to the inner one, hashing it.
 struct PayloadSource {
   struct archive* outer = nullptr;
@@ -102,7 +118,7 @@ la_ssize_t ReadPayloadBlock(struct archive*, void* data, const void** block) {
   if (n > 0) {
     src->sha->Update(src->buffer.data(), static_cast<size_t>(n));
     src->done += static_cast<uint64_t>(n);
-    double fraction = src->total ? static_cast<double>(src->done) / src->total : 1.0;
+    double fraction = src->total ? std::min(1.0, static_cast<double>(src->done) / src->total) : 1.0;
     if (*src->progress && fraction - src->reported >= 0.01) {
       src->reported = fraction;
       (*src->progress)(fraction);
@@ -112,7 +128,7 @@ la_ssize_t ReadPayloadBlock(struct archive*, void* data, const void** block) {
   return n;
 }
 
-// Checks one payload entry; returns PKG_OK or 277 with the reason.
+// Checks one payload entry's kind and mode; returns PKG_OK or 277.
 int CheckEntry(struct archive_entry* entry, const std::string& path, std::string* error) {
   mode_t type = archive_entry_filetype(entry);
   mode_t mode = archive_entry_perm(entry);
@@ -125,6 +141,9 @@ int CheckEntry(struct archive_entry* entry, const std::string& path, std::string
   }
   if (mode & (S_ISUID | S_ISGID)) {
     return Fail(error, PKG_ERR_HOSTILE_MEMBER, "setuid or setgid file in the payload: " + path);
+  }
+  if (type == AE_IFREG && archive_entry_size(entry) < 0) {
+    return Fail(error, PKG_ERR_HOSTILE_MEMBER, "file of negative size in the payload: " + path);
   }
   if (type == AE_IFLNK) {
     const char* target = archive_entry_symlink(entry);
@@ -139,13 +158,19 @@ int WriteErrorCode(int err) {
   return err == ENOSPC || err == EDQUOT ? PKG_ERR_NO_SPACE : PKG_ERR_EXTRACT;
 }
 
-// Copies the current entry's data into `fd`, honouring sparse offsets.
-int CopyData(struct archive* in, int fd, const std::string& path, std::string* error) {
+// Copies the current entry's data into `fd`, honouring sparse offsets but
+// never writing past the size the entry declared (and was counted with).
+int CopyData(struct archive* in, int fd, const std::string& path, uint64_t declared,
+             std::string* error) {
   const void* block;
   size_t size;
   la_int64_t offset;
   int r;
   while ((r = archive_read_data_block(in, &block, &size, &offset)) == ARCHIVE_OK) {
+    if (offset < 0 || static_cast<uint64_t>(offset) > declared ||
+        size > declared - static_cast<uint64_t>(offset)) {
+      return Fail(error, PKG_ERR_HOSTILE_MEMBER, "data beyond the declared size of " + path);
+    }
     const char* p = static_cast<const char*>(block);
     while (size > 0) {
       ssize_t n = pwrite(fd, p, size, offset);
@@ -158,37 +183,114 @@ int CopyData(struct archive* in, int fd, const std::string& path, std::string* e
     }
   }
   if (r != ARCHIVE_EOF) {
-    return Fail(error, PKG_ERR_EXTRACT,
-                "payload damaged at " + path + ": " + archive_error_string(in));
+    return Fail(error, PKG_ERR_EXTRACT, "payload damaged at " + path + ": " + PMSArchiveError(in));
   }
   return PKG_OK;
+}
+
+int ExtractFile(struct archive* in, struct archive_entry* entry, const std::string& path,
+                TreeWriter* writer, std::string* error) {
+  int fd = -1;
+  int err = writer->CreateFile(path, archive_entry_perm(entry) | 0600, &fd);
+  if (err != 0)
+    return Fail(error, WriteErrorCode(err), "cannot create " + path + ": " + strerror(err));
+  int code = CopyData(in, fd, path, static_cast<uint64_t>(archive_entry_size(entry)), error);
+  if (close(fd) != 0 && code == PKG_OK)
+    code = Fail(error, WriteErrorCode(errno), "cannot write " + path + ": " + strerror(errno));
+  return code;
 }
 
 int ExtractEntry(struct archive* in, struct archive_entry* entry, const std::string& path,
                  TreeWriter* writer, std::string* error) {
   mode_t type = archive_entry_filetype(entry);
-  mode_t mode = archive_entry_perm(entry);
-  int err = 0;
-  if (type == AE_IFDIR) {
-    err = writer->MakeDirectory(path, mode | 0700);
-  } else if (type == AE_IFLNK) {
-    err = writer->MakeSymlink(path, archive_entry_symlink(entry));
-  } else {
-    int fd = -1;
-    err = writer->CreateFile(path, mode | 0600, &fd);
-    if (err == 0) {
-      int code = CopyData(in, fd, path, error);
-      if (close(fd) != 0 && code == PKG_OK)
-        code = Fail(error, WriteErrorCode(errno), "cannot write " + path);
-      return code;
-    }
-  }
+  if (type == AE_IFREG) return ExtractFile(in, entry, path, writer, error);
+  // Folders stay enterable and writable for the owner: the files that
+  // follow are written into them.
+  int err = type == AE_IFDIR ? writer->MakeDirectory(path, archive_entry_perm(entry) | 0700)
+                             : writer->MakeSymlink(path, archive_entry_symlink(entry));
   if (err != 0)
     return Fail(error, WriteErrorCode(err), "cannot create " + path + ": " + strerror(err));
   return PKG_OK;
 }
 
+// The payload's entries as they stream by: each checked, each path taken
+// once, all of them counted against the room INFO declared before any of
+// their data is read, and with a writer, written out.
+class PayloadWalker {
+ public:
+  PayloadWalker(TreeWriter* writer, uint64_t limit) : writer_(writer), limit_(limit) {}
+
+  int Walk(struct archive* in, std::string* error) {
+    struct archive_entry* entry;
+    int r;
+    while ((r = archive_read_next_header(in, &entry)) == ARCHIVE_OK) {
+      int code = Visit(in, entry, error);
+      if (code != PKG_OK) return code;
+    }
+    if (r != ARCHIVE_EOF)
+      return Fail(error, PKG_ERR_EXTRACT, "payload damaged: " + PMSArchiveError(in));
+    return PKG_OK;
+  }
+
+ private:
+  int Visit(struct archive* in, struct archive_entry* entry, std::string* error) {
+    std::string path;
+    const char* raw = archive_entry_pathname(entry);
+    if (!raw || !NormalizeEntryPath(raw, &path)) {
+      return Fail(error, PKG_ERR_HOSTILE_MEMBER,
+                  std::string("payload path escapes the package: ") + (raw ? raw : ""));
+    }
+    if (path.empty()) return PKG_OK;
+    int code = CheckEntry(entry, path, error);
+    if (code != PKG_OK) return code;
+    if (!seen_.insert(path).second)
+      return Fail(error, PKG_ERR_HOSTILE_MEMBER, "the payload holds " + path + " twice");
+    bool regular = archive_entry_filetype(entry) == AE_IFREG;
+    uint64_t room = PMSPayloadEntryBytes(regular, regular ? archive_entry_size(entry) : 0);
+    if (room > limit_ - used_) {
+      return Fail(error, PKG_ERR_HOSTILE_MEMBER,
+                  "the payload takes more room unpacked than its extractsize of " +
+                      std::to_string(limit_ / 1024) + " KiB declares (at " + path + ")");
+    }
+    used_ += room;
+    return writer_ ? ExtractEntry(in, entry, path, writer_, error) : PKG_OK;
+  }
+
+  TreeWriter* writer_;
+  const uint64_t limit_;
+  uint64_t used_ = 0;
+  std::set<std::string> seen_;
+};
+
+// The package file must end with the payload: a member after it would be
+// one no check has seen (a second INFO, a second payload).
+int CheckNothingFollows(struct archive* outer, std::string* error) {
+  struct archive_entry* entry;
+  int r = archive_read_next_header(outer, &entry);
+  if (r == ARCHIVE_EOF) return PKG_OK;
+  if (r == ARCHIVE_OK || r == ARCHIVE_WARN) {
+    const char* name = archive_entry_pathname(entry);
+    return Fail(error, PKG_ERR_HOSTILE_MEMBER,
+                std::string("a member follows package.tgz: ") + (name ? name : ""));
+  }
+  return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
+              "damaged archive after package.tgz: " + PMSArchiveError(outer));
+}
+
 }  // namespace
+
+std::string PMSArchiveError(struct archive* a) {
+  const char* text = a ? archive_error_string(a) : nullptr;
+  if (text && *text) return text;
+  int err = a ? archive_errno(a) : 0;
+  return err > 0 ? strerror(err) : "the archive ends early or is damaged";
+}
+
+uint64_t PMSPayloadEntryBytes(bool regular_file, uint64_t size) {
+  if (!regular_file || size == 0) return kBlockBytes;
+  // Rounded up without overflowing near UINT64_MAX.
+  return (size / kBlockBytes + (size % kBlockBytes != 0)) * kBlockBytes;
+}
 
 std::string PMSSha256Hex(const std::string& data) {
   Sha256 sha;
@@ -225,14 +327,16 @@ PackageFileReader::~PackageFileReader() {
 }
 
 int PackageFileReader::ReadMember(const std::string& name, int64_t size, std::string* error) {
-  int64_t limit = name == "INFO" ? kMaxInfoBytes : kMaxMemberBytes;
-  if (size < 0 || size > limit) {
+  // INFO's own, smaller limit is applied after the digests, so that an INFO
+  // changed after signing is a bad signature like any other member.
+  if (size < 0 || size > kMaxMemberBytes) {
     return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
-                name + " is larger than " + std::to_string(limit >> 10) + " KiB");
+                name + " is larger than " + std::to_string(kMaxMemberBytes >> 10) + " KiB");
   }
   std::string data(static_cast<size_t>(size), '\0');
   if (size > 0 && archive_read_data(outer_, &data[0], data.size()) != size) {
-    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "cannot read " + name);
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
+                "cannot read " + name + ": " + PMSArchiveError(outer_));
   }
   if (name == "MANIFEST") {
     header_.manifest = data;
@@ -251,13 +355,8 @@ int PackageFileReader::ReadMember(const std::string& name, int64_t size, std::st
   return PKG_OK;
 }
 
-int PackageFileReader::Open(const std::string& path, std::string* error) {
-  outer_ = archive_read_new();
-  archive_read_support_format_tar(outer_);
-  if (archive_read_open_filename(outer_, path.c_str(), 64 << 10) != ARCHIVE_OK) {
-    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
-                std::string("cannot open: ") + archive_error_string(outer_));
-  }
+int PackageFileReader::ReadHeaderMembers(std::string* error) {
+  std::set<std::string> seen;
   struct archive_entry* entry;
   int r;
   while ((r = archive_read_next_header(outer_, &entry)) == ARCHIVE_OK) {
@@ -272,10 +371,14 @@ int PackageFileReader::Open(const std::string& path, std::string* error) {
     if (type != AE_IFREG || archive_entry_hardlink(entry)) {
       return Fail(error, PKG_ERR_HOSTILE_MEMBER, "member is not a plain file: " + name);
     }
+    // Two members of one name: whichever a reader keeps, the other is one
+    // nobody checked.
+    if (!seen.insert(name).second)
+      return Fail(error, PKG_ERR_HOSTILE_MEMBER, "the package holds " + name + " twice");
     if (name == kPayload) {
-      header_.payload_size = static_cast<uint64_t>(archive_entry_size(entry));
+      header_.payload_size = static_cast<uint64_t>(std::max<int64_t>(0, archive_entry_size(entry)));
       at_payload_ = true;
-      break;
+      return PKG_OK;
     }
     if (!PMSIsPackageMemberName(name)) {
       return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "unexpected member: " + name);
@@ -283,25 +386,61 @@ int PackageFileReader::Open(const std::string& path, std::string* error) {
     int code = ReadMember(name, archive_entry_size(entry), error);
     if (code != PKG_OK) return code;
   }
-  if (r != ARCHIVE_OK && r != ARCHIVE_EOF) {
-    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
-                std::string("damaged archive: ") + archive_error_string(outer_));
+  if (r != ARCHIVE_EOF) {
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "damaged archive: " + PMSArchiveError(outer_));
   }
-  if (!header_.members.count("INFO"))
-    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no INFO member");
-  if (header_.manifest.empty()) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no MANIFEST member");
-  if (!at_payload_) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no package.tgz member");
+  return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no package.tgz member");
+}
+
+int PackageFileReader::VerifyManifest(std::string* error) const {
   for (const auto& m : header_.members) {
+    std::string digest = PMSSha256Hex(m.second);
+    if (digest.empty()) return Fail(error, PKG_ERR_INTERNAL, "cannot compute SHA-256");
     auto it = header_.digests.find(m.first);
-    if (it == header_.digests.end() || it->second != PMSSha256Hex(m.second)) {
+    if (it == header_.digests.end() || it->second != digest) {
       return Fail(error, PKG_ERR_BAD_SIGNATURE, m.first + " does not match MANIFEST");
     }
   }
   if (header_.digests.size() != header_.members.size() + 1 || !header_.digests.count(kPayload)) {
     return Fail(error, PKG_ERR_BAD_SIGNATURE, "MANIFEST lists members the package does not hold");
   }
-  header_.info = KIVOKeyValueParse(header_.members["INFO"]);
   return PKG_OK;
+}
+
+int PackageFileReader::ReadInfo(std::string* error) {
+  auto info = header_.members.find("INFO");
+  if (info == header_.members.end()) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no INFO member");
+  if (info->second.size() > kMaxInfoBytes)
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "INFO is larger than 64 KiB");
+  header_.info = KIVOKeyValueParse(info->second);
+  // Every field that becomes a path, a name in the registry or a value in
+  // a script's environment is judged here, before any caller uses it.
+  std::string field;
+  std::string problem = PMSCheckInfo(header_.info, &field);
+  if (!problem.empty()) {
+    return Fail(error, field == "package" ? PKG_ERR_BAD_ID : PKG_ERR_NOT_PACKAGE_FILE,
+                "INFO: " + problem);
+  }
+  if (!DeclaredExtractBytes(header_.info, &header_.extract_limit)) {
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
+                "INFO: extractsize: required, the KiB the payload takes unpacked");
+  }
+  return PKG_OK;
+}
+
+int PackageFileReader::Open(const std::string& path, std::string* error) {
+  if (outer_) return Fail(error, PKG_ERR_INTERNAL, "package file opened twice");
+  outer_ = archive_read_new();
+  if (!outer_) return Fail(error, PKG_ERR_INTERNAL, "out of memory");
+  archive_read_support_format_tar(outer_);
+  if (archive_read_open_filename(outer_, path.c_str(), 64 << 10) != ARCHIVE_OK) {
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "cannot open: " + PMSArchiveError(outer_));
+  }
+  int code = ReadHeaderMembers(error);
+  if (code != PKG_OK) return code;
+  if (header_.manifest.empty()) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no MANIFEST member");
+  if ((code = VerifyManifest(error)) != PKG_OK) return code;
+  return ReadInfo(error);
 }
 
 int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
@@ -321,30 +460,14 @@ int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
     if (!writer->ok()) return Fail(error, PKG_ERR_EXTRACT, "cannot open " + dest);
   }
   struct archive* in = archive_read_new();
+  if (!in) return Fail(error, PKG_ERR_INTERNAL, "out of memory");
   archive_read_support_filter_gzip(in);
   archive_read_support_format_tar(in);
   int code = PKG_OK;
   if (archive_read_open(in, &src, nullptr, ReadPayloadBlock, nullptr) != ARCHIVE_OK) {
-    code = Fail(error, PKG_ERR_EXTRACT,
-                std::string("payload is not a tar.gz: ") + archive_error_string(in));
-  }
-  struct archive_entry* entry;
-  int r = ARCHIVE_OK;
-  while (code == PKG_OK && (r = archive_read_next_header(in, &entry)) == ARCHIVE_OK) {
-    std::string path;
-    const char* raw = archive_entry_pathname(entry);
-    if (!raw || !NormalizeEntryPath(raw, &path)) {
-      code = Fail(error, PKG_ERR_HOSTILE_MEMBER,
-                  std::string("payload path escapes the package: ") + (raw ? raw : ""));
-      break;
-    }
-    if (path.empty()) continue;
-    code = CheckEntry(entry, path, error);
-    if (code == PKG_OK && writer) code = ExtractEntry(in, entry, path, writer.get(), error);
-  }
-  if (code == PKG_OK && r != ARCHIVE_EOF) {
-    code =
-        Fail(error, PKG_ERR_EXTRACT, std::string("payload damaged: ") + archive_error_string(in));
+    code = Fail(error, PKG_ERR_EXTRACT, "payload is not a tar.gz: " + PMSArchiveError(in));
+  } else {
+    code = PayloadWalker(writer.get(), header_.extract_limit).Walk(in, error);
   }
   archive_read_free(in);
   // The digest covers every byte of package.tgz, also any after the tar's
@@ -353,12 +476,17 @@ int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,
   const void* rest;
   while (ReadPayloadBlock(nullptr, &src, &rest) > 0) {
   }
-  if (src.failed)
-    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "the package file is truncated or damaged");
-  if (sha.FinishHex() != header_.digests[kPayload]) {
+  if (src.failed) {
+    return Fail(error, PKG_ERR_NOT_PACKAGE_FILE,
+                "the package file is truncated or damaged: " + PMSArchiveError(outer_));
+  }
+  std::string digest = sha.FinishHex();
+  if (digest.empty()) return Fail(error, PKG_ERR_INTERNAL, "cannot compute SHA-256");
+  if (digest != header_.digests[kPayload]) {
     return Fail(error, PKG_ERR_BAD_SIGNATURE, "package.tgz does not match MANIFEST");
   }
   if (code != PKG_OK) return code;
+  if ((code = CheckNothingFollows(outer_, error)) != PKG_OK) return code;
   if (progress) progress(1.0);
   return PKG_OK;
 }

@@ -26,6 +26,7 @@ struct PackageFileHeader {
   std::map<std::string, std::string> members;  // scripts, wizards, licence, icons
   std::map<std::string, std::string> digests;  // MANIFEST: member name -> hex SHA-256
   uint64_t payload_size = 0;                   // bytes of package.tgz
+  uint64_t extract_limit = 0;                  // bytes INFO's extractsize allows unpacked
 };
 
 class PackageFileReader {
@@ -36,28 +37,49 @@ class PackageFileReader {
   PackageFileReader& operator=(const PackageFileReader&) = delete;
 
   // Opens `path` and reads every member up to the payload, checking each
-  // against MANIFEST. Returns PKG_OK or a result code (261 not a package
-  // file, 277 a member that is not allowed, 289 a member that does not match
-  // MANIFEST, 293 a newer format), with `*error` saying what was wrong.
-  int Open(const std::string& path, std::string* error);
+  // against MANIFEST, then INFO. Returns PKG_OK or a result code with
+  // `*error` saying what was wrong:
+  //   261  not a package file: damaged or cut short, a member missing or
+  //        too large, MANIFEST malformed, an INFO field invalid (a path,
+  //        version, dependency, extractsize missing or not a number, ...)
+  //   262  INFO's package id breaks the id rule (PMSIsValidPackageId)
+  //   277  a member that is not allowed: escapes, is not a plain file, or
+  //        is the second of its name (also a name MANIFEST lists twice)
+  //   289  a member that does not match MANIFEST, one MANIFEST lists that
+  //        is missing, or one it does not list
+  //   293  a newer format
+  // The digests are compared before INFO is judged, so a member changed
+  // after signing is 289 whatever it now says.
+  [[nodiscard]] int Open(const std::string& path, std::string* error);
   const PackageFileHeader& header() const { return header_; }
 
   // What ReadPayload does with the payload's entries.
   enum class Payload { Check, Extract };
 
   // Streams the payload: every entry is checked before anything is done with
-  // it (relative paths that stay inside, no hard links, device nodes, fifos
-  // or setuid/setgid bits, symlinks that point inside); with Extract it is
-  // written under `dest`, an existing empty folder, never following a
-  // symlink. The payload's digest must match MANIFEST. `progress` gets the
-  // fraction read so far. Returns PKG_OK or a code (276, 277, 279, 289) with
-  // `*error` set; after a failure `dest` holds a partial tree for the caller
-  // to remove.
-  int ReadPayload(Payload mode, const std::string& dest,
-                  const std::function<void(double)>& progress, std::string* error);
+  // it (relative paths that stay inside, each path once, no hard links,
+  // device nodes, fifos or setuid/setgid bits, symlinks that point inside,
+  // and all of them together within header().extract_limit); with Extract
+  // it is written under `dest`, an existing empty folder, never following a
+  // symlink, with its permission bits (owner read/write, and enter for
+  // folders, added). Nothing may follow package.tgz in the package file.
+  // `progress` gets the fraction read so far. Returns PKG_OK or a code with
+  // `*error` set; the payload's digest decides first:
+  //   261  the package file is cut short or damaged around the payload
+  //   289  package.tgz does not match MANIFEST
+  //   276  the payload is not a readable tar.gz, or a file cannot be written
+  //   277  an entry that is not allowed, a payload larger than extractsize
+  //        declares, or a member after package.tgz
+  //   279  the volume is full
+  // After a failure `dest` holds a partial tree for the caller to remove.
+  [[nodiscard]] int ReadPayload(Payload mode, const std::string& dest,
+                                const std::function<void(double)>& progress, std::string* error);
 
  private:
   int ReadMember(const std::string& name, int64_t size, std::string* error);
+  int ReadHeaderMembers(std::string* error);
+  int VerifyManifest(std::string* error) const;
+  int ReadInfo(std::string* error);
 
   struct archive* outer_ = nullptr;
   PackageFileHeader header_;
@@ -65,7 +87,17 @@ class PackageFileReader {
 };
 
 // Hex SHA-256 of `data`.
-std::string PMSSha256Hex(const std::string& data);
+[[nodiscard]] std::string PMSSha256Hex(const std::string& data);
 
 // The names a package file may hold besides the payload.
 bool PMSIsPackageMemberName(const std::string& name);
+
+// The room one payload entry takes unpacked, as extractsize counts it: a
+// regular file its size in whole 4 KiB blocks (at least one), any other
+// entry one block. The builder declares the sum, the reader enforces it.
+uint64_t PMSPayloadEntryBytes(bool regular_file, uint64_t size);
+
+// libarchive's text for the last error of `a`; never null, since libarchive
+// leaves it unset for some failures (a read callback's error, a cut-short
+// stream).
+std::string PMSArchiveError(struct archive* a);

@@ -4,6 +4,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <functional>
 
 #include "pkgtool/registry.h"
 
@@ -75,15 +76,25 @@ bool IsOSVersion(const std::string& v) {
   return sscanf(v.c_str(), "%d.%d-%d%c", &major, &minor, &build, &tail) == 3;
 }
 
-bool IsCleanText(const std::string& v) { return v.size() <= 4096; }
+// No NUL or other control character (a tab aside): values reach paths, C
+// strings and script environments, where such a byte would cut or bend them.
+bool IsPlainText(const std::string& v) {
+  return std::none_of(v.begin(), v.end(), [](char c) {
+    unsigned char u = static_cast<unsigned char>(c);
+    return (u < 0x20 && u != '\t') || u == 0x7f;
+  });
+}
 
-}  // namespace
+// KiB as decimal digits, at most 12 of them, so the byte count cannot
+// overflow.
+bool IsKiBCount(const std::string& v) {
+  return !v.empty() && v.size() <= 12 && v.find_first_not_of("0123456789") == std::string::npos;
+}
 
-std::string PMSCheckInfo(const KeyValueMap& info) {
-  auto get = [&info](const char* key) {
-    auto it = info.find(key);
-    return it == info.end() ? std::string() : it->second;
-  };
+using InfoGetter = std::function<std::string(const char*)>;
+
+// Each check below answers "" or "<key>: what is wrong".
+std::string CheckIdentity(const InfoGetter& get) {
   if (!PMSIsValidPackageId(get("package"))) {
     return "package: required, 1 to 64 characters of A-Z a-z 0-9 . _ + -, starting with a letter "
            "or digit";
@@ -91,6 +102,10 @@ std::string PMSCheckInfo(const KeyValueMap& info) {
   if (!PMSIsValidVersion(get("version"))) {
     return "version: required, up to 32 characters of A-Z a-z 0-9 . _ + - with at least one digit";
   }
+  return "";
+}
+
+std::string CheckForms(const InfoGetter& get) {
   for (const char* key :
        {"beta", "startable", "silent_install", "silent_upgrade", "silent_uninstall",
         "install_reboot", "support_center", "ctl_uninstall", "checkport"}) {
@@ -102,14 +117,22 @@ std::string PMSCheckInfo(const KeyValueMap& info) {
     }
   }
   std::string port = get("adminport");
-  if (!port.empty() && (port.find_first_not_of("0123456789") != std::string::npos ||
-                        std::atoi(port.c_str()) < 1 || std::atoi(port.c_str()) > 65535)) {
+  if (!port.empty() &&
+      (port.find_first_not_of("0123456789") != std::string::npos || port.size() > 5 ||
+       std::atoi(port.c_str()) < 1 || std::atoi(port.c_str()) > 65535)) {
     return "adminport: must be a port number from 1 to 65535";
   }
   std::string protocol = get("adminprotocol");
   if (!protocol.empty() && protocol != "http" && protocol != "https") {
     return "adminprotocol: must be http or https";
   }
+  if (!get("extractsize").empty() && !IsKiBCount(get("extractsize"))) {
+    return "extractsize: must be a number of KiB (up to 12 digits)";
+  }
+  return "";
+}
+
+std::string CheckPathsAndNames(const InfoGetter& get) {
   for (const char* key : {"logfile", "pidfile"}) {
     if (!get(key).empty() && !PMSIsContainedRelativePath(get(key))) {
       return std::string(key) + ": must be a relative path inside the package's data folder";
@@ -124,8 +147,30 @@ std::string PMSCheckInfo(const KeyValueMap& info) {
              ": entries are id or id<op>version separated by ':' (op: = > >= < <= !=)";
     }
   }
+  return "";
+}
+
+std::string CheckText(const KeyValueMap& info) {
   for (const auto& kv : info) {
-    if (!IsCleanText(kv.second)) return kv.first + ": longer than 4096 characters";
+    if (!IsPlainText(kv.first)) return "INFO: a key holds a control character";
+    if (!IsPlainText(kv.second)) return kv.first + ": holds a control character";
+    if (kv.second.size() > 4096) return kv.first + ": longer than 4096 characters";
   }
   return "";
+}
+
+}  // namespace
+
+std::string PMSCheckInfo(const KeyValueMap& info, std::string* field) {
+  InfoGetter get = [&info](const char* key) {
+    auto it = info.find(key);
+    return it == info.end() ? std::string() : it->second;
+  };
+  // Text first: the checks after it may take a value as a C string.
+  std::string problem = CheckText(info);
+  if (problem.empty()) problem = CheckIdentity(get);
+  if (problem.empty()) problem = CheckForms(get);
+  if (problem.empty()) problem = CheckPathsAndNames(get);
+  if (field) *field = problem.substr(0, problem.find(':'));
+  return problem;
 }

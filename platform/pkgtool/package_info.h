@@ -91,6 +91,9 @@ class PackageInfo {
   unsigned wizard_mask_ = 0;
 };
 
-// The INFO keys a package must have, and the checks `kivoctl build` makes.
-// Returns "" when `info` is acceptable, else what is wrong, for the author.
-std::string PMSCheckInfo(const KeyValueMap& info);
+// The INFO keys a package must have and the form of every field that
+// becomes a path, a registry name, an environment value or a number: the
+// checks `kivoctl build` makes and the package-file reader repeats. Returns
+// "" when `info` is acceptable, else what is wrong, for the author; `*field`
+// (when given) gets the key at fault.
+std::string PMSCheckInfo(const KeyValueMap& info, std::string* field = nullptr);

@@ -12,9 +12,12 @@ class Sha256 {
   Sha256& operator=(const Sha256&) = delete;
 
   void Update(const void* data, size_t size);
-  // The digest as lower-case hex; the object is spent afterwards.
-  std::string FinishHex();
+  // The digest as lower-case hex; "" when OpenSSL failed at any step (so it
+  // never equals a digest it was meant to match). The object is spent
+  // afterwards.
+  [[nodiscard]] std::string FinishHex();
 
  private:
   void* ctx_;
+  bool ok_;
 };

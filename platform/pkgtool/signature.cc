@@ -92,7 +92,10 @@ int PMSCheckSignature(const std::string& data, const std::string& signature, std
                       std::string* error) {
   if (signature.empty()) return PKG_ERR_NO_SIGNATURE;
   std::string home = PMSKeyringHome();
-  KIVOFSMkdirP(home.c_str(), 0700);
+  if (KIVOFSMkdirP(home.c_str(), 0700) != 0) {
+    *error = "cannot make the keyring folder " + home;
+    return PKG_ERR_SIGNATURE_UNCHECKABLE;
+  }
   GpgContext ctx(home);
   if (!ctx.get()) {
     *error = "cannot start GnuPG";
@@ -134,8 +137,12 @@ bool PMSSignData(const std::string& gnupg_home, const std::string& key, const st
     return false;
   }
   gpgme_signers_clear(ctx.get());
-  gpgme_signers_add(ctx.get(), signing_key);
+  gpgme_error_t added = gpgme_signers_add(ctx.get(), signing_key);
   gpgme_key_unref(signing_key);
+  if (added) {
+    *error = std::string("cannot sign with ") + key + ": " + gpgme_strerror(added);
+    return false;
+  }
   GpgData text(data), sig;
   gpgme_error_t err = gpgme_op_sign(ctx.get(), text.get(), sig.get(), GPGME_SIG_MODE_DETACH);
   if (err) {

@@ -23,16 +23,16 @@ int PMSTrustLevel();
 // signature), PKG_ERR_UNKNOWN_SIGNER, PKG_ERR_EXPIRED_KEY,
 // PKG_ERR_REVOKED_KEY, or PKG_ERR_SIGNATURE_UNCHECKABLE.
 // `*signer` gets the key's fingerprint when one was named.
-int PMSCheckSignature(const std::string& data, const std::string& signature, std::string* signer,
-                      std::string* error);
+[[nodiscard]] int PMSCheckSignature(const std::string& data, const std::string& signature,
+                                    std::string* signer, std::string* error);
 
 // Applies the trust level to an outcome: PKG_OK when the package may be used.
-int PMSApplyTrustLevel(int outcome, int trust_level);
+[[nodiscard]] int PMSApplyTrustLevel(int outcome, int trust_level);
 
 // Signs `data` with `key` (fingerprint, id or user id) of the keyring in
 // `gnupg_home`; *signature gets an armored detached signature.
-bool PMSSignData(const std::string& gnupg_home, const std::string& key, const std::string& data,
-                 std::string* signature, std::string* error);
+[[nodiscard]] bool PMSSignData(const std::string& gnupg_home, const std::string& key,
+                               const std::string& data, std::string* signature, std::string* error);
 
 // The appliance keyring's folder.
 std::string PMSKeyringHome();

@@ -44,28 +44,43 @@ int TreeWriter::OpenParent(const std::string& path, std::string* name) {
   return fd;
 }
 
+namespace {
+
+constexpr mode_t kKeptBits = 01777;
+
+// Sets the mode of the open `fd` and closes it; 0 or an errno value.
+int ChmodAndClose(int fd, mode_t mode) {
+  int err = fchmod(fd, mode & kKeptBits) == 0 ? 0 : errno;
+  close(fd);
+  return err;
+}
+
+}  // namespace
+
 int TreeWriter::MakeDirectory(const std::string& path, mode_t mode) {
   std::string name;
   int parent = OpenParent(path, &name);
   if (parent < 0) return errno;
-  if (mkdirat(parent, name.c_str(), mode & 0777) != 0) {
-    if (errno != EEXIST) return errno;
-    struct stat st;
-    // An existing entry of that name must be a real folder, not a symlink.
-    if (fstatat(parent, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
-    if (!S_ISDIR(st.st_mode)) return ENOTDIR;
-    fchmodat(parent, name.c_str(), mode & 0777, 0);
-  }
-  return 0;
+  if (mkdirat(parent, name.c_str(), 0700) != 0 && errno != EEXIST) return errno;
+  // Opened without following a symlink, so an existing entry of that name
+  // must be a real folder; its mode is set through the descriptor.
+  int fd = openat(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (fd < 0) return errno == ELOOP ? ENOTDIR : errno;
+  return ChmodAndClose(fd, mode);
 }
 
 int TreeWriter::CreateFile(const std::string& path, mode_t mode, int* fd) {
   std::string name;
   int parent = OpenParent(path, &name);
   if (parent < 0) return errno;
-  *fd = openat(parent, name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC,
-               mode & 0777);
-  return *fd < 0 ? errno : 0;
+  *fd = openat(parent, name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600);
+  if (*fd < 0) return errno;
+  // The umask applied at creation would drop group and other write bits.
+  if (fchmod(*fd, mode & kKeptBits) == 0) return 0;
+  int err = errno;
+  close(*fd);
+  *fd = -1;
+  return err;
 }
 
 int TreeWriter::MakeSymlink(const std::string& path, const std::string& target) {

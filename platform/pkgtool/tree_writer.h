@@ -17,11 +17,15 @@ class TreeWriter {
   bool ok() const { return root_fd_ >= 0; }
 
   // Each returns 0 or an errno value. `path` is a checked relative path.
-  int MakeDirectory(const std::string& path, mode_t mode);
+  // Modes are applied exactly, whatever the umask, with the permission bits
+  // and the sticky bit (01777); setuid and setgid are never set.
+  //
+  // Makes a folder, or gives an existing one (never a symlink) `mode`.
+  [[nodiscard]] int MakeDirectory(const std::string& path, mode_t mode);
   // Creates a new regular file (an existing one is an error: EEXIST) and
   // returns its descriptor in *fd; the caller writes and closes it.
-  int CreateFile(const std::string& path, mode_t mode, int* fd);
-  int MakeSymlink(const std::string& path, const std::string& target);
+  [[nodiscard]] int CreateFile(const std::string& path, mode_t mode, int* fd);
+  [[nodiscard]] int MakeSymlink(const std::string& path, const std::string& target);
 
  private:
   // Opens the folder that holds `path`'s last component, creating missing

@@ -12,6 +12,7 @@
 
 #include "klibc/atomic_file.h"
 #include "pkgtool/package_builder.h"
+#include "pkgtool/package_file.h"
 #include "testing/temp_root.h"
 
 namespace {
@@ -28,7 +29,7 @@ const char kDaemonScript[] =
     "esac\n";
 
 void Write(const std::string& path, const std::string& content, unsigned mode = 0644) {
-  KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str());
+  ASSERT_EQ(0, KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str())) << path;
   ASSERT_TRUE(KIVOWriteFileAtomic(path, content, SyncToDisk::No, mode)) << path;
 }
 
@@ -41,7 +42,7 @@ std::string TestPackage::Build(const std::string& dir) const {
   if (daemon) keys.emplace("pidfile", "daemon.pid");
   for (const auto& kv : keys) info_text += kv.first + "=\"" + kv.second + "\"\n";
   Write(src + "/INFO", info_text);
-  KIVOFSMkdirP((src + "/package").c_str());
+  EXPECT_EQ(0, KIVOFSMkdirP((src + "/package").c_str())) << src;
   for (const auto& f : files) Write(src + "/package/" + f.first, f.second);
   std::map<std::string, std::string> all_scripts = scripts;
   if (daemon) all_scripts.emplace("start-stop-status", kDaemonScript);
@@ -54,13 +55,11 @@ std::string TestPackage::Build(const std::string& dir) const {
   return out;
 }
 
-std::string BuildRawPackage(const std::string& dir, const std::string& id,
-                            const std::vector<RawEntry>& entries) {
-  std::string payload = dir + "/" + id + ".payload.tgz";
+void WriteRawPayload(const std::string& path, const std::vector<RawEntry>& entries) {
   struct archive* a = archive_write_new();
   archive_write_set_format_pax_restricted(a);
   archive_write_add_filter_gzip(a);
-  archive_write_open_filename(a, payload.c_str());
+  ASSERT_EQ(ARCHIVE_OK, archive_write_open_filename(a, path.c_str())) << path;
   for (const RawEntry& e : entries) {
     struct archive_entry* entry = archive_entry_new();
     archive_entry_set_pathname(entry, e.path.c_str());
@@ -87,19 +86,58 @@ std::string BuildRawPackage(const std::string& dir, const std::string& id,
         break;
     }
     archive_entry_set_size(entry, static_cast<la_int64_t>(data.size()));
-    archive_write_header(a, entry);
-    if (!data.empty()) archive_write_data(a, data.data(), data.size());
+    EXPECT_EQ(ARCHIVE_OK, archive_write_header(a, entry)) << e.path;
+    if (!data.empty()) {
+      EXPECT_EQ(static_cast<la_ssize_t>(data.size()),
+                archive_write_data(a, data.data(), data.size()));
+    }
     archive_entry_free(entry);
   }
-  archive_write_close(a);
+  EXPECT_EQ(ARCHIVE_OK, archive_write_close(a));
   archive_write_free(a);
+}
+
+std::string BuildRawPackage(const std::string& dir, const std::string& id,
+                            const std::vector<RawEntry>& entries) {
+  std::string payload = dir + "/" + id + ".payload.tgz";
+  WriteRawPayload(payload, entries);
   std::string out = dir + "/" + id + ".kpk";
   std::string error;
+  // Room enough for every entry: what is tested here is what they are.
+  std::string extractsize = std::to_string(4 * (entries.size() + 1));
   std::map<std::string, std::string> members = {
-      {"INFO", "package=\"" + id + "\"\nversion=\"1.0\"\nstartable=\"no\"\n"}};
+      {"INFO", "package=\"" + id + "\"\nversion=\"1.0\"\nstartable=\"no\"\nextractsize=\"" +
+                   extractsize + "\"\n"}};
   EXPECT_TRUE(PMSWritePackage(members, payload, "", out, &error)) << error;
   unlink(payload.c_str());
   return out;
+}
+
+void WriteRawPackageFile(const std::string& path, const MemberList& members) {
+  struct archive* a = archive_write_new();
+  archive_write_set_format_pax_restricted(a);
+  ASSERT_EQ(ARCHIVE_OK, archive_write_open_filename(a, path.c_str())) << path;
+  for (const auto& m : members) {
+    struct archive_entry* entry = archive_entry_new();
+    archive_entry_set_pathname(entry, m.first.c_str());
+    archive_entry_set_filetype(entry, AE_IFREG);
+    archive_entry_set_perm(entry, 0644);
+    archive_entry_set_size(entry, static_cast<la_int64_t>(m.second.size()));
+    EXPECT_EQ(ARCHIVE_OK, archive_write_header(a, entry)) << m.first;
+    if (!m.second.empty()) {
+      EXPECT_EQ(static_cast<la_ssize_t>(m.second.size()),
+                archive_write_data(a, m.second.data(), m.second.size()));
+    }
+    archive_entry_free(entry);
+  }
+  EXPECT_EQ(ARCHIVE_OK, archive_write_close(a));
+  archive_write_free(a);
+}
+
+std::string Manifest(const MemberList& members) {
+  std::string text = "KIVO-MANIFEST 1\n";
+  for (const auto& m : members) text += "sha256 " + PMSSha256Hex(m.second) + " " + m.first + "\n";
+  return text;
 }
 
 int RunProgram(const std::vector<std::string>& argv, std::string* out,

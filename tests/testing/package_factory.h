@@ -4,6 +4,7 @@
 
 #include <map>
 #include <string>
+#include <utility>
 #include <vector>
 
 struct TestPackage {
@@ -30,6 +31,16 @@ struct RawEntry {
 };
 std::string BuildRawPackage(const std::string& dir, const std::string& id,
                             const std::vector<RawEntry>& entries);
+// Writes just such a payload (a tar.gz) to `path`.
+void WriteRawPayload(const std::string& path, const std::vector<RawEntry>& entries);
+
+// A package file's outer archive as written: members in order, names and
+// contents exactly as given, so a test can write what no builder would
+// (two members of one name, a member after the payload). `Manifest` makes
+// the MANIFEST text listing the members given, in that order.
+using MemberList = std::vector<std::pair<std::string, std::string>>;
+void WriteRawPackageFile(const std::string& path, const MemberList& members);
+std::string Manifest(const MemberList& members);
 
 // Runs a program and returns its exit status; stdout and stderr into *out.
 int RunProgram(const std::vector<std::string>& argv, std::string* out,

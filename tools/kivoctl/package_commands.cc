@@ -129,7 +129,8 @@ int KivoctlInspect(const std::vector<std::string>& args) {
   code = reader.ReadPayload(PackageFileReader::Payload::Check, "", nullptr, &error);
   out["payload"] = code == PKG_OK ? "intact" : error;
   PrintJson(out);
-  return code;
+  if (code != PKG_OK) return Fail(args[0] + ": " + error + " [" + std::to_string(code) + "]");
+  return 0;
 }
 
 int KivoctlInstall(const std::vector<std::string>& args) {
