@@ -3,10 +3,12 @@
 #include <map>
 #include <string>
 
+#include "error_codes.h"
 #include "feasibility/feasibility_check.h"
 #include "klibc/last_error.h"
 #include "log_line.h"
 #include "package_webapi.h"
+#include "request_values.h"
 
 namespace KIVO_PACKAGE {
 
@@ -39,8 +41,10 @@ void PackageWebAPI::FeasibilityCheck() {
       {"install_check", 0x0E}, {"uninstall_check", 0x0F}, {"stop_check", 0x10}};
   const std::string type = request->GetParam("type", "").asString();
   const Json::Value packages = request->GetParam("packages", Json::Value(Json::arrayValue));
-  if (packages.empty()) {
-    response->SetError(4500, Json::Value());
+  // The names go to the library as one comma-joined C string: each is a
+  // whole package id, so none can carry a separator or a NUL into it.
+  if (packages.empty() || !packages.isArray() || !AreIdsOrEmpty(packages)) {
+    response->SetError(kErrBadParameter, Json::Value());
     return;
   }
   std::string joined;
@@ -56,7 +60,7 @@ void PackageWebAPI::FeasibilityCheck() {
       Json::Value data(Json::objectValue);
       data["reasons"] = reasons;
       data["check_type"] = check.name;
-      response->SetError(4556, data);
+      response->SetError(kErrNotFeasible, data);
       return;
     }
   }

@@ -3,13 +3,26 @@
 #include <algorithm>
 #include <unistd.h>
 
+#include "error_codes.h"
 #include "package_webapi.h"
 #include "pkgtool/package_manager.h"
+#include "pkgtool/result_codes.h"
+#include "request_values.h"
 #include "webapi/webapi_util.h"
 
 namespace KIVO_PACKAGE {
 
 namespace {
+
+// Refusals of a start or stop by the package tool; any other result is a
+// failed start (4580) or stop (4581).
+constexpr ToolCodeMapping kControlErrors[] = {
+    {PKG_ERR_SERVICE_NOT_RUNNING, kErrServiceNotRunning},
+    {PKG_ERR_VERSION_LIMIT, kErrStartVersionLimit},
+    {PKG_ERR_BUSY, kErrBusy},
+    {PKG_ERR_NO_VOLUME, kErrNoVolume},
+    {PKG_ERR_VOLUME_CRASHED, kErrVolumeUnusable},
+};
 
 // The package tool's operation type for a start or stop.
 int OperationType(const std::string& type, bool start) {
@@ -23,35 +36,36 @@ void PackageWebAPI::Start() { StartStop(true); }
 
 void PackageWebAPI::Stop() { StartStop(false); }
 
-bool PackageWebAPI::ServiceControl(const char* name, bool start, Json::Value& result) {
+bool PackageWebAPI::ServiceControl(const std::string& name, bool start, Json::Value& result) {
   PackageManager manager;
   const std::string type = request->GetParam("type", "").asString();
-  if (!name || !*name) {
-    response->SetError(4500, Json::Value());
+  // The whole id is checked: an id is never cut short into another one.
+  if (!IsPackageId(name)) {
+    response->SetError(kErrBadParameter, Json::Value());
     return false;
   }
   if (!manager.init()) {
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
     return false;
   }
   if (start) {
     PackageInfo info;
     if (!manager.getPackageInfo(name, info, request->GetUILanguage(), ~0ULL)) {
-      response->SetError(4501, Json::Value());
+      response->SetError(kErrFailed, Json::Value());
       return false;
     }
     std::string not_started;
     if (!manager.arePackagesInstallAndStart(info.getDependencies(), result["uninstall_packages"],
                                             not_started, nullptr)) {
       result["unstart_packages"] = not_started;
-      response->SetError(4584, result);
+      response->SetError(kErrStartDependency, result);
       return false;
     }
   } else {
     std::string running;
     if (!manager.areDependentPackageStop(name, request->GetUILanguage().c_str(), running)) {
       result["packages"] = running;
-      response->SetError(4582, result);
+      response->SetError(kErrStopDependents, result);
       return false;
     }
   }
@@ -63,31 +77,23 @@ bool PackageWebAPI::ServiceControl(const char* name, bool start, Json::Value& re
   if (!result["worker_message"].isArray()) result["worker_message"] = Json::Value(Json::arrayValue);
   if (!ok) {
     Json::Value services;
-    switch (manager.getResult(services)) {
-      case 260:
-        result["code"] = 4525;
+    const int code = manager.getResult(services);
+    const int error = MapToolCode(kControlErrors, code);
+    switch (code) {
+      case PKG_ERR_SERVICE_NOT_RUNNING:
+        result["code"] = error;
         result["services"] = services;
-        response->SetError(4525, Json::Value());
         break;
-      case 259:
-        result["code"] = 4583;
+      case PKG_ERR_VERSION_LIMIT:
+        result["code"] = error;
         result["current_version"] = manager.getMapParam("curver");
         result["require_version"] = manager.getMapParam("oldver");
-        response->SetError(4583, Json::Value());
-        break;
-      case 275:
-        response->SetError(4530, Json::Value());
-        break;
-      case 297:
-        response->SetError(4502, Json::Value());
-        break;
-      case 296:
-        response->SetError(4505, Json::Value());
         break;
       default:
-        response->SetError(start ? 4580 : 4581, Json::Value());
         break;
     }
+    response->SetError(error == kErrFailed ? (start ? kErrStartFailed : kErrStopFailed) : error,
+                       Json::Value());
   }
   // Each operation log is read once, here, and then removed.
   if (!manager.getLogFilePath().empty()) unlink(manager.getLogFilePath().c_str());
@@ -96,13 +102,13 @@ bool PackageWebAPI::ServiceControl(const char* name, bool start, Json::Value& re
 
 void PackageWebAPI::StartStop(bool start) {
   APIParameter<Json::Value> ids = request->GetAndCheckUnitArray("id", PARAM_REQUIRED);
-  if (ids.IsInvalid() || ids.Get().empty()) {
-    response->SetError(4500, Json::Value());
+  if (ids.IsInvalid() || ids.Get().empty() || !AreIdsOrEmpty(ids.Get())) {
+    response->SetError(kErrBadParameter, Json::Value());
     return;
   }
   if (ids.Get().size() == 1) {
     Json::Value result;
-    if (ServiceControl(ids.Get()[0].asCString(), start, result)) {
+    if (ServiceControl(ids.Get()[0].asString(), start, result)) {
       response->SetSuccess(result);
     } else if (!result.empty()) {
       response->SetError(response->GetError(), result);
@@ -120,7 +126,7 @@ void PackageWebAPI::StartStop(bool start) {
     if (!WebAPIUtil::JsonArrayHasString(ids.Get(), id)) continue;
     Json::Value data;
     Json::Value entry(Json::objectValue);
-    if (ServiceControl(id.c_str(), start, data)) {
+    if (ServiceControl(id, start, data)) {
       entry["data"] = data;
     } else {
       entry["code"] = response->GetError();
@@ -130,7 +136,7 @@ void PackageWebAPI::StartStop(bool start) {
     if (!data.empty()) batch[id] = entry;
   }
   if (failed) {
-    response->SetError(start ? 4580 : 4581, batch);
+    response->SetError(start ? kErrStartFailed : kErrStopFailed, batch);
   } else {
     response->SetSuccess(batch);
   }

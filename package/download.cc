@@ -17,6 +17,8 @@
 #include "pkgserver/server_record.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
+#include "remove_tree.h"
+#include "request_values.h"
 #include "task_record.h"
 
 namespace KIVO_PACKAGE {
@@ -43,29 +45,33 @@ void PackageWebAPI::ReadProgress() {
   task->waitForDataReady("data", 60);
   Json::Value data = task->getProperty("data");
   if (data.isNull()) {
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
     return;
   }
-  data["finished"] = task->isFinished();
+  const bool queued = data["blqinst"].isBool() && data["blqinst"].asBool();
+  // When the task cannot be written, this answer still says the job failed
+  // and the next reader tries again.
+  if (!queued && WorkerGone(*task, data) && !RecordWorkerGone(*task, data)) {
+    PKG_LOG_ERR("Failed to record the end of task '%s'", task->getTaskId().c_str());
+  }
+  data["finished"] = task->isFinished() || data["error"].isInt();
   if (data["installing"].isBool() && data["installing"].asBool()) {
     double progress = data.isMember("id") ? PMSGetProgress(data["id"].asString()) : -1.0;
     if (progress != -1.0) data["progress"] = progress;
   } else {
     data["progress"] = DownloadTaskProgress(*task, data);
   }
-  if (data["blqinst"].isBool() && data["blqinst"].asBool()) {
+  if (queued) {
     bool gone =
         !task->isFinished() && data["pid"].isInt() && KLIBCProcAlive(data["pid"].asInt()) != 1;
     if (task->isFinished() || gone) {
       data["finished"] = true;
-      task->remove();
+      DropTask(*task);
     }
   } else if (task->getDoubleProperty("progress", 0.0) < 0) {
     // A failed download: drop its task and its folder.
-    task->remove();
-    if (data.isMember("tmp_folder")) {
-      KLIBCExec("/bin/rm", "-rf", data["tmp_folder"].asString().c_str(), nullptr, nullptr);
-    }
+    DropTask(*task);
+    if (data["tmp_folder"].isString()) RemoveTree(data["tmp_folder"].asString());
   }
   response->SetSuccess(data);
 }
@@ -171,7 +177,7 @@ pid_t PackageWebAPI::ForkProcess(NVX::Task* task, Json::Value& result, const std
   if (name.empty() || !task || link.empty() || folder.empty()) return -1;
   pid_t pid = KLIBCProcFork();
   if (pid < 0) {
-    task->remove();
+    DropTask(*task);
     KLIBCErrSetEx(kForkFailed, __FILE__, __LINE__);
     return -1;
   }
@@ -199,7 +205,7 @@ bool PackageWebAPI::DownloadAndInstallPackage(const DownloadRequest& d, Json::Va
       result["progress"] = running->getDoubleProperty("progress", 0);
       return true;
     }
-    if (running) running->remove();
+    if (running) DropTask(*running);
   }
   std::string folder;
   if (!PMSCreateDownloadTmpDir(d.volume, d.name, static_cast<int64_t>(d.size), folder))
@@ -272,7 +278,7 @@ void PackageWebAPI::CheckDownloadPkgInfo() {
     // A download that cannot be installed is of no use: it goes, with its task.
     if (data["tmp_folder"].isString())
       KIVOPackageServer::PMSRemoveDownloadDir(data["tmp_folder"].asString());
-    task->remove();
+    DropTask(*task);
     return;
   }
   DumpPkgInfo(path, info, result);

@@ -5,10 +5,13 @@
 #include <cstdlib>
 #include <unistd.h>
 
+#include "error_codes.h"
 #include "klibc/last_error.h"
 #include "package_webapi.h"
 #include "pkgtool/pms.h"
+#include "request_values.h"
 #include "storage/storage_config.h"
+#include "webapi/upload_area.h"
 
 namespace KIVO_PACKAGE {
 
@@ -23,14 +26,27 @@ bool PackageWebAPI::VolumeListGet(Json::Value& out) {
   std::string tmp;
   if (!PMSGetTmpDir(size, tmp)) {
     int err = KLIBCErrGet();
-    response->SetError(err == 0x2900 ? 4520 : err == 0xDD00 ? 4503 : 4502, Json::Value());
+    response->SetError(err == KLIBC_ERR_NO_SPACE     ? kErrNoSpace
+                       : err == KLIBC_ERR_NO_TMP_DIR ? kErrNoTmpDir
+                                                     : kErrNoVolume,
+                       Json::Value());
     return false;
   }
   // The probe folder was only to learn that there is room.
   rmdir(tmp.c_str());
+  // The package file comes through the upload area: a check that called the
+  // appliance ready while an upload would fail there would send the user
+  // into an install that cannot start.
+  std::string probe;
+  int stored = KIVOCreateUploadFile(size > 0 ? static_cast<uint64_t>(size) : 0, &probe);
+  if (stored != UPLOAD_OK) {
+    response->SetError(UploadError(stored), Json::Value());
+    return false;
+  }
+  unlink(probe.c_str());
   KIVO::PXS::STORAGE_WEBUTILS::Volume volumes(1);
   if (!volumes.VolumeListGet(out, false) || out["volume_count"].asUInt() == 0) {
-    response->SetError(4502, Json::Value());
+    response->SetError(kErrNoVolume, Json::Value());
     return false;
   }
   return true;
@@ -43,22 +59,28 @@ bool PackageWebAPI::TinboxSpaceOk(const std::string& install_type) {
     Json::Value list(Json::objectValue);
     KIVO::PXS::STORAGE_WEBUTILS::Volume volumes(12);
     if (!volumes.VolumeListGet(list, false) || list["volume_count"].asUInt() == 0) {
-      response->SetError(4505, Json::Value());
+      response->SetError(kErrVolumeUnusable, Json::Value());
       return false;
     }
   }
   KIVOMountVolInfo info;
   if (KIVOMountVolInfoGet("/volume1", &info) != 0) return true;
   if (!info.available || info.free_bytes <= static_cast<uint64_t>(size) + kTinboxReserve) {
-    response->SetError(4504, Json::Value());
+    response->SetError(kErrNoRoomOnVolume, Json::Value());
     return false;
   }
   return true;
 }
 
 void PackageWebAPI::CheckEnv() {
-  const std::string id = request->GetParam("id", "").asString();
+  std::string id;
+  const Json::Value id_param = request->GetParam("id", "");
+  const bool no_id = id_param.isString() ? id_param.asString().empty() : id_param.empty();
   const std::string depsers = request->GetParam("depsers", "").asString();
+  if ((!no_id && !SinglePackageId(id_param, &id)) || !HasNoNul(depsers)) {
+    response->SetError(kErrBadParameter, Json::Value());
+    return;
+  }
   const std::string deppkgs = request->GetParam("deppkgs", "").toStyledString();
   const std::string conflicts = request->GetParam("conflictpkgs", "").toStyledString();
   const std::string install_type = request->GetParam("install_type", "").asString();
@@ -101,7 +123,7 @@ bool PackageWebAPI::CheckEnvConflicts(PackageManager& manager, const std::string
                                   request->GetUILanguage().c_str()) &&
       !message.empty()) {
     result["packages"] = message;
-    response->SetError(4524, result);
+    response->SetError(kErrConflict, result);
     return false;
   }
   return true;
@@ -124,7 +146,7 @@ bool PackageWebAPI::CheckEnvServices(PackageManager& manager, const std::string&
     result["services"] = Json::Value(Json::arrayValue);
     for (const std::string& name : stopped) result["services"].append(name);
   }
-  response->SetError(4525, result);
+  response->SetError(kErrServiceNotRunning, result);
   return false;
 }
 
@@ -139,7 +161,7 @@ bool PackageWebAPI::CheckEnvDependencies(PackageManager& manager, const std::str
     return true;
   }
   result["unstart_packages"] = not_started;
-  response->SetError(4526, result);
+  response->SetError(kErrDependencyMissing, result);
   return false;
 }
 
@@ -159,7 +181,7 @@ bool PackageWebAPI::CheckEnvDependents(PackageManager& manager, const std::strin
     }
   }
   result["packages"] = text;
-  response->SetError(4552, result);
+  response->SetError(kErrDependentsRunning, result);
   return false;
 }
 

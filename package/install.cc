@@ -10,11 +10,15 @@
 
 #include <json/writer.h>
 
+#include "error_codes.h"
 #include "klibc/last_error.h"
 #include "klibc/process.h"
 #include "log_line.h"
 #include "package_webapi.h"
 #include "pkgtool/pms.h"
+#include "pkgtool/result_codes.h"
+#include "remove_tree.h"
+#include "request_values.h"
 #include "storage/storage_config.h"
 #include "task_record.h"
 #include "utils/package_utils.h"
@@ -27,25 +31,61 @@ namespace KIVO_PACKAGE {
 
 namespace {
 
-// Code-signature outcomes of the package tool as API errors.
-int CodesignError(int code) {
-  switch (code) {
-    case 288:
-      return 4531;
-    case 289:
-      return 4532;
-    case 290:
-      return 4533;
-    case 291:
-      return 4534;
-    case 292:
-      return 4535;
-    default:
-      return 4501;
-  }
-}
+// Code-signature outcomes of the package tool. A member that does not match
+// the signed MANIFEST is a bad signature like any other.
+constexpr ToolCodeMapping kCodesignErrors[] = {
+    {PKG_ERR_SIGNATURE_UNCHECKABLE, kErrFailed}, {PKG_ERR_NO_SIGNATURE, kErrNoSignature},
+    {PKG_ERR_BAD_SIGNATURE, kErrBadSignature},   {PKG_ERR_UNKNOWN_SIGNER, kErrUnknownSigner},
+    {PKG_ERR_EXPIRED_KEY, kErrExpiredKey},       {PKG_ERR_REVOKED_KEY, kErrRevokedKey},
+};
 
-bool IsCodesignCode(int code) { return code == 150 || (code >= 288 && code <= 292); }
+// The package file's check against this appliance (upload, and the install
+// before it runs).
+constexpr ToolCodeMapping kCheckErrors[] = {
+    {PKG_ERR_SERVICE_NOT_RUNNING, kErrServiceNotRunning},
+    {PKG_ERR_NOT_PACKAGE_FILE, kErrBadPackageFile},
+    {PKG_ERR_DEPENDENCY, kErrDependencyMissing},
+    {PKG_ERR_HOSTILE_MEMBER, kErrUnsafeMember},
+    {PKG_ERR_NO_SPACE, kErrNoRoomOnVolume},
+    {PKG_ERR_ARCH, kErrNotSupported},
+    {PKG_ERR_PORT_IN_USE, kErrPortInUse},
+    {PKG_ERR_CONFLICT, kErrConflict},
+    {PKG_ERR_NO_TMP, kErrNoVolume},
+    {PKG_ERR_VOLUME_CRASHED, kErrVolumeUnusable},
+    {PKG_ERR_NO_VOLUME, kErrNoVolume},
+    {PKG_ERR_OS_TOO_NEW, kErrOsTooNew},
+    {PKG_ERR_OS_TOO_OLD, kErrOsTooOld},
+};
+
+// The install itself.
+constexpr ToolCodeMapping kInstallErrors[] = {
+    {PKG_ERR_NOT_INSTALLED, kErrInstallNotInstalled},
+    {PKG_ERR_VERSION_LIMIT, kErrVersionLimit},
+    {PKG_ERR_NOT_PACKAGE_FILE, kErrNotPackageFile},
+    {PKG_ERR_NOT_SUPPORTED, kErrNotSupported},
+    {PKG_ERR_BUILTIN, kErrNotSupported},
+    {PKG_ERR_NOT_NEWER, kErrNotNewer},
+    {PKG_ERR_DEPENDENCY, kErrInstallDependency},
+    {PKG_ERR_DEPENDENTS_RUNNING, kErrDependentsRunning},
+    {PKG_ERR_BAD_WIZARD_VALUES, kErrBadWizardValues},
+    {PKG_ERR_SCRIPT_FAILED, kErrScriptFailed},
+    {PKG_ERR_BUSY, kErrBusy},
+    {PKG_ERR_EXTRACT, kErrExtractFailed},
+    {PKG_ERR_HOSTILE_MEMBER, kErrUnsafePayload},
+    {PKG_ERR_INTERNAL, kErrFailed},
+    {PKG_ERR_NO_SPACE, kErrNoSpace},
+    {PKG_ERR_NO_TMP, kErrNoTmpDir},
+    {PKG_ERR_NO_VOLUME, kErrNoVolume},
+    {PKG_ERR_CANCELLED, kErrCancelled},
+    {PKG_ERR_UPGRADE_ROLLED_BACK, kErrUpgradeRolledBack},
+};
+
+bool IsCodesignCode(int code) {
+  for (const ToolCodeMapping& row : kCodesignErrors) {
+    if (row.tool == code) return true;
+  }
+  return false;
+}
 
 std::string Firmware(int major, int minor, int build) {
   char text[32];
@@ -59,9 +99,16 @@ std::string JsonText(const Json::Value& value) {
   return Json::writeString(builder, value);
 }
 
-void RemoveFile(const std::string& path) {
-  if (!path.empty()) KLIBCExec("/bin/rm", "-rf", path.c_str(), nullptr, nullptr);
+// Error details that carry the package tool's own words.
+Json::Value WithMessage(Json::Value data, const std::string& message) {
+  if (message.empty()) return data;
+  if (!data.isObject()) data = Json::Value(Json::objectValue);
+  data["message"] = message;
+  return data;
 }
+
+// The install task's job: the request process that installs while it lives.
+bool InstallInUse(const Json::Value& data) { return TaskProcessAlive(data); }
 
 }  // namespace
 
@@ -73,7 +120,7 @@ bool PackageWebAPI::CheckPackageFileInfo(const char* path, PackageInfo& info) {
 bool PackageWebAPI::CheckPackageFileInfo(const char* path, PackageInfo& info, bool strictCodesign,
                                          Json::Value& result) {
   if (!path) {
-    response->SetError(4500, Json::Value());
+    response->SetError(kErrBadParameter, Json::Value());
     return false;
   }
   std::string message;
@@ -85,69 +132,79 @@ bool PackageWebAPI::CheckPackageFileInfo(const char* path, PackageInfo& info, bo
   }
   if (IsCodesignCode(code)) {
     if (!strictCodesign) {
-      result["codesign_error"] = CodesignError(code);
+      result["codesign_error"] = MapToolCode(kCodesignErrors, code);
+      if (!message.empty()) result["codesign_message"] = message;
       return true;
     }
-    response->SetError(CodesignError(code), Json::Value());
+    response->SetError(MapToolCode(kCodesignErrors, code), WithMessage(Json::Value(), message));
     return false;
   }
+  response->SetError(MapToolCode(kCheckErrors, code),
+                     WithMessage(CheckErrorDetails(code, info, details), message));
+  return false;
+}
+
+Json::Value PackageWebAPI::CheckErrorDetails(int code, const PackageInfo& info,
+                                             const Json::Value& details) {
   Json::Value data(Json::objectValue);
   int major = 0, minor = 0, build = 0;
   switch (code) {
-    case 260:
+    case PKG_ERR_SERVICE_NOT_RUNNING:
       data["services"] = details["serviceNoStarted"];
-      return response->SetError(4525, data), false;
-    case 261:
-      return response->SetError(4522, Json::Value()), false;
-    case 268:
+      break;
+    case PKG_ERR_DEPENDENCY:
       data["unstart_packages"] = details["unStartPkgList"].asString();
       data["uninstall_packages"] = details["packages"];
-      return response->SetError(4526, data), false;
-    case 277:
-      return response->SetError(4529, Json::Value()), false;
-    case 279:
-      return response->SetError(4504, Json::Value()), false;
-    case 281:
-      return response->SetError(4528, Json::Value()), false;
-    case 283:
+      break;
+    case PKG_ERR_PORT_IN_USE:
       data["port"] = info.getAdminPort();
-      return response->SetError(4527, data), false;
-    case 284:
+      break;
+    case PKG_ERR_CONFLICT:
       data["packages"] = details["instPackageList"].asString();
-      return response->SetError(4524, data), false;
-    case 285:
-    case 297:
-      return response->SetError(4502, Json::Value()), false;
-    case 296:
-      return response->SetError(4505, Json::Value()), false;
-    case 302:
+      break;
+    case PKG_ERR_OS_TOO_NEW:
       PMSGetOSMaxVer(info, major, minor, build);
       data["firmware"] = Firmware(major, minor, build);
-      return response->SetError(4537, data), false;
-    case 303:
+      break;
+    case PKG_ERR_OS_TOO_OLD:
       PMSGetOSMinVer(info, major, minor, build);
       data["firmware"] = Firmware(major, minor, build);
-      return response->SetError(4538, data), false;
+      break;
     default:
-      return response->SetError(4501, Json::Value()), false;
+      return Json::Value();
   }
+  return data;
+}
+
+bool PackageWebAPI::ReadPackageFile(const std::string& path, PackageInfo& info, bool wizard) {
+  const char* language = request->GetUILanguage().c_str();
+  bool read = wizard ? pkgMgr.queryPackageFileInfoWithWizard(path, info, PKG_OP_NONE, language)
+                     : pkgMgr.queryPackageFileInfo(path, info, PKG_OP_NONE, language);
+  const int code = pkgMgr.getResult();
+  // A member that does not match MANIFEST is a bad signature: when the
+  // record could still be read, the check that follows judges it like a
+  // payload changed after signing (a warning at upload, refused by a strict
+  // install).
+  if ((read || IsCodesignCode(code)) && IsPackageId(info.getId())) return true;
+  Json::Value data = WithMessage(
+      Json::Value(), read ? "the package id in INFO is not valid" : PMSResultText(code));
+  response->SetError(
+      !read && IsCodesignCode(code) ? MapToolCode(kCodesignErrors, code) : kErrNotPackageFile,
+      data);
+  return false;
 }
 
 void PackageWebAPI::Upload() {
   Json::Value params(Json::objectValue);
   params["postParam"] = Json::Value(Json::objectValue);
   APIUpload upload(request);
-  if (upload.GetUploadParam(params["postParam"]) != 1) {
-    response->SetError(108, Json::Value());
+  if (upload.GetUploadParam(params["postParam"]) != UPLOAD_OK) {
+    response->SetError(kErrUploadNotStored, Json::Value());
     return;
   }
   int stored = upload.GetUploadFile(params["postParam"]);
-  if (stored != 1) {
-    int code = stored == -13                    ? 4502
-               : stored == -12                  ? 4503
-               : (stored == -3 || stored == -2) ? 4520
-                                                : 108;
-    response->SetError(code, Json::Value());
+  if (stored != UPLOAD_OK) {
+    response->SetError(UploadError(stored), Json::Value());
     return;
   }
   request->InitParam(params, false);
@@ -156,17 +213,17 @@ void PackageWebAPI::Upload() {
   if (UploadAndDescribe(file, result)) {
     response->SetSuccess(result);
   } else {
-    RemoveFile(file);  // a refused or failed upload leaves nothing behind
+    RemoveTree(file);  // a refused or failed upload leaves nothing behind
   }
 }
 
 bool PackageWebAPI::UploadAndDescribe(const std::string& file, Json::Value& result) {
   PackageInfo info;
-  if (!pkgMgr.queryPackageFileInfoWithWizard(file, info, PKG_OP_NONE,
-                                             request->GetUILanguage().c_str())) {
-    response->SetError(4521, Json::Value());
+  if (!IsCleanText(file)) {
+    response->SetError(kErrUploadNotStored, Json::Value());
     return false;
   }
+  if (!ReadPackageFile(file, info, true)) return false;
   if (!CheckPackageFileInfo(file.c_str(), info, false, result)) return false;
   uint64_t mask = 0;
   if (request->HasParam("additional")) {
@@ -180,16 +237,24 @@ bool PackageWebAPI::UploadAndDescribe(const std::string& file, Json::Value& resu
     PackageUtils::DumpUIFIle(info, result["install_pages"]);
   }
   if (mask) DumpStatusInfo(info, mask, result["additional"]);
+  return RegisterUpload(file, info.getId(), result);
+}
+
+// The upload task that lets "install" find the file. A task id is answered
+// only once the task holds the file's data.
+bool PackageWebAPI::RegisterUpload(const std::string& file, const std::string& id,
+                                   Json::Value& result) {
   const std::string task_id = kUploadPrefix + NVX::TaskUtil::getUniqueID(kTaskOwner, 0);
   std::unique_ptr<NVX::Task> task(GetNewTask(kTaskOwner, task_id.c_str()));
-  if (!task) {
+  Json::Value data(Json::objectValue);
+  data["id"] = id;
+  data["file_path"] = file;
+  if (!task || !task->setProperty("data", data)) {
     PKG_LOG_ERR("Failed to create task with task id '%s'", task_id.c_str());
+    if (task) DropTask(*task);
+    response->SetError(kErrFailed, WithMessage(Json::Value(), "the upload task cannot be written"));
     return false;
   }
-  Json::Value data(Json::objectValue);
-  data["id"] = info.getId();
-  data["file_path"] = file;
-  task->setProperty("data", data);
   result["task_id"] = task_id;
   return true;
 }
@@ -208,50 +273,76 @@ void PackageWebAPI::Install() {
     Json::Value data = upload ? upload->getProperty("data") : Json::Value();
     if (!data.isObject() || !data.isMember("file_path") || !data.isMember("id") ||
         data["file_path"].asString().empty()) {
-      response->SetError(4501, Json::Value());
+      response->SetError(kErrFailed, Json::Value());
       return;
     }
     path = data["file_path"].asString();
   }
   PackageInfo info;
-  if (!pkgMgr.queryPackageFileInfo(path, info, PKG_OP_NONE, request->GetUILanguage().c_str())) {
-    response->SetError(4521, Json::Value());
+  if (!IsCleanText(path)) {
+    response->SetError(kErrBadParameter, Json::Value());
     return;
   }
+  if (!ReadPackageFile(path, info, false)) return;
+  std::unique_ptr<NVX::Task> task(ClaimInstallTask(mgr, info));
+  if (!task) return;
+  Json::Value scratch;
+  bool check_codesign = request->GetParam("check_codesign", true).asBool();
+  bool ok = CheckPackageFileInfo(path.c_str(), info, check_codesign, scratch) &&
+            InstallPackageFile(path.c_str());
+  if (ok) {
+    if (upload) DropTask(*upload);
+    DropTask(*task);
+    // An installed upload has served its purpose; without its task nobody
+    // could clean it up any more.
+    if (upload) RemoveTree(path);
+  } else {
+    if (upload && !upload->finish(false))
+      PKG_LOG_ERR("Failed to finish task '%s'", task_id.c_str());
+    RecordFailure(*task);
+  }
+}
+
+// The install task "@KIVOPKG_DOWNLOAD_" + id, taken for this process in one
+// step. While another install of the package holds it, it is left as it is
+// and the answer is busy. Null with the answer set on failure.
+NVX::Task* PackageWebAPI::ClaimInstallTask(NVX::TaskMgr& mgr, const PackageInfo& info) {
   const std::string install_id = kDownloadPrefix + info.getId();
-  std::unique_ptr<NVX::Task> task(GetNewTask(kTaskOwner, install_id.c_str()));
-  if (!task) {
-    PKG_LOG_ERR("Failed to create task with task id '%s'", install_id.c_str());
-    return;
-  }
-  task->setFinishValue(false);
-  task->beginUpdate();
-  task->unsetProperty("progress");
-  Json::Value data = task->getProperty("data");
-  if (!data.isObject()) data = Json::Value(Json::objectValue);
+  Json::Value data(Json::objectValue);
   data["id"] = info.getId();
   data["name"] = info.getDisplayName();
   data["pid"] = static_cast<int>(getpid());
   data["taskid"] = install_id;
   data["installing"] = true;
   data["status"] = PMSCheckPackage(info.getId()) ? "upgrading" : "installing";
-  task->setProperty("data", data);
-  task->endUpdate();
-  Json::Value scratch;
-  bool check_codesign = request->GetParam("check_codesign", true).asBool();
-  bool ok = CheckPackageFileInfo(path.c_str(), info, check_codesign, scratch) &&
-            InstallPackageFile(path.c_str());
-  for (NVX::Task* t : {upload.get(), task.get()}) {
-    if (!t) continue;
-    if (ok) {
-      t->remove();
-    } else {
-      t->finish(false);
-    }
+  NVX::Task* task = nullptr;
+  switch (mgr.claimTask(install_id, data, InstallInUse, &task)) {
+    case NVX::TaskMgr::Claim::kClaimed:
+      return task;
+    case NVX::TaskMgr::Claim::kBusy:
+      response->SetError(kErrBusy, WithMessage(Json::Value(), "another install of " + info.getId() +
+                                                                  " is under way"));
+      return nullptr;
+    case NVX::TaskMgr::Claim::kFailed:
+      break;
   }
-  // An installed upload has served its purpose; without its task nobody
-  // could clean it up any more.
-  if (ok && upload) RemoveFile(path);
+  PKG_LOG_ERR("Failed to create task with task id '%s'", install_id.c_str());
+  response->SetError(kErrFailed, WithMessage(Json::Value(), "the install task cannot be written"));
+  return nullptr;
+}
+
+// A failed install leaves its task finished with false for the status call,
+// its data saying why.
+void PackageWebAPI::RecordFailure(NVX::Task& task) {
+  Json::Value data = task.getProperty("data");
+  if (!data.isObject()) data = Json::Value(Json::objectValue);
+  data["installing"] = false;
+  data["error"] = response->GetError();
+  const Json::Value& errors = response->GetData();
+  if (errors.isObject() && errors["message"].isString()) data["message"] = errors["message"];
+  if (!task.setProperty("data", data) || !task.finish(false)) {
+    PKG_LOG_ERR("Failed to record the end of task '%s'", task.getTaskId().c_str());
+  }
 }
 
 bool PackageWebAPI::InstallPackageFile(const char* path) {
@@ -260,6 +351,10 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
   bool check_codesign = request->GetParam("check_codesign", true).asBool();
   std::string volume = request->GetParam("volume_path", "").asString();
   std::string extra = request->GetParam("extra_values", "").asString();
+  if (!path || !HasNoNul(volume)) {
+    response->SetError(kErrBadParameter, Json::Value());
+    return false;
+  }
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;
@@ -276,71 +371,23 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
     response->SetSuccess(result);
     return true;
   }
-  int error = 4501;
   switch (code) {
-    case 255:
-      error = 4545;
-      break;
-    case 259:
-      error = 4548;
+    case PKG_ERR_VERSION_LIMIT:
       result["current_version"] = details["curVersion"].asString();
       result["require_version"] = details["insVersion"].asString();
       break;
-    case 261:
-      error = 4521;
-      break;
-    case 264:
-    case 265:
-      error = 4528;
-      break;
-    case 267:
-      error = 4546;
+    case PKG_ERR_NOT_NEWER:
       result["current_version"] = details["curVersion"].asString();
       result["install_version"] = details["insVersion"].asString();
       break;
-    case 268:
-      error = 4547;
+    case PKG_ERR_DEPENDENCY:
+    case PKG_ERR_DEPENDENTS_RUNNING:
       result["packages"] = JsonText(details["deppkg"]);
-      break;
-    case 269:
-      error = 4552;
-      result["packages"] = JsonText(details["deppkg"]);
-      break;
-    case 270:
-      error = 4544;
-      break;
-    case 274:
-      error = 4549;
-      break;
-    case 275:
-      error = 4530;
-      break;
-    case 276:
-      error = 4540;
-      break;
-    case 277:
-      error = 4541;
-      break;
-    case 279:
-      error = 4520;
-      break;
-    case 285:
-      error = 4503;
-      break;
-    case 297:
-      error = 4502;
-      break;
-    case 304:
-      error = 4550;
-      break;
-    case 305:
-      error = 4542;
       break;
     default:
       break;
   }
-  response->SetError(error, Json::Value());
-  response->SetError(response->GetError(), result);
+  response->SetError(MapToolCode(kInstallErrors, code), result);
   return false;
 }
 
@@ -354,32 +401,30 @@ void PackageWebAPI::CancelProgress() {
   }
   // Whatever happens below, the task is dropped before the answer.
   Json::Value data = task->getProperty("data");
+  DropTask(*task);
   if (data.isNull()) {
     PKG_LOG_ERR("Failed to get json data");
-    task->remove();
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
     return;
   }
-  if (data["installing"].isBool() && data["installing"].asBool()) {
-    task->remove();
-    response->SetError(4506, Json::Value());
+  // An install under way is not cut off; one whose process is gone is
+  // over already.
+  if (data["installing"].isBool() && data["installing"].asBool() && TaskProcessAlive(data)) {
+    response->SetError(kErrInstallRunning, Json::Value());
     return;
   }
-  KLIBCExec("/bin/rm", "-rf", data["tmp_folder"].asString().c_str(), nullptr, nullptr);
+  if (data["tmp_folder"].isString()) RemoveTree(data["tmp_folder"].asString());
   int pid = data["pid"].isInt() ? data["pid"].asInt() : 0;
   if (pid < 1) {
     PKG_LOG_ERR("Invalid process id");
-    task->remove();
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
     return;
   }
   if (kill(pid, SIGTERM) != 0 && errno != ESRCH) {
     PKG_LOG_ERR("Failed to kill process, reason=%s(%d)", strerror(errno), errno);
-    task->remove();
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
     return;
   }
-  task->remove();
   for (int i = 0; i < 10 && KLIBCProcAlive(pid) == 1; ++i) sleep(1);
   if (KLIBCProcAlive(pid) == 1) kill(pid, SIGKILL);
   response->SetSuccess();
@@ -397,17 +442,17 @@ void PackageWebAPI::CleanTmp() {
   // child's answer is never sent.
   std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, task_id));
   if (!task) {
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
     return;
   }
   Json::Value data = task->getProperty("data");
   std::string file = data.isObject() ? data["file_path"].asString() : "";
   if (!data.isObject() || !data.isMember("file_path") || !data.isMember("id") || file.empty()) {
-    response->SetError(4501, Json::Value());
-  } else if (access(file.c_str(), F_OK) == 0) {
-    RemoveFile(file);
+    response->SetError(kErrFailed, Json::Value());
+  } else if (IsCleanText(file) && access(file.c_str(), F_OK) == 0) {
+    RemoveTree(file);
   }
-  task->remove();
+  DropTask(*task);
 }
 
 }  // namespace KIVO_PACKAGE

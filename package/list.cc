@@ -1,10 +1,13 @@
 // The installed packages: "list" (also under the legacy API name) and "get".
 
+#include "error_codes.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
 #include "package_webapi.h"
 #include "pkgserver/auto_update.h"
 #include "pkgtool/pms.h"
+#include "pkgtool/result_codes.h"
+#include "request_values.h"
 #include "storage/storage_config.h"
 #include "utils/package_utils.h"
 #include "webapi/webapi_util.h"
@@ -82,9 +85,13 @@ void PackageWebAPI::List() {
 }
 
 void PackageWebAPI::Get() {
-  const std::string id = request->GetParam("id", "").asString();
+  std::string id;
+  if (!SinglePackageId(request->GetParam("id", ""), &id)) {
+    response->SetError(kErrBadParameter, Json::Value());
+    return;
+  }
   if (!pkgMgr.init()) {
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
     return;
   }
   uint64_t mask =
@@ -92,8 +99,8 @@ void PackageWebAPI::Get() {
   AutoUpdateState autoupdate = ReadAutoUpdateState(mask);
   PackageInfo info;
   if (!pkgMgr.getPackageInfo(id, info, request->GetUILanguage(), ~0ULL) &&
-      pkgMgr.getResult() == 255) {
-    response->SetError(4545, Json::Value());
+      pkgMgr.getResult() == PKG_ERR_NOT_INSTALLED) {
+    response->SetError(kErrInstallNotInstalled, Json::Value());
     return;
   }
   // Any other failure still renders the record as it stands: only an

@@ -2,10 +2,12 @@
 
 #include <limits.h>
 
+#include "error_codes.h"
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
 #include "log_line.h"
 #include "package_webapi.h"
+#include "request_values.h"
 #include "storage/storage_config.h"
 
 #include <stdlib.h>
@@ -13,10 +15,12 @@
 namespace KIVO_PACKAGE {
 
 void PackageWebAPI::GetLog() {
+  // The package tool checks the whole name against the id rule before it
+  // makes a path of it; an unknown or malformed name has no log.
   const std::string name = request->GetParam("name", "").asString();
   PackageManager manager;
   if (!manager.init()) {
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
     return;
   }
   Json::Value result(Json::objectValue);
@@ -85,10 +89,11 @@ bool PackageWebAPI::DeleteTmpFile(const char* path) {
 
 void PackageWebAPI::DeleteTmp() {
   const std::string path = request->GetParam("path", "").asString();
-  if (DeleteTmpFile(path.c_str())) {
+  // Checked whole: a path cut short at a NUL would name another file.
+  if (IsCleanText(path) && DeleteTmpFile(path.c_str())) {
     response->SetSuccess();
   } else {
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
   }
 }
 

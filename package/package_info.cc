@@ -8,6 +8,7 @@
 
 #include "package_webapi.h"
 #include "pkgtool/pms.h"
+#include "pkgtool/result_codes.h"
 #include "task_record.h"
 #include "utils/package_utils.h"
 
@@ -32,33 +33,35 @@ std::string RequestHost() {
 // The status the package tool's last result gives a package that does not run.
 const char* StoppedStatus(int result) {
   switch (result) {
-    case 255:
+    case PKG_ERR_NOT_INSTALLED:
       return "non_installed";
-    case 256:
-    case 263:
+    case PKG_ERR_STATUS_UNKNOWN:
+    case PKG_ERR_REGISTRY:
       return "NA";
-    case 150:
-    case 258:
+    case PKG_ERR_SIGNATURE_UNCHECKABLE:
+    case PKG_ERR_BROKEN:
       return "broken";
-    case 259:
+    case PKG_ERR_VERSION_LIMIT:
       return "version_limit";
-    case 265:
+    case PKG_ERR_BUILTIN:
       return "builtin";
-    case 264:
+    case PKG_ERR_NOT_SUPPORTED:
       return "non_support";
     default:
       return "stop";
   }
 }
 
-// The "data" of task `prefix`+id when a living process runs it; a task whose
-// process is gone is removed. Null when there is no such live task.
+// The "data" of task `prefix`+id when a living process runs it. Null when
+// there is no such live task. A task whose process is gone is stale: an
+// install or download job that never finished is recorded as failed (its
+// starter polls "status" for the outcome), any other stale task is removed.
 Json::Value LiveTaskData(NVX::TaskMgr& mgr, const std::string& id, const char* prefix) {
   std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, prefix + id));
   if (!task) return Json::Value();
   Json::Value data = task->getProperty("data");
   if (TaskProcessAlive(data) && !task->isFinished()) return data;
-  if (!TaskProcessAlive(data)) task->remove();
+  if (!TaskProcessAlive(data)) EndStaleTask(*task, data);
   return Json::Value();
 }
 
@@ -128,7 +131,8 @@ void PackageWebAPI::DumpPkgInfo(const std::string& path, const PackageInfo& info
   bool known = pkgMgr.getPackageInfo(info.getId(), installed, request->GetUILanguage());
   if (!known || !pkgMgr.getServiceStatus(installed, running, true) || !running) {
     status = StoppedStatus(pkgMgr.getResult());
-    if (pkgMgr.getResult() == 256 || pkgMgr.getResult() == 263) status = "NA";
+    if (pkgMgr.getResult() == PKG_ERR_STATUS_UNKNOWN || pkgMgr.getResult() == PKG_ERR_REGISTRY)
+      status = "NA";
   } else {
     status = "running";
   }

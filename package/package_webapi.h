@@ -89,7 +89,18 @@ class PackageWebAPI {
   bool CheckPackageFileInfo(const char* path, PackageInfo& info);
   bool CheckPackageFileInfo(const char* path, PackageInfo& info, bool strictCodesign,
                             Json::Value& result);
+  // The error details of a failed package-file check (null when the code
+  // has none).
+  Json::Value CheckErrorDetails(int code, const PackageInfo& info, const Json::Value& details);
+  // Reads the record of the package file at `path` into `info`. True when
+  // it was read with a valid package id, also when only a code-signature
+  // outcome stood in the way (the check decides on it); otherwise false with
+  // the answer set.
+  bool ReadPackageFile(const std::string& path, PackageInfo& info, bool wizard);
   bool UploadAndDescribe(const std::string& file, Json::Value& result);
+  bool RegisterUpload(const std::string& file, const std::string& id, Json::Value& result);
+  NVX::Task* ClaimInstallTask(NVX::TaskMgr& mgr, const PackageInfo& info);
+  void RecordFailure(NVX::Task& task);
   bool InstallPackageFile(const char* path);
   bool VolumeListGet(Json::Value& out);
   bool TinboxSpaceOk(const std::string& install_type);
@@ -122,7 +133,7 @@ class PackageWebAPI {
 
   // Start and stop (control.cc).
   void StartStop(bool start);
-  bool ServiceControl(const char* name, bool start, Json::Value& result);
+  bool ServiceControl(const std::string& name, bool start, Json::Value& result);
 
   APIRequest* request;
   APIResponse* response;

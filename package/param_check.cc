@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "request_values.h"
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
 #include "webapi/api_table.h"
@@ -107,6 +108,14 @@ class Check {
     return !p.set || !APIValidator::IsEqual(p.value.asString(), "") || Refuse(name, "condition");
   }
 
+  // The parameter, when sent, is (each of its elements is) empty or a whole
+  // package id: an id is checked as the string it is, before anything takes
+  // a C string of it (a NUL or a path would make it name another package).
+  bool Ids(const std::string& name) {
+    const ReadParam& p = (*this)[name];
+    return !p.set || KIVO_PACKAGE::AreIdsOrEmpty(p.value) || Refuse(name, "condition");
+  }
+
   // The parameter, when sent, is (each of its elements is) one of `set_text`.
   bool OneOf(const std::string& name, const char* set_text) {
     const ReadParam& p = (*this)[name];
@@ -139,29 +148,30 @@ bool AlwaysAccept(APIRequest*, APIResponse*) { return true; }
 
 bool CheckStart(APIRequest* req, APIResponse* resp) {
   Check c(req, resp, {{"id", Type::Array, kReq}});
-  return c.TypesOk() && c.NotOnlyEmpty("id");
+  return c.TypesOk() && c.NotOnlyEmpty("id") && c.Ids("id");
 }
 
 bool CheckStop(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp, {{"id", Type::Array, kReq}}).TypesOk();
+  Check c(req, resp, {{"id", Type::Array, kReq}});
+  return c.TypesOk() && c.Ids("id");
 }
 
 bool CheckUninstall(APIRequest* req, APIResponse* resp) {
   Check c(req, resp, {{"id", Type::Array, kReq}, {"extra_values", Type::String, kOpt}});
-  return c.TypesOk() && c.NotOnlyEmpty("id");
+  return c.TypesOk() && c.NotOnlyEmpty("id") && c.Ids("id");
 }
 
 bool CheckSettingSet(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp,
-               {{"packages", Type::Array, kOpt},
-                {"update_channel", Type::String, kOpt},
-                {"enable_email", Type::Bool, kOpt},
-                {"enable_nvx", Type::Bool, kOpt},
-                {"trust_level", Type::Int, kOpt},
-                {"enable_autoupdate", Type::Bool, kOpt},
-                {"autoupdateall", Type::Bool, kOpt},
-                {"default_vol", Type::String, kOpt}})
-      .TypesOk();
+  Check c(req, resp,
+          {{"packages", Type::Array, kOpt},
+           {"update_channel", Type::String, kOpt},
+           {"enable_email", Type::Bool, kOpt},
+           {"enable_nvx", Type::Bool, kOpt},
+           {"trust_level", Type::Int, kOpt},
+           {"enable_autoupdate", Type::Bool, kOpt},
+           {"autoupdateall", Type::Bool, kOpt},
+           {"default_vol", Type::String, kOpt}});
+  return c.TypesOk() && c.Ids("packages");
 }
 
 bool CheckVolumeSet(APIRequest* req, APIResponse* resp) {
@@ -169,7 +179,8 @@ bool CheckVolumeSet(APIRequest* req, APIResponse* resp) {
 }
 
 bool CheckIdArray(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp, {{"id", Type::Array, kReq}}).TypesOk();
+  Check c(req, resp, {{"id", Type::Array, kReq}});
+  return c.TypesOk() && c.Ids("id");
 }
 
 bool CheckThumb(APIRequest* req, APIResponse* resp) {
@@ -222,6 +233,7 @@ bool CheckRequiredString(APIRequest* req, APIResponse* resp) {
 }
 
 constexpr char kName[] = "name";
+
 constexpr char kList[] = "list";
 constexpr char kTaskId[] = "task_id";
 constexpr char kTaskid[] = "taskid";
@@ -229,28 +241,28 @@ constexpr char kPath[] = "path";
 constexpr char kUploadKeyring[] = "upload_keyring";
 
 bool CheckInstallationCheckV1(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp,
-               {{"id", Type::Array, kOpt},
-                {"depsers", Type::String, kOpt},
-                {"deppkgs", Type::Object, kOpt},
-                {"conflictpkgs", Type::Object, kOpt},
-                {"install_type", Type::String, kOpt},
-                {"size", Type::Int, kOpt},
-                {"blCheckDep", Type::Bool, kOpt}})
-      .TypesOk();
+  Check c(req, resp,
+          {{"id", Type::Array, kOpt},
+           {"depsers", Type::String, kOpt},
+           {"deppkgs", Type::Object, kOpt},
+           {"conflictpkgs", Type::Object, kOpt},
+           {"install_type", Type::String, kOpt},
+           {"size", Type::Int, kOpt},
+           {"blCheckDep", Type::Bool, kOpt}});
+  return c.TypesOk() && c.Ids("id");
 }
 
 bool CheckInstallationCheckV2(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp,
-               {{"id", Type::Array, kOpt},
-                {"depsers", Type::String, kOpt},
-                {"deppkgs", Type::Object, kOpt},
-                {"conflictpkgs", Type::Object, kOpt},
-                {"install_type", Type::String, kOpt},
-                {"size", Type::Int, kOpt},
-                {"blCheckDep", Type::Bool, kOpt},
-                {"ver", Type::String, kOpt}})
-      .TypesOk();
+  Check c(req, resp,
+          {{"id", Type::Array, kOpt},
+           {"depsers", Type::String, kOpt},
+           {"deppkgs", Type::Object, kOpt},
+           {"conflictpkgs", Type::Object, kOpt},
+           {"install_type", Type::String, kOpt},
+           {"size", Type::Int, kOpt},
+           {"blCheckDep", Type::Bool, kOpt},
+           {"ver", Type::String, kOpt}});
+  return c.TypesOk() && c.Ids("id");
 }
 
 // An install names its source in one of three ways: a running upload task
@@ -295,7 +307,8 @@ bool CheckInstall(APIRequest* req, APIResponse* resp) {
 
 bool CheckFeasibility(APIRequest* req, APIResponse* resp) {
   Check c(req, resp, {{"type", Type::String, kReq}, {"packages", Type::Array, kReq}});
-  return c.TypesOk() && c.OneOf("type", "[\"install_check\",\"uninstall_check\",\"stop_check\"]");
+  return c.TypesOk() && c.OneOf("type", "[\"install_check\",\"uninstall_check\",\"stop_check\"]") &&
+         c.Ids("packages");
 }
 
 bool CheckList(APIRequest* req, APIResponse* resp) {
@@ -305,7 +318,8 @@ bool CheckList(APIRequest* req, APIResponse* resp) {
 
 bool CheckGet(APIRequest* req, APIResponse* resp) {
   Check c(req, resp, {{"id", Type::Array, kReq}, {"additional", Type::Array, kOpt}});
-  return c.TypesOk() && c.NotOnlyEmpty("id") && c.OneOf("additional", kAdditionalKeys);
+  return c.TypesOk() && c.NotOnlyEmpty("id") && c.Ids("id") &&
+         c.OneOf("additional", kAdditionalKeys);
 }
 
 bool CheckServerList(APIRequest* req, APIResponse* resp) {

@@ -7,6 +7,7 @@
 #include <memory>
 #include <unistd.h>
 
+#include "log_line.h"
 #include "package_webapi.h"
 #include "pkgserver/badge.h"
 #include "pkgserver/catalogue.h"
@@ -104,7 +105,7 @@ bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, J
       entry["status"] = data["status"];
       return true;
     }
-    task->remove();
+    EndStaleTask(*task, data);
   }
   task.reset(GetTaskWithTaskMgr(mgr, kDownloadPrefix + name));
   if (task) {
@@ -116,7 +117,7 @@ bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, J
         if (progress != -1.0) entry["installing_progress"] = progress;
         return true;
       }
-      if (data["pid"].asInt() != 0) task->remove();
+      if (data["pid"].asInt() != 0) EndStaleTask(*task, data);
     }
   }
   task.reset(GetTaskWithTaskMgr(mgr, kUninstallPrefix + name));
@@ -126,7 +127,7 @@ bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, J
       entry["status"] = "uninstalling";
       return true;
     }
-    task->remove();
+    EndStaleTask(*task, data);
   }
   bool running = false;
   entry["status"] = "NA";
@@ -178,8 +179,11 @@ void PackageWebAPI::ListServerPackage() {
   const Json::Value& list = object_form ? answer["packages"] : answer;
   if (!list.isArray()) return;
   std::map<std::string, PackageInfo> installed;
-  pkgMgr.init();
-  pkgMgr.enumPackageInfoMap(installed, language, ~0ULL);
+  // Without the installed packages the catalogue shows every one as not
+  // installed; the log says why.
+  if (!pkgMgr.init() || !pkgMgr.enumPackageInfoMap(installed, language, ~0ULL)) {
+    PKG_LOG_ERR("Failed to read the installed packages [%d]", pkgMgr.getResult());
+  }
   NVX::TaskMgr mgr(kTaskOwner);
   const Json::Value recommend = object_form && !others && answer["recommend"].isArray()
                                     ? answer["recommend"]

@@ -2,6 +2,7 @@
 // error instead of inventing data; a member moves to its area's source when
 // it is built.
 
+#include "error_codes.h"
 #include "log_line.h"
 #include "package_webapi.h"
 
@@ -13,7 +14,7 @@ void PackageWebAPI::AnswerNotAvailable(const char* member) {
   data["message"] = request->GetAPIClass() + " " + request->GetAPIMethod() +
                     " is not available in this build yet";
   PKG_LOG_ERR("%s: %s is not available yet", request->GetAPIClass().c_str(), member);
-  response->SetError(4501, data);
+  response->SetError(kErrFailed, data);
 }
 
 #define KIVO_NOT_AVAILABLE(name) \

@@ -4,27 +4,46 @@
 
 #include <json/reader.h>
 
+#include "error_codes.h"
 #include "log_line.h"
 #include "package_webapi.h"
+#include "pkgtool/result_codes.h"
+#include "request_values.h"
 
 namespace KIVO_PACKAGE {
 
+namespace {
+
+// Refusals of an uninstall by the package tool; any other result is 4560.
+constexpr ToolCodeMapping kUninstallErrors[] = {
+    {PKG_ERR_DEPENDENCY, kErrUninstallDependents},
+    {PKG_ERR_BUSY, kErrBusy},
+};
+
+}  // namespace
+
 void PackageWebAPI::Uninstall() {
-  const std::string id = request->GetParam("id", "").asString();
+  // "id" names one package (the checker has let a string or an array in);
+  // the whole id is checked before the package tool sees it.
+  std::string id;
+  if (!SinglePackageId(request->GetParam("id", ""), &id)) {
+    response->SetError(kErrBadParameter, Json::Value());
+    return;
+  }
   const std::string user = request->GetLoginUserName();
   PackageManager manager;
   Json::Value result;
   Json::Value wizard;
   bool called = false;
   if (!manager.init()) {
-    response->SetError(4501, Json::Value());
+    response->SetError(kErrFailed, Json::Value());
   } else {
     const std::string extra = request->GetParam("extra_values", "").asString();
     Json::Reader reader(Json::Features::strictMode());
     if (!extra.empty() && !reader.parse(extra, wizard)) {
       PKG_LOG_ERR("Error: parsing error, reason = %s\n",
                   reader.getFormattedErrorMessages().c_str());
-      response->SetError(4561, Json::Value());
+      response->SetError(kErrUninstallBadValues, Json::Value());
     } else {
       called = true;
       bool ok =
@@ -33,14 +52,15 @@ void PackageWebAPI::Uninstall() {
       result["worker_message"] = manager.getJsonParam("worker_msg");
       if (!result["worker_message"].isArray())
         result["worker_message"] = Json::Value(Json::arrayValue);
+      const int error = MapToolCode(kUninstallErrors, manager.getResult());
       if (ok) {
         response->SetSuccess(result);
-      } else if (manager.getResult() == 268) {
-        result["code"] = 4562;
+      } else if (error == kErrUninstallDependents) {
+        result["code"] = error;
         result["packages"] = manager.getMapParam("deppkg");
-        response->SetError(4562, Json::Value());
+        response->SetError(error, Json::Value());
       } else {
-        response->SetError(manager.getResult() == 275 ? 4530 : 4560, Json::Value());
+        response->SetError(error == kErrFailed ? kErrUninstallFailed : error, Json::Value());
       }
     }
   }

@@ -62,7 +62,7 @@ class ControlTest : public ::testing::Test {
   }
   std::string Order() {
     std::string text;
-    KIVOReadFile(root_.Path("/tmp/order"), &text);
+    if (!KIVOReadFile(root_.Path("/tmp/order"), &text)) return "";
     unlink(root_.Path("/tmp/order").c_str());
     return text;
   }
@@ -214,16 +214,45 @@ TEST_F(ControlTest, FeasibilityHardSoftAndFailure) {
   EXPECT_EQ("hard", busy.Errors()["check_type"].asString());
   PMSUnlockFile(lock);
 
-  CgiAnswer failure =
+  CgiAnswer hostile =
       Call(kPkg, "feasibility_check", {{"type", "uninstall_check"}, {"packages", "[\"../etc\"]"}});
-  EXPECT_EQ(4556, failure.Code());
-  EXPECT_EQ("hard", failure.Errors()["check_type"].asString());
-  EXPECT_TRUE(failure.Errors()["reasons"].empty());
+  EXPECT_EQ(120, hostile.Code());
+  EXPECT_EQ("packages", hostile.Errors()["name"].asString());
   EXPECT_EQ(4500,
             Call(kPkg, "feasibility_check", {{"type", "stop_check"}, {"packages", "[]"}}).Code());
 }
 
 constexpr char kUninstall[] = "KIVO.Core.Package.Uninstallation";
+
+// An id with a NUL byte in it, sent raw (%00) or spelt in JSON (\u0000),
+// never acts on the package named before the NUL.
+TEST_F(ControlTest, AnIdCarryingANulActsOnNoPackage) {
+  Install("base", "", true);
+  auto status = [this]() {
+    return Call(kPkg, "get", {{"id", "base"}, {"additional", "[\"status\"]"}})
+        .Data()["additional"]["status"]
+        .asString();
+  };
+  ASSERT_EQ("running", status());
+  const std::string raw("[\"base\0/../../zzz\"]", 18);
+  const std::string spelt = "[\"base\\u0000/../../zzz\"]";
+  for (const char* method : {"stop", "start"}) {
+    EXPECT_EQ(101, Call("KIVO.Core.Package.Control", method, {{"id", raw}}).Code()) << method;
+    CgiAnswer refused = Call("KIVO.Core.Package.Control", method, {{"id", spelt}});
+    EXPECT_EQ(120, refused.Code()) << refused.body;
+    EXPECT_EQ("condition", refused.Errors()["reason"].asString());
+  }
+  EXPECT_EQ(101, Call(kUninstall, "uninstall", {{"id", raw}}).Code());
+  EXPECT_EQ(120, Call(kUninstall, "uninstall", {{"id", spelt}}).Code());
+  EXPECT_EQ(120, Call(kPkg, "get", {{"id", spelt}}).Code());
+  EXPECT_EQ(120,
+            Call(kPkg, "feasibility_check", {{"type", "stop_check"}, {"packages", spelt}}).Code());
+  EXPECT_EQ("running", status());
+  EXPECT_TRUE(PackageRegistry::IsInstalled("base"));
+  // The array form of one id works as the plain one.
+  EXPECT_TRUE(Call("KIVO.Core.Package.Control", "stop", {{"id", "[\"base\"]"}}).Success());
+  EXPECT_EQ("stop", status());
+}
 
 TEST_F(ControlTest, Uninstall) {
   Install("base", "", true);

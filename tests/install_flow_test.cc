@@ -13,6 +13,7 @@
 #include "klibc/process.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
+#include "taskmgr/sqlite_api.h"
 #include "taskmgr/task.h"
 #include "testing/cgi_client.h"
 #include "testing/gpg_keys.h"
@@ -70,6 +71,38 @@ class InstallFlowTest : public ::testing::Test {
     }
     children_.push_back(pid);
     return pid;
+  }
+
+  // Polls "status" of the install task of `id` until `done` says so (at
+  // most about 6 s); returns the last answer's data.
+  template <typename Done>
+  Json::Value PollStatus(const std::string& id, Done done) {
+    Json::Value data;
+    for (int i = 0; i < 300; ++i) {
+      data = Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_" + id}}).Data();
+      if (done(data)) break;
+      usleep(20000);
+    }
+    return data;
+  }
+  // Posts `body` as a multipart upload with the signed-in session.
+  CgiAnswer PostBody(const std::string& body, const std::string& boundary) {
+    return RunEntryCgi(
+        {{"REQUEST_METHOD", "POST"},
+         {"QUERY_STRING", "api=KIVO.Core.Package.Installation&method=upload&version=1"},
+         {"CONTENT_TYPE", "multipart/form-data; boundary=" + boundary},
+         {"CONTENT_LENGTH", std::to_string(body.size())},
+         {"HTTP_COOKIE", "id=" + client().sid()},
+         {"HTTP_X_KIVO_TOKEN", client().token()}},
+        body);
+  }
+  // Runs `sql` on the root's task database, as an operator's tool would.
+  void TaskStoreSql(const std::string& sql) {
+    sqlite3* db = nullptr;
+    ASSERT_EQ(SQLITE_OK, NVX::Sqlite()->open_v2(root_.Path("/run/kivo/tasks.db").c_str(), &db,
+                                                SQLITE_OPEN_READWRITE, nullptr));
+    EXPECT_EQ(SQLITE_OK, NVX::Sqlite()->exec(db, sql.c_str(), nullptr, nullptr, nullptr));
+    NVX::Sqlite()->close(db);
   }
 
   TempRoot root_;
@@ -198,7 +231,7 @@ TEST_F(InstallFlowTest, RefusalsAtUploadComeFromRealState) {
   EXPECT_EQ(0, Uploads());  // refused uploads leave nothing behind
   std::string junk = dir_ + "/junk.kpk";
   root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"normal\"}]");
-  KIVOWriteFileAtomic(junk, "not a package", SyncToDisk::No);
+  ASSERT_TRUE(KIVOWriteFileAtomic(junk, "not a package", SyncToDisk::No));
   EXPECT_EQ(4521, Upload(junk).Code());
   EXPECT_EQ(0, Uploads());
 }
@@ -235,9 +268,9 @@ TEST_F(InstallFlowTest, CodeSignatureIsLenientAtUploadAndStrictAtInstall) {
 
   std::string tampered_file = dir_ + "/tampered.kpk";
   std::string data;
-  KIVOReadFile(file, &data);
+  ASSERT_TRUE(KIVOReadFile(file, &data));
   data[data.find("\x1f\x8b\x08", data.find("package.tgz")) + 30] ^= 0x40;
-  KIVOWriteFileAtomic(tampered_file, data, SyncToDisk::No);
+  ASSERT_TRUE(KIVOWriteFileAtomic(tampered_file, data, SyncToDisk::No));
   EXPECT_EQ(4532, Upload(tampered_file).Data()["codesign_error"].asInt());
 }
 
@@ -292,12 +325,12 @@ TEST_F(InstallFlowTest, StatusAndCancelOfJobs) {
 
   auto make_task = [](const std::string& id, const Json::Value& data, double progress) {
     std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", id.c_str()));
-    task->setProperty("data", data);
-    task->setProperty("progress", progress);
+    ASSERT_TRUE(task->setProperty("data", data));
+    ASSERT_TRUE(task->setProperty("progress", progress));
   };
   // A download whose worker lives: cancel stops it and drops its folder.
   std::string folder = root_.Path("/volume1/@tmp/download-x");
-  KIVOFSMkdirP(folder.c_str());
+  ASSERT_EQ(0, KIVOFSMkdirP(folder.c_str()));
   Json::Value job(Json::objectValue);
   job["pid"] = Spawn({"sleep", "60"});
   job["tmp_folder"] = folder;
@@ -311,7 +344,7 @@ TEST_F(InstallFlowTest, StatusAndCancelOfJobs) {
 
   // Progress 1.0 counts only with the downloaded file; a negative one ends the job.
   job["pid"] = Spawn({"sleep", "60"});
-  KIVOFSMkdirP(folder.c_str());
+  ASSERT_EQ(0, KIVOFSMkdirP(folder.c_str()));
   make_task("@KIVOPKG_DOWNLOAD_y", job, 1.0);
   EXPECT_DOUBLE_EQ(
       0.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
@@ -347,7 +380,7 @@ TEST_F(InstallFlowTest, CancelKillsAWorkerThatIgnoresSigterm) {
   job["pid"] = Spawn({"sh", "-c", "trap '' TERM; while :; do sleep 0.1; done"});
   usleep(200000);  // let the shell set its trap
   std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", "@KIVOPKG_DOWNLOAD_stubborn"));
-  task->setProperty("data", job);
+  ASSERT_TRUE(task->setProperty("data", job));
   time_t start = time(nullptr);
   ASSERT_TRUE(Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_stubborn"}}).Success());
   EXPECT_GE(time(nullptr) - start, 9);  // ten one-second waits before SIGKILL
@@ -401,6 +434,172 @@ TEST_F(InstallFlowTest, InstallNamingAServerPackageStartsADownload) {
   ASSERT_TRUE(a.Success()) << a.body;
   EXPECT_EQ("@KIVOPKG_DOWNLOAD_demo", a.Data()["taskid"].asString());
   EXPECT_EQ(4501, Call("install", {{"task_id", "@KIVOPKG_UPLOAD_nothing"}}).Code());
+}
+
+// The process that runs an install dies: "status" reads the job as failed,
+// with a message, instead of "installing" forever.
+TEST_F(InstallFlowTest, AnInstallWhoseProcessDiedReadsAsFailed) {
+  TestPackage slow;
+  slow.scripts = {{"preinst", "sleep 3\n"}};
+  std::string file = slow.Build(dir_);
+  pid_t installer = fork();
+  if (installer == 0) _exit(client().Call(kInst, "install", 1, {{"path", file}}).Success() ? 0 : 1);
+  Json::Value running =
+      PollStatus("test-app", [](const Json::Value& d) { return d["pid"].isInt(); });
+  ASSERT_TRUE(running["installing"].asBool()) << running.toStyledString();
+  ASSERT_FALSE(running["finished"].asBool());
+  ASSERT_EQ(0, kill(running["pid"].asInt(), SIGKILL));
+  int exit_status = 0;
+  waitpid(installer, &exit_status, 0);
+  while (KLIBCProcAlive(running["pid"].asInt()) == 1) usleep(10000);
+  for (int poll = 0; poll < 2; ++poll) {  // the outcome stays for later polls too
+    CgiAnswer s = Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_test-app"}});
+    ASSERT_TRUE(s.Success()) << s.body;
+    EXPECT_TRUE(s.Data()["finished"].asBool()) << s.body;
+    EXPECT_FALSE(s.Data()["installing"].asBool());
+    EXPECT_EQ(4501, s.Data()["error"].asInt());
+    EXPECT_NE(std::string::npos, s.Data()["message"].asString().find("ended")) << s.body;
+  }
+  // A new install claims the dead job's task.
+  CgiAnswer again = Call("install", {{"path", file}});
+  EXPECT_TRUE(again.Success()) << again.body;
+}
+
+// Two installs of one package at once: the second is refused as busy and
+// leaves the first one's task exactly as it was.
+TEST_F(InstallFlowTest, ConcurrentInstallsOfOnePackageKeepTheFirstOnesTask) {
+  TestPackage slow;
+  slow.scripts = {{"preinst", "sleep 2\n"}};
+  CgiAnswer up = Upload(slow.Build(dir_));
+  ASSERT_TRUE(up.Success()) << up.body;
+  const std::string upload_task = up.Data()["task_id"].asString();
+  pid_t first = fork();
+  if (first == 0) {
+    _exit(client().Call(kInst, "install", 1, {{"task_id", upload_task}}).Success() ? 0 : 1);
+  }
+  Json::Value before =
+      PollStatus("test-app", [](const Json::Value& d) { return d["pid"].isInt(); });
+  ASSERT_TRUE(before["pid"].isInt()) << before.toStyledString();
+  CgiAnswer second = Call("install", {{"task_id", upload_task}});  // a double click
+  EXPECT_EQ(4530, second.Code()) << second.body;
+  EXPECT_NE(std::string::npos, second.Errors()["message"].asString().find("under way"));
+  Json::Value during = Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_test-app"}}).Data();
+  EXPECT_EQ(before["pid"].asInt(), during["pid"].asInt());
+  EXPECT_FALSE(during["finished"].asBool());
+  EXPECT_TRUE(during["installing"].asBool());
+  int exit_status = 0;
+  waitpid(first, &exit_status, 0);
+  EXPECT_EQ(0, WEXITSTATUS(exit_status));
+  EXPECT_TRUE(PackageRegistry::IsInstalled("test-app"));
+  EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(upload_task));
+}
+
+// A multipart body is taken whole or not at all.
+TEST_F(InstallFlowTest, UploadBodiesMustBeWholeWithOneFile) {
+  TestPackage app;
+  std::string content;
+  ASSERT_TRUE(KIVOReadFile(app.Build(dir_), &content));
+  std::string type;
+  const std::string good = MultipartBody({}, "app.kpk", content, &type);
+  const std::string boundary = type.substr(type.find('=') + 1);
+  const std::string closing = "\r\n--" + boundary + "--\r\n";
+  ASSERT_EQ(good.size() - closing.size(), good.rfind(closing));
+  const std::string head = good.substr(0, good.size() - closing.size());
+  const std::string file_part = good.substr(good.find("--" + boundary));
+  const std::string second_file = head + "\r\n" + file_part;
+  const std::string reserved = head + "\r\n--" + boundary +
+                               "\r\nContent-Disposition: form-data; name=\"file_tmp\"\r\n\r\n" +
+                               root_.Path("/etc/passwd") + closing;
+  for (const std::string& body : {head, head + "\r\nstray bytes", second_file, reserved}) {
+    CgiAnswer a = PostBody(body, boundary);
+    EXPECT_EQ(108, a.Code()) << a.body;
+    EXPECT_EQ(0, Uploads());
+  }
+  EXPECT_TRUE(KLIBCFileExist(root_.Path("/etc/passwd").c_str()));
+  const std::string nul_field = "--" + boundary +
+                                "\r\nContent-Disposition: form-data; name=\"additional\"\r\n\r\n" +
+                                std::string("[\"status\"]\0x", 12) + "\r\n" + good;
+  EXPECT_EQ(101, PostBody(nul_field, boundary).Code());
+  CgiAnswer whole = PostBody(good, boundary);
+  ASSERT_TRUE(whole.Success()) << whole.body;
+  EXPECT_EQ(1, Uploads());
+}
+
+// "check" and "upload" agree when the upload area of the volume is unusable.
+TEST_F(InstallFlowTest, CheckAndUploadAgreeOnAnUnusableTemporaryFolder) {
+  TestPackage app;
+  std::string file = app.Build(dir_);
+  root_.Write("/volume1/@tmp/upload", "a file where the folder should be");
+  EXPECT_EQ(4503, Call("check", {{"id", "test-app"}, {"size", "1000"}}, 2).Code());
+  EXPECT_EQ(4503, Upload(file).Code());
+  unlink(root_.Path("/volume1/@tmp/upload").c_str());
+  EXPECT_TRUE(Call("check", {{"id", "test-app"}, {"size", "1000"}}, 2).Success());
+  EXPECT_TRUE(Upload(file).Success());
+}
+
+// A task write that fails is never answered as a task id.
+TEST_F(InstallFlowTest, AnUploadWhoseTaskCannotBeWrittenIsRefused) {
+  TestPackage app;
+  std::string file = app.Build(dir_);
+  ASSERT_TRUE(Upload(file).Success());  // makes the task store
+  TaskStoreSql(
+      "CREATE TRIGGER full BEFORE INSERT ON properties BEGIN SELECT RAISE(FAIL, 'disk full'); "
+      "END;");
+  CgiAnswer refused = Upload(file);
+  EXPECT_EQ(4501, refused.Code()) << refused.body;
+  EXPECT_EQ(1, Uploads());  // the first upload's file only
+  NVX::TaskMgr mgr("@administrators");
+  for (const std::string& id : mgr.listTasks("@KIVOPKG_UPLOAD_")) {
+    std::unique_ptr<NVX::Task> task(mgr.getTask(id));
+    EXPECT_TRUE(task->getProperty("data").isObject()) << id;  // no task without its data
+  }
+  // The install task cannot be claimed either: refused before the install.
+  CgiAnswer install = Call("install", {{"path", file}});
+  EXPECT_EQ(4501, install.Code()) << install.body;
+  EXPECT_FALSE(PackageRegistry::IsInstalled("test-app"));
+  TaskStoreSql("DROP TRIGGER full;");
+}
+
+// Any member changed after signing is a bad signature (4532): the payload,
+// INFO and a script alike, at upload and at a strict install.
+TEST_F(InstallFlowTest, TamperedMembersAnswerAsABadSignature) {
+  TestKeys keys(root_.Path("/tmp"));
+  std::string publisher = keys.Create("Publisher <p@test.invalid>");
+  keys.Trust(publisher);
+  TestPackage app;
+  app.info = {{"displayname", "Tamper Check"}};
+  app.scripts = {{"postinst", "echo original-script\n"}};
+  std::string text;
+  for (int i = 0; i < 500; ++i) text += std::to_string(i * 7919) + " ";
+  app.files = {{"text.txt", text}};
+  std::string file = app.Build(dir_);
+  keys.Sign(file, publisher);
+  Trust(0);
+  CgiAnswer clean = Upload(file);
+  ASSERT_TRUE(clean.Success()) << clean.body;
+  EXPECT_FALSE(clean.Data().isMember("codesign_error")) << clean.body;
+  std::string data;
+  ASSERT_TRUE(KIVOReadFile(file, &data));
+  struct Tamper {
+    const char* what;
+    size_t at;
+  } tampers[] = {
+      {"INFO", data.find("Tamper Check") + 7},
+      {"script", data.find("original-script") + 3},
+      {"payload", data.find("\x1f\x8b\x08", data.find("package.tgz")) + 30},
+  };
+  for (const Tamper& t : tampers) {
+    std::string changed = data;
+    changed[t.at] ^= 0x01;
+    std::string path = dir_ + "/tampered-" + t.what + ".kpk";
+    ASSERT_TRUE(KIVOWriteFileAtomic(path, changed, SyncToDisk::No));
+    CgiAnswer up = Upload(path);
+    int code = up.Success() ? up.Data()["codesign_error"].asInt() : up.Code();
+    EXPECT_EQ(4532, code) << t.what << ": " << up.body;
+    CgiAnswer strict = Call("install", {{"path", path}});
+    EXPECT_EQ(4532, strict.Code()) << t.what << ": " << strict.body;
+    EXPECT_FALSE(PackageRegistry::IsInstalled("test-app")) << t.what;
+  }
 }
 
 }  // namespace

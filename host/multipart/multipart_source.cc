@@ -1,16 +1,14 @@
 #include "multipart_source.h"
 
 #include <cstring>
-#include <ctime>
-#include <dirent.h>
 #include <errno.h>
 #include <exception>
 #include <fcntl.h>
 #include <istream>
 #include <memory>
+#include <stdexcept>
 #include <streambuf>
 #include <string>
-#include <sys/stat.h>
 #include <unistd.h>
 #include <vector>
 
@@ -18,13 +16,9 @@
 #include <Poco/Net/MultipartReader.h>
 #include <Poco/Net/NameValueCollection.h>
 
-#include "klibc/atomic_file.h"
-#include "klibc/sysroot.h"
-#include "storage/storage_config.h"
+#include "webapi/upload_area.h"
 
 namespace {
-
-constexpr time_t kAbandonedAfterSeconds = 24 * 3600;
 
 // Reads at most `limit` bytes from a descriptor, so a body shorter than its
 // CONTENT_LENGTH shows as an early end and nothing after the body is read.
@@ -59,6 +53,20 @@ class FdStreamBuf : public std::streambuf {
   bool ended_early_ = false;
 };
 
+// Throws when `text` holds a NUL byte: every posted field becomes a request
+// parameter, and no parameter of the web API may hold one (it would cut the
+// value short wherever it becomes a C string).
+void RefuseNul(const std::string& text, const char* what) {
+  if (text.find('\0') != std::string::npos) {
+    throw std::runtime_error(std::string("a NUL byte in ") + what);
+  }
+}
+
+// The body holds the fields, at most one file part and more fields, and ends
+// with the closing boundary. A body cut short, one without the closing
+// boundary (whose last part would run to the end of the body and take stray
+// bytes with it) and one with a second file part are refused, and nothing is
+// stored for them.
 class MultipartSource : public UploadSource {
  public:
   MultipartSource(int fd, uint64_t length, const std::string& boundary)
@@ -79,9 +87,10 @@ class MultipartSource : public UploadSource {
     try {
       ReadUntilFile();
       if (!file_next_) return UPLOAD_NO_FILE;
-      int code = OpenTarget(&path);
+      int code = KIVOCreateUploadFile(length_, &path);
       if (code != UPLOAD_OK) return code;
       file_next_ = false;
+      stored_ = true;
       code = CopyPart(path);
       if (code != UPLOAD_OK) {
         unlink(path.c_str());
@@ -89,7 +98,7 @@ class MultipartSource : public UploadSource {
       }
       seen_["file_tmp"] = path;
       seen_["file_name"] = file_name_;
-      ReadUntilFile();  // the fields after the file
+      ReadUntilFile();  // the fields after the file, up to the closing boundary
       CopySeen(fields);
       return UPLOAD_OK;
     } catch (const std::exception&) {
@@ -105,56 +114,59 @@ class MultipartSource : public UploadSource {
     for (const std::string& name : seen_.getMemberNames()) fields[name] = seen_[name];
   }
 
-  // Reads parts into seen_ until a file part is next (or the body ends).
+  // Whether the part read last ended with the closing boundary.
+  bool Closed() {
+    if (!started_) return false;
+    auto* part = dynamic_cast<Poco::Net::MultipartIOS*>(&reader_.stream());
+    return part && part->lastPart();
+  }
+
+  // Reads parts into seen_ until a file part is next or the closing boundary
+  // has been read. Throws on a malformed body.
   void ReadUntilFile() {
-    while (!file_next_ && reader_.hasNextPart()) {
+    while (!file_next_ && !Closed()) {
+      // A part that ran to the end of the body ended without a boundary.
+      if (in_.rdbuf()->sgetc() == std::char_traits<char>::eof()) {
+        throw std::runtime_error("the body ends without its closing boundary");
+      }
       Poco::Net::MessageHeader header;
       reader_.nextPart(header);
+      started_ = true;
       std::string disposition;
       Poco::Net::NameValueCollection params;
       Poco::Net::MessageHeader::splitParameters(header.get("Content-Disposition", ""), disposition,
                                                 params);
       if (params.has("filename")) {
+        if (stored_) throw std::runtime_error("a second file part");
         file_next_ = true;
-        file_field_ = params.get("name", "file");
         file_name_ = params.get("filename", "");
+        RefuseNul(file_name_, "a file name");
         return;
       }
-      std::string value;
-      std::istream& part = reader_.stream();
-      char buf[4096];
-      while (part.read(buf, sizeof(buf)) || part.gcount() > 0) {
-        if (value.size() + static_cast<size_t>(part.gcount()) > (1u << 20)) {
-          throw std::runtime_error("a form field larger than 1 MiB");
-        }
-        value.append(buf, static_cast<size_t>(part.gcount()));
+      std::string name = params.get("name", "");
+      RefuseNul(name, "a field name");
+      // These two name the stored file; a client's field must never pass
+      // for them (the handler inspects and deletes that path).
+      if (name == "file_tmp" || name == "file_name") {
+        throw std::runtime_error("a field named like the stored file");
       }
-      seen_[params.get("name", "")] = value;
+      seen_[name] = ReadField();
     }
   }
 
-  // A new file on the first volume with room for the whole body.
-  int OpenTarget(std::string* path) {
-    std::vector<VolumeConfig> volumes = KIVOVolumesLoad();
-    bool any_usable = false;
-    for (const VolumeConfig& v : volumes) {
-      if (!v.usable()) continue;
-      any_usable = true;
-      int64_t free_bytes = KIVOVolumeFreeBytes(v);
-      if (free_bytes < 0 || static_cast<uint64_t>(free_bytes) <= length_) continue;
-      std::string dir = KIVORootPath(v.path + "/@tmp/upload");
-      if (KIVOFSMkdirP(dir.c_str(), 0700) != 0) return UPLOAD_NO_TMP_DIR;
-      // Uploads whose install never came: after a day nobody will ask for
-      // them any more, so they are swept here and cannot fill the volume.
-      KIVORemoveFilesOlderThan(dir, "upload-", kAbandonedAfterSeconds);
-      std::string pattern = dir + "/upload-XXXXXX";
-      int fd = mkostemp(&pattern[0], O_CLOEXEC);
-      if (fd < 0) return UPLOAD_NO_TMP_DIR;
-      close(fd);
-      *path = pattern;
-      return UPLOAD_OK;
+  // The rest of the current part, a form field of at most 1 MiB.
+  std::string ReadField() {
+    std::string value;
+    std::istream& part = reader_.stream();
+    char buf[4096];
+    while (part.read(buf, sizeof(buf)) || part.gcount() > 0) {
+      if (value.size() + static_cast<size_t>(part.gcount()) > (1u << 20)) {
+        throw std::runtime_error("a form field larger than 1 MiB");
+      }
+      value.append(buf, static_cast<size_t>(part.gcount()));
     }
-    return any_usable ? UPLOAD_TOO_LARGE : UPLOAD_NO_VOLUME;
+    RefuseNul(value, "a field");
+    return value;
   }
 
   int CopyPart(const std::string& path) {
@@ -188,8 +200,9 @@ class MultipartSource : public UploadSource {
   std::istream in_;
   Poco::Net::MultipartReader reader_;
   Json::Value seen_{Json::objectValue};
-  bool file_next_ = false;
-  std::string file_field_;
+  bool started_ = false;    // a part has been opened (reader_.stream() exists)
+  bool file_next_ = false;  // the part opened last is the file, not read yet
+  bool stored_ = false;     // the file part has been taken
   std::string file_name_;
 };
 

@@ -205,26 +205,62 @@ Task* TaskMgr::getTask(const std::string& id) {
   return hasTask(id) ? new Task(store_, owner_, id) : nullptr;
 }
 
+// Inside a transaction: task `id` anew, with no properties.
+bool TaskMgr::Recreate(const std::string& id) {
+  return Statement(*store_, "DELETE FROM properties WHERE owner=? AND id=?")
+             .Bind(1, owner_)
+             .Bind(2, id)
+             .Run() &&
+         Statement(
+             *store_,
+             "INSERT OR REPLACE INTO tasks (owner, id, finished, ok, created) VALUES (?,?,0,0,?)")
+             .Bind(1, owner_)
+             .Bind(2, id)
+             .Bind(3, static_cast<long long>(time(nullptr)))
+             .Run();
+}
+
+// Inside a transaction: whether task `id` exists unfinished and `in_use`
+// says its job still holds it.
+bool TaskMgr::StillHeld(const std::string& id, InUse in_use) {
+  Statement s(*store_, "SELECT finished FROM tasks WHERE owner=? AND id=?");
+  s.Bind(1, owner_).Bind(2, id);
+  if (!s.Row() || s.Int(0) != 0) return false;
+  Statement p(*store_, "SELECT value FROM properties WHERE owner=? AND id=? AND name=?");
+  p.Bind(1, owner_).Bind(2, id).Bind(3, std::string("data"));
+  Json::Value data;
+  if (p.Row()) WebAPIUtil::ParseJson(p.Text(0), data);
+  return in_use && in_use(data);
+}
+
 Task* TaskMgr::createTask(const std::string& id) {
   if (id.empty() || !store_->db()) return nullptr;
   if (!store_->Exec("BEGIN IMMEDIATE")) return nullptr;
-  bool ok =
-      Statement(*store_, "DELETE FROM properties WHERE owner=? AND id=?")
-          .Bind(1, owner_)
-          .Bind(2, id)
-          .Run() &&
-      Statement(
-          *store_,
-          "INSERT OR REPLACE INTO tasks (owner, id, finished, ok, created) VALUES (?,?,0,0,?)")
-          .Bind(1, owner_)
-          .Bind(2, id)
-          .Bind(3, static_cast<long long>(time(nullptr)))
-          .Run();
-  if (!ok || !store_->Exec("COMMIT")) {
+  if (!Recreate(id) || !store_->Exec("COMMIT")) {
     store_->Exec("ROLLBACK");
     return nullptr;
   }
   return new Task(store_, owner_, id);
+}
+
+TaskMgr::Claim TaskMgr::claimTask(const std::string& id, const Json::Value& data, InUse in_use,
+                                  Task** task) {
+  *task = nullptr;
+  if (id.empty() || !store_->db()) return Claim::kFailed;
+  // BEGIN IMMEDIATE takes the write lock before the look, so no other claim
+  // can come between the look and the write.
+  if (!store_->Exec("BEGIN IMMEDIATE")) return Claim::kFailed;
+  if (StillHeld(id, in_use)) {
+    store_->Exec("ROLLBACK");
+    return Claim::kBusy;
+  }
+  bool ok = Recreate(id) && WriteProperty(*store_, owner_, id, "data", false, data);
+  if (!ok || !store_->Exec("COMMIT")) {
+    store_->Exec("ROLLBACK");
+    return Claim::kFailed;
+  }
+  *task = new Task(store_, owner_, id);
+  return Claim::kClaimed;
 }
 
 std::vector<std::string> TaskMgr::listTasks(const std::string& prefix) {

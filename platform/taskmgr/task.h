@@ -32,20 +32,23 @@ class Task {
   Json::Value getProperty(const std::string& name);
   // A number property; `def` when unset or not a number.
   double getDoubleProperty(const std::string& name, double def);
-  // False when the store cannot be written. Between beginUpdate and
-  // endUpdate the writes are kept and written together by endUpdate.
-  bool setProperty(const std::string& name, const Json::Value& value);
-  bool unsetProperty(const std::string& name);
+  // False when the store cannot be written: the task then does not hold the
+  // value, and a caller must not tell anyone that it does. Between
+  // beginUpdate and endUpdate the writes are kept (and answer true) and
+  // written together by endUpdate, whose result is the batch's.
+  [[nodiscard]] bool setProperty(const std::string& name, const Json::Value& value);
+  [[nodiscard]] bool unsetProperty(const std::string& name);
   void beginUpdate();
-  bool endUpdate();
+  [[nodiscard]] bool endUpdate();
 
   // Whether the job has ended. setFinishValue sets it; finish(ok) ends the
-  // job and records whether it succeeded.
-  bool setFinishValue(bool finished);
-  bool finish(bool ok);
+  // job and records whether it succeeded. False when not written.
+  [[nodiscard]] bool setFinishValue(bool finished);
+  [[nodiscard]] bool finish(bool ok);
   bool isFinished();
-  // The task is gone for every reader afterwards.
-  bool remove();
+  // The task is gone for every reader afterwards. False when it could not be
+  // removed (it is then still there).
+  [[nodiscard]] bool remove();
   // Waits (polling) until `name` is set, at most `seconds`. True when set.
   bool waitForDataReady(const std::string& name, int seconds);
 
@@ -77,11 +80,26 @@ class TaskMgr {
   Task* getTask(const std::string& id);
   // Creates the task, replacing any earlier one of that id. Null when the
   // store cannot be written. The caller owns it.
-  Task* createTask(const std::string& id);
+  [[nodiscard]] Task* createTask(const std::string& id);
+
+  // Whether the job that a task's "data" describes still holds the task.
+  using InUse = bool (*)(const Json::Value& data);
+  enum class Claim { kClaimed, kBusy, kFailed };
+  // Takes task `id` for a new job in one transaction: unless a task of that
+  // id exists, is not finished and `in_use` says its "data" is still held,
+  // the task is created anew (replacing any earlier one) with "data" set to
+  // `data`, and `*task` is set to it (the caller owns it): kClaimed. A task
+  // still held is left exactly as it is: kBusy. kFailed when the store
+  // cannot be written. Two claims at once never both succeed.
+  [[nodiscard]] Claim claimTask(const std::string& id, const Json::Value& data, InUse in_use,
+                                Task** task);
   // Ids of this owner's tasks with the given prefix, sorted.
   std::vector<std::string> listTasks(const std::string& prefix = "");
 
  private:
+  bool Recreate(const std::string& id);
+  bool StillHeld(const std::string& id, InUse in_use);
+
   std::shared_ptr<TaskStore> store_;
   std::string owner_;
 };
@@ -95,9 +113,9 @@ std::string getUniqueID(const std::string& owner, int reserved);
 
 namespace KIVOPackageTool {
 // The task `id` of the registry, or null. The caller frees it.
-NVX::Task* GetTaskWithTaskMgr(NVX::TaskMgr& mgr, const std::string& id);
+[[nodiscard]] NVX::Task* GetTaskWithTaskMgr(NVX::TaskMgr& mgr, const std::string& id);
 // A new task `id` of `owner` (replacing any earlier one), or null.
-NVX::Task* GetNewTask(const char* owner, const char* id);
+[[nodiscard]] NVX::Task* GetNewTask(const char* owner, const char* id);
 }  // namespace KIVOPackageTool
 
 using KIVOPackageTool::GetNewTask;

@@ -1,6 +1,7 @@
 #include "taskmgr/task.h"
 
 #include <memory>
+#include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -48,10 +49,10 @@ TEST_F(TaskTest, PropertiesFinishAndRemove) {
 
 TEST_F(TaskTest, UpdatesAreAllOrNothingAndRecreatingStartsAfresh) {
   std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", "t"));
-  task->setProperty("progress", 0.7);
+  ASSERT_TRUE(task->setProperty("progress", 0.7));
   task->beginUpdate();
-  task->setProperty("data", Json::Value("new"));
-  task->unsetProperty("progress");
+  ASSERT_TRUE(task->setProperty("data", Json::Value("new")));
+  ASSERT_TRUE(task->unsetProperty("progress"));
   EXPECT_TRUE(task->getProperty("data").isNull());  // not written before endUpdate
   ASSERT_TRUE(task->endUpdate());
   EXPECT_EQ("new", task->getProperty("data").asString());
@@ -72,7 +73,7 @@ TEST_F(TaskTest, ProcessesShareTasks) {
       for (int i = 0; i < 20; ++i) {
         if (!task->setProperty("k" + std::to_string(c) + "_" + std::to_string(i), i)) _exit(1);
       }
-      if (c == 3) task->setProperty("data", Json::Value("ready"));
+      if (c == 3 && !task->setProperty("data", Json::Value("ready"))) _exit(1);
       _exit(0);
     }
     children.push_back(pid);
@@ -89,6 +90,57 @@ TEST_F(TaskTest, ProcessesShareTasks) {
     }
   }
   EXPECT_FALSE(task->waitForDataReady("never", 1));
+}
+
+bool HeldByLivingPid(const Json::Value& data) {
+  return data["pid"].isInt() && kill(data["pid"].asInt(), 0) == 0;
+}
+
+Json::Value JobOf(pid_t pid) {
+  Json::Value data(Json::objectValue);
+  data["pid"] = static_cast<int>(pid);
+  return data;
+}
+
+// Claims by several processes at once: one wins, the others leave its task
+// as it is; a finished task or one whose job is gone is claimed anew.
+TEST_F(TaskTest, ClaimsAreExclusive) {
+  std::vector<pid_t> children;
+  for (int c = 0; c < 4; ++c) {
+    pid_t pid = fork();
+    if (pid == 0) {
+      NVX::Task* raw = nullptr;
+      auto claim =
+          NVX::TaskMgr("@administrators").claimTask("job", JobOf(getppid()), HeldByLivingPid, &raw);
+      delete raw;
+      _exit(claim == NVX::TaskMgr::Claim::kClaimed ? 0
+            : claim == NVX::TaskMgr::Claim::kBusy  ? 2
+                                                   : 1);
+    }
+    children.push_back(pid);
+  }
+  int claimed = 0, busy = 0;
+  for (pid_t pid : children) {
+    int status;
+    waitpid(pid, &status, 0);
+    claimed += WEXITSTATUS(status) == 0;
+    busy += WEXITSTATUS(status) == 2;
+  }
+  EXPECT_EQ(1, claimed);
+  EXPECT_EQ(3, busy);
+  NVX::Task* raw = nullptr;
+  EXPECT_EQ(NVX::TaskMgr::Claim::kBusy, mgr_.claimTask("job", JobOf(1), HeldByLivingPid, &raw));
+  std::unique_ptr<NVX::Task> held(mgr_.getTask("job"));
+  EXPECT_EQ(getpid(), held->getProperty("data")["pid"].asInt());
+  ASSERT_TRUE(held->finish(false));
+  ASSERT_EQ(NVX::TaskMgr::Claim::kClaimed,
+            mgr_.claimTask("job", JobOf(999999), HeldByLivingPid, &raw));
+  std::unique_ptr<NVX::Task> again(raw);
+  EXPECT_FALSE(again->isFinished());
+  // Its job (pid 999999) is gone: the task is free again.
+  ASSERT_EQ(NVX::TaskMgr::Claim::kClaimed,
+            mgr_.claimTask("job", JobOf(getpid()), HeldByLivingPid, &raw));
+  delete raw;
 }
 
 TEST(TaskUtilTest, UniqueIds) {

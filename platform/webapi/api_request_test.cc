@@ -34,6 +34,18 @@ TEST_F(APIRequestTest, DecodesJsonValuesAndKeepsRealsAsText) {
   EXPECT_FALSE(req_.HasParam("absent"));
 }
 
+TEST_F(APIRequestTest, JsonSpellingANulStaysText) {
+  Send("id", "[\"demo-notes\\u0000/../../zzz\"]");
+  Send("obj", "{\"a\\u0000b\": 1}");
+  Send("s", "\"x\\u0000\"");
+  for (const char* name : {"id", "obj", "s"}) {
+    const Json::Value value = req_.GetParam(name);
+    ASSERT_TRUE(value.isString()) << name;
+    EXPECT_EQ(std::string::npos, value.asString().find('\0')) << name;
+  }
+  EXPECT_EQ("[\"demo-notes\\u0000/../../zzz\"]", req_.GetParam("id").asString());
+}
+
 TEST_F(APIRequestTest, StringReaderTakesScalarTextAndRefusesContainers) {
   Send("ver", "1.10");
   Send("n", "5");

@@ -16,6 +16,7 @@ bool UrlDecode(const std::string& in, std::string* out) {
   out->reserve(in.size());
   for (size_t i = 0; i < in.size(); ++i) {
     char c = in[i];
+    if (c == '\0') return false;
     if (c == '+') {
       *out += ' ';
     } else if (c != '%') {
@@ -23,7 +24,7 @@ bool UrlDecode(const std::string& in, std::string* out) {
     } else {
       int hi = i + 2 < in.size() ? HexValue(in[i + 1]) : -1;
       int lo = hi >= 0 ? HexValue(in[i + 2]) : -1;
-      if (lo < 0) return false;
+      if (lo < 0 || hi * 16 + lo == 0) return false;
       *out += static_cast<char>(hi * 16 + lo);
       i += 2;
     }
@@ -43,7 +44,7 @@ bool ParseUrlEncoded(const std::string& text, FormFields* out, std::string* erro
     std::string name, value;
     if (!UrlDecode(field.substr(0, eq), &name) ||
         (eq != std::string::npos && !UrlDecode(field.substr(eq + 1), &value))) {
-      *error = "invalid percent-encoding in field " + std::to_string(out->size() + 1);
+      *error = "invalid percent-encoding or NUL byte in field " + std::to_string(out->size() + 1);
       return false;
     }
     out->emplace_back(std::move(name), std::move(value));

@@ -25,11 +25,18 @@ TEST(UrlEncodedTest, RefusesBrokenEscapes) {
   }
 }
 
-TEST(UrlEncodedTest, KeepsArbitraryBytes) {
+TEST(UrlEncodedTest, KeepsArbitraryBytesButNul) {
   FormFields f;
   std::string error;
-  ASSERT_TRUE(ParseUrlEncoded("n=%FF%00%C3", &f, &error));
-  EXPECT_EQ(std::string("\xFF\0\xC3", 3), f[0].second);
+  ASSERT_TRUE(ParseUrlEncoded("n=%FF%01%C3", &f, &error));
+  EXPECT_EQ(std::string("\xFF\x01\xC3", 3), f[0].second);
+  // A NUL would cut the value short wherever it becomes a C string.
+  for (const std::string& bad :
+       {std::string("id=demo%00/../x"), std::string("n%00=1"), std::string("a=1&id=x\0y", 11)}) {
+    FormFields g;
+    EXPECT_FALSE(ParseUrlEncoded(bad, &g, &error)) << bad;
+    EXPECT_NE(std::string::npos, error.find("NUL")) << error;
+  }
 }
 
 }  // namespace

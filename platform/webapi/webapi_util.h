@@ -16,7 +16,9 @@ bool JsonArrayHasString(const Json::Value& array, const std::string& value);
 // Turns a parameter's text as sent into its value: text that is valid JSON
 // and an object, array, quoted string, integer, true, false or null becomes
 // that JSON value; anything else (reals such as 1.10 among them) stays the
-// string as sent, so a version "1.10" is never turned into 1.1.
+// string as sent, so a version "1.10" is never turned into 1.1. JSON whose
+// strings or member names would hold a NUL character (\u0000) stays the
+// text as sent too, so no decoded value holds a NUL byte.
 Json::Value DecodeParamValue(const std::string& raw);
 
 }  // namespace WebAPIUtil
