@@ -17,6 +17,7 @@
 #include <unistd.h>
 #include <vector>
 
+#include "bench_setup.h"
 #include "klibc/atomic_file.h"
 #include "pkgtool/package_builder.h"
 #include "testing/payload_generator.h"
@@ -60,11 +61,10 @@ int main(int argc, char** argv) {
   uint64_t mib = argc > 1 ? std::strtoull(argv[1], nullptr, 10) : 1024;
   UseBuildDirOfThisProgram();
   TempRoot root;
-  KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+  WriteOrExit(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
   std::string src = root.Path("/tmp/src");
-  KIVOFSMkdirP((src + "/package").c_str());
-  KIVOWriteFileAtomic(src + "/INFO",
-                      "package=\"bench-payload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
+  MakeDirOrExit(src + "/package");
+  WriteOrExit(src + "/INFO", "package=\"bench-payload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
   Clock::time_point t = Clock::now();
   uint64_t bytes = GeneratePayload(src + "/package", mib << 20);
   printf("payload: %.0f MiB in generated files (%.1f s)\n", bytes / 1048576.0, Seconds(t));
@@ -79,13 +79,13 @@ int main(int argc, char** argv) {
   }
   printf("package built with gzip level 1 (%.1f s)\n", Seconds(t));
   std::string work = root.Path("/tmp/work");
-  KIVOFSMkdirP(work.c_str());
+  MakeDirOrExit(work);
   Run({"tar", "-xf", pkg, "-C", work, "package.tgz"}, nullptr);
   Run({"rm", "-rf", src}, nullptr);
   Run({"cat", pkg, work + "/package.tgz"}, nullptr);  // both start from the page cache
 
   std::string tar_target = root.Path("/volume1/tar-target");
-  KIVOFSMkdirP(tar_target.c_str());
+  MakeDirOrExit(tar_target);
   long tar_kib = 0, tool_kib = 0;
   double tar_s = Run({"tar", "-xzf", work + "/package.tgz", "-C", tar_target}, &tar_kib);
   Run({"rm", "-rf", tar_target}, nullptr);

@@ -11,6 +11,7 @@
 #include <unistd.h>
 #include <vector>
 
+#include "bench_setup.h"
 #include "klibc/atomic_file.h"
 #include "pkgtool/package_manager.h"
 #include "testing/cgi_client.h"
@@ -72,9 +73,9 @@ int main(int argc, char** argv) {
   for (int count : {30, 300, 3000}) {
     TempRoot root;
     root.AddAccount("admin", "secret", {"administrators"});
-    KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+    WriteOrExit(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
     std::string dir = root.Path("/tmp/src");
-    KIVOFSMkdirP(dir.c_str());
+    MakeDirOrExit(dir);
     InstallMany(dir, count);
     ApiClient admin("admin", "secret");
     WebServer server(root.dir());

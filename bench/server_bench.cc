@@ -18,6 +18,7 @@
 #include <unistd.h>
 #include <vector>
 
+#include "bench_setup.h"
 #include "klibc/atomic_file.h"
 #include "pkgserver/download.h"
 #include "pkgtool/package_manager.h"
@@ -90,9 +91,9 @@ Percentiles Time(int port, const std::string& target, const std::string& headers
 void ListFigures(int requests) {
   TempRoot root;
   root.AddAccount("admin", "secret", {"administrators"});
-  KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+  WriteOrExit(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
   std::string dir = root.Path("/tmp/src");
-  KIVOFSMkdirP(dir.c_str());
+  MakeDirOrExit(dir);
   InstallMany(dir, 300);
   ApiClient admin("admin", "secret");
   WebServer server(root.dir());
@@ -157,7 +158,7 @@ void DownloadFigures(int mib) {
   TempRoot root;
   WebServer server(root.dir());
   const std::string feed = root.Path("/usr/kivo/www/feed");
-  KIVOFSMkdirP(feed.c_str());
+  MakeDirOrExit(feed);
   const std::string big = feed + "/bigpkg.kpk", small = feed + "/smallpkg.kpk";
   RunProgram({"sh", "-c",
               "head -c " + std::to_string(mib) + "M /dev/urandom > " + big + " && head -c 64M " +

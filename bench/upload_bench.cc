@@ -22,6 +22,7 @@
 
 #include <json/reader.h>
 
+#include "bench_setup.h"
 #include "klibc/atomic_file.h"
 #include "pkgtool/package_builder.h"
 #include "testing/cgi_client.h"
@@ -48,7 +49,8 @@ long EntryCgiPeakKib() {
     std::string comm;
     if (!KIVOReadFile(base + "/comm", &comm, 64) || comm.compare(0, 9, "entry.cgi") != 0) continue;
     std::string status;
-    KIVOReadFile(base + "/status", &status, 4096);
+    // The process may have ended since its name was read.
+    if (!KIVOReadFile(base + "/status", &status, 4096)) continue;
     size_t at = status.find("VmHWM:");
     if (at != std::string::npos) peak = std::max(peak, std::atol(status.c_str() + at + 6));
   }
@@ -74,11 +76,10 @@ int main(int argc, char** argv) {
   UseBuildDirOfThisProgram();
   TempRoot root;
   root.AddAccount("admin", "secret", {"administrators"});
-  KIVOWriteFileAtomic(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+  WriteOrExit(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
   std::string src = root.Path("/tmp/src");
-  KIVOFSMkdirP((src + "/package").c_str());
-  KIVOWriteFileAtomic(src + "/INFO",
-                      "package=\"bench-upload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
+  MakeDirOrExit(src + "/package");
+  WriteOrExit(src + "/INFO", "package=\"bench-upload\"\nversion=\"1.0\"\nstartable=\"no\"\n");
   uint64_t bytes = GeneratePayload(src + "/package", mib << 20);
   std::string pkg = root.Path("/tmp/bench.kpk"), error;
   BuildOptions options;

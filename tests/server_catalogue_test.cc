@@ -86,8 +86,8 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
   Json::Value data(Json::objectValue);
   data["tmp_folder"] = root_.Path("/volume1/@tmp/download-app-b-gone");
   data["pid"] = 0;
-  task->setProperty("data", data);
-  task->setProperty("progress", 1.0);
+  ASSERT_TRUE(task->setProperty("data", data));
+  ASSERT_TRUE(task->setProperty("progress", 1.0));
 
   CgiAnswer list = List();
   ASSERT_TRUE(list.Success()) << list.body;

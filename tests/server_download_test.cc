@@ -259,7 +259,7 @@ TEST_F(ServerDownloadTest, DownloadCheckRemovesWhatCannotBeInstalled) {
   std::unique_ptr<NVX::Task> task(GetNewTask("@administrators", kTask));
   Json::Value data(Json::objectValue);
   data["tmp_folder"] = root_.Path("/volume1/@tmp/download-dl-app-gone");
-  task->setProperty("data", data);
+  ASSERT_TRUE(task->setProperty("data", data));
   EXPECT_EQ(4501, client().Call(kApi, "check", 1, {{"taskid", kTask}}).Code());
   EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(kTask));
 }

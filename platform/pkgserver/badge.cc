@@ -52,7 +52,7 @@ int updateBadgeCount(bool forceReload) {
   }
   badge["count"] = badge["packages"].size();
   badge["time"] = static_cast<Json::Int64>(time(nullptr));
-  KIVOFSMkdirP(KIVORootPath("/var/cache/kivo/pkgserver").c_str());
+  if (KIVOFSMkdirP(KIVORootPath("/var/cache/kivo/pkgserver").c_str()) != 0) return -1;
   if (!WebUtils::SaveJsonFile(PMSBadgeCountPath(), badge)) return -1;
   return static_cast<int>(badge["count"].asUInt());
 }

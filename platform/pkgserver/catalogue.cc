@@ -38,9 +38,11 @@ std::string CacheKey(const std::string& url, const std::string& language) {
 // The server's address with what the appliance is appended.
 std::string QueryUrl(const std::string& url, const std::string& language,
                      const Json::Value& extra) {
+  // A missing device or settings file leaves its fields empty: the server
+  // then answers for any device and the default channel.
   KeyValueMap device, info;
-  KIVOKeyValueLoad(KIVORootPath("/etc/kivo/device.conf"), &device);
-  KIVOKeyValueLoad(KIVORootPath("/etc/kivoinfo.conf"), &info);
+  if (!KIVOKeyValueLoad(KIVORootPath("/etc/kivo/device.conf"), &device)) device.clear();
+  if (!KIVOKeyValueLoad(KIVORootPath("/etc/kivoinfo.conf"), &info)) info.clear();
   std::string q = url + (url.find('?') == std::string::npos ? "?" : "&");
   q += "language=" + PMSUrlEncode(language) + "&arch=" + PMSUrlEncode(device["arch"]) +
        "&os_version=" + PMSUrlEncode(device["os_version"]) +
@@ -74,12 +76,17 @@ bool ReadCache(const std::string& path, CachedCatalogue* cached) {
   return true;
 }
 
+// The cache only saves the next request a transfer: failing to write it is
+// logged and otherwise harmless.
 void WriteCache(const std::string& path, const CachedCatalogue& cached) {
   Json::StreamWriterBuilder builder;
   builder["indentation"] = "";
-  KIVOFSMkdirP(CacheDir().c_str());
-  KIVOWriteFileAtomic(path, Json::writeString(builder, cached.meta) + "\n" + cached.body,
-                      SyncToDisk::No);
+  if (KIVOFSMkdirP(CacheDir().c_str()) != 0 ||
+      !KIVOWriteFileAtomic(path, Json::writeString(builder, cached.meta) + "\n" + cached.body,
+                           SyncToDisk::No)) {
+    syslog(LOG_WARNING, "%s:%d cannot write the catalogue cache %s", "catalogue", __LINE__,
+           path.c_str());
+  }
 }
 
 bool ParseAnswer(const std::string& body, Json::Value& answer) {

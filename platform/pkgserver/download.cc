@@ -54,10 +54,22 @@ struct ProgressWriter {
     self->last = now;
     // 1.0 means "complete and checked"; until then stay below it.
     double fraction = std::min(0.99, static_cast<double>(have) / static_cast<double>(total));
-    if (TaskExists(self->task)) self->task->setProperty("progress", fraction);
+    // Progress is advisory: a failed write is retried with the next block.
+    if (TaskExists(self->task) && !self->task->setProperty("progress", fraction)) self->last = 0;
   }
   static bool Canceled(void*) { return isCanceled(); }
 };
+
+// Writes `data` (and "progress" when it is not negative) in one transaction.
+// False, with a log line, when the task store refused it.
+bool WriteTaskData(NVX::Task* task, const Json::Value& data, double progress) {
+  task->beginUpdate();
+  bool ok = task->setProperty("data", data);
+  if (progress >= -1.0) ok = task->setProperty("progress", progress) && ok;
+  ok = task->endUpdate() && ok;
+  if (!ok) DOWNLOAD_LOG("cannot write task %s", task->getTaskId().c_str());
+  return ok;
+}
 
 void Fail(NVX::Task* task, int code, const std::string& message, int result = 0) {
   if (isCanceled() || !TaskExists(task)) return;
@@ -68,24 +80,22 @@ void Fail(NVX::Task* task, int code, const std::string& message, int result = 0)
   data["error"]["code"] = code;
   data["error"]["message"] = message;
   if (result) data["error"]["result"] = result;
-  task->beginUpdate();
-  task->setProperty("data", data);
-  task->setProperty("progress", -1.0);
-  task->endUpdate();
-  task->finish(false);
+  // The log line says what failed even when the task cannot.
+  DOWNLOAD_LOG("%s: %s", task->getTaskId().c_str(), message.c_str());
+  if (!WriteTaskData(task, data, -1.0) || !task->finish(false)) {
+    DOWNLOAD_LOG("cannot record the failure in task %s", task->getTaskId().c_str());
+  }
 }
 
 // One update of "status" and "installing" (and "progress" when given).
-void SetStatus(NVX::Task* task, const char* status, bool installing, double progress = -2.0) {
+[[nodiscard]] bool SetStatus(NVX::Task* task, const char* status, bool installing,
+                             double progress = -2.0) {
   Json::Value data = task->getProperty("data");
   if (!data.isObject()) data = Json::Value(Json::objectValue);
   data["status"] = status;
   data["installing"] = installing;
   data["pid"] = static_cast<int>(getpid());
-  task->beginUpdate();
-  task->setProperty("data", data);
-  if (progress >= 0) task->setProperty("progress", progress);
-  task->endUpdate();
+  return WriteTaskData(task, data, progress >= 0 ? progress : -2.0);
 }
 
 // The sha256 a catalogue gives for `link`, "" when none does.
@@ -173,11 +183,7 @@ bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const
   data["blqinst"] = quickInstall;
   data["installing"] = false;
   data["status"] = "downloading";
-  if (!task->setFinishValue(false)) return false;
-  task->beginUpdate();
-  task->setProperty("progress", 0.0);
-  task->setProperty("data", data);
-  return task->endUpdate();
+  return task->setFinishValue(false) && WriteTaskData(task, data, 0.0);
 }
 
 void RegisterCancel() {
@@ -209,10 +215,9 @@ bool DownloadPackage(NVX::Task* task, const std::string& user, const std::string
     return false;
   }
   if (!TaskExists(task)) return false;
-  SetStatus(task, "downloaded", false, 1.0);
+  if (!SetStatus(task, "downloaded", false, 1.0)) return false;
   // A quick install goes on in this task; a plain download is complete.
-  if (!quickInstall) task->finish(true);
-  return true;
+  return quickInstall || task->finish(true);
 }
 
 bool Install(NVX::Task* task, const std::string& user, const std::string& volume,
@@ -220,7 +225,10 @@ bool Install(NVX::Task* task, const std::string& user, const std::string& volume
              const std::string& wizardValues, bool typeFlag, const std::string& language) {
   if (!task) return false;
   const std::string path = folder + "/" + task->getTaskId();
-  SetStatus(task, PMSCheckPackage(name) ? "upgrading" : "installing", true);
+  if (!SetStatus(task, PMSCheckPackage(name) ? "upgrading" : "installing", true)) {
+    PMSRemoveDownloadDir(folder);
+    return false;
+  }
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;
@@ -234,9 +242,7 @@ bool Install(NVX::Task* task, const std::string& user, const std::string& volume
          static_cast<int>(code));
     return false;
   }
-  SetStatus(task, "installed", false);
-  task->finish(true);
-  return true;
+  return SetStatus(task, "installed", false) && task->finish(true);
 }
 
 bool PMSRemoveDownloadDir(const std::string& folder) {

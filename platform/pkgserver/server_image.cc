@@ -56,7 +56,7 @@ bool Fetch(const std::string& link, const std::string& path) {
                                : fetch.error.c_str());
     return false;
   }
-  KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str());
+  if (KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str()) != 0) return false;
   return KIVOWriteFileAtomic(path, fetch.body, SyncToDisk::No);
 }
 

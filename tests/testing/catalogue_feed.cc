@@ -1,12 +1,14 @@
 #include "testing/catalogue_feed.h"
 
+#include <gtest/gtest.h>
+
 #include "klibc/atomic_file.h"
 #include "webapi/webapi_util.h"
 
 CatalogueFeed::CatalogueFeed(HttpTestServer& server, const std::string& dir,
                              const std::string& prefix)
     : server_(server), dir_(dir), prefix_(prefix) {
-  KIVOFSMkdirP(dir_.c_str());
+  if (KIVOFSMkdirP(dir_.c_str()) != 0) ADD_FAILURE() << "cannot create " << dir_;
 }
 
 std::string CatalogueFeed::Add(const TestPackage& package) {
