@@ -56,6 +56,12 @@ enum ApiError : int {
   kErrStopDependents = 4582,
   kErrStartVersionLimit = 4583,
   kErrStartDependency = 4584,
+  kErrFeedNotServer = 4590,      // the feed does not answer as a package server
+  kErrFeedExists = 4591,         // the feed address is already in the list
+  kErrKeyUnreadable = 4592,      // the uploaded key file cannot be read
+  kErrKeyNotPublic = 4593,       // the file holds no OpenPGP public key
+  kErrKeySecret = 4594,          // the file holds a secret key
+  kErrKeyringUnwritable = 4595,  // the appliance keyring cannot be written
 };
 
 // One row of a table that maps a package-tool result code onto an answer.

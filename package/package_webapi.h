@@ -69,6 +69,12 @@ class PackageWebAPI {
   // Answers that the member's method is not part of this build yet.
   void AnswerNotAvailable(const char* member);
 
+  // Feeds (feed.cc): the parsed "list" parameter (answers 4501 when it is
+  // not JSON), and a "set" change applied to the list (answers 4591 when the
+  // new address is another feed's).
+  bool ReadFeedRequest(Json::Value* parsed);
+  bool ApplyFeedChange(Json::Value* feeds, const Json::Value& change);
+
   // Rendering (package_info.cc): the live status and web address of an
   // installed package, its uninstall wizard pages, a package file.
   void DumpStatusInfo(const PackageInfo& info, uint64_t mask, Json::Value& additional);

@@ -20,13 +20,6 @@ void PackageWebAPI::AnswerNotAvailable(const char* member) {
 #define KIVO_NOT_AVAILABLE(name) \
   void PackageWebAPI::name() { AnswerNotAvailable(#name); }
 
-KIVO_NOT_AVAILABLE(LoadFeedList)
-KIVO_NOT_AVAILABLE(EditFeedList)
-KIVO_NOT_AVAILABLE(AddFeedList)
-KIVO_NOT_AVAILABLE(DelFeedList)
-KIVO_NOT_AVAILABLE(AddKeyring)
-KIVO_NOT_AVAILABLE(ListKeyring)
-KIVO_NOT_AVAILABLE(DelKeyring)
 KIVO_NOT_AVAILABLE(GetSetting)
 KIVO_NOT_AVAILABLE(SetSetting)
 KIVO_NOT_AVAILABLE(LoadConfig)

@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include "klibc/atomic_file.h"
+#include "tools/kivoctl/codesign_install.h"
 
 namespace {
 
@@ -84,6 +85,7 @@ bool KIVOCreateSystemRoot(const std::string& dir, std::string* error) {
   // GnuPG insists on a private home for the appliance keyring.
   std::string keyring = dir + "/usr/kivo/etc/packages/gnupg";
   if (KIVOFSMkdirP(keyring.c_str(), 0700) != 0) return (*error = "cannot create " + keyring), false;
+  if (!KIVOInstallCodesignScript(dir, error)) return false;
   for (const DefaultFile& f : kFiles) {
     std::string path = dir + "/" + f.path;
     if (KLIBCFileExist(path.c_str())) continue;

@@ -1,0 +1,31 @@
+// The feed list, "/usr/kivo/etc/packages/feeds" under the root: a JSON array
+// of {"feed": address, "name": label, ...}. Changes are made under an
+// exclusive lock on a file beside it, so two requests that change the list
+// at once are applied one after the other and neither is lost; the file
+// itself is always replaced whole (temporary file + rename).
+#pragma once
+
+#include <string>
+
+namespace KIVOPackageServer {
+
+// The feed file's path and its folder, under the root.
+std::string PMSFeedFilePath();
+std::string PMSFeedFolder();
+
+// Holds the feed list's lock for its lifetime. Check held(): false (with
+// errno set) when the lock file cannot be made or locked.
+class FeedFileLock {
+ public:
+  FeedFileLock();
+  ~FeedFileLock();
+  FeedFileLock(const FeedFileLock&) = delete;
+  FeedFileLock& operator=(const FeedFileLock&) = delete;
+
+  bool held() const { return fd_ >= 0; }
+
+ private:
+  int fd_ = -1;
+};
+
+}  // namespace KIVOPackageServer
