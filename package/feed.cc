@@ -106,6 +106,16 @@ Json::Value PublishedKeys(const Json::Value& answer) {
   return Json::Value();
 }
 
+// Loads the list again once the lock is held; false (logged) otherwise.
+bool LockAndLoad(const KIVOPackageServer::FeedFileLock& lock, Json::Value* feeds,
+                 bool missing_is_empty) {
+  if (!lock.held()) {
+    PKG_LOG_ERR("Fail to lock %s, %m", PMSFeedFilePath().c_str());
+    return false;
+  }
+  return LoadFeeds(feeds, missing_is_empty);
+}
+
 void UpdateKeys(const std::string& feed, const Json::Value& keys) {
   if (!KIVOPackageServer::PMSUpdatePkgServerKey(feed, keys)) {
     PKG_LOG_ERR("Fail to update the keys of %s", feed.c_str());
@@ -256,7 +266,7 @@ void PackageWebAPI::AddFeedList() {
   // The probe may take seconds: the list is read again under the lock, so a
   // change made meanwhile is kept and a feed added meanwhile is not doubled.
   KIVOPackageServer::FeedFileLock lock;
-  if (!lock.held() || !LoadFeeds(&feeds, true)) {
+  if (!LockAndLoad(lock, &feeds, true)) {
     return response->SetError(kErrFailed, Json::Value());
   }
   if (HasFeed(feeds, feed)) return response->SetError(kErrFeedExists, Json::Value());
@@ -300,7 +310,7 @@ void PackageWebAPI::EditFeedList() {
     return response->SetError(kErrFeedNotServer, Json::Value());
   }
   KIVOPackageServer::FeedFileLock lock;
-  if (!lock.held() || !LoadFeeds(&feeds, false)) {
+  if (!LockAndLoad(lock, &feeds, false)) {
     return response->SetError(kErrFailed, Json::Value());
   }
   const bool changed = HasFeed(feeds, orifeed);
@@ -315,7 +325,7 @@ void PackageWebAPI::EditFeedList() {
 void PackageWebAPI::DelFeedList() {
   Json::Value feeds, gone;
   KIVOPackageServer::FeedFileLock lock;
-  if (!lock.held() || !LoadFeeds(&feeds, false)) {
+  if (!LockAndLoad(lock, &feeds, false)) {
     return response->SetError(kErrFailed, Json::Value());
   }
   if (!ReadFeedRequest(&gone)) return;
