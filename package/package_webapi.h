@@ -137,6 +137,15 @@ class PackageWebAPI {
   bool AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, Json::Value& entry);
   void AnnotateDownload(NVX::TaskMgr& mgr, Json::Value& entry);
 
+  // Settings (setting.cc).
+  // Stores the default volume; false with the error answered (4504 for a
+  // full volume, 4502 otherwise). `result` is left untouched.
+  bool SavePackageDefVolPath(std::string path, Json::Value& result);
+  void SetAutoUpdate(bool add);
+  // False on the package center's first visit, which it records.
+  bool VisitedBefore();
+  void FillTermsOfService(Json::Value& reply);
+
   // Start and stop (control.cc).
   void StartStop(bool start);
   bool ServiceControl(const std::string& name, bool start, Json::Value& result);

@@ -20,13 +20,6 @@ void PackageWebAPI::AnswerNotAvailable(const char* member) {
 #define KIVO_NOT_AVAILABLE(name) \
   void PackageWebAPI::name() { AnswerNotAvailable(#name); }
 
-KIVO_NOT_AVAILABLE(GetSetting)
-KIVO_NOT_AVAILABLE(SetSetting)
-KIVO_NOT_AVAILABLE(LoadConfig)
-KIVO_NOT_AVAILABLE(SetDefVol)
-KIVO_NOT_AVAILABLE(GetDefVol)
-KIVO_NOT_AVAILABLE(AddAutoUpdate)
-KIVO_NOT_AVAILABLE(DelAutoUpdate)
 KIVO_NOT_AVAILABLE(GetServerIcon)
 KIVO_NOT_AVAILABLE(GetVXIcon)
 KIVO_NOT_AVAILABLE(GetServerScreenshot)

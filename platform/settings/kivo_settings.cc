@@ -1,0 +1,48 @@
+#include "settings/kivo_settings.h"
+
+#include <regex>
+
+#include "klibc/atomic_file.h"
+#include "klibc/last_error.h"
+#include "klibc/sysroot.h"
+#include "settings/web_utils.h"
+
+bool KivoSettingsUserNameValid(const std::string& name) {
+  static const std::regex kAccountName("[a-z_][a-z0-9_.-]{0,31}");
+  // A leading dot is excluded by the first character, so "." and ".." can
+  // never match.
+  return std::regex_match(name, kAccountName);
+}
+
+KivoSettings::KivoSettings(const std::string& user) {
+  if (KivoSettingsUserNameValid(user)) {
+    path_ = KIVORootPath("/usr/kivo/etc/users/" + user + "/settings.json");
+  }
+}
+
+bool KivoSettings::loadUserJsonSettings(Json::Value& settings) const {
+  settings = Json::Value();
+  if (path_.empty()) {
+    KLIBCErrSet(KLIBC_ERR_BAD_PARAMETER);
+    return false;
+  }
+  if (!KLIBCFileExist(path_.c_str())) {
+    settings = Json::Value(Json::objectValue);
+    return true;
+  }
+  if (!WebUtils::LoadJsonFile(path_, settings)) return false;
+  if (!settings.isObject()) {
+    settings = Json::Value();
+    KLIBCErrSet(KLIBC_ERR_FILE_READ);
+    return false;
+  }
+  return true;
+}
+
+bool KivoSettings::saveUserJsonSettings(const Json::Value& settings) const {
+  if (path_.empty() || !settings.isObject()) {
+    KLIBCErrSet(KLIBC_ERR_BAD_PARAMETER);
+    return false;
+  }
+  return WebUtils::SaveJsonFile(path_, settings);
+}
