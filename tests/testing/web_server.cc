@@ -1,5 +1,8 @@
 #include "testing/web_server.h"
 
+#include <cstdio>
+#include <cstdlib>
+#include <dirent.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
@@ -7,7 +10,6 @@
 
 #include "klibc/atomic_file.h"
 #include "testing/temp_root.h"
-#include "tools/kivoctl/web_config.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
@@ -42,12 +44,33 @@ int FreeLoopbackPort() {
   return ntohs(addr.sin_port);
 }
 
-WebServer::WebServer(const std::string& root, const std::string& entry_cgi) {
+const char* WebModeName(WebMode mode) { return mode == WebMode::kScgi ? "scgi" : "cgi"; }
+
+namespace {
+
+WebServerOptions CgiOptions(const std::string& entry_cgi) {
+  WebServerOptions options;
+  options.entry_cgi = entry_cgi;
+  return options;
+}
+
+}  // namespace
+
+WebServer::WebServer(const std::string& root, const std::string& entry_cgi)
+    : WebServer(root, CgiOptions(entry_cgi)) {}
+
+WebServer::WebServer(const std::string& root, const WebServerOptions& o) {
   WebConfigOptions options;
   options.root = root;
-  options.entry_cgi = entry_cgi.empty() ? BuildDir() + "/bin/entry.cgi" : entry_cgi;
+  options.mode = o.mode;
+  options.entry_cgi = o.entry_cgi.empty() ? BuildDir() + "/bin/entry.cgi" : o.entry_cgi;
+  options.webd = BuildDir() + "/bin/kivo-webd";
+  options.module_dir = o.module_dir;
+  options.max_children = o.max_children;
+  options.read_timeout_seconds = o.read_timeout_seconds;
   options.port = port_ = FreeLoopbackPort();
   std::string conf = root + "/lighttpd-" + std::to_string(port_) + ".conf";
+  if (!WebConfigProblem(options).empty()) return;
   if (!KIVOWriteFileAtomic(conf, KIVOWebConfig(options), SyncToDisk::No)) return;
   pid_t pid = fork();
   if (pid == 0) {
@@ -61,6 +84,26 @@ WebServer::WebServer(const std::string& root, const std::string& entry_cgi) {
     waitpid(pid_, nullptr, 0);
     pid_ = -1;
   }
+}
+
+pid_t WebServer::WebdPid() const {
+  DIR* proc = opendir("/proc");
+  if (!proc) return -1;
+  pid_t found = -1;
+  while (struct dirent* e = readdir(proc)) {
+    std::string stat;
+    if (!KIVOReadFile(std::string("/proc/") + e->d_name + "/stat", &stat)) continue;
+    // "<pid> (<comm>) <state> <ppid> ..."
+    size_t close = stat.rfind(')');
+    if (close == std::string::npos || stat.find("(kivo-webd)") == std::string::npos) continue;
+    char state = 0;
+    int ppid = 0;
+    if (sscanf(stat.c_str() + close + 1, " %c %d", &state, &ppid) == 2 && ppid == pid_ &&
+        state != 'Z')
+      found = atoi(e->d_name);
+  }
+  closedir(proc);
+  return found;
 }
 
 WebServer::~WebServer() {

@@ -2,7 +2,8 @@
 //
 //   kivoctl init-root DIR
 //   kivoctl [--root DIR] user-add NAME [--password PW | --password-stdin] [--group G]...
-//   kivoctl [--root DIR] web-config [--port N] [--address A] [--cgi PATH]
+//   kivoctl [--root DIR] web-config [--mode cgi|scgi] [--port N] [--address A] [--cgi PATH]
+//                                   [--webd PATH] [--max-children N] [--read-timeout S]
 //   kivoctl [--root DIR] server-config [--vendor URL] [--company-info URL]
 //   kivoctl build|sign|inspect|index ...      (package authors)
 //   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
@@ -31,7 +32,8 @@ const char kUsage[] =
     "                           create an account in the root, or reset its password\n"
     "                           and add it to groups (administrators may use the\n"
     "                           package center)\n"
-    "  web-config [--port N] [--address A] [--cgi PATH]\n"
+    "  web-config [--mode cgi|scgi] [--port N] [--address A] [--cgi PATH]\n"
+    "             [--webd PATH] [--max-children N] [--read-timeout SECONDS]\n"
     "                           print the lighttpd configuration that serves the\n"
     "                           root's web API (default 127.0.0.1:5000, the entry.cgi\n"
     "                           beside this program)\n"
@@ -94,23 +96,33 @@ int UserAdd(const std::vector<std::string>& args) {
   return 0;
 }
 
-// entry.cgi is installed beside kivoctl.
-std::string EntryCgiBesideUs() {
+// entry.cgi and kivo-webd are installed beside kivoctl.
+std::string BesideUs(const std::string& program) {
   char exe[4096];
   ssize_t n = readlink("/proc/self/exe", exe, sizeof(exe) - 1);
-  if (n <= 0) return "/usr/bin/entry.cgi";
+  if (n <= 0) return "/usr/bin/" + program;
   std::string path(exe, static_cast<size_t>(n));
-  return path.substr(0, path.rfind('/')) + "/entry.cgi";
+  return path.substr(0, path.rfind('/')) + "/" + program;
 }
 
 int WebConfig(const std::vector<std::string>& args) {
   WebConfigOptions options;
   const char* root = getenv("KIVO_ROOT");
   options.root = root && *root ? root : "/";
-  options.entry_cgi = EntryCgiBesideUs();
+  options.mode = WebMode::kScgi;
+  options.entry_cgi = BesideUs("entry.cgi");
+  options.webd = BesideUs("kivo-webd");
   for (size_t i = 0; i < args.size(); ++i) {
     bool has_value = i + 1 < args.size();
-    if (args[i] == "--port" && has_value) {
+    if (args[i] == "--mode" && has_value) {
+      if (!ParseWebMode(args[++i], &options.mode)) return Fail("--mode takes cgi or scgi");
+    } else if (args[i] == "--webd" && has_value) {
+      options.webd = args[++i];
+    } else if (args[i] == "--max-children" && has_value) {
+      options.max_children = std::atoi(args[++i].c_str());
+    } else if (args[i] == "--read-timeout" && has_value) {
+      options.read_timeout_seconds = std::atoi(args[++i].c_str());
+    } else if (args[i] == "--port" && has_value) {
       options.port = std::atoi(args[++i].c_str());
     } else if (args[i] == "--address" && has_value) {
       options.address = args[++i];
@@ -120,8 +132,8 @@ int WebConfig(const std::vector<std::string>& args) {
       return Fail("unknown option for web-config: " + args[i]);
     }
   }
-  if (options.port <= 0 || options.port > 65535) return Fail("--port takes 1 to 65535");
-  if (options.root[0] != '/') return Fail("the root must be an absolute path");
+  std::string problem = WebConfigProblem(options);
+  if (!problem.empty()) return Fail(problem);
   std::cout << KIVOWebConfig(options);
   return 0;
 }

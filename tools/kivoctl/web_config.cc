@@ -1,36 +1,113 @@
 #include "tools/kivoctl/web_config.h"
 
+#include <sys/un.h>
+
+namespace {
+
+// Paths go into quoted configuration strings, and kivo-webd's into a command
+// line the web server splits at spaces.
+bool Plain(const std::string& path) {
+  return !path.empty() && path[0] == '/' &&
+         path.find_first_of(" \t\r\n\"\\$'") == std::string::npos;
+}
+
+std::string Quoted(const std::string& text) { return "\"" + text + "\""; }
+
+std::string Environment(const WebConfigOptions& o) {
+  std::string env = "(\"KIVO_ROOT\" => " + Quoted(o.root);
+  if (!o.module_dir.empty()) env += ", \"KIVO_MODULE_DIR\" => " + Quoted(o.module_dir);
+  return env + ")";
+}
+
+std::string CgiSection(const WebConfigOptions& o) {
+  return "alias.url = (\"/webapi/entry.cgi\" => " + Quoted(o.entry_cgi) +
+         ")\n"
+         "$HTTP[\"url\"] == \"/webapi/entry.cgi\" {\n"
+         "  cgi.assign = (\"\" => \"\")\n"
+         "}\n";
+}
+
+std::string ScgiSection(const WebConfigOptions& o) {
+  std::string command = o.webd + " --max-children " + std::to_string(o.max_children) +
+                        " --read-timeout " + std::to_string(o.read_timeout_seconds);
+  return "$HTTP[\"url\"] == \"/webapi/entry.cgi\" {\n"
+         "  scgi.server = (\"\" => ((\n"
+         "    \"socket\" => " +
+         Quoted(WebdSocketPath(o)) +
+         ",\n"
+         "    \"bin-path\" => " +
+         Quoted(command) +
+         ",\n"
+         // kivo-webd forks per request itself; one of it is enough.
+         "    \"max-procs\" => 1,\n"
+         "    \"check-local\" => \"disable\",\n"
+         "    \"bin-environment\" => " +
+         Environment(o) +
+         "\n"
+         "  )))\n"
+         "}\n";
+}
+
+}  // namespace
+
+bool ParseWebMode(const std::string& text, WebMode* mode) {
+  if (text == "cgi") return (*mode = WebMode::kCgi), true;
+  if (text == "scgi") return (*mode = WebMode::kScgi), true;
+  return false;
+}
+
+std::string WebdSocketPath(const WebConfigOptions& o) {
+  std::string root = o.root == "/" ? "" : o.root;
+  return root + "/run/kivo/webd-" + std::to_string(o.port) + ".sock";
+}
+
+std::string WebConfigProblem(const WebConfigOptions& o) {
+  if (!Plain(o.root)) return "the root must be an absolute path without spaces or quotes";
+  if (!o.module_dir.empty() && !Plain(o.module_dir))
+    return "the modules folder must be an absolute path without spaces or quotes";
+  if (o.port <= 0 || o.port > 65535) return "the port must be 1 to 65535";
+  if (o.mode == WebMode::kCgi)
+    return Plain(o.entry_cgi) ? "" : "entry.cgi must be an absolute path without spaces or quotes";
+  if (!Plain(o.webd)) return "kivo-webd must be an absolute path without spaces or quotes";
+  if (o.max_children < 1 || o.max_children > 4096) return "max children must be 1 to 4096";
+  if (o.read_timeout_seconds < 1 || o.read_timeout_seconds > 86400)
+    return "the read time limit must be 1 to 86400 seconds";
+  // The web server adds "-0" to the socket's name.
+  if (WebdSocketPath(o).size() + 2 >= sizeof(sockaddr_un::sun_path))
+    return "the root's path is too long for kivo-webd's socket";
+  return "";
+}
+
 std::string KIVOWebConfig(const WebConfigOptions& o) {
   std::string www = o.root + "/usr/kivo/www";
+  const char* module = o.mode == WebMode::kScgi ? "mod_scgi" : "mod_cgi";
   return "# Web API of the system root " + o.root +
          "\n"
-         "server.modules = (\"mod_access\", \"mod_alias\", \"mod_setenv\", \"mod_cgi\")\n"
-         "server.bind = \"" +
-         o.address +
-         "\"\n"
+         "server.modules = (\"mod_access\", \"mod_alias\", \"mod_setenv\", \"" +
+         module +
+         "\")\n"
+         "server.bind = " +
+         Quoted(o.address) +
+         "\n"
          "server.port = " +
          std::to_string(o.port) +
          "\n"
-         "server.document-root = \"" +
-         www +
-         "\"\n"
-         "server.upload-dirs = (\"" +
-         o.root +
-         "/tmp\")\n"
+         "server.document-root = " +
+         Quoted(www) +
+         "\n"
+         "server.upload-dirs = (" +
+         Quoted(o.root + "/tmp") +
+         ")\n"
          "server.errorlog-use-syslog = \"disable\"\n"
          "server.tag = \"kivo\"\n"
-         // entry.cgi decodes the body itself; hand it over as it arrives
+         // The web API decodes the body itself; hand it over as it arrives
          // instead of buffering whole uploads in the web server.
          "server.stream-request-body = 2\n"
-         // Uploads stream through; entry.cgi applies its own limit
+         // Uploads stream through; the web API applies its own limit
          // ("max_upload_bytes"), so the web server only caps at 4 GiB.
-         "server.max-request-size = 4194304\n"
-         "alias.url = (\"/webapi/entry.cgi\" => \"" +
-         o.entry_cgi +
-         "\")\n"
-         "$HTTP[\"url\"] == \"/webapi/entry.cgi\" {\n"
-         "  cgi.assign = (\"\" => \"\")\n"
-         "}\n"
-         "setenv.add-environment = (\"KIVO_ROOT\" => \"" +
-         o.root + "\")\n";
+         "server.max-request-size = 4194304\n" +
+         (o.mode == WebMode::kScgi ? ScgiSection(o) : CgiSection(o)) +
+         // Every request's environment, in both modes (SCGI carries it in
+         // the request's head).
+         "setenv.add-environment = " + Environment(o) + "\n";
 }
