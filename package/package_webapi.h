@@ -6,6 +6,8 @@
 
 #include <cstdint>
 #include <map>
+#include <string>
+#include <vector>
 
 #include "pkgtool/package_manager.h"
 #include "taskmgr/task.h"
@@ -145,6 +147,17 @@ class PackageWebAPI {
   // False on the package center's first visit, which it records.
   bool VisitedBefore();
   void FillTermsOfService(Json::Value& reply);
+
+  // Images (image.cc). DumpImage sends the file at `path` with a cache
+  // time of `max_age` seconds and ends the process; it returns false only
+  // when the file cannot be read. The lookups write the found image's path
+  // into `buffer`.
+  bool DumpImage(const char* path, int max_age);
+  bool GetVXImage(const std::vector<int>& kinds, const char* file, char* buffer, size_t size);
+  bool GetServerImage(const std::vector<std::string>& files, char* buffer, size_t size);
+  // The screenshot file name the request asks for; false with 4500 answered
+  // when the name, version or number is missing or out of range.
+  bool ReadScreenshotRequest(std::string& file);
 
   // Start and stop (control.cc).
   void StartStop(bool start);

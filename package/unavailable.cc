@@ -20,10 +20,6 @@ void PackageWebAPI::AnswerNotAvailable(const char* member) {
 #define KIVO_NOT_AVAILABLE(name) \
   void PackageWebAPI::name() { AnswerNotAvailable(#name); }
 
-KIVO_NOT_AVAILABLE(GetServerIcon)
-KIVO_NOT_AVAILABLE(GetVXIcon)
-KIVO_NOT_AVAILABLE(GetServerScreenshot)
-KIVO_NOT_AVAILABLE(GetVXScreenshot)
 KIVO_NOT_AVAILABLE(GetFakeIFrame)
 
 }  // namespace KIVO_PACKAGE

@@ -6,7 +6,7 @@ set -euo pipefail
 PACKAGES=(
   g++ cmake ninja-build pkg-config ccache clang-format clang libclang-rt-dev
   libjsoncpp-dev libcrypt-dev libgtest-dev googletest
-  libarchive-dev libsqlite3-dev libcurl4-openssl-dev libgpgme-dev libpoco-dev libssl-dev
+  libarchive-dev libsqlite3-dev libcurl4-openssl-dev libgpgme-dev libpoco-dev libssl-dev libpng-dev
   lighttpd php-cli gnupg curl procps
 )
 

@@ -4,6 +4,7 @@
 
 #include "klibc/atomic_file.h"
 #include "tools/kivoctl/codesign_install.h"
+#include "tools/kivoctl/fallback_icon.h"
 
 namespace {
 
@@ -18,6 +19,7 @@ const char* const kFolders[] = {
     "volume1",                // the first data volume
     "usr/kivo/www",           // the web server's document root
     "run/kivo/pkgtool",       // the package tool's lock and progress
+    "usr/kivo/kivoman/webman/modules/PkgManApp/images",  // the package center's icons
 };
 
 struct DefaultFile {
@@ -72,6 +74,26 @@ const DefaultFile kFiles[] = {
     {"usr/kivo/etc/packages/feeds", "[]\n", 0644},
 };
 
+// The package center's own icons, shown for packages without one. The
+// server icon method asks for its large one under a doubled extension.
+const struct {
+  const char* name;
+  int size;
+} kFallbackIcons[] = {
+    {"package_center_72.png", 72},
+    {"package_center_256.png", 256},
+    {"package_center_256.png.png", 256},
+};
+
+bool WriteFallbackIcons(const std::string& dir, std::string* error) {
+  for (const auto& icon : kFallbackIcons) {
+    std::string path = dir + "/usr/kivo/kivoman/webman/modules/PkgManApp/images/" + icon.name;
+    if (KLIBCFileExist(path.c_str())) continue;
+    if (!KIVOWriteFallbackIcon(path, icon.size)) return (*error = "cannot write " + path), false;
+  }
+  return true;
+}
+
 }  // namespace
 
 bool KIVOCreateSystemRoot(const std::string& dir, std::string* error) {
@@ -93,5 +115,5 @@ bool KIVOCreateSystemRoot(const std::string& dir, std::string* error) {
       return (*error = "cannot write " + path), false;
     }
   }
-  return true;
+  return WriteFallbackIcons(dir, error);
 }
