@@ -42,5 +42,9 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
 // carry its token, except for `token_exempt` calls that browsers load by URL)
 // or from the parameter "_sid". Sets the login user on `request`; on refusal
 // sets the error on `response` and answers false.
+// One method guards itself: "KIVO.Core.Package.FakeIFrame" "get" always
+// passes, with its caller (or none, without an error) handed to the raw-page
+// session object (webapi/web_man.h), which answers a bare 404 to anyone who is
+// not an administrator.
 bool AuthorizeAdministrator(const CgiRequest& cgi, bool token_exempt, APIRequest* request,
                             APIResponse* response);
