@@ -1,7 +1,9 @@
 // "list" with every additional key through lighttpd, for 30, 300 and 3000
-// installed packages: p50 and p99 per size, and the cost per package.
+// installed packages, with the web API run as a CGI program per request and
+// by kivo-webd (SCGI): p50 and p99 per size and mode, and the cost per
+// package.
 //
-//   list_bench [requests per size]      (default 20)
+//   list_bench [requests per size] [largest size]      (default 20, 3000)
 
 #include <algorithm>
 #include <chrono>
@@ -68,9 +70,12 @@ void InstallMany(const std::string& dir, int count) {
 
 int main(int argc, char** argv) {
   int requests = argc > 1 ? std::max(1, atoi(argv[1])) : 20;
+  int largest = argc > 2 ? atoi(argv[2]) : 3000;
   UseBuildDirOfThisProgram();
-  printf("%8s %9s %9s %14s %12s\n", "packages", "p50 ms", "p99 ms", "ms/package", "answer KiB");
+  printf("%8s %5s %9s %9s %14s %12s\n", "packages", "mode", "p50 ms", "p99 ms", "ms/package",
+         "answer KiB");
   for (int count : {30, 300, 3000}) {
+    if (count > largest) break;
     TempRoot root;
     root.AddAccount("admin", "secret", {"administrators"});
     WriteOrExit(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
@@ -78,23 +83,28 @@ int main(int argc, char** argv) {
     MakeDirOrExit(dir);
     InstallMany(dir, count);
     ApiClient admin("admin", "secret");
-    WebServer server(root.dir());
     std::string target =
         "/webapi/entry.cgi?api=KIVO.Core.Package&version=1&method=list&additional=" +
         std::string(kAllKeys);
     std::string headers =
         "Cookie: id=" + admin.sid() + "\r\nX-KIVO-Token: " + admin.token() + "\r\n";
-    size_t size = LoopbackGet(server.port(), target, headers);  // warm-up
-    std::vector<double> ms;
-    for (int r = 0; r < requests; ++r) {
-      Clock::time_point t = Clock::now();
-      LoopbackGet(server.port(), target, headers);
-      ms.push_back(std::chrono::duration<double, std::milli>(Clock::now() - t).count());
+    for (WebMode mode : {WebMode::kCgi, WebMode::kScgi}) {
+      WebServerOptions options;
+      options.mode = mode;
+      WebServer server(root.dir(), options);
+      size_t size = LoopbackGet(server.port(), target, headers);  // warm-up
+      std::vector<double> ms;
+      for (int r = 0; r < requests; ++r) {
+        Clock::time_point t = Clock::now();
+        LoopbackGet(server.port(), target, headers);
+        ms.push_back(std::chrono::duration<double, std::milli>(Clock::now() - t).count());
+      }
+      std::sort(ms.begin(), ms.end());
+      double p50 = ms[ms.size() / 2], p99 = ms[std::min(ms.size() - 1, ms.size() * 99 / 100)];
+      printf("%8d %5s %9.1f %9.1f %14.3f %12.0f\n", count, WebModeName(mode), p50, p99, p50 / count,
+             size / 1024.0);
+      fflush(stdout);
     }
-    std::sort(ms.begin(), ms.end());
-    double p50 = ms[ms.size() / 2], p99 = ms[std::min(ms.size() - 1, ms.size() * 99 / 100)];
-    printf("%8d %9.1f %9.1f %14.3f %12.0f\n", count, p50, p99, p50 / count, size / 1024.0);
-    fflush(stdout);
   }
   return 0;
 }

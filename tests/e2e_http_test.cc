@@ -1,4 +1,6 @@
-// The web API over HTTP through lighttpd, as a browser or script reaches it.
+// The web API over HTTP through lighttpd, as a browser or script reaches it,
+// once per way lighttpd runs it: entry.cgi per request (CGI) and kivo-webd's
+// forked children (SCGI).
 
 #include <sys/wait.h>
 #include <unistd.h>
@@ -48,12 +50,21 @@ HttpAnswer Curl(const std::vector<std::string>& args) {
   return answer;
 }
 
-TEST(EndToEndHttpTest, SignInQueryAndReadALogThroughLighttpd) {
+class EndToEndHttpTest : public testing::TestWithParam<WebMode> {
+ protected:
+  WebServerOptions Options() const {
+    WebServerOptions options;
+    options.mode = GetParam();
+    return options;
+  }
+};
+
+TEST_P(EndToEndHttpTest, SignInQueryAndReadALogThroughLighttpd) {
   TempRoot root;
   root.AddAccount("admin", "secret", {"administrators"});
   root.Write("/var/packages/demo/INFO", "package=\"demo\"\nlogfile=\"demo.log\"\n");
   root.Write("/var/packages/demo/var/demo.log", "hello from demo\n");
-  WebServer server(root.dir());
+  WebServer server(root.dir(), Options());
   ASSERT_TRUE(server.running());
   const std::string url = server.EntryURL();
   const std::string jar = root.Path("/cookies");
@@ -77,7 +88,7 @@ TEST(EndToEndHttpTest, SignInQueryAndReadALogThroughLighttpd) {
   EXPECT_EQ(101, Curl({url + "?api=%zz"}).json["error"]["code"].asInt());
 }
 
-TEST(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
+TEST_P(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
   TempRoot root;
   root.AddAccount("admin", "secret", {"administrators"});
   root.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
@@ -85,7 +96,7 @@ TEST(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
   app.id = "http-app";
   app.files = {{"big.bin", std::string(3 << 20, 'q')}};  // several MiB through the stream
   std::string file = app.Build(root.Path("/tmp"));
-  WebServer server(root.dir());
+  WebServer server(root.dir(), Options());
   ASSERT_TRUE(server.running());
   const std::string url = server.EntryURL();
   const std::string jar = root.Path("/cookies");
@@ -110,5 +121,10 @@ TEST(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
   ASSERT_TRUE(KIVOReadFile(root.Path("/var/packages/http-app/target/big.bin"), &big));
   EXPECT_EQ(3u << 20, big.size());
 }
+
+INSTANTIATE_TEST_SUITE_P(Modes, EndToEndHttpTest, testing::Values(WebMode::kCgi, WebMode::kScgi),
+                         [](const testing::TestParamInfo<WebMode>& info) {
+                           return std::string(WebModeName(info.param));
+                         });
 
 }  // namespace

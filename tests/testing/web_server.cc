@@ -79,7 +79,9 @@ WebServer::WebServer(const std::string& root, const WebServerOptions& o) {
   }
   pid_ = pid;
   for (int i = 0; i < 500 && !Accepts(port_); ++i) usleep(10000);
-  if (!Accepts(port_)) {
+  // lighttpd starts kivo-webd as it starts; wait until it runs the program.
+  for (int i = 0; i < 500 && o.mode == WebMode::kScgi && WebdPid() <= 0; ++i) usleep(10000);
+  if (!Accepts(port_) || (o.mode == WebMode::kScgi && WebdPid() <= 0)) {
     kill(pid_, SIGKILL);
     waitpid(pid_, nullptr, 0);
     pid_ = -1;
@@ -117,18 +119,24 @@ std::string WebServer::EntryURL() const {
 }
 
 size_t LoopbackGet(int port, const std::string& target, const std::string& headers) {
+  return LoopbackExchange(port,
+                          "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n")
+      .size();
+}
+
+std::string LoopbackExchange(int port, const std::string& request) {
   int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
   sockaddr_in addr = Loopback(port);
   if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
     close(fd);
-    return 0;
+    return "";
   }
-  std::string request = "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n";
-  size_t total = 0;
+  std::string response;
   if (write(fd, request.data(), request.size()) == static_cast<ssize_t>(request.size())) {
     char buf[65536];
-    for (ssize_t n; (n = read(fd, buf, sizeof(buf))) > 0;) total += static_cast<size_t>(n);
+    for (ssize_t n; (n = read(fd, buf, sizeof(buf))) > 0;)
+      response.append(buf, static_cast<size_t>(n));
   }
   close(fd);
-  return total;
+  return response;
 }

@@ -51,3 +51,7 @@ int FreeLoopbackPort();
 // (each ending in "\r\n"), read to the end. The bytes received; 0 when the
 // connection failed.
 size_t LoopbackGet(int port, const std::string& target, const std::string& headers);
+
+// Sends `request` (raw HTTP) to 127.0.0.1:`port` and returns the whole
+// response as read to the end; empty when the connection failed.
+std::string LoopbackExchange(int port, const std::string& request);
