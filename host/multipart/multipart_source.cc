@@ -16,6 +16,8 @@
 #include <Poco/Net/MultipartReader.h>
 #include <Poco/Net/NameValueCollection.h>
 
+#include "klibc/atomic_file.h"
+#include "klibc/sysroot.h"
 #include "webapi/upload_area.h"
 
 namespace {
@@ -62,15 +64,32 @@ void RefuseNul(const std::string& text, const char* what) {
   }
 }
 
-// The body holds the fields, at most one file part and more fields, and ends
-// with the closing boundary. A body cut short, one without the closing
-// boundary (whose last part would run to the end of the body and take stray
-// bytes with it) and one with a second file part are refused, and nothing is
-// stored for them.
+// The largest file part other than the package file ("file") that the host
+// keeps: such parts are small documents (a key file), read whole by the
+// handler, and never worth a volume's room.
+constexpr size_t kSmallFileLimit = 4u << 20;
+
+// The package file is the part named "file": it streams to a volume when the
+// handler asks for it (StoreFile). Any other file part, named N, is small
+// (kSmallFileLimit): it is stored at once in the root's tmp/ and handed over
+// as the fields N (the file's name as sent) and N + "_tmp" (the stored path).
+// Those files are removed when the source is deleted, at the end of the
+// request, whatever its outcome; a handler may remove them sooner.
+//
+// The body holds the fields, at most one package file part and more fields,
+// and ends with the closing boundary. A body cut short, one without the
+// closing boundary (whose last part would run to the end of the body and
+// take stray bytes with it) and one with a second file part of one name are
+// refused, and nothing is stored for them.
 class MultipartSource : public UploadSource {
  public:
   MultipartSource(int fd, uint64_t length, const std::string& boundary)
       : length_(length), buf_(fd, length), in_(&buf_), reader_(in_, boundary) {}
+  ~MultipartSource() override {
+    for (const std::string& path : small_files_) unlink(path.c_str());
+  }
+  MultipartSource(const MultipartSource&) = delete;
+  MultipartSource& operator=(const MultipartSource&) = delete;
 
   int ReadFields(Json::Value& fields) override {
     try {
@@ -136,6 +155,18 @@ class MultipartSource : public UploadSource {
       Poco::Net::NameValueCollection params;
       Poco::Net::MessageHeader::splitParameters(header.get("Content-Disposition", ""), disposition,
                                                 params);
+      std::string name = params.get("name", "");
+      RefuseNul(name, "a field name");
+      // A name ending in "_tmp" names a stored file, and so do these two; a
+      // client's field must never pass for one (the handler reads and
+      // deletes that path).
+      if (name == "file_name" || EndsWithTmp(name)) {
+        throw std::runtime_error("a field named like a stored file");
+      }
+      if (params.has("filename") && name != "file") {
+        StoreSmallFile(name, params.get("filename", ""));
+        continue;
+      }
       if (params.has("filename")) {
         if (stored_) throw std::runtime_error("a second file part");
         file_next_ = true;
@@ -143,28 +174,57 @@ class MultipartSource : public UploadSource {
         RefuseNul(file_name_, "a file name");
         return;
       }
-      std::string name = params.get("name", "");
-      RefuseNul(name, "a field name");
-      // These two name the stored file; a client's field must never pass
-      // for them (the handler inspects and deletes that path).
-      if (name == "file_tmp" || name == "file_name") {
-        throw std::runtime_error("a field named like the stored file");
-      }
+      if (seen_.isMember(name + "_tmp")) throw std::runtime_error("a field named like a file");
       seen_[name] = ReadField();
     }
   }
 
-  // The rest of the current part, a form field of at most 1 MiB.
-  std::string ReadField() {
+  static bool EndsWithTmp(const std::string& name) {
+    return name.size() >= 4 && name.compare(name.size() - 4, 4, "_tmp") == 0;
+  }
+
+  // Stores the current part, a file part named `name` other than the
+  // package file, in the root's tmp/ and records its two fields. Throws
+  // (leaving no file) on a second part of that name, an empty or unsafe
+  // name, a part over kSmallFileLimit or a file that cannot be written.
+  void StoreSmallFile(const std::string& name, const std::string& file_name) {
+    RefuseNul(file_name, "a file name");
+    if (name.empty() || seen_.isMember(name)) throw std::runtime_error("a second part " + name);
+    const std::string folder = KIVORootPath("/tmp");
+    if (KIVOFSMkdirP(folder.c_str(), 01777) != 0) throw std::runtime_error("no tmp folder");
+    std::string pattern = folder + "/upload-XXXXXX";
+    // The part is read whole first: a part over the limit or cut short
+    // leaves no file at all.
+    const std::string content = ReadPart(kSmallFileLimit);
+    if (buf_.ended_early()) throw std::runtime_error("the file part " + name + " is cut short");
+    int fd = mkostemp(&pattern[0], O_CLOEXEC);
+    if (fd < 0) throw std::runtime_error("cannot make a file in " + folder);
+    close(fd);
+    small_files_.push_back(pattern);
+    if (!KIVOWriteFileAtomic(pattern, content, SyncToDisk::No, 0600)) {
+      throw std::runtime_error("the file part " + name + " cannot be kept");
+    }
+    seen_[name] = file_name;
+    seen_[name + "_tmp"] = pattern;
+  }
+
+  // The rest of the current part, at most `limit` bytes.
+  std::string ReadPart(size_t limit) {
     std::string value;
     std::istream& part = reader_.stream();
     char buf[4096];
     while (part.read(buf, sizeof(buf)) || part.gcount() > 0) {
-      if (value.size() + static_cast<size_t>(part.gcount()) > (1u << 20)) {
-        throw std::runtime_error("a form field larger than 1 MiB");
+      if (value.size() + static_cast<size_t>(part.gcount()) > limit) {
+        throw std::runtime_error("a part larger than " + std::to_string(limit) + " bytes");
       }
       value.append(buf, static_cast<size_t>(part.gcount()));
     }
+    return value;
+  }
+
+  // The rest of the current part, a form field of at most 1 MiB.
+  std::string ReadField() {
+    std::string value = ReadPart(1u << 20);
     RefuseNul(value, "a field");
     return value;
   }
@@ -204,6 +264,7 @@ class MultipartSource : public UploadSource {
   bool file_next_ = false;  // the part opened last is the file, not read yet
   bool stored_ = false;     // the file part has been taken
   std::string file_name_;
+  std::vector<std::string> small_files_;  // stored file parts other than "file"
 };
 
 }  // namespace

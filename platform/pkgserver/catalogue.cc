@@ -223,6 +223,21 @@ bool PMSQueryPkgServer(const char* language, std::string& answer, const std::str
   return FetchText(feed, language ? language : "", forceReload, extra, answer);
 }
 
+std::string PMSFeedListing(const std::string& name, const std::string& link,
+                           const std::string& language) {
+  if (link.empty()) return "";
+  for (const std::string& url : FeedUrls()) {
+    Json::Value answer;
+    if (!QueryServer(url, false, language, answer)) continue;
+    const Json::Value* entries = PMSCatalogueEntries(answer);
+    if (!entries) continue;
+    for (const Json::Value& e : *entries) {
+      if (e.isObject() && Text(e["package"]) == name && Text(e["link"]) == link) return url;
+    }
+  }
+  return "";
+}
+
 bool PMSFindServerEntry(const std::string& name, bool isKivo, const std::string& language,
                         Json::Value& entry) {
   Json::Value answer;

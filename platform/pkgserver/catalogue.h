@@ -37,6 +37,12 @@ bool PMSQueryPkgServer(const char* language, std::string& answer, const std::str
 // answer itself (array form); null for anything else.
 const Json::Value* PMSCatalogueEntries(const Json::Value& answer);
 
+// The address of the feed whose (cached or fetched) catalogue lists package
+// `name` with exactly `link`; "" when no listed feed does. A download from
+// that link is a download from that feed, whatever the client said.
+std::string PMSFeedListing(const std::string& name, const std::string& link,
+                           const std::string& language);
+
 // The entry of package `name` from the vendor's (isKivo) or the feeds'
 // cached-or-fetched catalogue; the highest version when several match.
 bool PMSFindServerEntry(const std::string& name, bool isKivo, const std::string& language,

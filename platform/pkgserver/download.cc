@@ -10,6 +10,7 @@
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
 #include "pkgserver/catalogue.h"
+#include "pkgserver/feed_keys.h"
 #include "pkgserver/server_config.h"
 #include "pkgserver/server_net.h"
 #include "pkgtool/package_manager.h"
@@ -96,6 +97,19 @@ void Fail(NVX::Task* task, int code, const std::string& message, int result = 0)
   data["installing"] = installing;
   data["pid"] = static_cast<int>(getpid());
   return WriteTaskData(task, data, progress >= 0 ? progress : -2.0);
+}
+
+// Puts into the task's data which key signed the file and who vouched for
+// it ("signature"), and the feed that listed the link ("feed", "" when
+// none), so that the desktop can show them with the outcome.
+[[nodiscard]] bool RecordSignature(NVX::Task* task, const std::string& feed,
+                                   const std::string& note) {
+  if (!TaskExists(task)) return false;
+  Json::Value data = task->getProperty("data");
+  if (!data.isObject()) data = Json::Value(Json::objectValue);
+  data["feed"] = feed;
+  data["signature"] = note;
+  return WriteTaskData(task, data, -2.0);
 }
 
 // The sha256 a catalogue gives for `link`, "" when none does.
@@ -229,12 +243,27 @@ bool Install(NVX::Task* task, const std::string& user, const std::string& volume
     PMSRemoveDownloadDir(folder);
     return false;
   }
+  // A file that a feed lists may be vouched for by that feed's keys; any
+  // other download is checked against the appliance keyring alone.
+  Json::Value data = task->getProperty("data");
+  PMSSourceKeys source;
+  source.source =
+      PMSFeedListing(name, data["link"].isString() ? data["link"].asString() : "", language);
+  if (!source.source.empty()) source.keys = PMSFeedKeys(source.source);
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;
   bool ok = InstallPackageFileImpl(user, path, volume, 0, wizardValues, run, language, message,
-                                   code, details, typeFlag, true);
+                                   code, details, typeFlag, true, &source);
   PMSRemoveDownloadDir(folder);
+  if (details["signature"].isString()) {
+    DOWNLOAD_LOG("%s from %s: %s", name.c_str(),
+                 source.source.empty() ? "a source that is no feed" : source.source.c_str(),
+                 details["signature"].asCString());
+    if (!RecordSignature(task, source.source, details["signature"].asString())) {
+      DOWNLOAD_LOG("cannot record the signature of %s in its task", name.c_str());
+    }
+  }
   if (!ok) {
     DOWNLOAD_LOG("install of %s failed: %s [%d]", name.c_str(), message.c_str(),
                  static_cast<int>(code));

@@ -47,12 +47,26 @@ void InfoFromHeader(const std::string& path, const PackageFileHeader& header,
   info->setWizardMask(mask);
 }
 
-// The signature outcome under the appliance's trust level.
-int SignatureVerdict(const PackageFileHeader& header, std::string* message) {
-  std::string signer, error;
-  int outcome = PMSCheckSignature(header.manifest, header.signature, &signer, &error);
+// The signature outcome under the appliance's trust level. `source_keys`
+// (may be null) are the keys of the feed the file came from; `*who` gets a
+// line saying which key signed the file and who vouched for it.
+int SignatureVerdict(const PackageFileHeader& header, const PMSSourceKeys* source_keys,
+                     std::string* message, std::string* who = nullptr) {
+  std::string signer, error, voucher;
+  int outcome =
+      PMSCheckSignature(header.manifest, header.signature, &signer, &error, source_keys, &voucher);
   int verdict = PMSApplyTrustLevel(outcome, PMSTrustLevel());
   if (verdict != PKG_OK) *message = PMSResultText(verdict) + (error.empty() ? "" : ": " + error);
+  if (who) {
+    if (outcome == PKG_OK) {
+      *who = "signed by key " + signer + ", vouched for by " + voucher;
+    } else if (signer.empty()) {
+      *who = std::string("not signed by a known key (") + PMSResultText(outcome) + ")";
+    } else {
+      *who = "signed by key " + signer + ", which no trusted source vouches for (" +
+             std::string(PMSResultText(outcome)) + ")";
+    }
+  }
   return verdict;
 }
 
@@ -109,6 +123,7 @@ struct InstallJob {
   std::string path, volume, user, language;
   Json::Value wizard;
   bool run_after = false, force = true, check_codesign = true;
+  const PMSSourceKeys* source_keys = nullptr;  // the feed's keys for a file from a feed
 };
 
 class Installer {
@@ -149,6 +164,7 @@ class Installer {
   PackageInfo old_;
   std::string old_record_;
   std::string id_;
+  std::string signature_note_;  // which key signed the file, who vouched for it
 };
 
 int Installer::CheckVersions(const PackageInfo& info) {
@@ -321,8 +337,11 @@ int Installer::Run() {
   if (code != PKG_OK) return code;
   if ((code = PMSCheckPackageFits(info, PKG_ERR_NOT_SUPPORTED, message_, details_)) != PKG_OK)
     return code;
-  if (job_.check_codesign && (code = SignatureVerdict(reader.header(), message_)) != PKG_OK)
-    return code;
+  if (job_.check_codesign) {
+    code = SignatureVerdict(reader.header(), job_.source_keys, message_, &signature_note_);
+    op_->Log("signature: " + signature_note_);
+    if (code != PKG_OK) return code;
+  }
   Staging staging;
   if ((code = Stage(&reader, info, &staging)) != PKG_OK) return code;
   if ((code = RunScriptsAndPublish(info, &staging)) != PKG_OK) return code;
@@ -335,6 +354,10 @@ void Installer::Report() {
   if (!id_.empty()) PMSClearProgress(id_);
   if (!op_) return;
   (*details_)["workerMessage"] = op_->WorkerMessages();
+  if (!signature_note_.empty()) {
+    (*details_)["signature"] = signature_note_;
+    (*details_)["workerMessage"].append("signature: " + signature_note_);
+  }
   std::string log = PMSReadPackageLog(op_->log_path());
   if (!log.empty()) *message_ += (message_->empty() ? "" : "\n") + log;
   unlink(op_->log_path().c_str());
@@ -406,7 +429,7 @@ bool CheckFile(const char* language, const std::string& path, std::string& messa
   }
   // The signature comes last, so that a package that cannot be installed
   // says why before it says who signed it.
-  if (result == PKG_OK) result = SignatureVerdict(reader.header(), &message);
+  if (result == PKG_OK) result = SignatureVerdict(reader.header(), nullptr, &message);
   code = static_cast<PKG_ERRCODE>(result);
   return result == PKG_OK;
 }
@@ -414,8 +437,10 @@ bool CheckFile(const char* language, const std::string& path, std::string& messa
 bool InstallFile(const std::string& user, const std::string& path, const std::string& volume,
                  int reserved, const std::string& extraValues, bool typeFlag,
                  const std::string& language, std::string& message, PKG_ERRCODE& code,
-                 Json::Value& details, bool force, bool checkCodesign) {
-  InstallJob job{path, volume, user, language, Json::Value(), typeFlag, force, checkCodesign};
+                 Json::Value& details, bool force, bool checkCodesign,
+                 const PMSSourceKeys* sourceKeys) {
+  InstallJob job{path,     volume, user,          language,  Json::Value(),
+                 typeFlag, force,  checkCodesign, sourceKeys};
   details = Json::Value(Json::objectValue);
   details["workerMessage"] = Json::Value(Json::arrayValue);
   if (!extraValues.empty() && !WebAPIUtil::ParseJson(extraValues, job.wizard)) {

@@ -64,13 +64,13 @@ bool CheckPackageFileInfoImpl(const char* language, const std::string& path, std
 bool InstallPackageFileImpl(const std::string& user, const std::string& path,
                             const std::string& volume, int reserved, const std::string& extraValues,
                             bool typeFlag, const std::string& language, std::string& message,
-                            PKG_ERRCODE& code, Json::Value& details, bool force,
-                            bool checkCodesign) {
+                            PKG_ERRCODE& code, Json::Value& details, bool force, bool checkCodesign,
+                            const PMSSourceKeys* sourceKeys) {
   const PackageFileOps* ops = PMSPackageFileOps(&message);
   if (!ops) {
     code = PKG_ERR_INTERNAL;
     return false;
   }
   return ops->install(user, path, volume, reserved, extraValues, typeFlag, language, message, code,
-                      details, force, checkCodesign);
+                      details, force, checkCodesign, sourceKeys);
 }

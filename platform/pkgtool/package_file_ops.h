@@ -11,6 +11,7 @@
 
 #include "pkgtool/package_info.h"
 #include "pkgtool/result_codes.h"
+#include "pkgtool/signature.h"
 
 // The table libkivo_pkgfile.so exports as KivoPackageFileOps().
 struct PackageFileOps {
@@ -22,7 +23,8 @@ struct PackageFileOps {
   bool (*install)(const std::string& user, const std::string& path, const std::string& volume,
                   int reserved, const std::string& extra_values, bool type_flag,
                   const std::string& language, std::string& message, PKG_ERRCODE& code,
-                  Json::Value& details, bool force, bool check_codesign);
+                  Json::Value& details, bool force, bool check_codesign,
+                  const PMSSourceKeys* source_keys);
 };
 
 extern "C" {

@@ -22,6 +22,7 @@
 #include "pkgtool/operation.h"
 #include "pkgtool/package_info.h"
 #include "pkgtool/result_codes.h"
+#include "pkgtool/signature.h"
 
 class PackageManager {
  public:
@@ -170,13 +171,17 @@ class PackageManager {
 // Installs or upgrades the package file `path` onto `volume` ("" for the
 // default volume). `extraValues` is the wizard's JSON text; `typeFlag` true
 // starts the package when installed. `details` receives "workerMessage",
-// "installReboot", "curVersion"/"insVersion" and "deppkg" where they apply.
+// "installReboot", "curVersion"/"insVersion" and "deppkg" where they apply,
+// and "signature" (which key signed the file, who vouched for it) once it
+// was checked. `sourceKeys` are the keys of the feed the file was downloaded
+// from (null for any other file: an upload, a path, another source).
 [[nodiscard]] bool InstallPackageFileImpl(const std::string& user, const std::string& path,
                                           const std::string& volume, int reserved,
                                           const std::string& extraValues, bool typeFlag,
                                           const std::string& language, std::string& message,
                                           PKG_ERRCODE& code, Json::Value& details, bool force,
-                                          bool checkCodesign);
+                                          bool checkCodesign,
+                                          const PMSSourceKeys* sourceKeys = nullptr);
 
 // The log text of a package log file; when it is larger than 1 MiB, its last
 // 1 MiB. "" when it cannot be read.

@@ -1,12 +1,14 @@
 #include "pkgtool/signature.h"
 
 #include <cstdlib>
+#include <vector>
 
 #include <gpgme.h>
 
 #include "klibc/atomic_file.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
+#include "pkgtool/lifecycle.h"
 #include "pkgtool/result_codes.h"
 
 namespace {
@@ -77,25 +79,9 @@ int OutcomeOf(gpgme_signature_t sig) {
   return status == GPG_ERR_NO_ERROR ? PKG_OK : PKG_ERR_BAD_SIGNATURE;
 }
 
-}  // namespace
-
-std::string PMSKeyringHome() { return KIVORootPath("/usr/kivo/etc/packages/gnupg"); }
-
-int PMSTrustLevel() {
-  KeyValueMap conf;
-  if (!KIVOKeyValueLoad(KIVORootPath("/etc/kivoinfo.conf"), &conf)) return PKG_TRUST_KEYRING;
-  int level = std::atoi(conf["pkg_source_trust_level"].c_str());
-  return level >= PKG_TRUST_KEYRING && level <= PKG_TRUST_ANY ? level : PKG_TRUST_KEYRING;
-}
-
-int PMSCheckSignature(const std::string& data, const std::string& signature, std::string* signer,
-                      std::string* error) {
-  if (signature.empty()) return PKG_ERR_NO_SIGNATURE;
-  std::string home = PMSKeyringHome();
-  if (KIVOFSMkdirP(home.c_str(), 0700) != 0) {
-    *error = "cannot make the keyring folder " + home;
-    return PKG_ERR_SIGNATURE_UNCHECKABLE;
-  }
+// Verifies `signature` over `data` against the keyring in `home`.
+int VerifyIn(const std::string& home, const std::string& data, const std::string& signature,
+             std::string* signer, std::string* error) {
   GpgContext ctx(home);
   if (!ctx.get()) {
     *error = "cannot start GnuPG";
@@ -115,6 +101,100 @@ int PMSCheckSignature(const std::string& data, const std::string& signature, std
   int outcome = OutcomeOf(first);
   if (outcome != PKG_OK) *error = gpgme_strerror(first->status);
   return outcome;
+}
+
+// A GnuPG home made for one check under the root's tmp/, removed with the
+// object.
+class ScratchHome {
+ public:
+  ScratchHome() = default;
+  ~ScratchHome() {
+    if (!path_.empty()) static_cast<void>(PMSRemoveTree(owner_, path_));
+  }
+  ScratchHome(const ScratchHome&) = delete;
+  ScratchHome& operator=(const ScratchHome&) = delete;
+
+  bool Make(std::string* error) {
+    owner_ = KIVORootPath("/tmp");
+    std::vector<char> name(owner_.begin(), owner_.end());
+    const std::string pattern = "/source-keys-XXXXXX";
+    name.insert(name.end(), pattern.begin(), pattern.end());
+    name.push_back('\0');
+    if (KIVOFSMkdirP(owner_.c_str(), 01777) != 0 || !mkdtemp(name.data())) {
+      *error = "cannot make a scratch keyring under " + owner_;
+      return false;
+    }
+    path_ = name.data();
+    return true;
+  }
+  const std::string& path() const { return path_; }
+
+ private:
+  std::string owner_, path_;
+};
+
+// Imports armored public keys into the keyring in `home`. A block that
+// imports nothing fails the whole check: the stored keys were public keys
+// when the feed was added, so a block that is not one now is damage.
+bool ImportKeys(const std::string& home, const std::vector<std::string>& keys, std::string* error) {
+  GpgContext ctx(home);
+  if (!ctx.get()) {
+    *error = "cannot start GnuPG";
+    return false;
+  }
+  for (const std::string& key : keys) {
+    GpgData block(key);
+    gpgme_error_t err = gpgme_op_import(ctx.get(), block.get());
+    gpgme_import_result_t result = gpgme_op_import_result(ctx.get());
+    if (err || !result || result->considered == 0 || result->secret_imported > 0) {
+      *error = std::string("a key of the source cannot be imported: ") +
+               (err ? gpgme_strerror(err) : "no public key in it");
+      return false;
+    }
+  }
+  return true;
+}
+
+}  // namespace
+
+std::string PMSKeyringHome() { return KIVORootPath("/usr/kivo/etc/packages/gnupg"); }
+
+int PMSTrustLevel() {
+  KeyValueMap conf;
+  if (!KIVOKeyValueLoad(KIVORootPath("/etc/kivoinfo.conf"), &conf)) return PKG_TRUST_KEYRING;
+  int level = std::atoi(conf["pkg_source_trust_level"].c_str());
+  return level >= PKG_TRUST_KEYRING && level <= PKG_TRUST_ANY ? level : PKG_TRUST_KEYRING;
+}
+
+int PMSCheckSignature(const std::string& data, const std::string& signature, std::string* signer,
+                      std::string* error, const PMSSourceKeys* source_keys, std::string* voucher) {
+  if (voucher) voucher->clear();
+  if (signature.empty()) return PKG_ERR_NO_SIGNATURE;
+  std::string home = PMSKeyringHome();
+  if (KIVOFSMkdirP(home.c_str(), 0700) != 0) {
+    *error = "cannot make the keyring folder " + home;
+    return PKG_ERR_SIGNATURE_UNCHECKABLE;
+  }
+  int outcome = VerifyIn(home, data, signature, signer, error);
+  if (outcome == PKG_OK) {
+    if (voucher) *voucher = kPMSKeyringVoucher;
+    return outcome;
+  }
+  // Only a signer the appliance keyring does not know may be vouched for by
+  // the source: a key the administrator has (expired, revoked) keeps its
+  // verdict, and a tampered file stays tampered.
+  if (outcome != PKG_ERR_UNKNOWN_SIGNER || !source_keys || source_keys->keys.empty()) {
+    return outcome;
+  }
+  ScratchHome scratch;
+  if (!scratch.Make(error)) return PKG_ERR_SIGNATURE_UNCHECKABLE;
+  if (!ImportKeys(scratch.path(), source_keys->keys, error)) return PKG_ERR_SIGNATURE_UNCHECKABLE;
+  std::string source_error;
+  int by_source = VerifyIn(scratch.path(), data, signature, signer, &source_error);
+  if (by_source == PKG_ERR_UNKNOWN_SIGNER) return outcome;  // the first error stands
+  *error = source_error;
+  if (by_source == PKG_OK && voucher) *voucher = source_keys->source;
+  return by_source;
 }
 
 int PMSApplyTrustLevel(int outcome, int trust_level) {

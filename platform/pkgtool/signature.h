@@ -5,6 +5,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 // How strict the appliance is ("pkg_source_trust_level" in
 // /etc/kivoinfo.conf):
@@ -17,14 +18,33 @@ enum PKG_TRUST_LEVEL { PKG_TRUST_KEYRING = 0, PKG_TRUST_UNSIGNED = 1, PKG_TRUST_
 // The trust level the appliance's settings name (0 when unset or unreadable).
 int PMSTrustLevel();
 
+// Keys that vouch for one package besides the appliance keyring: those a
+// feed publishes, for a package downloaded from that feed and nothing else.
+struct PMSSourceKeys {
+  std::string source;             // who vouches: the feed's address
+  std::vector<std::string> keys;  // armored OpenPGP public key blocks
+};
+
+// The name a check gives the appliance keyring as the voucher.
+constexpr const char* kPMSKeyringVoucher = "appliance keyring";
+
 // The outcome of checking one signature, before any trust level applies:
 // PKG_OK (good, by a key of the keyring), PKG_ERR_NO_SIGNATURE,
 // PKG_ERR_BAD_SIGNATURE (tampered, or a signature file that holds no
 // signature), PKG_ERR_UNKNOWN_SIGNER, PKG_ERR_EXPIRED_KEY,
 // PKG_ERR_REVOKED_KEY, or PKG_ERR_SIGNATURE_UNCHECKABLE.
 // `*signer` gets the key's fingerprint when one was named.
+//
+// With `source_keys` (not null, with keys), a signer the appliance keyring
+// does not know is looked up among those keys: they are imported into a
+// scratch GnuPG home under the root's tmp/ for this check alone and removed
+// with it, so the appliance keyring never holds them. `*voucher` (when not
+// null) gets who vouched for a good signature: kPMSKeyringVoucher or the
+// source's name; "" otherwise.
 [[nodiscard]] int PMSCheckSignature(const std::string& data, const std::string& signature,
-                                    std::string* signer, std::string* error);
+                                    std::string* signer, std::string* error,
+                                    const PMSSourceKeys* source_keys = nullptr,
+                                    std::string* voucher = nullptr);
 
 // Applies the trust level to an outcome: PKG_OK when the package may be used.
 [[nodiscard]] int PMSApplyTrustLevel(int outcome, int trust_level);
