@@ -46,6 +46,26 @@ rm "$FEED/demo-gone.kpk"
 $K server-config --vendor "http://127.0.0.1:$PORT/feed/catalogue.json" \
   --company-info "http://127.0.0.1:$PORT/feed/company-info.json" >/dev/null
 
+# A second catalogue, a "community" feed that a user adds through the API:
+# demo-unsigned signed by a community key made here (never committed),
+# whose public key the catalogue publishes in its "keyrings". The appliance
+# keyring does not hold it: only packages downloaded from this feed verify.
+COMMUNITY=$ROOT/usr/kivo/www/community
+COMMUNITY_GPG=$ROOT/community-gnupg
+rm -rf "$COMMUNITY" "$COMMUNITY_GPG" && mkdir -p "$COMMUNITY" && mkdir -m 700 "$COMMUNITY_GPG"
+gpg --homedir "$COMMUNITY_GPG" --batch --quiet --passphrase '' --quick-gen-key \
+  "KIVO Community Publisher <community@kivo.invalid>" ed25519 sign never 2>/dev/null
+CKEY=$(gpg --homedir "$COMMUNITY_GPG" --batch --with-colons --list-secret-keys | awk -F: '/^fpr/ {print $10; exit}')
+cp build/examples/demo-unsigned.kpk "$COMMUNITY/"
+build/bin/kivoctl sign "$COMMUNITY/demo-unsigned.kpk" --homedir "$COMMUNITY_GPG" --key "$CKEY" >/dev/null
+$K index "$COMMUNITY" --base-url "http://127.0.0.1:$PORT/community" >/dev/null
+gpg --homedir "$COMMUNITY_GPG" --batch --armor --export "$CKEY" >"$COMMUNITY_GPG/community.asc"
+php -r '$f = $argv[1]; $c = json_decode(file_get_contents($f), true);
+  $c["keyrings"] = [file_get_contents($argv[2])];
+  file_put_contents($f . ".tmp", json_encode($c, JSON_PRETTY_PRINT | JSON_UNESCAPED_SLASHES) . "\n");
+  rename($f . ".tmp", $f);' "$COMMUNITY/catalogue.json" "$COMMUNITY_GPG/community.asc"
+gpgconf --homedir "$COMMUNITY_GPG" --kill gpg-agent 2>/dev/null || true
+
 cat <<TXT
 
 The web API of $ROOT:
@@ -53,6 +73,7 @@ The web API of $ROOT:
 Installed: $($K list | tr '\n' ';')
 Sample package files: $ROOT/volume1/public/packages
 Package server: http://127.0.0.1:$PORT/feed/catalogue.json
+Community feed (add it through the API): http://127.0.0.1:$PORT/community/catalogue.json
 Try the curl lines of README.md. Ctrl-C stops the server.
 
 TXT
