@@ -304,6 +304,12 @@ bool PMSIsPackageMemberName(const std::string& name) {
   for (const char* f : kFixed) {
     if (name == f) return true;
   }
+  // Screenshots SCREENSHOT_1.PNG to SCREENSHOT_8.PNG, shown by the package
+  // center beside the description.
+  if (name.size() == 16 && name.compare(0, 11, "SCREENSHOT_") == 0 && name[11] >= '1' &&
+      name[11] <= '8' && name.compare(12, 4, ".PNG") == 0) {
+    return true;
+  }
   static const char* const kScripts[] = {"preinst",          "postinst",   "preuninst",
                                          "postuninst",       "preupgrade", "postupgrade",
                                          "start-stop-status"};

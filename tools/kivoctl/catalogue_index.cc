@@ -100,6 +100,27 @@ bool WriteIcons(const PackageFileHeader& h, const CatalogueIndexOptions& o, cons
   return true;
 }
 
+// Screenshots go to screenshots/<package>-<version>/screenshot_<n>.png, the
+// name the package center caches a server screenshot under; the entry lists
+// their addresses in order.
+bool WriteScreenshots(const PackageFileHeader& h, const CatalogueIndexOptions& o,
+                      const std::string& stem, Json::Value& entry, std::string* error) {
+  const std::string folder = o.folder + "/screenshots/" + stem;
+  Json::Value urls(Json::arrayValue);
+  for (int n = 1; n <= 8; ++n) {
+    auto it = h.members.find("SCREENSHOT_" + std::to_string(n) + ".PNG");
+    if (it == h.members.end()) continue;
+    std::string file = "screenshot_" + std::to_string(n) + ".png";
+    if (KIVOFSMkdirP(folder.c_str()) != 0 ||
+        !KIVOWriteFileAtomic(folder + "/" + file, it->second, SyncToDisk::No)) {
+      return (*error = "cannot write " + folder + "/" + file), false;
+    }
+    urls.append(o.base_url + "/screenshots/" + PMSUrlEncode(stem) + "/" + file);
+  }
+  if (!urls.empty()) entry["screenshots"] = urls;
+  return true;
+}
+
 bool MakeEntry(const CatalogueIndexOptions& o, const std::string& name, Json::Value& entry,
                std::string* error) {
   const std::string path = o.folder + "/" + name;
@@ -128,8 +149,9 @@ bool MakeEntry(const CatalogueIndexOptions& o, const std::string& name, Json::Va
   entry["deppkgs"] = deps == info.end() ? "" : deps->second;
   auto conflicts = info.find("install_conflict_packages");
   entry["conflictpkgs"] = conflicts == info.end() ? "" : conflicts->second;
-  return WriteIcons(reader.header(), o, info.at("package") + "-" + info.at("version"), entry,
-                    error);
+  const std::string stem = info.at("package") + "-" + info.at("version");
+  return WriteIcons(reader.header(), o, stem, entry, error) &&
+         WriteScreenshots(reader.header(), o, stem, entry, error);
 }
 
 }  // namespace
