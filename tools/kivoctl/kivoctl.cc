@@ -7,6 +7,7 @@
 //   kivoctl [--root DIR] server-config [--vendor URL] [--company-info URL]
 //   kivoctl build|sign|inspect|index ...      (package authors)
 //   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
+//   kivoctl [--root DIR] auto-update [--dry-run]
 
 #include <cstdio>
 #include <cstdlib>
@@ -16,6 +17,7 @@
 #include <vector>
 
 #include "accounts/accounts.h"
+#include "tools/kivoctl/auto_update.h"
 #include "tools/kivoctl/catalogue_index.h"
 #include "tools/kivoctl/package_commands.h"
 #include "tools/kivoctl/root_setup.h"
@@ -56,6 +58,8 @@ const char kUsage[] =
     "  start ID | stop ID | status ID     control a package\n"
     "  list                               installed packages\n"
     "  log ID                             the package's own log\n"
+    "  auto-update [--dry-run]            upgrade the packages the automatic-update\n"
+    "                                     settings choose (--dry-run: only say what)\n"
     "\n"
     "--root DIR selects the system root (default: $KIVO_ROOT, else /).\n";
 
@@ -167,6 +171,7 @@ int main(int argc, char** argv) {
   if (command == "status") return KivoctlStatus(args);
   if (command == "list") return KivoctlList(args);
   if (command == "log") return KivoctlLog(args);
+  if (command == "auto-update") return KivoctlAutoUpdate(args);
   std::cerr << kUsage;
   return Fail("unknown command: " + command);
 }

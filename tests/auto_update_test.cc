@@ -1,0 +1,156 @@
+// kivoctl auto-update on a system root against a package server on the
+// loopback: an upgradable package is upgraded and runs again, a beta is
+// held back on the stable channel and taken on the beta channel, a failing
+// upgrade leaves the old version running and fails the run, the settings
+// "off" and the chosen list are honoured, and --dry-run changes nothing.
+
+#include <gtest/gtest.h>
+
+#include "pkgtool/registry.h"
+#include "testing/catalogue_feed.h"
+#include "testing/http_test_server.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+
+namespace {
+
+class AutoUpdateTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_.Write("/etc/kivo/pkgserver.conf",
+                "vendor_url=\"" + vendor_.Url() + "\"\nconnect_timeout=\"2\"\n");
+    Settings("yes", "yes", "stable");
+  }
+  void TearDown() override {
+    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
+  }
+  // The automatic-update switches and the update channel, as the settings
+  // store them; unsigned packages are accepted.
+  void Settings(const std::string& enable, const std::string& all, const std::string& channel) {
+    root_.Write("/etc/kivoinfo.conf",
+                "pkg_source_trust_level=\"1\"\n"
+                "enable_pkg_autoupdate_all=\"" +
+                    enable + "\"\npkg_autoupdate_all=\"" + all + "\"\npackage_update_channel=\"" +
+                    channel + "\"\n");
+  }
+  // Installs and starts version 1.0 of `id`.
+  void InstallOld(const std::string& id) {
+    TestPackage v1;
+    v1.id = id;
+    std::string out;
+    ASSERT_EQ(0, Kivoctl({"install", v1.Build(local_), "--run"}, &out)) << out;
+  }
+  // The vendor offers version 2.0 of `id` (with `scripts`), as a beta when
+  // `beta`. Call Serve() after the last.
+  void Offer(const std::string& id, const std::map<std::string, std::string>& scripts = {},
+             bool beta = false) {
+    TestPackage v2;
+    v2.id = id;
+    v2.version = "2.0";
+    v2.scripts = scripts;
+    vendor_.Add(v2);
+    if (beta) betas_.push_back(id);
+  }
+  void Serve() {
+    ASSERT_TRUE(vendor_.Index());
+    for (const std::string& id : betas_) vendor_.Entry(id)["beta"] = true;
+    vendor_.Publish();
+  }
+  int AutoUpdate(std::string* out, bool dry_run = false) {
+    std::vector<std::string> args = {"auto-update"};
+    if (dry_run) args.push_back("--dry-run");
+    return Kivoctl(args, out);
+  }
+  // "ID VERSION STATE" from kivoctl list.
+  std::string State(const std::string& id) {
+    std::string out;
+    EXPECT_EQ(0, Kivoctl({"list"}, &out)) << out;
+    size_t at = out.find(id + " ");
+    return at == std::string::npos ? "" : out.substr(at, out.find('\n', at) - at);
+  }
+
+  TempRoot root_;
+  HttpTestServer server_;
+  std::string local_ = root_.Path("/local-packages");
+  CatalogueFeed vendor_{server_, root_.Path("/vendor-files"), "/vendor"};
+  std::vector<std::string> betas_;
+};
+
+TEST_F(AutoUpdateTest, UpgradesAnUpgradablePackageWhichRunsAgain) {
+  InstallOld("au-a");
+  Offer("au-a");
+  Serve();
+  std::string out;
+  ASSERT_EQ(0, AutoUpdate(&out, true)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: would upgrade 1.0 -> 2.0 from http://")) << out;
+  EXPECT_EQ("au-a 1.0 running", State("au-a"));
+
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: upgraded 1.0 -> 2.0")) << out;
+  EXPECT_EQ("au-a 2.0 running", State("au-a"));
+
+  // Nothing newer is left.
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: skipped: no newer version offered")) << out;
+}
+
+TEST_F(AutoUpdateTest, BetaOnlyOnTheBetaChannel) {
+  InstallOld("au-a");
+  Offer("au-a", {}, true);
+  Serve();
+  std::string out;
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: skipped: only a beta version is newer")) << out;
+  EXPECT_EQ("au-a 1.0 running", State("au-a"));
+
+  Settings("yes", "yes", "beta");
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: upgraded 1.0 -> 2.0")) << out;
+  EXPECT_EQ("au-a 2.0 running", State("au-a"));
+}
+
+TEST_F(AutoUpdateTest, FailedUpgradeLeavesTheOldVersionRunning) {
+  InstallOld("au-a");
+  InstallOld("au-b");
+  Offer("au-a", {{"postupgrade", "echo postupgrade refuses >&2\nexit 1\n"}});
+  Offer("au-b");
+  Serve();
+  std::string out;
+  EXPECT_EQ(1, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: failed 1.0 -> 2.0: ")) << out;
+  EXPECT_NE(std::string::npos, out.find("[305]")) << out;
+  EXPECT_EQ("au-a 1.0 running", State("au-a"));
+  // One failure does not stop the others.
+  EXPECT_NE(std::string::npos, out.find("au-b: upgraded 1.0 -> 2.0")) << out;
+  EXPECT_EQ("au-b 2.0 running", State("au-b"));
+}
+
+TEST_F(AutoUpdateTest, OffChosenListAndRestrictions) {
+  InstallOld("au-a");
+  InstallOld("au-b");
+  InstallOld("au-c");
+  Offer("au-a");
+  Offer("au-b");
+  Offer("au-c");
+  Serve();
+  std::string out;
+  Settings("no", "yes", "stable");
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_EQ("automatic update is off\n", out);
+  EXPECT_EQ(0, server_.Requests("/vendor/catalogue.json"));
+
+  Settings("yes", "no", "stable");
+  root_.Write("/usr/kivo/etc/packages/autoupdate.json", "[\"au-b\", \"au-c\"]");
+  root_.Write("/usr/kivo/etc/packages/restricted", "au-c 2.0\n");
+  ASSERT_EQ(0, AutoUpdate(&out, true)) << out;
+  EXPECT_EQ("au-b 1.0 running", State("au-b"));
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: skipped: not chosen for automatic update")) << out;
+  EXPECT_NE(std::string::npos, out.find("au-b: upgraded 1.0 -> 2.0")) << out;
+  EXPECT_NE(std::string::npos, out.find("au-c: skipped: no newer version offered")) << out;
+  EXPECT_EQ("au-a 1.0 running", State("au-a"));
+  EXPECT_EQ("au-b 2.0 running", State("au-b"));
+  EXPECT_EQ("au-c 1.0 running", State("au-c"));
+}
+
+}  // namespace

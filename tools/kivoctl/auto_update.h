@@ -1,0 +1,42 @@
+// kivoctl auto-update: applies the package center's automatic-update
+// settings, as the appliance's scheduler runs it (a systemd timer or a cron
+// line, see README.md).
+//
+// The settings say off, all installed packages, or the chosen list
+// ("enable_pkg_autoupdate_all" / "pkg_autoupdate_all" of /etc/kivoinfo.conf
+// and KIVOPackageServer::List). For each chosen installed package the newest
+// entry of the vendor's and the feeds' catalogues that is newer than the
+// installed version is taken, unless the update channel is "stable" and the
+// entry is a beta, or the restriction list refuses it. Each is downloaded
+// with the catalogue's checksums and upgraded by the package tool under its
+// lock, one package at a time, with the trust level and signature checks of
+// any install; a package that ran before runs again afterwards. A failed
+// upgrade leaves the old version in place (the package tool's guarantee).
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include <json/value.h>
+
+// What happens to one installed package.
+struct AutoUpdatePlan {
+  enum class Action { kUpgrade, kSkip };
+  Action action = Action::kSkip;
+  std::string id;
+  std::string installed;  // installed version
+  std::string version;    // the version to upgrade to (kUpgrade)
+  std::string reason;     // why it is skipped (kSkip)
+  Json::Value entry;      // the catalogue entry to upgrade to (kUpgrade)
+};
+
+// The plan for package `id` at version `installed` against the catalogue
+// `entries` (vendor and feeds together). `beta` is true on the "beta" update
+// channel. Restricted versions (PMSThirdPartyCheckLimit) are never taken.
+AutoUpdatePlan PlanAutoUpdate(const std::string& id, const std::string& installed,
+                              const Json::Value& entries, bool beta);
+
+// `kivoctl auto-update [--dry-run]`: one line per installed package on
+// stdout, each outcome also to syslog. Exit status 0 when nothing failed, 1
+// when an upgrade or the catalogue failed, 2 on a usage error.
+int KivoctlAutoUpdate(const std::vector<std::string>& args);
