@@ -56,7 +56,7 @@ enum ApiError : int {
   kErrStopDependents = 4582,
   kErrStartVersionLimit = 4583,
   kErrStartDependency = 4584,
-  kErrImageNotFound = 4586,  // no such screenshot, installed or on the server
+  kErrImageNotFound = 4586,      // no such screenshot, installed or on the server
   kErrFeedNotServer = 4590,      // the feed does not answer as a package server
   kErrFeedExists = 4591,         // the feed address is already in the list
   kErrKeyUnreadable = 4592,      // the uploaded key file cannot be read

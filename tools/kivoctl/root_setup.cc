@@ -9,16 +9,16 @@
 namespace {
 
 const char* const kFolders[] = {
-    "etc/kivo",               // platform configuration
-    "usr/kivo/etc/packages",  // the feed list and package center files
-    "usr/kivo/bin",           // platform scripts
-    "var/packages",           // the installed-package registry
-    "var/log/packages",       // package operation logs
-    "run/kivo/sessions",      // signed-in sessions
-    "tmp",                    // temporary files of uploads and downloads
-    "volume1",                // the first data volume
-    "usr/kivo/www",           // the web server's document root
-    "run/kivo/pkgtool",       // the package tool's lock and progress
+    "etc/kivo",                                          // platform configuration
+    "usr/kivo/etc/packages",                             // the feed list and package center files
+    "usr/kivo/bin",                                      // platform scripts
+    "var/packages",                                      // the installed-package registry
+    "var/log/packages",                                  // package operation logs
+    "run/kivo/sessions",                                 // signed-in sessions
+    "tmp",                                               // temporary files of uploads and downloads
+    "volume1",                                           // the first data volume
+    "usr/kivo/www",                                      // the web server's document root
+    "run/kivo/pkgtool",                                  // the package tool's lock and progress
     "usr/kivo/kivoman/webman/modules/PkgManApp/images",  // the package center's icons
 };
 
