@@ -6,11 +6,14 @@
 //     download worker (md5 and sha256 checked) against `curl -o` of the same
 //     file, and the worker's peak memory for 64 MiB and 1 GiB.
 //
-//   server_bench [requests per case] [download MiB]   (default 20, 1024)
+//   server_bench [requests per case] [download MiB] [list|download]
+//   (default 20, 1024, both). SERVER_BENCH_ENTRY names a program lighttpd
+//   runs instead of the build's entry.cgi (a profiler wrapped around it).
 
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
+#include <cstdlib>
 #include <memory>
 #include <string>
 #include <sys/resource.h>
@@ -96,7 +99,8 @@ void ListFigures(int requests) {
   MakeDirOrExit(dir);
   InstallMany(dir, 300);
   ApiClient admin("admin", "secret");
-  WebServer server(root.dir());
+  const char* entry = getenv("SERVER_BENCH_ENTRY");
+  WebServer server(root.dir(), entry ? entry : "");
   const std::string headers =
       "Cookie: id=" + admin.sid() + "\r\nX-KIVO-Token: " + admin.token() + "\r\n";
   const std::string target = "/webapi/entry.cgi?api=KIVO.Core.Package.Server&version=1&method=list";
@@ -186,8 +190,9 @@ void DownloadFigures(int mib) {
 int main(int argc, char** argv) {
   int requests = argc > 1 ? std::max(1, atoi(argv[1])) : 20;
   int mib = argc > 2 ? std::max(64, atoi(argv[2])) : 1024;
+  const std::string only = argc > 3 ? argv[3] : "";
   UseBuildDirOfThisProgram();
-  ListFigures(requests);
-  DownloadFigures(mib);
+  if (only != "download") ListFigures(requests);
+  if (only != "list") DownloadFigures(mib);
   return 0;
 }

@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <map>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -136,8 +137,10 @@ class PackageWebAPI {
   // The progress a download task reports: 1.0 only once its file is there,
   // never below 0.
   static double DownloadTaskProgress(NVX::Task& task, const Json::Value& data);
-  bool AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, Json::Value& entry);
-  void AnnotateDownload(NVX::TaskMgr& mgr, Json::Value& entry);
+  // `tasks`: the ids of the package tasks, listed once per request.
+  bool AnnotateInstalled(NVX::TaskMgr& mgr, const std::set<std::string>& tasks,
+                         const PackageInfo& p, Json::Value& entry);
+  void AnnotateDownload(NVX::TaskMgr& mgr, const std::set<std::string>& tasks, Json::Value& entry);
 
   // Settings (setting.cc).
   // Stores the default volume; false with the error answered (4504 for a

@@ -5,7 +5,9 @@
 #include <cstdlib>
 #include <map>
 #include <memory>
+#include <set>
 #include <unistd.h>
+#include <vector>
 
 #include "log_line.h"
 #include "package_webapi.h"
@@ -91,14 +93,24 @@ void RewriteDependencies(Json::Value& entry, const char* conf_key, const char* t
   }
   Json::Value out;
   deps.toJSON(out);
-  entry[out_key] = out;
+  entry[out_key] = std::move(out);
+}
+
+// Task `id` when the request's one listing of the package tasks holds it. A
+// catalogue has thousands of entries and few of them have a task: asking the
+// task store once per request instead of once per entry keeps the listing's
+// cost in reading the catalogue.
+NVX::Task* ListedTask(NVX::TaskMgr& mgr, const std::set<std::string>& listed,
+                      const std::string& id) {
+  return listed.count(id) ? GetTaskWithTaskMgr(mgr, id) : nullptr;
 }
 
 }  // namespace
 
-bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, Json::Value& entry) {
+bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const std::set<std::string>& tasks,
+                                      const PackageInfo& p, Json::Value& entry) {
   const std::string name = entry["package"].asString();
-  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, kStartStopPrefix + name));
+  std::unique_ptr<NVX::Task> task(ListedTask(mgr, tasks, kStartStopPrefix + name));
   if (task) {
     Json::Value data = task->getProperty("data");
     if (data.isMember("status") && TaskProcessAlive(data)) {
@@ -107,7 +119,7 @@ bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, J
     }
     EndStaleTask(*task, data);
   }
-  task.reset(GetTaskWithTaskMgr(mgr, kDownloadPrefix + name));
+  task.reset(ListedTask(mgr, tasks, kDownloadPrefix + name));
   if (task) {
     Json::Value data = task->getProperty("data");
     if (IsTrue(data["installing"]) && !task->isFinished() && data["pid"].isInt()) {
@@ -120,7 +132,7 @@ bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, J
       if (data["pid"].asInt() != 0) EndStaleTask(*task, data);
     }
   }
-  task.reset(GetTaskWithTaskMgr(mgr, kUninstallPrefix + name));
+  task.reset(ListedTask(mgr, tasks, kUninstallPrefix + name));
   if (task) {
     Json::Value data = task->getProperty("data");
     if (data.isMember("status") && TaskProcessAlive(data)) {
@@ -142,10 +154,10 @@ bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const PackageInfo& p, J
   return false;
 }
 
-void PackageWebAPI::AnnotateDownload(NVX::TaskMgr& mgr, Json::Value& entry) {
-  const std::string id = kDownloadPrefix + entry["package"].asString();
-  if (!mgr.hasTask(id)) return;
-  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, id));
+void PackageWebAPI::AnnotateDownload(NVX::TaskMgr& mgr, const std::set<std::string>& tasks,
+                                     Json::Value& entry) {
+  std::unique_ptr<NVX::Task> task(
+      ListedTask(mgr, tasks, kDownloadPrefix + entry["package"].asString()));
   Json::Value data = task ? task->getProperty("data") : Json::Value();
   if (data.isNull()) return;
   if (IsTrue(data["blqinst"]) &&
@@ -176,7 +188,7 @@ void PackageWebAPI::ListServerPackage() {
   const bool object_form = answer.isObject() && !answer.empty();
   if (object_form && (!answer.isMember("packages") || !answer.isMember("recommend"))) return;
   if (!object_form && !answer.isArray()) return;
-  const Json::Value& list = object_form ? answer["packages"] : answer;
+  Json::Value& list = object_form ? answer["packages"] : answer;
   if (!list.isArray()) return;
   std::map<std::string, PackageInfo> installed;
   // Without the installed packages the catalogue shows every one as not
@@ -185,30 +197,38 @@ void PackageWebAPI::ListServerPackage() {
     PKG_LOG_ERR("Failed to read the installed packages [%d]", pkgMgr.getResult());
   }
   NVX::TaskMgr mgr(kTaskOwner);
-  const Json::Value recommend = object_form && !others && answer["recommend"].isArray()
-                                    ? answer["recommend"]
-                                    : Json::Value(Json::arrayValue);
+  const std::vector<std::string> listed = mgr.listTasks("@KIVOPKG_");
+  const std::set<std::string> tasks(listed.begin(), listed.end());
+  const PMSThirdPartyLimits limits;
+  // The recommendation slot of each recommended name (its first place).
+  std::map<std::string, Json::ArrayIndex> slot_of;
   Json::Value slots(Json::arrayValue), data(Json::arrayValue);
+  if (object_form && !others && answer["recommend"].isArray()) {
+    const Json::Value& recommend = answer["recommend"];
+    for (Json::ArrayIndex i = 0; i < recommend.size(); ++i) {
+      if (recommend[i].isString()) slot_of.emplace(recommend[i].asString(), i);
+    }
+    slots.resize(recommend.size());
+  }
   bool any_upgrade = false;
-  for (const Json::Value& element : list) {
+  for (Json::Value& element : list) {
     if (!element.isObject() || !element["package"].isString()) continue;
-    Json::Value entry = element;
+    // The answer is this request's own: its entries move into the result.
+    Json::Value entry = std::move(element);
     const std::string name = entry["package"].asString();
     entry["id"] = name;
-    if (entry.isMember("version") && PMSThirdPartyCheckLimit(name, Text(entry["version"])) != 0) {
-      continue;
-    }
+    if (entry.isMember("version") && limits.Restricts(name, Text(entry["version"]))) continue;
     entry["blupgrade"] = false;
     entry["source"] = others ? "others" : "kivo";
     auto p = installed.find(name);
     if (p != installed.end()) {
       PackageBasicInfo have(p->second.getId(), p->second.getVersion());
       if (have.compare(PackageBasicInfo(name, Text(entry["version"])), PKG_VER_LT) &&
-          PMSThirdPartyCheckLimit(p->second.getId(), p->second.getVersion()) == 0) {
+          !limits.Restricts(p->second.getId(), p->second.getVersion())) {
         entry["blupgrade"] = true;
         any_upgrade = true;
       }
-      AnnotateInstalled(mgr, p->second, entry);
+      AnnotateInstalled(mgr, tasks, p->second, entry);
     }
     RewriteDependencies(entry, "conf_deppkgs", "deppkgs", "deppkgs");
     RewriteDependencies(entry, "conf_conxpkgs", "conflictpkgs", "conflictpkgs");
@@ -217,13 +237,9 @@ void PackageWebAPI::ListServerPackage() {
                                          Text(entry["version"]).c_str(), "thumb_72.png",
                                          entry["icon"].asCString(), nullptr, 0);
     }
-    AnnotateDownload(mgr, entry);
-    for (Json::ArrayIndex i = 0; i < recommend.size(); ++i) {
-      if (Text(recommend[i]) == name) {
-        slots[i] = entry;
-        break;
-      }
-    }
+    AnnotateDownload(mgr, tasks, entry);
+    auto slot = slot_of.find(name);
+    if (slot != slot_of.end()) slots[slot->second] = entry;
     data.append(std::move(entry));
   }
   Json::Value result(Json::objectValue);
@@ -235,7 +251,7 @@ void PackageWebAPI::ListServerPackage() {
   result["total"] = data.size();
   result["data"] = std::move(data);
   result["blupgrade"] = any_upgrade;
-  response->SetSuccess(result);
+  response->SetSuccess(std::move(result));
 }
 
 void PackageWebAPI::CheckUpdate() {

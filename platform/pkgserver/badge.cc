@@ -15,12 +15,13 @@ namespace KIVOPackageTool {
 namespace {
 
 // The highest unrestricted server version per package.
-std::map<std::string, std::string> OfferedVersions(const Json::Value& entries) {
+std::map<std::string, std::string> OfferedVersions(const Json::Value& entries,
+                                                   const PMSThirdPartyLimits& limits) {
   std::map<std::string, std::string> offered;
   for (const Json::Value& e : entries) {
     if (!e.isObject() || !e["package"].isString() || !e["version"].isString()) continue;
     const std::string id = e["package"].asString(), version = e["version"].asString();
-    if (PMSThirdPartyCheckLimit(id, version)) continue;
+    if (limits.Restricts(id, version)) continue;
     auto it = offered.find(id);
     if (it == offered.end() || PMSCompareVersion(version, it->second) > 0) offered[id] = version;
   }
@@ -43,11 +44,12 @@ int updateBadgeCount(bool forceReload) {
     return -1;
   Json::Value badge(Json::objectValue);
   badge["packages"] = Json::Value(Json::arrayValue);
-  for (const auto& [id, version] : OfferedVersions(*entries)) {
+  const PMSThirdPartyLimits limits;
+  for (const auto& [id, version] : OfferedVersions(*entries, limits)) {
     auto it = installed.find(id);
     if (it == installed.end()) continue;
     const std::string& have = it->second.getVersion();
-    if (PMSCompareVersion(have, version) < 0 && !PMSThirdPartyCheckLimit(id, have))
+    if (PMSCompareVersion(have, version) < 0 && !limits.Restricts(id, have))
       badge["packages"].append(id);
   }
   badge["count"] = badge["packages"].size();

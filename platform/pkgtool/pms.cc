@@ -143,14 +143,19 @@ void PMSGetOSMaxVer(const PackageInfo& info, int& major, int& minor, int& build)
 }
 
 int PMSThirdPartyCheckLimit(const std::string& id, const std::string& version) {
+  return PMSThirdPartyLimits().Restricts(id, version) ? 1 : 0;
+}
+
+PMSThirdPartyLimits::PMSThirdPartyLimits() {
   std::string text;
-  if (!KIVOReadFile(KIVORootPath("/usr/kivo/etc/packages/restricted"), &text, 1 << 20)) return 0;
+  if (!KIVOReadFile(KIVORootPath("/usr/kivo/etc/packages/restricted"), &text, 1 << 20)) return;
   std::istringstream in(text);
   std::string rid, rversion;
-  while (in >> rid >> rversion) {
-    if (rid == id && rversion == version) return 1;
-  }
-  return 0;
+  while (in >> rid >> rversion) restricted_.emplace(rid, rversion);
+}
+
+bool PMSThirdPartyLimits::Restricts(const std::string& id, const std::string& version) const {
+  return !restricted_.empty() && restricted_.count({id, version}) != 0;
 }
 
 double PMSGetProgress(const std::string& id) {

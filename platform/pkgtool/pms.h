@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstdint>
+#include <set>
 #include <string>
 
 #include "pkgtool/package_info.h"
@@ -42,6 +43,15 @@ void PMSGetOSMaxVer(const PackageInfo& info, int& major, int& minor, int& build)
 // Nonzero when `id` at `version` may not be offered as an upgrade
 // ("/usr/kivo/etc/packages/restricted": lines "id version").
 int PMSThirdPartyCheckLimit(const std::string& id, const std::string& version);
+// The same list read once, for a caller that checks many entries.
+class PMSThirdPartyLimits {
+ public:
+  PMSThirdPartyLimits();
+  bool Restricts(const std::string& id, const std::string& version) const;
+
+ private:
+  std::set<std::pair<std::string, std::string>> restricted_;
+};
 // The install progress of `id` (0.0 to 1.0), -1.0 when none is running.
 double PMSGetProgress(const std::string& id);
 // The path of the package's icon (size 72 or 256), "" when it has none.
