@@ -2,10 +2,14 @@
 // libkivo_pkgserver_net.so, which the light library loads on first use.
 
 #include <cerrno>
+#include <condition_variable>
 #include <cstring>
+#include <deque>
 #include <fcntl.h>
 #include <memory>
+#include <mutex>
 #include <sys/stat.h>
+#include <thread>
 #include <unistd.h>
 
 #include <curl/curl.h>
@@ -156,6 +160,69 @@ std::string Hex(const unsigned char* digest, unsigned size) {
   return out;
 }
 
+// md5 and sha256 of a download on a thread of their own, so that hashing
+// one block overlaps receiving and writing the next: inline, the digests
+// took most of the worker's time and the server waited on a full socket.
+// At most kMaxQueued blocks wait, so memory stays flat in the file size.
+class DigestThread {
+ public:
+  DigestThread(EVP_MD_CTX* md5, EVP_MD_CTX* sha256) : md5_(md5), sha256_(sha256) {}
+  ~DigestThread() {
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      closing_ = true;
+    }
+    changed_.notify_all();
+    if (thread_.joinable()) thread_.join();
+  }
+  DigestThread(const DigestThread&) = delete;
+  DigestThread& operator=(const DigestThread&) = delete;
+
+  void Feed(const char* data, size_t size) {
+    if (!md5_ && !sha256_) return;
+    if (!thread_.joinable()) thread_ = std::thread(&DigestThread::Run, this);
+    std::unique_lock<std::mutex> lock(mutex_);
+    changed_.wait(lock, [this] { return queue_.size() < kMaxQueued; });
+    queue_.emplace_back(data, size);
+    changed_.notify_all();
+  }
+  // Returns once every block fed so far is in the digests.
+  void Drain() {
+    std::unique_lock<std::mutex> lock(mutex_);
+    changed_.wait(lock, [this] { return queue_.empty() && !busy_; });
+  }
+
+ private:
+  static constexpr size_t kMaxQueued = 8;
+
+  void Run() {
+    std::unique_lock<std::mutex> lock(mutex_);
+    for (;;) {
+      changed_.wait(lock, [this] { return closing_ || !queue_.empty(); });
+      if (queue_.empty()) return;
+      std::string block = std::move(queue_.front());
+      queue_.pop_front();
+      busy_ = true;
+      changed_.notify_all();
+      lock.unlock();
+      if (md5_) EVP_DigestUpdate(md5_, block.data(), block.size());
+      if (sha256_) EVP_DigestUpdate(sha256_, block.data(), block.size());
+      lock.lock();
+      busy_ = false;
+      changed_.notify_all();
+    }
+  }
+
+  EVP_MD_CTX* md5_;
+  EVP_MD_CTX* sha256_;
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::deque<std::string> queue_;
+  bool busy_ = false;
+  bool closing_ = false;
+  std::thread thread_;
+};
+
 class FileSink {
  public:
   FileSink(HttpDownload& d) : d_(d) {}
@@ -172,6 +239,7 @@ class FileSink {
     if (fstat(fd_, &st) != 0) return false;
     if (d_.want_md5) md5_.reset(EVP_MD_CTX_new());
     if (d_.want_sha256) sha256_.reset(EVP_MD_CTX_new());
+    hasher_ = std::make_unique<DigestThread>(md5_.get(), sha256_.get());
     return ResetDigests() && HashExisting(static_cast<uint64_t>(st.st_size));
   }
   // Drops everything received so far (the server ignored the range).
@@ -192,6 +260,7 @@ class FileSink {
   }
   uint64_t have() const { return have_; }
   void Finish() {
+    hasher_->Drain();
     unsigned char digest[EVP_MAX_MD_SIZE];
     unsigned size = 0;
     if (md5_ && EVP_DigestFinal_ex(md5_.get(), digest, &size)) d_.md5_hex = Hex(digest, size);
@@ -201,13 +270,11 @@ class FileSink {
 
  private:
   bool ResetDigests() {
+    hasher_->Drain();
     return (!md5_ || EVP_DigestInit_ex(md5_.get(), EVP_md5(), nullptr)) &&
            (!sha256_ || EVP_DigestInit_ex(sha256_.get(), EVP_sha256(), nullptr));
   }
-  void Hash(const char* data, size_t size) {
-    if (md5_) EVP_DigestUpdate(md5_.get(), data, size);
-    if (sha256_) EVP_DigestUpdate(sha256_.get(), data, size);
-  }
+  void Hash(const char* data, size_t size) { hasher_->Feed(data, size); }
   // Bytes left by an earlier attempt count once the server resumes after them.
   bool HashExisting(uint64_t size) {
     char buffer[64 * 1024];
@@ -224,6 +291,8 @@ class FileSink {
   int fd_ = -1;
   uint64_t have_ = 0;
   Digest md5_, sha256_;
+  // Declared after the digests it updates: it ends before they are freed.
+  std::unique_ptr<DigestThread> hasher_;
 };
 
 struct Attempt {
