@@ -14,5 +14,7 @@
 // head's variables, which are those a CGI program gets from the web server;
 // the connection becomes stdin and stdout (stderr stays the server's, the web
 // server's error log). A head that cannot be read ends the child without an
-// answer, which the web server reports as a failed request.
+// answer, which the web server reports as a failed request. The child ends
+// with _exit once stdout is flushed: the libraries' exit handlers and static
+// destructors do not run.
 [[noreturn]] void ServeScgiConnection(int conn, int read_timeout_seconds);
