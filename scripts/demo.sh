@@ -19,7 +19,10 @@ ROOT=$PWD/demo-root
 K="build/bin/kivoctl --root $ROOT"
 build/bin/kivoctl init-root "$ROOT"
 $K user-add admin --password "$PASSWORD" --group administrators
-$K web-config --port "$PORT" > "$ROOT/lighttpd.conf"
+# The web API runs in kivo-webd behind lighttpd's SCGI module (a forked
+# process per request; lighttpd starts it and starts it again if it ends).
+# --mode cgi runs entry.cgi per request instead.
+$K web-config --mode scgi --port "$PORT" > "$ROOT/lighttpd.conf"
 
 # The sample packages, signed by a demo publisher key that this root trusts.
 examples/build.sh "$PWD/build/bin/kivoctl" "$PWD/build/examples"
