@@ -132,6 +132,7 @@ std::string Digest(const char* tool, const std::string& path) {
 void WorkerDownload(const std::string& url, const std::string& md5, const char* label) {
   int fds[2];
   if (pipe(fds) != 0) return;
+  fflush(stdout);  // the child must not print the parent's buffered lines again
   Clock::time_point t = Clock::now();
   pid_t pid = fork();
   if (pid == 0) {
