@@ -157,15 +157,6 @@ std::string AddMember(const std::string& group_line, const std::string& account)
 
 }  // namespace
 
-bool KIVOAccountNameValid(const std::string& name) {
-  if (name.empty() || name.size() > 32) return false;
-  if (!(islower(static_cast<unsigned char>(name[0])) || name[0] == '_')) return false;
-  return std::all_of(name.begin(), name.end(), [](char c) {
-    return islower(static_cast<unsigned char>(c)) || isdigit(static_cast<unsigned char>(c)) ||
-           c == '_' || c == '.' || c == '-';
-  });
-}
-
 bool KIVOAccountCheckPassword(const std::string& account, const std::string& password) {
   std::string hash = KIVOAccountNameValid(account) ? StoredHash(account) : "";
   bool usable = IsUsableHash(hash);

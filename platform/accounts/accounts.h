@@ -6,15 +6,14 @@
 #include <string>
 #include <vector>
 
+#include "klibc/account_name.h"
+
 // True when `account` exists, is not locked, and `password` matches its hash.
 bool KIVOAccountCheckPassword(const std::string& account, const std::string& password);
 
 // True when `account` is a member of `group` (listed in the group, or the
 // group is its primary group).
 bool KIVOAccountInGroup(const std::string& account, const std::string& group);
-
-// True when `name` is a valid account or group name: [a-z_][a-z0-9_.-]{0,31}.
-bool KIVOAccountNameValid(const std::string& name);
 
 // Creates `account` (or replaces its password and groups when it exists) with
 // a fresh yescrypt hash, adding it to each of `groups` (created when missing).

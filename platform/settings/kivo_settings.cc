@@ -1,21 +1,13 @@
 #include "settings/kivo_settings.h"
 
-#include <regex>
-
+#include "klibc/account_name.h"
 #include "klibc/atomic_file.h"
 #include "klibc/last_error.h"
 #include "klibc/sysroot.h"
 #include "settings/web_utils.h"
 
-bool KivoSettingsUserNameValid(const std::string& name) {
-  static const std::regex kAccountName("[a-z_][a-z0-9_.-]{0,31}");
-  // A leading dot is excluded by the first character, so "." and ".." can
-  // never match.
-  return std::regex_match(name, kAccountName);
-}
-
 KivoSettings::KivoSettings(const std::string& user) {
-  if (KivoSettingsUserNameValid(user)) {
+  if (KIVOAccountNameValid(user)) {
     path_ = KIVORootPath("/usr/kivo/etc/users/" + user + "/settings.json");
   }
 }

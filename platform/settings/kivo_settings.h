@@ -32,7 +32,3 @@ class KivoSettings {
  private:
   std::string path_;
 };
-
-// True when `name` may name an account: [a-z_][a-z0-9_.-]{0,31}, so it can
-// never hold a slash, a NUL or be "..".
-bool KivoSettingsUserNameValid(const std::string& name);
