@@ -10,8 +10,8 @@
 #include <json/writer.h>
 
 #include "accounts/accounts.h"
-#include "host/file_lock.h"
 #include "klibc/atomic_file.h"
+#include "klibc/file_lock.h"
 #include "klibc/sysroot.h"
 #include "settings/web_utils.h"
 

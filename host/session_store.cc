@@ -10,8 +10,8 @@
 #include <utility>
 #include <vector>
 
-#include "host/file_lock.h"
 #include "klibc/atomic_file.h"
+#include "klibc/file_lock.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
 

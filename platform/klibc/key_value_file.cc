@@ -3,12 +3,10 @@
 #include <algorithm>
 #include <cctype>
 #include <cstring>
-#include <fcntl.h>
 #include <sstream>
-#include <sys/file.h>
-#include <unistd.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/file_lock.h"
 #include "klibc/last_error.h"
 #include "klibc/sysroot.h"
 
@@ -50,27 +48,6 @@ bool ParseLine(const std::string& line, std::string* key, std::string* value) {
   return !key->empty();
 }
 
-// Holds an exclusive advisory lock on "<path>.lock" for its lifetime.
-class FileLock {
- public:
-  explicit FileLock(const std::string& path) {
-    fd_ = open((path + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
-    if (fd_ >= 0 && flock(fd_, LOCK_EX) != 0) {
-      close(fd_);
-      fd_ = -1;
-    }
-  }
-  ~FileLock() {
-    if (fd_ >= 0) close(fd_);
-  }
-  FileLock(const FileLock&) = delete;
-  FileLock& operator=(const FileLock&) = delete;
-  bool held() const { return fd_ >= 0; }
-
- private:
-  int fd_ = -1;
-};
-
 }  // namespace
 
 KeyValueMap KIVOKeyValueParse(const std::string& text) {
@@ -110,7 +87,7 @@ bool KIVOKeyValueSet(const std::string& path, const std::string& key, const std:
     KLIBCErrSet(KLIBC_ERR_BAD_PARAMETER);
     return false;
   }
-  FileLock lock(path);
+  FileLock lock(path + ".lock");
   if (!lock.held()) {
     KLIBCErrSet(KLIBC_ERR_LOCK);
     return false;

@@ -7,6 +7,8 @@
 
 #include <string>
 
+#include "klibc/file_lock.h"
+
 namespace KIVOPackageServer {
 
 // The feed file's path and its folder, under the root.
@@ -15,17 +17,9 @@ std::string PMSFeedFolder();
 
 // Holds the feed list's lock for its lifetime. Check held(): false (with
 // errno set) when the lock file cannot be made or locked.
-class FeedFileLock {
+class FeedFileLock : public FileLock {
  public:
   FeedFileLock();
-  ~FeedFileLock();
-  FeedFileLock(const FeedFileLock&) = delete;
-  FeedFileLock& operator=(const FeedFileLock&) = delete;
-
-  bool held() const { return fd_ >= 0; }
-
- private:
-  int fd_ = -1;
 };
 
 }  // namespace KIVOPackageServer

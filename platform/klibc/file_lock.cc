@@ -1,4 +1,4 @@
-#include "host/file_lock.h"
+#include "klibc/file_lock.h"
 
 #include <cerrno>
 #include <fcntl.h>
@@ -13,8 +13,10 @@ FileLock::FileLock(const std::string& path) {
     rc = flock(fd_, LOCK_EX);
   } while (rc != 0 && errno == EINTR);
   if (rc != 0) {
+    int saved = errno;
     close(fd_);
     fd_ = -1;
+    errno = saved;
   }
 }
 

@@ -1,7 +1,7 @@
 // An exclusive advisory lock (flock) on a lock file, held for the lifetime of
-// the object. The host runs one process per request, so state that several
-// requests update (sign-in attempts, sessions) is guarded by a file lock
-// rather than by anything in memory.
+// the object. Requests, workers and tools are separate processes, so state
+// that several of them update (key/value files, sign-in attempts, sessions,
+// the feed list) is guarded by a file lock rather than by anything in memory.
 #pragma once
 
 #include <string>
@@ -9,7 +9,8 @@
 class FileLock {
  public:
   // Creates `path` (mode 0600) when missing and blocks until the lock is
-  // held. Check held(): false when the file cannot be opened or locked.
+  // held. Check held(): false (with errno set) when the file cannot be
+  // opened or locked.
   explicit FileLock(const std::string& path);
   ~FileLock();
   FileLock(const FileLock&) = delete;
