@@ -50,10 +50,13 @@ TEST_F(ParamCheckTest, AlwaysAcceptShape) {
                                                         {"KIVO.Core.Package.Feed", "list"},
                                                         {"KIVO.Core.Package.Feed.Keyring", "list"},
                                                         {kInst, "upload"},
-                                                        {"KIVO.Core.Package.FakeIFrame", "get"},
                                                         {"KIVO.Core.Package.Server", "check"}}) {
     ExpectAccepted(row.first, 1, row.second, {{"anything", "[1,2]"}, {"id", "{}"}});
   }
+  // The inline-frame page answers its page, not JSON, whatever it is sent.
+  CgiAnswer page = client().Call("KIVO.Core.Package.FakeIFrame", "get", 1,
+                                 {{"anything", "[1,2]"}, {"id", "{}"}});
+  EXPECT_NE(std::string::npos, page.body.find("<html")) << page.body;
 }
 
 TEST_F(ParamCheckTest, TypesOnlyShape) {
