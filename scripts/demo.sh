@@ -48,6 +48,11 @@ $K index "$FEED" --base-url "http://127.0.0.1:$PORT/feed" --recommend demo-web -
 rm "$FEED/demo-gone.kpk"
 $K server-config --vendor "http://127.0.0.1:$PORT/feed/catalogue.json" \
   --company-info "http://127.0.0.1:$PORT/feed/company-info.json" >/dev/null
+# The terms-of-service endpoint answers the hash of the current terms; the
+# package center asks the user to agree again whenever it changes.
+cp examples/terms-of-service.txt "$FEED/terms-of-service.txt"
+printf '{"content_hash":"%s"}\n' "$(sha256sum examples/terms-of-service.txt | cut -d' ' -f1)" \
+  >"$FEED/company-info.json"
 
 # A second catalogue, a "community" feed that a user adds through the API:
 # demo-unsigned signed by a community key made here (never committed),
