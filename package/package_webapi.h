@@ -69,9 +69,6 @@ class PackageWebAPI {
   void GetFakeIFrame();
 
  private:
-  // Answers that the member's method is not part of this build yet.
-  void AnswerNotAvailable(const char* member);
-
   // Feeds (feed.cc): the parsed "list" parameter (answers 4501 when it is
   // not JSON), and a "set" change applied to the list (answers 4591 when the
   // new address is another feed's).
