@@ -54,15 +54,7 @@ void InstallMany(const std::string& dir, int count) {
               {"install_dep_services", "pgsql"}};
     if (i == 0) p.info["startable"] = "no";  // a library the others need
     if (i > 0 && i % 3 == 0) p.info["install_dep_packages"] = "bench-0";
-    std::string file = p.Build(dir), message;
-    PKG_ERRCODE code;
-    Json::Value details;
-    if (!InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true,
-                                false)) {
-      fprintf(stderr, "install of %s failed: %s\n", p.id.c_str(), message.c_str());
-      exit(1);
-    }
-    unlink(file.c_str());
+    InstallOrExit(p.Build(dir));
   }
 }
 

@@ -46,15 +46,7 @@ void InstallMany(const std::string& dir, int count) {
     p.id = "bench-" + std::to_string(i);
     p.daemon = false;
     p.info = {{"adminport", "18000"}, {"checkport", "no"}};
-    std::string file = p.Build(dir), message;
-    PKG_ERRCODE code;
-    Json::Value details;
-    if (!InstallPackageFileImpl("root", file, "", 0, "", false, "enu", message, code, details, true,
-                                false)) {
-      fprintf(stderr, "install of %s failed: %s\n", p.id.c_str(), message.c_str());
-      exit(1);
-    }
-    unlink(file.c_str());
+    InstallOrExit(p.Build(dir));
   }
 }
 

@@ -78,14 +78,7 @@ class FeedTrustTest : public ::testing::Test {
     return s;
   }
   // Scratch keyrings left in the root's tmp/.
-  int ScratchHomes() {
-    int n = 0;
-    if (DIR* d = opendir(root_.Path("/tmp").c_str())) {
-      while (dirent* e = readdir(d)) n += std::string(e->d_name).rfind("source-keys-", 0) == 0;
-      closedir(d);
-    }
-    return n;
-  }
+  int ScratchHomes() { return CountEntries(root_.Path("/tmp"), "source-keys-"); }
 
   TempRoot root_;
   HttpTestServer server_;

@@ -75,14 +75,7 @@ class ServerDownloadTest : public ::testing::Test {
     return s;
   }
   // Download folders left on the volume.
-  int DownloadFolders() {
-    int n = 0;
-    if (DIR* d = opendir(root_.Path("/volume1/@tmp").c_str())) {
-      while (dirent* e = readdir(d)) n += std::string(e->d_name).rfind("download-", 0) == 0;
-      closedir(d);
-    }
-    return n;
-  }
+  int DownloadFolders() { return CountEntries(root_.Path("/volume1/@tmp"), "download-"); }
   // Serves the changed catalogue; the appliance keeps the one it has for a
   // while, so it is told to ask again at once.
   void Republish() {

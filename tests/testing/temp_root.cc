@@ -1,5 +1,6 @@
 #include "testing/temp_root.h"
 
+#include <dirent.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -10,6 +11,15 @@
 #include "tools/kivoctl/root_setup.h"
 
 #include <stdlib.h>
+
+int CountEntries(const std::string& dir, const std::string& prefix) {
+  int n = 0;
+  if (DIR* d = opendir(dir.c_str())) {
+    while (dirent* e = readdir(d)) n += std::string(e->d_name).rfind(prefix, 0) == 0;
+    closedir(d);
+  }
+  return n;
+}
 
 std::string BuildDir() {
   const char* dir = getenv("KIVO_BUILD_DIR");

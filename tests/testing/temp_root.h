@@ -24,6 +24,10 @@ class TempRoot {
   std::string dir_;
 };
 
+// How many entries of folder `dir` have a name starting with `prefix` (0 when
+// the folder cannot be read): what an operation left behind.
+int CountEntries(const std::string& dir, const std::string& prefix);
+
 // The build tree (KIVO_BUILD_DIR, set by ctest).
 std::string BuildDir();
 // For programs run outside ctest (benchmarks): the build tree is the folder
