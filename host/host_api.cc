@@ -174,6 +174,31 @@ void Logout(const CgiRequest& cgi, const APIRequest& request, APIResponse* respo
   response->SetSuccess();
 }
 
+// Tells a page that was reloaded who it is signed in as and hands it the
+// session's token again, so that the page keeps the token in memory only and
+// never needs to store it. Only the cookie session is asked: a cross-site
+// page cannot read the answer, and the SameSite cookie does not even travel
+// with its requests.
+void SessionQuery(const CgiRequest& cgi, APIResponse* response) {
+  const std::string sid = CookieValue(cgi.cookie, "id");
+  Session session;
+  SessionStore store(LoadSessionLimits());
+  SessionLookup found = sid.empty() ? SessionLookup::Unknown : store.Find(sid, &session);
+  if (found == SessionLookup::Expired) {
+    response->SetError(kErrSessionExpired, Reason("session expired"));
+    return;
+  }
+  if (found != SessionLookup::Found) {
+    response->SetError(kErrNotSignedIn, Reason("not signed in"));
+    return;
+  }
+  Json::Value data(Json::objectValue);
+  data["account"] = session.user;
+  data["token"] = session.token;
+  data["administrator"] = KIVOAccountInGroup(session.user, kAdminGroup);
+  response->SetSuccess(data);
+}
+
 // The inline-frame page answers everyone who is not an administrator with a
 // bare 404 of its own, which hides that the page exists; a JSON refusal here
 // would tell. So the host only tells the page's session object who calls.
@@ -202,8 +227,9 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
                 APIResponse* response) {
   const std::string& api = request->GetAPIClass();
   const std::string& method = request->GetAPIMethod();
-  bool known = (api == kInfoAPI && method == "query") ||
-               (api == kAuthAPI && (method == "login" || method == "logout"));
+  bool known =
+      (api == kInfoAPI && method == "query") ||
+      (api == kAuthAPI && (method == "login" || method == "logout" || method == "session"));
   if (!known) {
     response->SetError(kErrNoSuchMethod);
   } else if (request->GetAPIVersion() != 1) {
@@ -212,6 +238,8 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
     InfoQuery(*modules, response);
   } else if (method == "login") {
     Login(cgi, *request, response);
+  } else if (method == "session") {
+    SessionQuery(cgi, response);
   } else {
     Logout(cgi, *request, response);
   }

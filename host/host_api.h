@@ -5,6 +5,8 @@
 //                            only by POST with both in the body, throttled after
 //                            failures (host/login_throttle.h)
 //  "KIVO.API.Auth" "logout"  ends the calling session
+//  "KIVO.API.Auth" "session" the cookie session's {"account", "token",
+//                            "administrator"}, for a page that was reloaded
 #pragma once
 
 #include <string>

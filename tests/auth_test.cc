@@ -231,4 +231,40 @@ TEST_F(AuthTest, PasswordsAreTakenOnlyFromAPostBody) {
   EXPECT_TRUE(SignIn("admin", "secret").Success());
 }
 
+// A reloaded page gets its account and token back from the cookie alone; a
+// session id passed as a parameter is not enough, and logging out ends it.
+TEST_F(AuthTest, TheCookieSessionTellsAReloadedPageItsTokenAndRole) {
+  root_.AddAccount("viewer", "view-pw", {"users"});
+  const std::string query = "api=KIVO.API.Auth&version=1&method=session";
+  auto ask = [&](const std::string& cookie, const std::string& extra = "") {
+    return RunEntryCgi(
+        {{"REQUEST_METHOD", "GET"}, {"QUERY_STRING", query + extra}, {"HTTP_COOKIE", cookie}});
+  };
+  EXPECT_EQ(kNotSignedIn, ask("").Code());
+  EXPECT_EQ(kNotSignedIn, ask("id=0123456789abcdef0123456789abcdef").Code());
+
+  CgiAnswer admin = SignIn("admin", "secret");
+  ASSERT_TRUE(admin.Success()) << admin.body;
+  const std::string sid = admin.Data()["sid"].asString();
+  CgiAnswer a = ask("lang=en; id=" + sid);
+  ASSERT_TRUE(a.Success()) << a.body;
+  EXPECT_EQ("admin", a.Data()["account"].asString());
+  EXPECT_EQ(admin.Data()["token"], a.Data()["token"]);
+  EXPECT_TRUE(a.Data()["administrator"].asBool());
+  EXPECT_EQ(kNotSignedIn, ask("", "&_sid=" + sid).Code());
+
+  CgiAnswer viewer = SignIn("viewer", "view-pw");
+  ASSERT_TRUE(viewer.Success()) << viewer.body;
+  CgiAnswer v = ask("id=" + viewer.Data()["sid"].asString());
+  ASSERT_TRUE(v.Success()) << v.body;
+  EXPECT_FALSE(v.Data()["administrator"].asBool());
+
+  CgiAnswer out = RunEntryCgi({{"REQUEST_METHOD", "GET"},
+                               {"QUERY_STRING", "api=KIVO.API.Auth&version=1&method=logout"},
+                               {"HTTP_COOKIE", "id=" + sid},
+                               {"HTTP_X_KIVO_TOKEN", a.Data()["token"].asString()}});
+  ASSERT_TRUE(out.Success()) << out.body;
+  EXPECT_EQ(kNotSignedIn, ask("id=" + sid).Code());
+}
+
 }  // namespace
