@@ -3,11 +3,19 @@
 # when any is missing. Needs root for the install (apt-get update first).
 set -euo pipefail
 
+# The page is built with Node.js and npm, which the machine brings (20.19 or
+# newer, for its bundler); Debian 12's own nodejs is too old to stand in.
+if ! command -v npm >/dev/null; then
+  echo "Node.js 20.19+ with npm is needed to build the package center page" >&2
+  exit 1
+fi
+
 PACKAGES=(
   g++ cmake ninja-build pkg-config ccache clang-format clang libclang-rt-dev
   libjsoncpp-dev libcrypt-dev libgtest-dev googletest
   libarchive-dev libsqlite3-dev libcurl4-openssl-dev libgpgme-dev libpoco-dev libssl-dev libpng-dev
   lighttpd php-cli gnupg curl procps
+  chromium
 )
 
 missing=()

@@ -3,7 +3,9 @@
 # build/, then again under AddressSanitizer and UndefinedBehaviorSanitizer in
 # build-asan/. KIVO_SANITIZE=0 skips the second run, KIVO_SANITIZE=only runs
 # just that one. Last, a short fuzz run of the readers of untrusted input
-# (fuzz/run.sh, clang, build-fuzz/); KIVO_FUZZ=0 skips it.
+# (fuzz/run.sh, clang, build-fuzz/); KIVO_FUZZ=0 skips it. The package
+# center page's checks and browser tests run after the plain run
+# (scripts/test-page.sh); KIVO_PAGE=0 skips them.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -21,6 +23,7 @@ if [ "${KIVO_SANITIZE:-1}" != only ]; then
   export BUILD_DIR=build
   scripts/build.sh
   run_tests
+  [ "${KIVO_PAGE:-1}" = 0 ] || scripts/test-page.sh
 fi
 if [ "${KIVO_SANITIZE:-1}" != 0 ]; then
   export BUILD_DIR=build-asan

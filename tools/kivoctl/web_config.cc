@@ -48,6 +48,40 @@ std::string ScgiSection(const WebConfigOptions& o) {
          "}\n";
 }
 
+// The package center page (index.html and its hashed assets/) lies in the
+// document root beside the feeds. Its policy allows only the page's own
+// scripts, styles and images and calls to this server: an injected script or
+// style has nowhere to come from and nowhere to send anything. The assets'
+// names change with their content, so browsers may keep them for a year;
+// index.html is asked again each time, so a new page is seen at once.
+std::string PageSection() {
+  const std::string policy =
+      "\"Content-Security-Policy\" => \"default-src 'self'; script-src 'self'; "
+      "style-src 'self'; img-src 'self' data:; connect-src 'self'; frame-src 'self'; "
+      "object-src 'none'; base-uri 'none'; form-action 'self'; frame-ancestors 'self'\", "
+      "\"X-Content-Type-Options\" => \"nosniff\", "
+      "\"Referrer-Policy\" => \"same-origin\"";
+  return "index-file.names = (\"index.html\")\n"
+         "mimetype.assign = (\".html\" => \"text/html; charset=utf-8\", "
+         "\".js\" => \"text/javascript; charset=utf-8\", "
+         "\".css\" => \"text/css; charset=utf-8\", "
+         "\".json\" => \"application/json; charset=utf-8\", "
+         "\".txt\" => \"text/plain; charset=utf-8\", "
+         "\".asc\" => \"text/plain; charset=utf-8\", "
+         "\".svg\" => \"image/svg+xml\", \".png\" => \"image/png\", "
+         "\".ico\" => \"image/x-icon\", \"\" => \"application/octet-stream\")\n"
+         "$HTTP[\"url\"] =~ \"^/assets/\" {\n"
+         "  setenv.set-response-header = (" +
+         policy +
+         ", \"Cache-Control\" => \"public, max-age=31536000, immutable\")\n"
+         "}\n"
+         "else $HTTP[\"url\"] !~ \"^/webapi/\" {\n"
+         "  setenv.set-response-header = (" +
+         policy +
+         ", \"Cache-Control\" => \"no-cache\")\n"
+         "}\n";
+}
+
 }  // namespace
 
 bool ParseWebMode(const std::string& text, WebMode* mode) {
@@ -106,7 +140,7 @@ std::string KIVOWebConfig(const WebConfigOptions& o) {
          // Uploads stream through; the web API applies its own limit
          // ("max_upload_bytes"), so the web server only caps at 4 GiB.
          "server.max-request-size = 4194304\n" +
-         (o.mode == WebMode::kScgi ? ScgiSection(o) : CgiSection(o)) +
+         (o.mode == WebMode::kScgi ? ScgiSection(o) : CgiSection(o)) + PageSection() +
          // Every request's environment, in both modes (SCGI carries it in
          // the request's head).
          "setenv.add-environment = " + Environment(o) + "\n";

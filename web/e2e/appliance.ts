@@ -1,0 +1,87 @@
+// A real appliance for the page's browser tests: a demo system root made by
+// scripts/demo-root.sh (sample packages, the vendor's package server, the
+// community feed, the built page) served by lighttpd and the web API on a
+// free loopback port. Each test file gets its own, so files never see each
+// other's installs.
+
+import { execFileSync, spawn, type ChildProcess } from 'node:child_process';
+import { mkdtempSync, rmSync } from 'node:fs';
+import { createServer } from 'node:net';
+import { tmpdir } from 'node:os';
+import { join, resolve } from 'node:path';
+
+export const kRepo = resolve(import.meta.dirname, '../..');
+export const kPassword = 'admin';
+
+function freePort(): Promise<number> {
+  return new Promise((done, fail) => {
+    const server = createServer();
+    server.once('error', fail);
+    server.listen(0, '127.0.0.1', () => {
+      const address = server.address();
+      server.close(() => done(typeof address === 'object' && address ? address.port : 0));
+    });
+  });
+}
+
+async function waitForPage(url: string, server: ChildProcess): Promise<void> {
+  for (let i = 0; i < 200; ++i) {
+    if (server.exitCode !== null) throw new Error(`lighttpd ended with ${server.exitCode}`);
+    try {
+      if ((await fetch(url)).ok) return;
+    } catch {
+      // not listening yet
+    }
+    await new Promise((r) => setTimeout(r, 50));
+  }
+  throw new Error(`${url} did not answer`);
+}
+
+export class Appliance {
+  private constructor(
+    readonly root: string,
+    readonly url: string,
+    private readonly server: ChildProcess,
+  ) {}
+
+  static async start(): Promise<Appliance> {
+    const root = mkdtempSync(join(tmpdir(), 'kivo-page-'));
+    const port = await freePort();
+    execFileSync(join(kRepo, 'scripts/demo-root.sh'), [root, String(port)], {
+      env: { ...process.env, KIVO_DEMO_PASSWORD: kPassword },
+      stdio: ['ignore', 'ignore', 'inherit'],
+    });
+    const server = spawn('/usr/sbin/lighttpd', ['-D', '-f', join(root, 'lighttpd.conf')], {
+      stdio: ['ignore', 'ignore', 'pipe'],
+    });
+    server.stderr?.on('data', (chunk: Buffer) => process.env.KIVO_E2E_VERBOSE && process.stderr.write(chunk));
+    const url = `http://127.0.0.1:${port}/`;
+    await waitForPage(url, server);
+    return new Appliance(root, url, server);
+  }
+
+  // Runs kivoctl on this appliance's root, e.g. kivoctl('status', 'demo-web').
+  kivoctl(...args: string[]): string {
+    return execFileSync(join(kRepo, 'build/bin/kivoctl'), ['--root', this.root, ...args], { encoding: 'utf8' });
+  }
+
+  // A path inside the root, e.g. file('/volume1/public/packages/demo-beta.kpk').
+  file(path: string): string {
+    return join(this.root, path);
+  }
+
+  async stop(): Promise<void> {
+    if (this.server.exitCode === null) {
+      const ended = new Promise((r) => this.server.once('exit', r));
+      this.server.kill('SIGTERM');
+      await ended;
+    }
+    // Package services the tests started run on after the web server.
+    try {
+      for (const id of this.kivoctl('list').split('\n').filter(Boolean)) this.kivoctl('stop', id.split(/\s/)[0]);
+    } catch {
+      // a package that will not stop is left to the root's removal
+    }
+    rmSync(this.root, { recursive: true, force: true });
+  }
+}

@@ -1,0 +1,5 @@
+import './styles.css';
+import { render } from 'preact';
+import { App } from './app';
+
+render(<App />, document.getElementById('app') as HTMLElement);

@@ -1,0 +1,4 @@
+// Not built yet: says so rather than showing anything made up.
+export function SettingsScreen() {
+  return <p class="hint">This screen is not built yet.</p>;
+}
