@@ -1,0 +1,272 @@
+// The install wizard's pages that every install shows, whether the package
+// came as an uploaded file or from a package server: the licence to accept,
+// the package's own wizard pages, the volume to install to and a summary.
+//
+// Contract:
+// - Each builder returns StepPage(s) for ui/steps.tsx and holds no state:
+//   the flow keeps an `InstallChoices` (useState) and rebuilds the pages on
+//   every render, passing the choices in and a setter out. Pages whose
+//   answers are incomplete carry a `problem`, so Steps keeps the user there.
+// - `installPages` builds the whole sequence from what the API said about the
+//   package (`PackageFacts`: the licence and wizard pages as the API sends
+//   them, URL-encoded) and the volumes (`readVolumes` of a `check` or
+//   Setting "get" answer). A package without a licence or wizard simply has
+//   no such page.
+// - `initialChoices` preselects the volume: the one the package is already
+//   installed on (an upgrade), else the default install volume, else the
+//   first listed.
+// - `installParams` turns the choices into the parameters `install` takes
+//   (`volume_path`, `extra_values`: the wizard's answers as JSON text).
+// - `CheckRefusal` shows why the environment check (or the upload's
+//   inspection, which makes the same tests) refused, with the packages,
+//   services or OS versions the answer names.
+// - `loadDefaultVolume` asks KIVO.Core.Package.Setting.Volume "get"; an
+//   appliance with none set answers an empty string, not a failure.
+
+import './install-pages.css';
+import type { Api, ApiFailure, Result } from '../api/client';
+import { PackageCode } from '../api/codes';
+import { ErrorText } from './error-text';
+import type { StepPage } from './steps';
+import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from './wizard';
+
+export interface Volume {
+  path: string;
+  freeBytes: number | null;
+  totalBytes: number | null;
+}
+
+export interface PackageFacts {
+  id: string;
+  name: string;
+  version: string;
+  licence?: unknown;
+  installPages?: unknown;
+}
+
+export interface InstallChoices {
+  licenceAccepted: boolean;
+  wizard: WizardValues;
+  volume: string;
+}
+
+function isObject(value: unknown): value is Record<string, unknown> {
+  return typeof value === 'object' && value !== null && !Array.isArray(value);
+}
+
+function byteCount(value: unknown): number | null {
+  const n = typeof value === 'string' ? Number(value) : typeof value === 'number' ? value : NaN;
+  return Number.isFinite(n) && n >= 0 ? n : null;
+}
+
+// The volumes listed in an answer of `check` or of Setting "get" (both carry
+// "volumes": [{"volume_path", "size_free_byte", "size_total_byte", ...}]).
+export function readVolumes(answer: unknown): Volume[] {
+  if (!isObject(answer) || !Array.isArray(answer.volumes)) return [];
+  return answer.volumes
+    .filter((v): v is Record<string, unknown> => isObject(v) && typeof v.volume_path === 'string' && v.volume_path !== '')
+    .map((v) => ({ path: v.volume_path as string, freeBytes: byteCount(v.size_free_byte), totalBytes: byteCount(v.size_total_byte) }));
+}
+
+export async function loadDefaultVolume(api: Api): Promise<Result<string>> {
+  const answer = await api.call<{ default_vol?: string } | null>('KIVO.Core.Package.Setting.Volume', 'get', 1);
+  if (!answer.ok) return answer;
+  return { ok: true, data: typeof answer.data?.default_vol === 'string' ? answer.data.default_vol : '' };
+}
+
+// The licence text the API sent URL-encoded, or null when there is none.
+export function decodeLicence(encoded: unknown): string | null {
+  if (typeof encoded !== 'string' || encoded === '') return null;
+  try {
+    return decodeURIComponent(encoded);
+  } catch {
+    return encoded;
+  }
+}
+
+// `installedOn` is the volume of an already installed version (check's
+// "volume_path"), `defaultVolume` the appliance's default install volume.
+export function initialChoices(facts: PackageFacts, volumes: Volume[], installedOn: string, defaultVolume: string): InstallChoices {
+  const listed = (path: string) => path !== '' && volumes.some((v) => v.path === path);
+  const volume = [installedOn, defaultVolume].find(listed) ?? volumes[0]?.path ?? '';
+  const steps = decodeWizard(facts.installPages);
+  return { licenceAccepted: false, wizard: steps ? initialWizardValues(steps) : {}, volume };
+}
+
+export function installParams(facts: PackageFacts, choices: InstallChoices): { volume_path: string; extra_values?: string } {
+  const hasWizard = decodeWizard(facts.installPages) !== null;
+  return { volume_path: choices.volume, extra_values: hasWizard ? JSON.stringify(choices.wizard) : undefined };
+}
+
+type Change = (next: InstallChoices) => void;
+
+export function licencePage(text: string, choices: InstallChoices, onChange: Change): StepPage {
+  return {
+    title: 'Licence',
+    body: (
+      <>
+        <p>Read the package's licence. You can install the package only if you accept it.</p>
+        <div class="licence" tabIndex={0} role="document" aria-label="Licence text">
+          {text}
+        </div>
+        <label class="choice">
+          <input
+            type="checkbox"
+            checked={choices.licenceAccepted}
+            onChange={(e) => onChange({ ...choices, licenceAccepted: e.currentTarget.checked })}
+          />{' '}
+          I accept the licence
+        </label>
+      </>
+    ),
+    problem: choices.licenceAccepted ? null : 'Accept the licence to go on.',
+  };
+}
+
+export function wizardPages(steps: WizardStep[], choices: InstallChoices, onChange: Change): StepPage[] {
+  return steps.map((step, i) => ({
+    title: step.step_title || `Settings ${i + 1}`,
+    body: <WizardStepForm step={step} values={choices.wizard} onChange={(wizard) => onChange({ ...choices, wizard })} />,
+    problem: wizardStepProblem(step, choices.wizard),
+  }));
+}
+
+export function formatBytes(bytes: number): string {
+  const units = ['bytes', 'KB', 'MB', 'GB', 'TB'];
+  let value = bytes;
+  let unit = 0;
+  while (value >= 1000 && unit < units.length - 1) {
+    value /= 1000;
+    ++unit;
+  }
+  return unit === 0 ? `${value} bytes` : `${value.toFixed(1)} ${units[unit]}`;
+}
+
+function volumeText(volume: Volume): string {
+  if (volume.freeBytes === null) return volume.path;
+  const total = volume.totalBytes ? ` of ${formatBytes(volume.totalBytes)}` : '';
+  return `${volume.path} (${formatBytes(volume.freeBytes)} free${total})`;
+}
+
+export function volumePage(volumes: Volume[], choices: InstallChoices, onChange: Change): StepPage {
+  return {
+    title: 'Volume',
+    body: (
+      <fieldset>
+        <legend>Install on volume</legend>
+        {volumes.map((v) => (
+          <label class="choice" key={v.path}>
+            <input
+              type="radio"
+              name="install-volume"
+              value={v.path}
+              checked={choices.volume === v.path}
+              onChange={() => onChange({ ...choices, volume: v.path })}
+            />{' '}
+            {volumeText(v)}
+          </label>
+        ))}
+      </fieldset>
+    ),
+    problem: volumes.length === 0 ? 'The appliance has no volume to install to.' : choices.volume === '' ? 'Choose a volume.' : null,
+  };
+}
+
+export function summaryPage(facts: PackageFacts, choices: InstallChoices, extra: { label: string; value: string }[] = []): StepPage {
+  const rows = [
+    { label: 'Package', value: facts.name || facts.id },
+    { label: 'Version', value: facts.version },
+    { label: 'Volume', value: choices.volume },
+    ...extra,
+  ];
+  return {
+    title: 'Summary',
+    body: (
+      <>
+        <p>The package will be installed with these choices.</p>
+        <dl class="summary">
+          {rows.map((r) => (
+            <div key={r.label}>
+              <dt>{r.label}</dt>
+              <dd>{r.value}</dd>
+            </div>
+          ))}
+        </dl>
+      </>
+    ),
+  };
+}
+
+// Every page of an install, in order: licence, the package's wizard, volume,
+// summary.
+export function installPages(facts: PackageFacts, volumes: Volume[], choices: InstallChoices, onChange: Change): StepPage[] {
+  const licence = decodeLicence(facts.licence);
+  const steps = decodeWizard(facts.installPages);
+  return [
+    ...(licence !== null ? [licencePage(licence, choices, onChange)] : []),
+    ...(steps ? wizardPages(steps, choices, onChange) : []),
+    volumePage(volumes, choices, onChange),
+    summaryPage(facts, choices),
+  ];
+}
+
+function text(value: unknown): string {
+  if (typeof value === 'string') return value;
+  if (Array.isArray(value)) return value.map(text).filter(Boolean).join(', ');
+  if (isObject(value)) return Object.keys(value).join(', ');
+  return value === undefined || value === null ? '' : String(value);
+}
+
+// The facts an answer's details add to its code's message, as sentences.
+export function refusalFacts(error: ApiFailure): string[] {
+  const e = error.errors ?? {};
+  const facts: string[] = [];
+  const add = (prefix: string, value: unknown) => {
+    const t = text(value);
+    if (t !== '') facts.push(`${prefix}${t}.`);
+  };
+  switch (error.code) {
+    case PackageCode.Conflict:
+      add('It cannot be installed beside: ', e.packages);
+      break;
+    case PackageCode.ServiceNotRunning:
+      add('Services that must run first: ', e.services);
+      break;
+    case PackageCode.DependencyMissing:
+      add('Packages to install first: ', e.uninstall_packages);
+      add('Packages to start first: ', e.unstart_packages);
+      break;
+    case PackageCode.DependentsRunning:
+    case PackageCode.InstallDependency:
+      add('Packages concerned: ', e.packages);
+      break;
+    case PackageCode.OsTooNew:
+      add('The highest system version it runs on is ', e.firmware);
+      break;
+    case PackageCode.OsTooOld:
+      add('It needs system version ', e.firmware);
+      break;
+    case PackageCode.PortInUse:
+      add('Port in use: ', e.port);
+      break;
+  }
+  if (typeof e.message === 'string' && e.message !== '') facts.push(`The package tool says: ${e.message}`);
+  return facts;
+}
+
+// A refusal of the environment check or of a package file, in words.
+export function CheckRefusal({ error }: { error: ApiFailure }) {
+  const facts = refusalFacts(error);
+  return (
+    <div class="refusal">
+      <ErrorText error={error} />
+      {facts.length > 0 && (
+        <ul>
+          {facts.map((f) => (
+            <li key={f}>{f}</li>
+          ))}
+        </ul>
+      )}
+    </div>
+  );
+}
