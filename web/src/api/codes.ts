@@ -1,9 +1,11 @@
-// The web API's result codes that the page acts on (rather than only shows),
-// one name each. Every code's words for the user are in messages.ts.
+// The web API's result codes, one name each. Every code's words for the user are in messages.ts.
 
 export const HostCode = {
   Unknown: 100,
   BadRequest: 101,
+  UnknownApi: 102,
+  UnknownMethod: 103,
+  UnsupportedVersion: 104,
   NotPermitted: 105,
   SessionExpired: 106,
   NotSignedIn: 119,

@@ -1,29 +1,231 @@
-// Words for every result code the web API can answer. An unknown code still
-// shows its number, so a user can report it.
+// Words for every result code the web API can answer (the host's codes in
+// docs/http-api.md, the package module's in docs/error-codes.md), written for
+// an administrator: what happened and what to do. Where the answer's "errors"
+// name what is in the way (packages, services, a port, versions, the package
+// tool's own words), they are told too. An unknown code still shows its
+// number, so a user can report it.
 
 import { kNoAnswer, type ApiFailure } from './client';
+import { HostCode, PackageCode } from './codes';
+
+type Errors = Record<string, unknown>;
 
 const messages: Record<number, string> = {
   [kNoAnswer]: 'The appliance did not answer. Check the connection and try again.',
-  100: 'The appliance could not complete the request.',
-  101: 'The request was not understood.',
-  102: 'The appliance does not offer this function.',
-  103: 'The appliance does not offer this function.',
-  104: 'The appliance does not offer this version of the function.',
-  105: 'You are not allowed to do this: only administrators manage packages.',
-  106: 'Your session has expired. Please sign in again.',
-  119: 'You are not signed in.',
-  120: 'A value sent to the appliance was missing or not valid.',
-  400: 'Wrong account or password.',
-  407: 'Too many failed sign-ins.',
+
+  [HostCode.Unknown]: 'The appliance could not complete the request. Try again; if it keeps failing, check the system log.',
+  [HostCode.BadRequest]: 'The appliance did not understand the request. Reload the page and try again.',
+  [HostCode.UnknownApi]: 'The appliance does not offer this function. Its software may be older than this page.',
+  [HostCode.UnknownMethod]: 'The appliance does not offer this function. Its software may be older than this page.',
+  [HostCode.UnsupportedVersion]: 'The appliance does not offer this version of the function. Reload the page.',
+  [HostCode.NotPermitted]: 'You are not allowed to do this: only administrators, signed in on this page, manage packages.',
+  [HostCode.SessionExpired]: 'Your session has expired. Please sign in again.',
+  [HostCode.NotSignedIn]: 'You are not signed in. Please sign in.',
+  [HostCode.Parameter]: 'A value sent to the appliance was missing or not valid.',
+  [HostCode.WrongPassword]: 'Wrong account or password.',
+  [HostCode.SignInThrottled]: 'Too many failed sign-ins.',
+
+  [PackageCode.UploadNotStored]: 'The file did not arrive whole. Upload it again.',
+  [PackageCode.BadParameter]: 'The request named no package or held an invalid value. Reload the page and try again.',
+  [PackageCode.Failed]: 'The package operation failed.',
+  [PackageCode.NoVolume]: 'No usable volume with free space was found. Add or repair a volume, or free some space.',
+  [PackageCode.NoTmpDir]: 'The appliance cannot make a temporary folder on its volumes. Check that a volume is usable and has room.',
+  [PackageCode.NoRoomOnVolume]: 'The chosen volume has no room for this package. Choose another volume or free some space.',
+  [PackageCode.VolumeUnusable]: 'The package\'s volume is missing or damaged. Repair the volume, then try again.',
+  [PackageCode.InstallRunning]: 'The install could not be cancelled: it is already past the point where it can stop.',
+  [PackageCode.NoSpace]: 'There is not enough free space for this package. Free some space and try again.',
+  [PackageCode.NotPackageFile]: 'This file is not a package this appliance can read. Check that you chose the right file.',
+  [PackageCode.BadPackageFile]: 'This file is not a valid package. Get a fresh copy from its publisher.',
+  [PackageCode.Conflict]: 'This package cannot be installed next to a package that is already installed.',
+  [PackageCode.ServiceNotRunning]: 'A service this package needs is not running. Start it, then try again.',
+  [PackageCode.DependencyMissing]: 'This package needs other packages that are not installed or not running.',
+  [PackageCode.PortInUse]: 'The network port this package uses is taken by another program.',
+  [PackageCode.NotSupported]: 'This package does not run on this appliance (another architecture or model, or a built-in package).',
+  [PackageCode.UnsafeMember]: 'This package file holds unsafe content and was refused.',
+  [PackageCode.Busy]: 'Another package operation is under way. Wait for it to finish, then try again.',
+  [PackageCode.NoSignature]: 'This package is not signed.',
+  [PackageCode.BadSignature]: 'This package\'s signature is not valid: the file was changed after it was signed.',
+  [PackageCode.UnknownSigner]: 'This package is signed by a key this appliance does not trust. Import the publisher\'s key, or lower the trust level.',
+  [PackageCode.ExpiredKey]: 'This package is signed with a key that has expired. Ask its publisher for a newer package.',
+  [PackageCode.RevokedKey]: 'This package is signed with a key that has been revoked. Do not install it.',
+  [PackageCode.OsTooNew]: 'This package does not support the appliance\'s system version, which is newer than it allows.',
+  [PackageCode.OsTooOld]: 'This package needs a newer system version. Update the appliance first.',
+  [PackageCode.ExtractFailed]: 'The package\'s contents could not be unpacked. The file may be damaged, or the volume full.',
+  [PackageCode.UnsafePayload]: 'The package\'s contents hold unsafe files; the install was stopped.',
+  [PackageCode.UpgradeRolledBack]: 'The upgrade failed; the previous version was restored.',
+  [PackageCode.BadWizardValues]: 'The package did not accept the answers given in its install wizard. Check them and try again.',
+  [PackageCode.InstallNotInstalled]: 'This package is not installed.',
+  [PackageCode.NotNewer]: 'The same or a newer version of this package is already installed.',
+  [PackageCode.InstallDependency]: 'This package needs other packages that are missing or stopped. Install or start them first.',
+  [PackageCode.VersionLimit]: 'A package this one needs is installed in a version that does not fit. Upgrade it first.',
+  [PackageCode.ScriptFailed]: 'A script of the package failed.',
+  [PackageCode.Cancelled]: 'The install was cancelled.',
+  [PackageCode.DependentsRunning]: 'Running packages depend on this one. Stop them first.',
+  [PackageCode.NotFeasible]: 'The appliance does not allow this now.',
+  [PackageCode.UninstallFailed]: 'The package could not be uninstalled.',
+  [PackageCode.UninstallBadValues]: 'The answers of the uninstall wizard could not be read. Go back and answer again.',
+  [PackageCode.UninstallDependents]: 'Other packages depend on this one. Uninstall them first.',
+  [PackageCode.StartFailed]: 'The package could not be started.',
+  [PackageCode.StopFailed]: 'The package could not be stopped.',
+  [PackageCode.StopDependents]: 'Running packages need this one. Stop them first.',
+  [PackageCode.StartVersionLimit]: 'A package this one needs is installed in a version that does not fit. Upgrade it first.',
+  [PackageCode.StartDependency]: 'This package needs other packages that are not installed or not running.',
+  [PackageCode.FeedNotServer]:
+    'That address does not answer as a package source: it is down, too slow, not http or https, or not a package server. Check the address.',
+  [PackageCode.FeedExists]: 'This package source is already in the list.',
+  [PackageCode.KeyUnreadable]: 'The key file could not be read. Choose the publisher\'s key file again.',
+  [PackageCode.KeyNotPublic]: 'This file holds no public signing key. Choose the publisher\'s public key file.',
+  [PackageCode.KeySecret]: 'This file holds a secret key, which must never be imported. Ask the publisher for the public key.',
+  [PackageCode.KeyringUnwritable]: 'The appliance\'s keyring could not be written. Check the system volume, then try again.',
 };
+
+// An answer's detail as words: a list of names (an array, or the keys of an
+// object) joined with commas; a string as it stands, or the value it
+// encodes when it is JSON text (the package tool hands some lists over as
+// JSON text); a number as digits.
+function names(value: unknown): string {
+  if (typeof value === 'number') return String(value);
+  if (typeof value === 'string') {
+    const text = value.trim();
+    if (/^["[{]/.test(text)) {
+      try {
+        return names(JSON.parse(text));
+      } catch {
+        // not JSON after all: shown as it stands
+      }
+    }
+    return text;
+  }
+  if (Array.isArray(value)) return value.map(names).filter((n) => n !== '').join(', ');
+  if (value !== null && typeof value === 'object') return Object.keys(value).join(', ');
+  return '';
+}
+
+// "Label: names." when `value` names anything, else nothing.
+function listed(label: string, value: unknown): string | undefined {
+  const text = names(value);
+  return text === '' ? undefined : `${label}: ${text}.`;
+}
+
+function seconds(count: number): string {
+  if (count < 90) return count === 1 ? '1 second' : `${count} seconds`;
+  return `${Math.ceil(count / 60)} minutes`;
+}
+
+function parameterProblem(e: Errors): string | undefined {
+  if (typeof e.name !== 'string') return undefined;
+  if (e.reason === 'required') return `"${e.name}" is missing.`;
+  if (e.reason === 'type') return `"${e.name}" has the wrong type.`;
+  return `"${e.name}" is not valid.`;
+}
+
+function feasibility(e: Errors): string[] {
+  const reasons = names(e.reasons);
+  if (e.check_type === 'soft') {
+    return [reasons === '' ? 'It advises against it.' : `It advises against it: ${reasons}.`, 'Confirm to go ahead anyway.'];
+  }
+  return [reasons === '' ? 'The check could not be made; try again later.' : `Reason: ${reasons}.`];
+}
+
+function versions(e: Errors): string | undefined {
+  const parts: string[] = [];
+  if (typeof e.require_version === 'string' && e.require_version !== '') parts.push(`needed: ${e.require_version}`);
+  if (typeof e.install_version === 'string' && e.install_version !== '') parts.push(`in this file: ${e.install_version}`);
+  if (typeof e.current_version === 'string' && e.current_version !== '') parts.push(`installed: ${e.current_version}`);
+  return parts.length === 0 ? undefined : `Version ${parts.join('; ')}.`;
+}
+
+function missingPackages(e: Errors): (string | undefined)[] {
+  return [listed('Not installed', e.uninstall_packages), listed('Not running', e.unstart_packages)];
+}
+
+function hostReason(e: Errors): string | undefined {
+  return typeof e.reason === 'string' && e.reason !== '' ? `(${e.reason})` : undefined;
+}
+
+// What a code's "errors" add to its sentence, for the codes whose details
+// say what stands in the way.
+const details: Partial<Record<number, (e: Errors) => (string | undefined)[]>> = {
+  [HostCode.Unknown]: (e) => [hostReason(e)],
+  [HostCode.BadRequest]: (e) => [hostReason(e)],
+  [HostCode.NotPermitted]: (e) => [hostReason(e)],
+  [HostCode.Parameter]: (e) => [parameterProblem(e)],
+  [HostCode.SignInThrottled]: (e) =>
+    [typeof e.retry_after === 'number' ? `Try again in ${seconds(e.retry_after)}.` : 'Wait a while, then try again.'],
+  [PackageCode.Conflict]: (e) => [listed('Conflicting packages', e.packages)],
+  [PackageCode.ServiceNotRunning]: (e) => [listed('Services not running', e.services)],
+  [PackageCode.DependencyMissing]: missingPackages,
+  [PackageCode.StartDependency]: missingPackages,
+  [PackageCode.PortInUse]: (e) => [typeof e.port === 'number' ? `Port ${e.port} is in use. Stop what uses it, then try again.` : undefined],
+  [PackageCode.OsTooNew]: (e) => [listed('Newest system version it supports', e.firmware)],
+  [PackageCode.OsTooOld]: (e) => [listed('System version it needs', e.firmware)],
+  [PackageCode.NotNewer]: (e) => [versions(e)],
+  [PackageCode.VersionLimit]: (e) => [versions(e)],
+  [PackageCode.StartVersionLimit]: (e) => [versions(e)],
+  [PackageCode.InstallDependency]: (e) => [listed('Needed packages', e.packages)],
+  [PackageCode.DependentsRunning]: (e) => [listed('Running dependents', e.packages)],
+  [PackageCode.UninstallDependents]: (e) => [listed('Dependent packages', e.packages)],
+  [PackageCode.StopDependents]: (e) => [listed('Running dependents', e.packages)],
+  [PackageCode.NotFeasible]: feasibility,
+};
+
+// The package tool's operation log can run to many lines; its last ones say
+// how the operation ended.
+const kToolLines = 3;
+
+// The package tool's own words ("message", and "worker_message": what the
+// package's scripts told the user), present on most package answers.
+function toolWords(e: Errors): string[] {
+  const said: string[] = [];
+  if (typeof e.message === 'string') {
+    const lines = e.message.split('\n').map((l) => l.trim()).filter((l) => l !== '');
+    if (lines.length > 0) said.push(`The package tool said: ${lines.slice(-kToolLines).join(' ')}`);
+  }
+  if (Array.isArray(e.worker_message)) {
+    for (const line of e.worker_message) {
+      const text = names(line);
+      if (text !== '' && !said.some((s) => s.includes(text))) said.push(text);
+    }
+  }
+  return said;
+}
+
+// A start or stop of several packages fails as a whole with each package's
+// own outcome under its id: {"<id>": {"code", "errors"}} or {"<id>": {"data"}}.
+function batchFailures(e: Errors): string[] {
+  if ('message' in e || 'worker_message' in e || 'code' in e) return [];
+  const told: string[] = [];
+  for (const [id, outcome] of Object.entries(e)) {
+    if (outcome === null || typeof outcome !== 'object') continue;
+    const { code, errors } = outcome as { code?: unknown; errors?: unknown };
+    if (typeof code !== 'number') continue;
+    const inner = errors !== null && typeof errors === 'object' ? (errors as Errors) : undefined;
+    told.push(`${id}: ${messageFor({ code, errors: inner })}`);
+  }
+  return told;
+}
+
+export interface Explanation {
+  // What happened and what to do.
+  summary: string;
+  // What the answer's details add: names of packages, versions, reasons, the
+  // package tool's words, one sentence each.
+  details: string[];
+}
+
+// `failure` explained in parts, for a screen that shows the details apart
+// (a list of reasons, say). messageFor joins the same parts.
+export function explain(failure: ApiFailure): Explanation {
+  const errors = failure.errors ?? {};
+  const summary = messages[failure.code] ?? `The appliance answered with error ${failure.code}.`;
+  const own = details[failure.code]?.(errors) ?? [];
+  const parts = [...own, ...batchFailures(errors), ...toolWords(errors)];
+  return { summary, details: parts.filter((p): p is string => p !== undefined && p !== '') };
+}
 
 // The sentence for `failure`, with the details the answer carries that a
 // user can act on.
 export function messageFor(failure: ApiFailure): string {
-  const text = messages[failure.code];
-  if (text === undefined) return `The appliance answered with error ${failure.code}.`;
-  const retry = failure.errors?.retry_after;
-  if (typeof retry === 'number') return `${text} Try again in ${retry} seconds.`;
-  return text;
+  const { summary, details: told } = explain(failure);
+  return [summary, ...told].join(' ');
 }
