@@ -62,6 +62,7 @@ export const PackageCode = {
   StopDependents: 4582,
   StartVersionLimit: 4583,
   StartDependency: 4584,
+  ImageNotFound: 4586,
   FeedNotServer: 4590,
   FeedExists: 4591,
   KeyUnreadable: 4592,

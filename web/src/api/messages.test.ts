@@ -1,6 +1,7 @@
 // Every code the API documents has words in the page, and the details an
 // answer carries reach those words. The code lists come from the docs'
-// tables themselves, so a code added to the API without a message fails here.
+// tables and the module's own code list, so a code added to the API without
+// a name, a row in the docs or a message fails here.
 
 import assert from 'node:assert/strict';
 import { readFileSync } from 'node:fs';
@@ -9,12 +10,12 @@ import { kNoAnswer } from './client';
 import { HostCode, PackageCode } from './codes';
 import { explain, messageFor } from './messages';
 
-const docs = new URL('../../../docs/', import.meta.url);
+const repo = new URL('../../../', import.meta.url);
 
 // The rows of the first table after `heading` (or in the whole file) whose
 // first cell is a number: [code, second cell].
 function codeRows(file: string, heading?: string): [number, string][] {
-  let text = readFileSync(new URL(file, docs), 'utf8');
+  let text = readFileSync(new URL(`docs/${file}`, repo), 'utf8');
   if (heading !== undefined) {
     const at = text.indexOf(`\n${heading}\n`);
     assert.ok(at >= 0, `${file} has no section "${heading}"`);
@@ -58,6 +59,13 @@ test('codes.ts names each module code as docs/error-codes.md does', () => {
   }
 });
 
+test('codes.ts has every code the package module defines, by its name', () => {
+  const header = readFileSync(new URL('package/error_codes.h', repo), 'utf8');
+  const defined = [...header.matchAll(/\bkErr(\w+) = (\d+)/g)].map(([, name, code]) => [name, Number(code)]);
+  assert.ok(defined.length >= 50, `found only ${defined.length} codes in package/error_codes.h`);
+  assert.deepEqual(defined.filter(([name, code]) => (PackageCode as Record<string, number>)[name] !== code), []);
+});
+
 test('an unknown code still shows its number, with the package tool words it carries', () => {
   assert.match(messageFor({ code: 4999 }), /\b4999\b/);
   assert.match(messageFor({ code: 4999, errors: { message: 'disk on fire' } }), /4999.*disk on fire/);
@@ -86,6 +94,9 @@ test('details that say what stands in the way are told', () => {
     said(PackageCode.StartVersionLimit, { code: 4583, current_version: '1.0', require_version: 'demo-base>=2.0' }),
     /needed: demo-base>=2\.0; installed: 1\.0/,
   );
+  assert.match(said(PackageCode.Failed, { failed: 'update_channel' }), /Could not store the update channel; the settings before it/);
+  assert.match(said(PackageCode.Failed, { volume_status: 'crashed' }), /The default volume is damaged/);
+  assert.match(said(PackageCode.BadParameter, { name: 'index', reason: 'condition' }), /"index" is not valid\./);
   assert.match(said(PackageCode.NotNewer, { current_version: '2.0', install_version: '1.5' }), /in this file: 1\.5; installed: 2\.0/);
 });
 

@@ -70,6 +70,7 @@ const messages: Record<number, string> = {
   [PackageCode.StopDependents]: 'Running packages need this one. Stop them first.',
   [PackageCode.StartVersionLimit]: 'A package this one needs is installed in a version that does not fit. Upgrade it first.',
   [PackageCode.StartDependency]: 'This package needs other packages that are not installed or not running.',
+  [PackageCode.ImageNotFound]: 'This screenshot is not available.',
   [PackageCode.FeedNotServer]:
     'That address does not answer as a package source: it is down, too slow, not http or https, or not a package server. Check the address.',
   [PackageCode.FeedExists]: 'This package source is already in the list.',
@@ -139,6 +140,32 @@ function missingPackages(e: Errors): (string | undefined)[] {
   return [listed('Not installed', e.uninstall_packages), listed('Not running', e.unstart_packages)];
 }
 
+// The settings are stored one step after another; a failing step names
+// itself, and those before it stay stored.
+const kSettingSteps: Record<string, string> = {
+  trust_level: 'the trust level',
+  update_channel: 'the update channel',
+  notification: 'the notifications',
+  autoupdate: 'the automatic updates',
+};
+
+// Why the stored default volume cannot take packages.
+const kVolumeStates: Record<string, string> = {
+  no_space: 'is full',
+  crashed: 'is damaged',
+  no_found: 'is missing',
+  unknown: 'cannot be used',
+};
+
+function generalFailure(e: Errors): (string | undefined)[] {
+  const step = typeof e.failed === 'string' ? (kSettingSteps[e.failed] ?? `"${e.failed}"`) : undefined;
+  const volume = typeof e.volume_status === 'string' ? (kVolumeStates[e.volume_status] ?? 'cannot be used') : undefined;
+  return [
+    step && `Could not store ${step}; the settings before it were stored.`,
+    volume && `The default volume ${volume}: choose another one in the settings.`,
+  ];
+}
+
 function hostReason(e: Errors): string | undefined {
   return typeof e.reason === 'string' && e.reason !== '' ? `(${e.reason})` : undefined;
 }
@@ -152,6 +179,8 @@ const details: Partial<Record<number, (e: Errors) => (string | undefined)[]>> = 
   [HostCode.Parameter]: (e) => [parameterProblem(e)],
   [HostCode.SignInThrottled]: (e) =>
     [typeof e.retry_after === 'number' ? `Try again in ${seconds(e.retry_after)}.` : 'Wait a while, then try again.'],
+  [PackageCode.BadParameter]: (e) => [parameterProblem(e)],
+  [PackageCode.Failed]: generalFailure,
   [PackageCode.Conflict]: (e) => [listed('Conflicting packages', e.packages)],
   [PackageCode.ServiceNotRunning]: (e) => [listed('Services not running', e.services)],
   [PackageCode.DependencyMissing]: missingPackages,
