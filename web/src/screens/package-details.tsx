@@ -1,4 +1,246 @@
-// Not built yet: says so rather than showing anything made up.
+import './package-details.css';
+import { useCallback, useState } from 'preact/hooks';
+import { routeHref } from '../route';
+import { useSession } from '../session';
+import { ErrorText } from '../ui/error-text';
+import { PackageIcon } from '../ui/package-icon';
+import { isBusyStatus, StatusBadge } from '../ui/status-badge';
+import { usePolled } from './installed';
+import { PackageActions } from './package-actions';
+
+// One installed package: what it is, who makes it, where to get help, what
+// it needs, the address of its own web page while it runs, its screenshots
+// and its log.
+
+interface Dependency {
+  operator?: string;
+  version?: string;
+}
+
+interface PackageDetails {
+  id: string;
+  name: string;
+  version: string;
+  additional?: {
+    description?: string;
+    maintainer?: string;
+    maintainer_url?: string;
+    distributor?: string;
+    distributor_url?: string;
+    help_url?: string;
+    support_url?: string;
+    report_beta_url?: string;
+    beta?: boolean;
+    startable?: boolean;
+    status?: string;
+    url?: string | string[];
+    is_uninstall_pages?: boolean;
+    dependent_packages?: Record<string, Dependency> | null;
+    installed_info?: { path?: string };
+  };
+}
+
+const kDetailFields = [
+  'description',
+  'maintainer',
+  'maintainer_url',
+  'distributor',
+  'distributor_url',
+  'help_url',
+  'support_url',
+  'report_beta_url',
+  'beta',
+  'startable',
+  'status',
+  'url',
+  'is_uninstall_pages',
+  'dependent_packages',
+  'installed_info',
+];
+
+// Only web addresses become links: a package's INFO could hold anything.
+function isWebAddress(text: string | undefined): text is string {
+  return !!text && /^https?:\/\//i.test(text);
+}
+
+function Person({ label, name, url }: { label: string; name?: string; url?: string }) {
+  if (!name && !url) return null;
+  return (
+    <>
+      <dt>{label}</dt>
+      <dd>{isWebAddress(url) ? <a href={url}>{name || url}</a> : name}</dd>
+    </>
+  );
+}
+
+function Links({ extra }: { extra: NonNullable<PackageDetails['additional']> }) {
+  const links = [
+    { label: 'Help', url: extra.help_url },
+    { label: 'Support', url: extra.support_url },
+    { label: 'Report a fault in this beta', url: extra.report_beta_url },
+  ].filter((l) => isWebAddress(l.url));
+  if (links.length === 0) return null;
+  return (
+    <>
+      <dt>Links</dt>
+      <dd>
+        <ul class="inline-list">
+          {links.map((l) => (
+            <li key={l.label}>
+              <a href={l.url}>{l.label}</a>
+            </li>
+          ))}
+        </ul>
+      </dd>
+    </>
+  );
+}
+
+function Dependencies({ deps }: { deps: Record<string, Dependency> | null | undefined }) {
+  const ids = Object.keys(deps ?? {});
+  return (
+    <>
+      <dt>Needs</dt>
+      <dd>
+        {ids.length === 0 ? (
+          'No other packages.'
+        ) : (
+          <ul class="inline-list">
+            {ids.map((id) => {
+              const dep = deps?.[id] ?? {};
+              return (
+                <li key={id}>
+                  <a href={routeHref({ screen: 'package', id })}>{id}</a>
+                  {dep.operator && dep.version ? ` ${dep.operator} ${dep.version}` : ''}
+                </li>
+              );
+            })}
+          </ul>
+        )}
+      </dd>
+    </>
+  );
+}
+
+function WebAddress({ url }: { url: string | string[] | undefined }) {
+  const urls = (Array.isArray(url) ? url : [url]).filter(isWebAddress);
+  if (urls.length === 0) return null;
+  return (
+    <>
+      <dt>Its web page</dt>
+      <dd>
+        {urls.map((u) => (
+          <a key={u} href={u} target="_blank" rel="noopener noreferrer">
+            {u}
+          </a>
+        ))}
+      </dd>
+    </>
+  );
+}
+
+// A package has up to eight screenshots and the API does not say how
+// many: each one is asked for after the one before it loaded, and the first
+// that is missing ends the row.
+function Screenshots({ id, version }: { id: string; version: string }) {
+  const { api } = useSession();
+  const [loaded, setLoaded] = useState(0);
+  const [ended, setEnded] = useState(false);
+  const shown = ended ? loaded : Math.min(loaded + 1, 8);
+  const indexes = Array.from({ length: shown }, (_, i) => i + 1);
+  return (
+    <section aria-labelledby="screenshots-title" hidden={loaded === 0}>
+      <h2 id="screenshots-title">Screenshots</h2>
+      <div class="screenshots">
+        {indexes.map((index) => (
+          <img
+            key={index}
+            src={api.url('KIVO.Core.Package.Screenshot', 'get', 1, { name: id, ver: version, index })}
+            alt={`Screenshot ${index} of ${id}`}
+            hidden={index > loaded}
+            onLoad={() => setLoaded((n) => Math.max(n, index))}
+            onError={() => setEnded(true)}
+          />
+        ))}
+      </div>
+    </section>
+  );
+}
+
+function Log({ id }: { id: string }) {
+  const { api } = useSession();
+  const load = useCallback(() => api.call<{ pkglog: string }>('KIVO.Core.Package.Log', 'get', 1, { name: id }), [api, id]);
+  const { result, reload } = usePolled(load, () => false);
+  return (
+    <section aria-labelledby="log-title">
+      <div class="section-head">
+        <h2 id="log-title">Log</h2>
+        <button type="button" onClick={reload}>
+          Refresh log
+        </button>
+      </div>
+      {result === null && <p class="hint">Loading the log…</p>}
+      {result !== null && !result.ok && <ErrorText error={result.error} />}
+      {result?.ok && (result.data.pkglog === '' ? <p class="hint">The package has written no log.</p> : <pre class="log">{result.data.pkglog}</pre>)}
+    </section>
+  );
+}
+
 export function PackageScreen({ id }: { id: string }) {
-  return <p class="hint">The details of {id} are not built yet.</p>;
+  const { api } = useSession();
+  const load = useCallback(() => api.call<PackageDetails>('KIVO.Core.Package', 'get', 1, { id, additional: kDetailFields }), [api, id]);
+  const { result, reload } = usePolled(load, (p) => isBusyStatus(p.additional?.status));
+  const back = (
+    <p>
+      <a href={routeHref({ screen: 'installed' })}>← Installed packages</a>
+    </p>
+  );
+  if (result === null) return <p class="hint">Loading {id}…</p>;
+  if (!result.ok)
+    return (
+      <section>
+        {back}
+        <h1>{id}</h1>
+        <ErrorText error={result.error} />
+      </section>
+    );
+  const pkg = result.data;
+  const extra = pkg.additional ?? {};
+  return (
+    <article class="package-details" aria-labelledby="details-title">
+      {back}
+      <header class="details-head">
+        <PackageIcon id={pkg.id} version={pkg.version} size={256} shown={72} />
+        <div>
+          <h1 id="details-title">{pkg.name}</h1>
+          <p class="details-version">
+            Version {pkg.version} {extra.beta && <span class="badge beta">Beta</span>} <StatusBadge status={extra.status} withReason />
+          </p>
+        </div>
+        <PackageActions
+          pkg={{ id: pkg.id, name: pkg.name, status: extra.status, startable: extra.startable, hasUninstallPages: extra.is_uninstall_pages }}
+          onChanged={reload}
+          onRemoved={() => (location.hash = routeHref({ screen: 'installed' }))}
+        />
+      </header>
+      {extra.description && <p class="details-description">{extra.description}</p>}
+      <dl class="details-facts">
+        <WebAddress url={extra.status === 'running' ? extra.url : undefined} />
+        <Person label="Maintainer" name={extra.maintainer} url={extra.maintainer_url} />
+        <Person label="Distributor" name={extra.distributor} url={extra.distributor_url} />
+        <Links extra={extra} />
+        <Dependencies deps={extra.dependent_packages} />
+        {extra.installed_info?.path && (
+          <>
+            <dt>Installed in</dt>
+            <dd>
+              <code>{extra.installed_info.path}</code>
+            </dd>
+          </>
+        )}
+      </dl>
+      <Screenshots id={pkg.id} version={pkg.version} />
+      <Log id={pkg.id} />
+    </article>
+  );
 }

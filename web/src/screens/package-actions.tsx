@@ -1,0 +1,289 @@
+import './package-actions.css';
+import { useState } from 'preact/hooks';
+import type { Api, ApiFailure, Result } from '../api/client';
+import { PackageCode } from '../api/codes';
+import { Dialog } from '../ui/dialog';
+import { ErrorText } from '../ui/error-text';
+import { Steps, type StepPage } from '../ui/steps';
+import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from '../ui/wizard';
+import { isBusyStatus } from '../ui/status-badge';
+import { useSession } from '../session';
+
+// Start, stop and uninstall of one installed package. Stop and uninstall
+// ask the appliance first whether they are allowed (the feasibility check,
+// docs/feasibility.md): hard reasons refuse and are shown, soft reasons are
+// shown and need a confirmation. The check knows no start: what a start
+// needs (its dependencies running) the start itself refuses, and says so.
+
+export interface ActionPackage {
+  id: string;
+  name: string;
+  status?: string;
+  startable?: boolean;
+  hasUninstallPages?: boolean;
+}
+
+type Action = 'start' | 'stop' | 'uninstall';
+
+const kVerbs: Record<Action, { label: string; doing: string; failed: string }> = {
+  start: { label: 'Start', doing: 'Starting', failed: 'Could not start' },
+  stop: { label: 'Stop', doing: 'Stopping', failed: 'Could not stop' },
+  uninstall: { label: 'Uninstall', doing: 'Uninstalling', failed: 'Could not uninstall' },
+};
+
+type Flow =
+  | { kind: 'checking'; action: Action }
+  | { kind: 'refused'; action: Action; reasons: string[]; error: ApiFailure }
+  | { kind: 'confirm'; action: Action; reasons: string[] }
+  | { kind: 'uninstall'; reasons: string[]; wizard: WizardStep[] }
+  | { kind: 'running'; action: Action }
+  | { kind: 'failed'; action: Action; error: ApiFailure };
+
+type Feasibility = { allowed: true; soft: string[] } | { allowed: false; hard: string[]; error: ApiFailure };
+
+function strings(value: unknown): string[] {
+  return Array.isArray(value) ? value.filter((v): v is string => typeof v === 'string') : [];
+}
+
+// Whether the appliance allows `action`; soft reasons still allow it. A
+// check that cannot be made refuses, as the API does.
+async function checkFeasible(api: Api, action: 'stop' | 'uninstall', id: string): Promise<Feasibility> {
+  const type = action === 'stop' ? 'stop_check' : 'uninstall_check';
+  const answer = await api.call('KIVO.Core.Package', 'feasibility_check', 1, { type, packages: [id] });
+  if (answer.ok) return { allowed: true, soft: [] };
+  const { code, errors } = answer.error;
+  if (code === PackageCode.NotFeasible && errors?.check_type === 'soft') return { allowed: true, soft: strings(errors.reasons) };
+  return { allowed: false, hard: code === PackageCode.NotFeasible ? strings(errors?.reasons) : [], error: answer.error };
+}
+
+function names(value: unknown): string {
+  if (typeof value === 'string') return value;
+  if (Array.isArray(value)) return strings(value).join(', ');
+  if (value && typeof value === 'object') return Object.keys(value).join(', ');
+  return '';
+}
+
+// The details a refused start, stop or uninstall carries, in words: which
+// packages stand in the way, which versions or services are missing, and
+// what the package's own scripts told the user.
+export function failureDetails(error: ApiFailure): string[] {
+  const e = error.errors ?? {};
+  const details: string[] = [];
+  const dependents = names(e.packages);
+  if (dependents && error.code === PackageCode.StopDependents) details.push(`Still running and needing it: ${dependents}.`);
+  else if (dependents) details.push(`Installed packages that need it: ${dependents}.`);
+  const notInstalled = names(e.uninstall_packages);
+  if (notInstalled) details.push(`It needs these packages installed: ${notInstalled}.`);
+  const notRunning = names(e.unstart_packages);
+  if (notRunning) details.push(`It needs these packages running: ${notRunning}.`);
+  if (typeof e.require_version === 'string' && e.require_version)
+    details.push(`It needs version ${e.require_version}; installed is ${String(e.current_version ?? 'none')}.`);
+  const services = names(e.services);
+  if (services) details.push(`It needs these system services: ${services}.`);
+  return details.concat(strings(e.worker_message));
+}
+
+// A failure with its details and, when there is one, the operation's log.
+export function ActionFailure({ error }: { error: ApiFailure }) {
+  const details = failureDetails(error);
+  const log = typeof error.errors?.message === 'string' ? error.errors.message.trim() : '';
+  return (
+    <div class="action-failure">
+      <ErrorText error={error} />
+      {details.length > 0 && (
+        <ul class="reasons">
+          {details.map((d) => (
+            <li key={d}>{d}</li>
+          ))}
+        </ul>
+      )}
+      {log && (
+        <details>
+          <summary>Operation log</summary>
+          <pre class="log">{log}</pre>
+        </details>
+      )}
+    </div>
+  );
+}
+
+function Reasons({ reasons }: { reasons: string[] }) {
+  return (
+    <ul class="reasons">
+      {reasons.map((r) => (
+        <li key={r}>{r}</li>
+      ))}
+    </ul>
+  );
+}
+
+async function control(api: Api, action: Action, id: string, wizard: WizardValues | null): Promise<Result<unknown>> {
+  if (action === 'uninstall') {
+    // The API takes the wizard's answers as one JSON text.
+    const extra = wizard ? JSON.stringify(wizard) : undefined;
+    return api.call('KIVO.Core.Package.Uninstallation', 'uninstall', 1, { id, extra_values: extra });
+  }
+  return api.call('KIVO.Core.Package.Control', action, 1, { id: [id] });
+}
+
+// The uninstall's pages: the soft reasons to confirm, the package's own
+// wizard, then the last word before removing.
+function uninstallPages(name: string, reasons: string[], wizard: WizardStep[], values: WizardValues, onValues: (v: WizardValues) => void) {
+  const pages: StepPage[] = [];
+  if (reasons.length > 0)
+    pages.push({ title: 'Before you go on', body: <Reasons reasons={reasons} />, nextLabel: 'Continue anyway' });
+  for (const step of wizard)
+    pages.push({
+      title: step.step_title || 'Options',
+      body: <WizardStepForm step={step} values={values} onChange={onValues} />,
+      problem: wizardStepProblem(step, values),
+    });
+  pages.push({ title: 'Confirm', body: <p>{name} and the data it keeps will be removed from the appliance.</p> });
+  return pages;
+}
+
+// Buttons for what can be done with `pkg` now; `onChanged` runs when its
+// state may have changed (also when an action begins, so a list shows the
+// package as busy), `onRemoved` after an uninstall.
+export function PackageActions({ pkg, onChanged, onRemoved }: { pkg: ActionPackage; onChanged: () => void; onRemoved?: () => void }) {
+  const { api } = useSession();
+  const [flow, setFlow] = useState<Flow | null>(null);
+  const [values, setValues] = useState<WizardValues>({});
+  const busy = isBusyStatus(pkg.status) || flow !== null;
+
+  const run = async (action: Action, wizard: WizardValues | null) => {
+    setFlow({ kind: 'running', action });
+    const pending = control(api, action, pkg.id, wizard);
+    onChanged();
+    const answer = await pending;
+    if (!answer.ok) {
+      setFlow({ kind: 'failed', action, error: answer.error });
+      onChanged();
+      return;
+    }
+    setFlow(null);
+    if (action === 'uninstall' && onRemoved) onRemoved();
+    else onChanged();
+  };
+
+  const begin = async (action: Action) => {
+    if (action === 'start') return run('start', null);
+    setFlow({ kind: 'checking', action });
+    const feasible = await checkFeasible(api, action, pkg.id);
+    if (!feasible.allowed) return setFlow({ kind: 'refused', action, reasons: feasible.hard, error: feasible.error });
+    if (action === 'stop') return feasible.soft.length > 0 ? setFlow({ kind: 'confirm', action, reasons: feasible.soft }) : run('stop', null);
+    let wizard: WizardStep[] = [];
+    if (pkg.hasUninstallPages) {
+      const got = await api.call<{ additional?: { uninstall_pages?: string } }>('KIVO.Core.Package', 'get', 1, {
+        id: pkg.id,
+        additional: ['uninstall_pages'],
+      });
+      if (!got.ok) return setFlow({ kind: 'failed', action, error: got.error });
+      wizard = decodeWizard(got.data.additional?.uninstall_pages) ?? [];
+    }
+    setValues(initialWizardValues(wizard));
+    setFlow({ kind: 'uninstall', reasons: feasible.soft, wizard });
+  };
+
+  const close = () => setFlow(null);
+  const canControl = pkg.startable !== false && !busy;
+  return (
+    <div class="package-actions">
+      {pkg.status === 'running' ? (
+        <button type="button" aria-label={`Stop ${pkg.name}`} disabled={!canControl} onClick={() => begin('stop')}>
+          Stop
+        </button>
+      ) : (
+        <button type="button" aria-label={`Start ${pkg.name}`} disabled={!canControl} onClick={() => begin('start')}>
+          Start
+        </button>
+      )}
+      <button type="button" aria-label={`Uninstall ${pkg.name}`} disabled={busy} onClick={() => begin('uninstall')}>
+        Uninstall
+      </button>
+      {flow && <FlowDialog pkg={pkg} flow={flow} values={values} onValues={setValues} onClose={close} onRun={run} />}
+    </div>
+  );
+}
+
+function FlowDialog({
+  pkg,
+  flow,
+  values,
+  onValues,
+  onClose,
+  onRun,
+}: {
+  pkg: ActionPackage;
+  flow: Flow;
+  values: WizardValues;
+  onValues: (v: WizardValues) => void;
+  onClose: () => void;
+  onRun: (action: Action, wizard: WizardValues | null) => void;
+}) {
+  const closeButton = (
+    <div class="buttons">
+      <button type="button" class="primary" onClick={onClose}>
+        Close
+      </button>
+    </div>
+  );
+  // A running action cannot be called back; the dialog stays until it ends.
+  const ignore = () => {};
+  switch (flow.kind) {
+    case 'checking':
+    case 'running':
+      return (
+        <Dialog title={`${kVerbs[flow.action].label} ${pkg.name}`} onClose={ignore}>
+          <p role="status">{flow.kind === 'checking' ? 'Checking whether this is allowed…' : `${kVerbs[flow.action].doing} ${pkg.name}…`}</p>
+        </Dialog>
+      );
+    case 'refused':
+      return (
+        <Dialog title={`${kVerbs[flow.action].failed} ${pkg.name}`} onClose={onClose}>
+          {flow.reasons.length > 0 ? (
+            <>
+              <p role="alert">The appliance does not allow this now:</p>
+              <Reasons reasons={flow.reasons} />
+            </>
+          ) : (
+            <ActionFailure error={flow.error} />
+          )}
+          {closeButton}
+        </Dialog>
+      );
+    case 'failed':
+      return (
+        <Dialog title={`${kVerbs[flow.action].failed} ${pkg.name}`} onClose={onClose}>
+          <ActionFailure error={flow.error} />
+          {closeButton}
+        </Dialog>
+      );
+    case 'confirm':
+      return (
+        <Dialog title={`${kVerbs[flow.action].label} ${pkg.name}?`} onClose={onClose}>
+          <p>Please note before you go on:</p>
+          <Reasons reasons={flow.reasons} />
+          <div class="buttons">
+            <button type="button" onClick={onClose}>
+              Cancel
+            </button>
+            <button type="button" class="primary" onClick={() => onRun(flow.action, null)}>
+              {kVerbs[flow.action].label} anyway
+            </button>
+          </div>
+        </Dialog>
+      );
+    case 'uninstall':
+      return (
+        <Dialog title={`Uninstall ${pkg.name}`} onClose={onClose} wide={flow.wizard.length > 0}>
+          <Steps
+            pages={uninstallPages(pkg.name, flow.reasons, flow.wizard, values, onValues)}
+            finishLabel="Uninstall"
+            onFinish={() => onRun('uninstall', flow.wizard.length > 0 ? values : null)}
+            onCancel={onClose}
+          />
+        </Dialog>
+      );
+  }
+}
