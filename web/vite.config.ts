@@ -14,7 +14,7 @@ export default defineConfig({
     sourcemap: false,
   },
   server: {
-    // `npm run dev` next to a running demo: the API calls go to it.
+    // `npx vite` next to a running demo: the API calls go to it.
     proxy: { '/webapi': `http://127.0.0.1:${process.env.KIVO_PORT ?? '5000'}` },
   },
 });

@@ -1,5 +1,5 @@
 import { useEffect, useMemo, useState } from 'preact/hooks';
-import { Api, type SessionInfo } from './api/client';
+import { Api, isSessionGone, type SessionInfo } from './api/client';
 import { messageFor } from './api/messages';
 import { Session } from './session';
 import { routeHref, useRoute, type Route } from './route';
@@ -71,11 +71,17 @@ export function App() {
   const [state, setState] = useState<State>({ kind: 'loading' });
   useEffect(() => {
     api.onSessionEnded = (code) => setState({ kind: 'signed-out', notice: messageFor({ code }) });
-    api.restoreSession().then((r) => setState(r.ok ? { kind: 'signed-in', session: r.data } : { kind: 'signed-out' }));
+    api.restoreSession().then((r) => {
+      if (r.ok) setState({ kind: 'signed-in', session: r.data });
+      // Not signed in is the usual start; anything else is worth telling.
+      else setState({ kind: 'signed-out', notice: isSessionGone(r.error.code) ? undefined : messageFor(r.error) });
+    });
   }, [api]);
   const signOut = async () => {
-    await api.signOut();
-    setState({ kind: 'signed-out' });
+    const result = await api.signOut();
+    // A session the server has already ended is signed out all the same.
+    const failed = !result.ok && !isSessionGone(result.error.code);
+    setState({ kind: 'signed-out', notice: failed ? `Signing out failed: ${messageFor(result.error)}` : undefined });
   };
   if (state.kind === 'loading') return <p class="loading">Loading…</p>;
   if (state.kind === 'signed-out')

@@ -82,7 +82,8 @@ export class Api {
   }
 
   // Posts `file` as multipart/form-data with `fields` before it, reporting
-  // the bytes sent; `abort` cancels the transfer. fetch cannot report upload
+  // the bytes sent; `abort` cancels the transfer; `part` names the file's
+  // part (a key file goes as "upload_keyring"). fetch cannot report upload
   // progress, hence XMLHttpRequest.
   upload<T = unknown>(
     api: string,
@@ -92,13 +93,14 @@ export class Api {
     file: File,
     onProgress: (sent: number, total: number) => void,
     abort?: AbortSignal,
+    part = 'file',
   ): Promise<Result<T>> {
     const query = new URLSearchParams({ api, method, version: String(version) });
     const form = new FormData();
     for (const [name, value] of Object.entries(fields)) {
       if (value !== undefined) form.append(name, JSON.stringify(value));
     }
-    form.append('file', file, file.name);
+    form.append(part, file, file.name);
     return new Promise((resolve) => {
       const xhr = new XMLHttpRequest();
       xhr.open('POST', `${kEndpoint}?${query}`);
@@ -132,9 +134,10 @@ export class Api {
     return { ok: true, data: { account: session.data.account, administrator: session.data.administrator } };
   }
 
-  async signOut(): Promise<void> {
-    await this.call('KIVO.API.Auth', 'logout', 1);
+  async signOut(): Promise<Result<unknown>> {
+    const result = await this.call('KIVO.API.Auth', 'logout', 1);
     this.token = '';
+    return result;
   }
 
   private checked<T>(result: Result<T>): Result<T> {
