@@ -1,4 +1,419 @@
-// Not built yet: says so rather than showing anything made up.
+import './manual-install.css';
+import { useEffect, useRef, useState } from 'preact/hooks';
+import type { Api, ApiFailure, Result } from '../api/client';
+import { messageFor } from '../api/messages';
+import { useSession } from '../session';
+import { routeHref } from '../route';
+import { Dialog } from '../ui/dialog';
+import { ErrorText } from '../ui/error-text';
+import { ProgressBar } from '../ui/progress';
+import { Steps, type StepPage } from '../ui/steps';
+import {
+  CheckRefusal,
+  initialChoices,
+  installPages,
+  installParams,
+  loadDefaultVolume,
+  readVolumes,
+  type InstallChoices,
+  type PackageFacts,
+  type Volume,
+} from '../ui/install-pages';
+
+// Manual install: the administrator picks a package file, which is uploaded
+// and inspected by the appliance; the environment check runs; the wizard asks
+// for what the install needs (signature confirmation, licence, the package's
+// own pages, volume); the install runs with its progress polled. The uploaded
+// file lives on the appliance behind an upload task until the install takes
+// it, so every way out of the wizard other than a successful install asks the
+// appliance to clean it up.
+
+const kApi = 'KIVO.Core.Package.Installation';
+const kPollMs = 500;
+
+interface UploadAnswer {
+  id: string;
+  name: string;
+  version: string;
+  task_id: string;
+  licence?: string;
+  install_pages?: string;
+  codesign_error?: number;
+  codesign_message?: string;
+  additional?: { dependent_packages?: unknown; start_dependent_services?: unknown; install_type?: unknown };
+}
+
+interface CheckAnswer {
+  volume_path?: string;
+  is_occupied?: boolean;
+}
+
+interface InstallAnswer {
+  message?: string;
+  worker_message?: unknown;
+}
+
+interface Prepared {
+  upload: UploadAnswer;
+  facts: PackageFacts;
+  volumes: Volume[];
+  busy: boolean;
+  defaultVolumeError: ApiFailure | null;
+  initial: InstallChoices;
+}
+
+type Phase =
+  | { kind: 'idle' }
+  | { kind: 'uploading'; file: File; sent: number; total: number }
+  | { kind: 'checking'; file: File }
+  | { kind: 'refused'; file: File; error: ApiFailure }
+  | { kind: 'wizard'; prepared: Prepared; choices: InstallChoices }
+  | { kind: 'installing'; prepared: Prepared; choices: InstallChoices; progress: number | null }
+  | { kind: 'done'; prepared: Prepared; choices: InstallChoices; outcome: Result<InstallAnswer> };
+
+// What the check needs to know about the package, from the upload's answer.
+function checkParams(upload: UploadAnswer) {
+  const extra = upload.additional ?? {};
+  const deps = extra.dependent_packages;
+  const services = Array.isArray(extra.start_dependent_services) ? extra.start_dependent_services.filter((s) => typeof s === 'string') : [];
+  return {
+    id: upload.id,
+    ver: upload.version,
+    deppkgs: typeof deps === 'object' && deps !== null && Object.keys(deps).length > 0 ? deps : undefined,
+    depsers: services.length > 0 ? services.join(':') : undefined,
+    install_type: typeof extra.install_type === 'string' ? extra.install_type : undefined,
+  };
+}
+
+async function prepare(api: Api, upload: UploadAnswer): Promise<Result<Prepared>> {
+  const [check, defaultVolume] = await Promise.all([
+    api.call<CheckAnswer>(kApi, 'check', 2, checkParams(upload)),
+    loadDefaultVolume(api),
+  ]);
+  if (!check.ok) return check;
+  const facts: PackageFacts = {
+    id: upload.id,
+    name: upload.name,
+    version: upload.version,
+    licence: upload.licence,
+    installPages: upload.install_pages,
+  };
+  const volumes = readVolumes(check.data);
+  const initial = initialChoices(facts, volumes, check.data.volume_path ?? '', defaultVolume.ok ? defaultVolume.data : '');
+  return {
+    ok: true,
+    data: { upload, facts, volumes, busy: check.data.is_occupied === true, defaultVolumeError: defaultVolume.ok ? null : defaultVolume.error, initial },
+  };
+}
+
+function clean(api: Api, taskId: string): void {
+  // The appliance answers at once and removes the file in the background;
+  // an upload nobody comes back for is swept after a day anyway.
+  void api.call(kApi, 'clean', 1, { task_id: taskId });
+}
+
+function workerMessages(answer: InstallAnswer): string[] {
+  const lines = answer.worker_message;
+  return Array.isArray(lines) ? lines.filter((l): l is string => typeof l === 'string' && l.trim() !== '') : [];
+}
+
+function codesignPage(upload: UploadAnswer, confirmed: boolean, onConfirm: (yes: boolean) => void): StepPage {
+  const code = upload.codesign_error ?? 0;
+  return {
+    title: 'Signature',
+    body: (
+      <div class="codesign-warning">
+        <p class="warning">
+          <strong>This package's signature could not be verified.</strong> {messageFor({ code })}
+        </p>
+        {upload.codesign_message && <p>The package tool says: {upload.codesign_message}</p>}
+        <p>Its contents may have been changed, or it comes from a publisher this appliance does not know. Install it only if you trust where it came from.</p>
+        <label class="choice">
+          <input type="checkbox" checked={confirmed} onChange={(e) => onConfirm(e.currentTarget.checked)} /> Install it anyway
+        </label>
+      </div>
+    ),
+    problem: confirmed ? null : 'Confirm that you want to install a package whose signature could not be verified.',
+  };
+}
+
+function InstallWizard({
+  prepared,
+  start,
+  onInstall,
+  onCancel,
+}: {
+  prepared: Prepared;
+  start: InstallChoices;
+  onInstall: (choices: InstallChoices, trustUnverified: boolean) => void;
+  onCancel: () => void;
+}) {
+  const [choices, setChoices] = useState(start);
+  const [trustUnverified, setTrustUnverified] = useState(false);
+  const unverified = prepared.upload.codesign_error !== undefined;
+  const pages = [
+    ...(unverified ? [codesignPage(prepared.upload, trustUnverified, setTrustUnverified)] : []),
+    ...installPages(prepared.facts, prepared.volumes, choices, setChoices),
+  ];
+  return (
+    <>
+      {prepared.busy && <p class="hint">Another package operation is under way; the install may have to wait for it.</p>}
+      {prepared.defaultVolumeError && (
+        <div>
+          <p class="hint">The default install volume could not be read:</p>
+          <ErrorText error={prepared.defaultVolumeError} />
+        </div>
+      )}
+      <Steps pages={pages} finishLabel="Install" onFinish={() => onInstall(choices, trustUnverified)} onCancel={onCancel} />
+    </>
+  );
+}
+
+function InstallOutcome({ prepared, outcome }: { prepared: Prepared; outcome: Result<InstallAnswer> }) {
+  const name = prepared.facts.name || prepared.facts.id;
+  if (!outcome.ok) {
+    return (
+      <>
+        <p>
+          {name} {prepared.facts.version} was not installed.
+        </p>
+        <CheckRefusal error={outcome.error} />
+      </>
+    );
+  }
+  const lines = workerMessages(outcome.data);
+  return (
+    <>
+      <p class="installed-note" role="status">
+        {name} {prepared.facts.version} is installed. <a href={routeHref({ screen: 'package', id: prepared.facts.id })}>Show the package</a>
+      </p>
+      {lines.length > 0 && <MessageList lines={lines} />}
+    </>
+  );
+}
+
+function MessageList({ lines }: { lines: string[] }) {
+  return (
+    <>
+      <h3>Messages from the package</h3>
+      <ul class="worker-messages">
+        {lines.map((l, i) => (
+          <li key={i}>{l}</li>
+        ))}
+      </ul>
+    </>
+  );
+}
+
+// Polls the install task's progress while `active`; stops when it ends.
+function useInstallProgress(api: Api, packageId: string, active: boolean, onProgress: (value: number | null) => void) {
+  useEffect(() => {
+    if (!active) return;
+    let stopped = false;
+    let timer: ReturnType<typeof setTimeout> | undefined;
+    const poll = async () => {
+      const status = await api.call<{ progress?: number; finished?: boolean }>(kApi, 'status', 1, { task_id: `@KIVOPKG_DOWNLOAD_${packageId}` });
+      if (stopped) return;
+      if (status.ok && typeof status.data.progress === 'number') onProgress(status.data.progress);
+      timer = setTimeout(poll, kPollMs);
+    };
+    timer = setTimeout(poll, kPollMs);
+    return () => {
+      stopped = true;
+      clearTimeout(timer);
+    };
+  }, [api, packageId, active]);
+}
+
+function dialogTitle(phase: Phase): string {
+  switch (phase.kind) {
+    case 'uploading':
+    case 'checking':
+      return `Uploading ${phase.file.name}`;
+    case 'refused':
+      return `${phase.file.name} cannot be installed`;
+    case 'idle':
+      return '';
+    default:
+      return `Install ${phase.prepared.facts.name || phase.prepared.facts.id}`;
+  }
+}
+
 export function ManualInstallScreen() {
-  return <p class="hint">This screen is not built yet.</p>;
+  const { api } = useSession();
+  const [file, setFile] = useState<File | null>(null);
+  const [phase, setPhase] = useState<Phase>({ kind: 'idle' });
+  const abort = useRef<AbortController | null>(null);
+  // The upload task the appliance still keeps a file for; cleaned when the
+  // user leaves the wizard, also by leaving the screen.
+  const pendingUpload = useRef<string | null>(null);
+
+  useEffect(
+    () => () => {
+      abort.current?.abort();
+      if (pendingUpload.current) clean(api, pendingUpload.current);
+    },
+    [api],
+  );
+
+  const installing = phase.kind === 'installing' ? phase : null;
+  useInstallProgress(api, installing?.prepared.facts.id ?? '', installing !== null, (progress) =>
+    setPhase((p) => (p.kind === 'installing' ? { ...p, progress } : p)),
+  );
+
+  const upload = async (chosen: File) => {
+    const controller = new AbortController();
+    abort.current = controller;
+    setPhase({ kind: 'uploading', file: chosen, sent: 0, total: chosen.size });
+    const additional = ['dependent_packages', 'start_dependent_services', 'install_type'];
+    const answer = await api.upload<UploadAnswer>(
+      kApi,
+      'upload',
+      1,
+      { additional },
+      chosen,
+      (sent, total) => setPhase((p) => (p.kind === 'uploading' ? { ...p, sent, total } : p)),
+      controller.signal,
+    );
+    abort.current = null;
+    if (controller.signal.aborted) return;
+    if (!answer.ok) return setPhase({ kind: 'refused', file: chosen, error: answer.error });
+    pendingUpload.current = answer.data.task_id;
+    setPhase({ kind: 'checking', file: chosen });
+    const prepared = await prepare(api, answer.data);
+    if (prepared.ok) return setPhase({ kind: 'wizard', prepared: prepared.data, choices: prepared.data.initial });
+    // The appliance is not ready for this package: nothing more will be done
+    // with the upload.
+    finishUpload();
+    setPhase({ kind: 'refused', file: chosen, error: prepared.error });
+  };
+
+  const finishUpload = () => {
+    if (pendingUpload.current) clean(api, pendingUpload.current);
+    pendingUpload.current = null;
+  };
+
+  const install = async (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean) => {
+    setPhase({ kind: 'installing', prepared, choices, progress: null });
+    const outcome = await api.call<InstallAnswer>(kApi, 'install', 1, {
+      task_id: prepared.upload.task_id,
+      ...installParams(prepared.facts, choices),
+      check_codesign: trustUnverified ? false : undefined,
+    });
+    // A successful install took the file; a failed one leaves it for a retry.
+    if (outcome.ok) pendingUpload.current = null;
+    setPhase({ kind: 'done', prepared, choices, outcome });
+  };
+
+  const close = () => {
+    switch (phase.kind) {
+      case 'uploading':
+        abort.current?.abort();
+        break;
+      case 'checking':
+      case 'installing':
+        // The appliance is answering; an install under way cannot be stopped.
+        return;
+      default:
+        finishUpload();
+    }
+    setPhase({ kind: 'idle' });
+  };
+
+  return (
+    <section class="manual-install">
+      <h1>Manual install</h1>
+      <p class="hint">Install a package from a package file (.kpk) on this computer.</p>
+      <form
+        class="card upload-form"
+        onSubmit={(e) => {
+          e.preventDefault();
+          if (file) void upload(file);
+        }}
+      >
+        <div class="field">
+          <label for="package-file">Package file</label>
+          <input id="package-file" type="file" accept=".kpk" onChange={(e) => setFile(e.currentTarget.files?.[0] ?? null)} />
+        </div>
+        <div class="buttons">
+          <button type="submit" class="primary" disabled={!file || phase.kind !== 'idle'}>
+            Upload
+          </button>
+        </div>
+      </form>
+      {phase.kind !== 'idle' && (
+        <Dialog title={dialogTitle(phase)} onClose={close} wide={phase.kind === 'wizard'}>
+          <PhaseBody phase={phase} onClose={close} onInstall={install} onRetry={(prepared, choices) => setPhase({ kind: 'wizard', prepared, choices })} />
+        </Dialog>
+      )}
+    </section>
+  );
+}
+
+function PhaseBody({
+  phase,
+  onClose,
+  onInstall,
+  onRetry,
+}: {
+  phase: Phase;
+  onClose: () => void;
+  onInstall: (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean) => void;
+  onRetry: (prepared: Prepared, choices: InstallChoices) => void;
+}) {
+  switch (phase.kind) {
+    case 'uploading':
+      return (
+        <>
+          <ProgressBar label="Uploading" value={phase.total > 0 ? phase.sent / phase.total : null} />
+          <CloseButtons label="Cancel" onClose={onClose} />
+        </>
+      );
+    case 'checking':
+      return <ProgressBar label="Checking the package" value={null} />;
+    case 'refused':
+      return (
+        <>
+          <CheckRefusal error={phase.error} />
+          <CloseButtons label="Close" onClose={onClose} />
+        </>
+      );
+    case 'wizard':
+      return <InstallWizard prepared={phase.prepared} start={phase.choices} onInstall={(c, t) => onInstall(phase.prepared, c, t)} onCancel={onClose} />;
+    case 'installing':
+      return (
+        <>
+          <ProgressBar label="Installing" value={phase.progress} />
+          <p class="hint">An install under way cannot be stopped; it ends by itself.</p>
+        </>
+      );
+    case 'done':
+      return (
+        <>
+          <InstallOutcome prepared={phase.prepared} outcome={phase.outcome} />
+          <div class="buttons">
+            {!phase.outcome.ok && (
+              <button type="button" onClick={() => onRetry(phase.prepared, phase.choices)}>
+                Back to the wizard
+              </button>
+            )}
+            <button type="button" class="primary" onClick={onClose}>
+              Close
+            </button>
+          </div>
+        </>
+      );
+    default:
+      return null;
+  }
+}
+
+function CloseButtons({ label, onClose }: { label: string; onClose: () => void }) {
+  return (
+    <div class="buttons">
+      <button type="button" onClick={onClose}>
+        {label}
+      </button>
+    </div>
+  );
 }

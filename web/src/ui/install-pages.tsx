@@ -18,15 +18,14 @@
 // - `installParams` turns the choices into the parameters `install` takes
 //   (`volume_path`, `extra_values`: the wizard's answers as JSON text).
 // - `CheckRefusal` shows why the environment check (or the upload's
-//   inspection, which makes the same tests) refused, with the packages,
-//   services or OS versions the answer names.
+//   inspection, which makes the same tests, or the install) refused, with
+//   the packages, services or system versions the answer names.
 // - `loadDefaultVolume` asks KIVO.Core.Package.Setting.Volume "get"; an
 //   appliance with none set answers an empty string, not a failure.
 
 import './install-pages.css';
 import type { Api, ApiFailure, Result } from '../api/client';
-import { PackageCode } from '../api/codes';
-import { ErrorText } from './error-text';
+import { explain } from '../api/messages';
 import type { StepPage } from './steps';
 import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from './wizard';
 
@@ -210,60 +209,18 @@ export function installPages(facts: PackageFacts, volumes: Volume[], choices: In
   ];
 }
 
-function text(value: unknown): string {
-  if (typeof value === 'string') return value;
-  if (Array.isArray(value)) return value.map(text).filter(Boolean).join(', ');
-  if (isObject(value)) return Object.keys(value).join(', ');
-  return value === undefined || value === null ? '' : String(value);
-}
-
-// The facts an answer's details add to its code's message, as sentences.
-export function refusalFacts(error: ApiFailure): string[] {
-  const e = error.errors ?? {};
-  const facts: string[] = [];
-  const add = (prefix: string, value: unknown) => {
-    const t = text(value);
-    if (t !== '') facts.push(`${prefix}${t}.`);
-  };
-  switch (error.code) {
-    case PackageCode.Conflict:
-      add('It cannot be installed beside: ', e.packages);
-      break;
-    case PackageCode.ServiceNotRunning:
-      add('Services that must run first: ', e.services);
-      break;
-    case PackageCode.DependencyMissing:
-      add('Packages to install first: ', e.uninstall_packages);
-      add('Packages to start first: ', e.unstart_packages);
-      break;
-    case PackageCode.DependentsRunning:
-    case PackageCode.InstallDependency:
-      add('Packages concerned: ', e.packages);
-      break;
-    case PackageCode.OsTooNew:
-      add('The highest system version it runs on is ', e.firmware);
-      break;
-    case PackageCode.OsTooOld:
-      add('It needs system version ', e.firmware);
-      break;
-    case PackageCode.PortInUse:
-      add('Port in use: ', e.port);
-      break;
-  }
-  if (typeof e.message === 'string' && e.message !== '') facts.push(`The package tool says: ${e.message}`);
-  return facts;
-}
-
-// A refusal of the environment check or of a package file, in words.
+// A refusal of the environment check, of a package file or of an install,
+// in words: what happened, then each thing the answer names as in the way,
+// one line each.
 export function CheckRefusal({ error }: { error: ApiFailure }) {
-  const facts = refusalFacts(error);
+  const { summary, details } = explain(error);
   return (
-    <div class="refusal">
-      <ErrorText error={error} />
-      {facts.length > 0 && (
+    <div class="refusal" role="alert" data-code={error.code}>
+      <p class="error">{summary}</p>
+      {details.length > 0 && (
         <ul>
-          {facts.map((f) => (
-            <li key={f}>{f}</li>
+          {details.map((d) => (
+            <li key={d}>{d}</li>
           ))}
         </ul>
       )}
