@@ -6,6 +6,7 @@
 #include "accounts/accounts.h"
 #include "host/host_config.h"
 #include "host/login_throttle.h"
+#include "host/user_settings_api.h"
 #include "webapi/web_man.h"
 
 namespace {
@@ -31,6 +32,7 @@ void InfoQuery(const ModuleTable& modules, APIResponse* response) {
   Json::Value data(Json::objectValue);
   AddRange(&data, kInfoAPI, 1, 1);
   AddRange(&data, kAuthAPI, 1, 1);
+  AddRange(&data, kUserSettingsAPI, 1, 1);
   for (const APIVersionRange& r : modules.Versions())
     AddRange(&data, r.api, r.min_version, r.max_version);
   response->SetSuccess(data);
@@ -161,17 +163,34 @@ bool FindSession(const CgiRequest& cgi, const APIRequest& request, Session* sess
   return false;
 }
 
+// Finds the caller's session and, when it came in the cookie, checks the
+// token that proves the page read our answer; on refusal sets the error and
+// answers false.
+bool FindProvenSession(const CgiRequest& cgi, const APIRequest& request, Session* session,
+                       APIResponse* response) {
+  bool from_cookie = false;
+  if (!FindSession(cgi, request, session, &from_cookie, response)) return false;
+  if (from_cookie && !ConstantTimeEquals(cgi.token, session->token)) {
+    response->SetError(kErrNotPermitted, Reason("missing or wrong X-KIVO-Token"));
+    return false;
+  }
+  return true;
+}
+
 void Logout(const CgiRequest& cgi, const APIRequest& request, APIResponse* response) {
   Session session;
-  bool from_cookie = false;
-  if (!FindSession(cgi, request, &session, &from_cookie, response)) return;
-  if (from_cookie && !ConstantTimeEquals(cgi.token, session.token)) {
-    response->SetError(kErrNotPermitted, Reason("missing or wrong X-KIVO-Token"));
-    return;
-  }
+  if (!FindProvenSession(cgi, request, &session, response)) return;
   SessionStore(LoadSessionLimits()).Remove(session.id);
   response->AddHeader("Set-Cookie: id=; Path=/; HttpOnly; SameSite=Strict; Max-Age=0");
   response->SetSuccess();
+}
+
+// Settings belong to the caller's own account, so any signed-in account may
+// write them; a cookie session still proves its page with the token.
+void UserSettings(const CgiRequest& cgi, const APIRequest& request, APIResponse* response) {
+  Session session;
+  if (!FindProvenSession(cgi, request, &session, response)) return;
+  UserSettingsSet(request, session.user, response);
 }
 
 // Tells a page that was reloaded who it is signed in as and hands it the
@@ -221,7 +240,9 @@ void HandOverCaller(const CgiRequest& cgi, APIRequest* request) {
 
 }  // namespace
 
-bool IsHostAPI(const std::string& api) { return api == kInfoAPI || api == kAuthAPI; }
+bool IsHostAPI(const std::string& api) {
+  return api == kInfoAPI || api == kAuthAPI || api == kUserSettingsAPI;
+}
 
 void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* modules,
                 APIResponse* response) {
@@ -229,13 +250,16 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
   const std::string& method = request->GetAPIMethod();
   bool known =
       (api == kInfoAPI && method == "query") ||
-      (api == kAuthAPI && (method == "login" || method == "logout" || method == "session"));
+      (api == kAuthAPI && (method == "login" || method == "logout" || method == "session")) ||
+      (api == kUserSettingsAPI && method == "set");
   if (!known) {
     response->SetError(kErrNoSuchMethod);
   } else if (request->GetAPIVersion() != 1) {
     response->SetError(kErrBadVersion);
   } else if (api == kInfoAPI) {
     InfoQuery(*modules, response);
+  } else if (api == kUserSettingsAPI) {
+    UserSettings(cgi, *request, response);
   } else if (method == "login") {
     Login(cgi, *request, response);
   } else if (method == "session") {

@@ -7,6 +7,8 @@
 //  "KIVO.API.Auth" "logout"  ends the calling session
 //  "KIVO.API.Auth" "session" the cookie session's {"account", "token",
 //                            "administrator"}, for a page that was reloaded
+//  "KIVO.API.UserSettings" "set"  the caller's own per-user settings, for any
+//                            signed-in account (host/user_settings_api.h)
 #pragma once
 
 #include <string>

@@ -1,0 +1,119 @@
+// The per-user settings that the desktop's applications write through the
+// host: each account writes only its own document, members merge into the
+// application's object, and the package center's information reads back the
+// terms-of-service agreement stored this way.
+
+#include <ctime>
+#include <fstream>
+#include <sstream>
+
+#include <gtest/gtest.h>
+#include <json/reader.h>
+#include <json/writer.h>
+
+#include "testing/cgi_client.h"
+#include "testing/temp_root.h"
+
+namespace {
+
+constexpr char kApp[] = "KIVO.PXS.PkgManApp.Instance";
+constexpr int kParameter = 120;
+constexpr int kNotPermitted = 105;
+constexpr int kNotSignedIn = 119;
+
+class UserSettingsTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_.AddAccount("admin", "secret", {"administrators"});
+    root_.AddAccount("guest", "guest-pw", {"users"});
+  }
+
+  Json::Value Document(const std::string& user) const {
+    std::ifstream in(root_.Path("/usr/kivo/etc/users/" + user + "/settings.json"));
+    std::stringstream text;
+    text << in.rdbuf();
+    Json::Value doc;
+    std::string errors;
+    Json::CharReaderBuilder builder;
+    std::istringstream stream(text.str());
+    if (!Json::parseFromStream(builder, stream, &doc, &errors)) return Json::Value();
+    return doc;
+  }
+
+  static CgiAnswer Set(const ApiClient& client, const std::string& app,
+                       const std::string& settings) {
+    return client.Call("KIVO.API.UserSettings", "set", 1, {{"app", app}, {"settings", settings}});
+  }
+
+  TempRoot root_;
+};
+
+TEST_F(UserSettingsTest, MembersMergeIntoTheCallersOwnApplicationObject) {
+  ApiClient admin("admin", "secret");
+  ASSERT_TRUE(admin.signed_in());
+  root_.Write("/usr/kivo/etc/users/admin/settings.json",
+              std::string(R"({"other":{"x":1},")") + kApp + R"(":{"tos_hash":"h1","keep":true}})");
+
+  CgiAnswer a = Set(admin, kApp, R"({"termofservice":true,"agreed_tos_hash":"h1"})");
+  ASSERT_TRUE(a.Success()) << a.body;
+  Json::Value doc = Document("admin");
+  EXPECT_EQ(1, doc["other"]["x"].asInt());
+  EXPECT_TRUE(doc[kApp]["keep"].asBool());
+  EXPECT_EQ("h1", doc[kApp]["tos_hash"].asString());
+  EXPECT_TRUE(doc[kApp]["termofservice"].asBool());
+  EXPECT_EQ("h1", doc[kApp]["agreed_tos_hash"].asString());
+
+  // An account that is not an administrator keeps settings too, its own.
+  ApiClient guest("guest", "guest-pw");
+  ASSERT_TRUE(guest.signed_in());
+  ASSERT_TRUE(Set(guest, "Notes", R"({"font":"large"})").Success());
+  EXPECT_EQ("large", Document("guest")["Notes"]["font"].asString());
+  EXPECT_FALSE(Document("admin").isMember("Notes"));
+}
+
+TEST_F(UserSettingsTest, BadParametersAndMissingProofAreRefusedAndWriteNothing) {
+  ApiClient admin("admin", "secret");
+  ASSERT_TRUE(admin.signed_in());
+  EXPECT_EQ(kParameter, Set(admin, "../../etc", R"({"a":1})").Code());
+  EXPECT_EQ(kParameter, Set(admin, "", R"({"a":1})").Code());
+  EXPECT_EQ(kParameter, Set(admin, kApp, R"([1,2])").Code());
+  EXPECT_EQ(kParameter, Set(admin, kApp, "not json").Code());
+  CgiAnswer big = Set(admin, kApp, R"({"a":")" + std::string(70 * 1024, 'x') + R"("})");
+  EXPECT_EQ(kParameter, big.Code()) << big.body;
+  EXPECT_TRUE(Document("admin").isNull());
+
+  // A cookie without the token is what a forged cross-site request carries.
+  CgiAnswer forged = RunEntryCgi(
+      {{"REQUEST_METHOD", "GET"},
+       {"QUERY_STRING", "api=KIVO.API.UserSettings&version=1&method=set&app=A&settings={}"},
+       {"HTTP_COOKIE", "id=" + admin.sid()}});
+  EXPECT_EQ(kNotPermitted, forged.Code()) << forged.body;
+  CgiAnswer anonymous = RunEntryCgi(
+      {{"REQUEST_METHOD", "GET"},
+       {"QUERY_STRING", "api=KIVO.API.UserSettings&version=1&method=set&app=A&settings={}"}});
+  EXPECT_EQ(kNotSignedIn, anonymous.Code());
+  EXPECT_TRUE(Document("admin").isNull());
+}
+
+// The agreement a page stores here is what the package center's information
+// reads: agreeing to the current terms stops them being shown.
+TEST_F(UserSettingsTest, AnAgreementStoredHereEndsTheTermsPrompt) {
+  ApiClient admin("admin", "secret");
+  ASSERT_TRUE(admin.signed_in());
+  // A fresh cached hash, so the information asks no server.
+  root_.Write("/usr/kivo/etc/users/admin/settings.json",
+              std::string(R"({")") + kApp + R"(":{"tos_hash":"h1","tos_hash_timestamp":)" +
+                  std::to_string(time(nullptr)) + "}}");
+  auto show_tos = [&] {
+    return admin.Call("KIVO.Core.Package.Info", "get", 1).Data()["show_tos"].asString();
+  };
+  EXPECT_EQ("new", show_tos());
+  ASSERT_TRUE(
+      Set(admin, kApp, R"({"termofservice":true,"termofservice_4_2":true,"agreed_tos_hash":"h1"})")
+          .Success());
+  EXPECT_EQ("no", show_tos());
+  ASSERT_TRUE(Set(admin, kApp, R"({"agreed_tos_hash":"h0"})").Success());
+  EXPECT_EQ("change", show_tos());
+}
+
+}  // namespace
