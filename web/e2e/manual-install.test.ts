@@ -203,4 +203,16 @@ test('packages the appliance refuses say why in words and leave no upload behind
   await dialog.getByRole('button', { name: 'Close' }).click();
   assert.deepEqual(uploadArea(), []);
   assert.doesNotMatch(installed(), /^demo-(future|legacy) /m);
+
+  // The file itself is fine, but the environment check refuses: Demo Notes
+  // runs on the Demo Web that this file would upgrade. The accepted upload
+  // is cleaned up, since nothing more can be done with it.
+  await chooseAndUpload(appliance.file(`${kSamples}/demo-web-update.kpk`));
+  dialog = page.getByRole('dialog', { name: 'demo-web-update.kpk cannot be installed' });
+  await dialog.getByText('Running packages depend on this one. Stop them first.').waitFor();
+  await dialog.getByText('Running dependents: Demo Notes.').waitFor();
+  await screenshot(page, 'manual-check-refusal');
+  await dialog.getByRole('button', { name: 'Close' }).click();
+  await waitForEmptyUploadArea();
+  assert.match(installed(), /^demo-web 1\.0\.0-0001 /m);
 });
