@@ -179,11 +179,25 @@ test('an unsigned package asks for confirmation, and abandoning its wizard remov
   await waitForEmptyUploadArea();
   assert.doesNotMatch(installed(), /^demo-unsigned /m);
 
-  // Escape abandons the wizard the same way.
+  // Escape abandons the wizard the same way, and so do leaving the screen
+  // and reloading the page.
   await chooseAndUpload(appliance.file(`${kSamples}/demo-unsigned.kpk`));
   await dialog.getByText('Step 1 of 3: Signature').waitFor();
   await page.keyboard.press('Escape');
   await dialog.waitFor({ state: 'detached' });
+  await waitForEmptyUploadArea();
+
+  await chooseAndUpload(appliance.file(`${kSamples}/demo-unsigned.kpk`));
+  await dialog.getByText('Step 1 of 3: Signature').waitFor();
+  await page.evaluate(() => (location.hash = '#/installed'));
+  await dialog.waitFor({ state: 'detached' });
+  await waitForEmptyUploadArea();
+  await page.goBack();
+
+  await chooseAndUpload(appliance.file(`${kSamples}/demo-unsigned.kpk`));
+  await dialog.getByText('Step 1 of 3: Signature').waitFor();
+  await page.reload();
+  await page.getByRole('heading', { name: 'Manual install' }).waitFor();
   await waitForEmptyUploadArea();
 });
 

@@ -65,7 +65,9 @@ export class Api {
   // user to sign in again instead of showing the error on every panel.
   onSessionEnded: (code: number) => void = () => {};
 
-  async call<T = unknown>(api: string, method: string, version: number, params: Params = {}): Promise<Result<T>> {
+  // `keepalive` lets the request outlive the page, for a clean-up sent as
+  // the page is left.
+  async call<T = unknown>(api: string, method: string, version: number, params: Params = {}, keepalive = false): Promise<Result<T>> {
     let text: string;
     try {
       const response = await fetch(kEndpoint, {
@@ -73,6 +75,7 @@ export class Api {
         credentials: 'same-origin',
         headers: { 'X-KIVO-Token': this.token },
         body: encode(api, method, version, params),
+        keepalive,
       });
       text = await response.text();
     } catch {

@@ -108,8 +108,9 @@ async function prepare(api: Api, upload: UploadAnswer): Promise<Result<Prepared>
 
 function clean(api: Api, taskId: string): void {
   // The appliance answers at once and removes the file in the background;
-  // an upload nobody comes back for is swept after a day anyway.
-  void api.call(kApi, 'clean', 1, { task_id: taskId });
+  // an upload nobody comes back for is swept after a day anyway. The call is
+  // kept alive so that it also goes out when the page itself is left.
+  void api.call(kApi, 'clean', 1, { task_id: taskId }, true);
 }
 
 function workerMessages(answer: InstallAnswer): string[] {
@@ -248,13 +249,19 @@ export function ManualInstallScreen() {
   // user leaves the wizard, also by leaving the screen.
   const pendingUpload = useRef<string | null>(null);
 
-  useEffect(
-    () => () => {
+  // Leaving the screen, reloading or closing the page abandons the wizard too.
+  useEffect(() => {
+    const leave = () => {
       abort.current?.abort();
       if (pendingUpload.current) clean(api, pendingUpload.current);
-    },
-    [api],
-  );
+      pendingUpload.current = null;
+    };
+    addEventListener('pagehide', leave);
+    return () => {
+      removeEventListener('pagehide', leave);
+      leave();
+    };
+  }, [api]);
 
   const installing = phase.kind === 'installing' ? phase : null;
   useInstallProgress(api, installing?.prepared.facts.id ?? '', installing !== null, (progress) =>
