@@ -120,7 +120,7 @@ test('stopping demo-web is refused while demo-notes runs; stopped and started in
   // A start whose dependency is stopped is refused and names it.
   await row('Demo Notes').getByRole('button', { name: 'Start Demo Notes' }).click();
   const failed = page.getByRole('dialog', { name: 'Could not start Demo Notes' });
-  await failed.getByText('It needs these packages running: demo-web.').waitFor();
+  await failed.getByText('Not running: demo-web.').waitFor();
   await failed.getByRole('button', { name: 'Close' }).click();
 
   await row('Demo Web').getByRole('button', { name: 'Start Demo Web' }).click();

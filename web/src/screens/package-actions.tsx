@@ -3,7 +3,7 @@ import { useState } from 'preact/hooks';
 import type { Api, ApiFailure, Result } from '../api/client';
 import { PackageCode } from '../api/codes';
 import { Dialog } from '../ui/dialog';
-import { ErrorText } from '../ui/error-text';
+import { explain } from '../api/messages';
 import { Steps, type StepPage } from '../ui/steps';
 import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from '../ui/wizard';
 import { isBusyStatus } from '../ui/status-badge';
@@ -56,53 +56,14 @@ async function checkFeasible(api: Api, action: 'stop' | 'uninstall', id: string)
   return { allowed: false, hard: code === PackageCode.NotFeasible ? strings(errors?.reasons) : [], error: answer.error };
 }
 
-function names(value: unknown): string {
-  if (typeof value === 'string') return value;
-  if (Array.isArray(value)) return strings(value).join(', ');
-  if (value && typeof value === 'object') return Object.keys(value).join(', ');
-  return '';
-}
-
-// The details a refused start, stop or uninstall carries, in words: which
-// packages stand in the way, which versions or services are missing, and
-// what the package's own scripts told the user.
-export function failureDetails(error: ApiFailure): string[] {
-  const e = error.errors ?? {};
-  const details: string[] = [];
-  const dependents = names(e.packages);
-  if (dependents && error.code === PackageCode.StopDependents) details.push(`Still running and needing it: ${dependents}.`);
-  else if (dependents) details.push(`Installed packages that need it: ${dependents}.`);
-  const notInstalled = names(e.uninstall_packages);
-  if (notInstalled) details.push(`It needs these packages installed: ${notInstalled}.`);
-  const notRunning = names(e.unstart_packages);
-  if (notRunning) details.push(`It needs these packages running: ${notRunning}.`);
-  if (typeof e.require_version === 'string' && e.require_version)
-    details.push(`It needs version ${e.require_version}; installed is ${String(e.current_version ?? 'none')}.`);
-  const services = names(e.services);
-  if (services) details.push(`It needs these system services: ${services}.`);
-  return details.concat(strings(e.worker_message));
-}
-
-// A failure with its details and, when there is one, the operation's log.
+// A failure in words, with what stands in the way (packages, versions,
+// services, what the package's scripts said) as a list beneath.
 export function ActionFailure({ error }: { error: ApiFailure }) {
-  const details = failureDetails(error);
-  const log = typeof error.errors?.message === 'string' ? error.errors.message.trim() : '';
+  const { summary, details } = explain(error);
   return (
-    <div class="action-failure">
-      <ErrorText error={error} />
-      {details.length > 0 && (
-        <ul class="reasons">
-          {details.map((d) => (
-            <li key={d}>{d}</li>
-          ))}
-        </ul>
-      )}
-      {log && (
-        <details>
-          <summary>Operation log</summary>
-          <pre class="log">{log}</pre>
-        </details>
-      )}
+    <div class="action-failure" role="alert" data-code={error.code}>
+      <p class="error">{summary}</p>
+      {details.length > 0 && <Reasons reasons={details} />}
     </div>
   );
 }

@@ -1,0 +1,146 @@
+// Benchmark, not a test: how fast the installed-packages screen is with 300
+// packages. Makes a system root, builds and installs 300 generated packages
+// with kivoctl, serves it with lighttpd and the built page (build/page, from
+// scripts/build-page.sh, or the folder in KIVO_PAGE_DIR), and prints:
+//   - the list call's time as the page sees it,
+//   - the time from loading the page (signed in) to all rows on screen,
+//   - a scroll through the whole list: its duration and the longest frame.
+//
+//   cd web && node --import tsx e2e/bench-installed.ts [COUNT]
+
+import { execFile, execFileSync, spawn } from 'node:child_process';
+import { cpSync, mkdirSync, mkdtempSync, rmSync, writeFileSync } from 'node:fs';
+import { createServer } from 'node:net';
+import { tmpdir } from 'node:os';
+import { join } from 'node:path';
+import { promisify } from 'node:util';
+import { kRepo } from './appliance.ts';
+import type { Response } from 'playwright-core';
+import { launch, signIn } from './browser.ts';
+
+const kCount = Number(process.argv[2] ?? 300);
+const kKivoctl = join(kRepo, 'build/bin/kivoctl');
+const run = promisify(execFile);
+
+function freePort(): Promise<number> {
+  return new Promise((done, fail) => {
+    const server = createServer();
+    server.once('error', fail);
+    server.listen(0, '127.0.0.1', () => {
+      const address = server.address();
+      server.close(() => done(typeof address === 'object' && address ? address.port : 0));
+    });
+  });
+}
+
+// A package source with nothing to run: the screen's cost does not depend
+// on what a package does.
+function writeSource(folder: string, n: number): string {
+  const id = `bench-${String(n).padStart(4, '0')}`;
+  const source = join(folder, id);
+  mkdirSync(join(source, 'package'), { recursive: true });
+  writeFileSync(join(source, 'package/README'), `${id}\n`);
+  const info = { package: id, version: `1.0.${n}`, displayname: `Bench package ${n}`, description: `Generated package ${n}.`, startable: 'no' };
+  writeFileSync(join(source, 'INFO'), Object.entries(info).map(([k, v]) => `${k}="${v}"\n`).join(''));
+  return source;
+}
+
+async function installAll(root: string, work: string): Promise<void> {
+  // Two at a time: builds overlap, installs take the package tool's lock anyway.
+  const next = { n: 1 };
+  const worker = async () => {
+    while (next.n <= kCount) {
+      const n = next.n++;
+      const file = join(work, `${n}.kpk`);
+      await run(kKivoctl, ['build', writeSource(work, n), file]);
+      await run(kKivoctl, ['--root', root, 'install', file, '--no-codesign']);
+    }
+  };
+  await Promise.all([worker(), worker()]);
+}
+
+async function main(): Promise<void> {
+  const root = mkdtempSync(join(tmpdir(), 'kivo-bench-installed-'));
+  const work = join(root, 'sources');
+  const port = await freePort();
+  execFileSync(kKivoctl, ['init-root', root], { stdio: 'ignore' });
+  execFileSync(kKivoctl, ['--root', root, 'user-add', 'admin', '--password', 'admin', '--group', 'administrators'], { stdio: 'ignore' });
+  writeFileSync(join(root, 'lighttpd.conf'), execFileSync(kKivoctl, ['--root', root, 'web-config', '--port', String(port)]));
+  cpSync(process.env.KIVO_PAGE_DIR ?? join(kRepo, 'build/page'), join(root, 'usr/kivo/www'), { recursive: true });
+  const started = performance.now();
+  await installAll(root, work);
+  console.log(`set-up: ${kCount} packages built and installed in ${((performance.now() - started) / 1000).toFixed(1)} s`);
+
+  const server = spawn('/usr/sbin/lighttpd', ['-D', '-f', join(root, 'lighttpd.conf')], { stdio: 'ignore' });
+  const browser = await launch();
+  try {
+    const url = `http://127.0.0.1:${port}/`;
+    for (let i = 0; i < 100; ++i) {
+      try {
+        if ((await fetch(url)).ok) break;
+      } catch {
+        await new Promise((r) => setTimeout(r, 50));
+      }
+    }
+    const page = await browser.newPage({ viewport: { width: 1280, height: 800 } });
+    // Marks, in the page's own clock, the moment the last row is in the
+    // document. Injected by the browser's debugging protocol, which the
+    // page's CSP does not govern.
+    await page.addInitScript((count: number) => {
+      const marks = window as unknown as { rowsAt?: number };
+      new MutationObserver((_, observer) => {
+        if (document.getElementsByClassName('installed-row').length < count) return;
+        marks.rowsAt = performance.timeOrigin + performance.now();
+        observer.disconnect();
+      }).observe(document, { childList: true, subtree: true });
+    }, kCount);
+    await page.goto(url);
+    await signIn(page);
+    const rows = page.getByRole('list', { name: 'Installed packages' }).getByRole('listitem');
+    const isList = (r: Response) => /api=KIVO\.Core\.Package&.*method=list/.test(r.request().postData() ?? '');
+    for (let round = 1; round <= 3; ++round) {
+      const listCall = page.waitForResponse(isList);
+      await page.reload();
+      const answered = await listCall;
+      const size = (await answered.body()).length;
+      await rows.nth(kCount - 1).waitFor({ state: 'attached' });
+      const timing = answered.request().timing();
+      const navigation = await page.evaluate(() => performance.timeOrigin);
+      const rowsAt = await page.evaluate(() => (window as unknown as { rowsAt: number }).rowsAt);
+      const answeredAt = timing.startTime + timing.responseEnd;
+      console.log(
+        `load ${round}: list call took ${(timing.responseEnd - timing.requestStart).toFixed(0)} ms (${(size / 1024).toFixed(0)} KiB), ` +
+          `answered ${(answeredAt - navigation).toFixed(0)} ms after the page began to load; ` +
+          `all ${kCount} rows in the document ${(rowsAt - answeredAt).toFixed(0)} ms after the answer, ` +
+          `${(rowsAt - navigation).toFixed(0)} ms after the page began to load`,
+      );
+    }
+    // Scroll from top to bottom in steps of 400 pixels, one per frame, and
+    // time every frame meanwhile.
+    const scroll = await page.evaluate(async () => {
+      window.scrollTo(0, 0);
+      const frames: number[] = [];
+      let last = performance.now();
+      const begin = last;
+      while (window.scrollY + window.innerHeight < document.documentElement.scrollHeight - 1) {
+        window.scrollBy(0, 400);
+        await new Promise((r) => requestAnimationFrame(r));
+        const now = performance.now();
+        frames.push(now - last);
+        last = now;
+      }
+      frames.sort((a, b) => a - b);
+      return { ms: last - begin, frames: frames.length, longest: frames[frames.length - 1], median: frames[frames.length >> 1] };
+    });
+    console.log(
+      `scroll: ${scroll.frames} steps of 400 px in ${scroll.ms.toFixed(0)} ms, ` +
+        `median frame ${scroll.median.toFixed(1)} ms, longest ${scroll.longest.toFixed(1)} ms`,
+    );
+  } finally {
+    await browser.close();
+    server.kill('SIGTERM');
+    rmSync(root, { recursive: true, force: true });
+  }
+}
+
+await main();
