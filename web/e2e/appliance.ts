@@ -13,7 +13,7 @@ import { join, resolve } from 'node:path';
 export const kRepo = resolve(import.meta.dirname, '../..');
 export const kPassword = 'admin';
 
-function freePort(): Promise<number> {
+export function freePort(): Promise<number> {
   return new Promise((done, fail) => {
     const server = createServer();
     server.once('error', fail);

@@ -10,28 +10,16 @@
 
 import { execFile, execFileSync, spawn } from 'node:child_process';
 import { cpSync, mkdirSync, mkdtempSync, rmSync, writeFileSync } from 'node:fs';
-import { createServer } from 'node:net';
 import { tmpdir } from 'node:os';
 import { join } from 'node:path';
 import { promisify } from 'node:util';
-import { kRepo } from './appliance.ts';
+import { freePort, kRepo } from './appliance.ts';
 import type { Response } from 'playwright-core';
 import { launch, signIn } from './browser.ts';
 
 const kCount = Number(process.argv[2] ?? 300);
 const kKivoctl = join(kRepo, 'build/bin/kivoctl');
 const run = promisify(execFile);
-
-function freePort(): Promise<number> {
-  return new Promise((done, fail) => {
-    const server = createServer();
-    server.once('error', fail);
-    server.listen(0, '127.0.0.1', () => {
-      const address = server.address();
-      server.close(() => done(typeof address === 'object' && address ? address.port : 0));
-    });
-  });
-}
 
 // A package source with nothing to run: the screen's cost does not depend
 // on what a package does.
