@@ -9,6 +9,9 @@
 //   server_bench [requests per case] [download MiB] [list|download]
 //   (default 20, 1024, both). SERVER_BENCH_ENTRY names a program lighttpd
 //   runs instead of the build's entry.cgi (a profiler wrapped around it).
+//   SERVER_BENCH_ANSWERS names a folder that receives each case's answer
+//   body (list-<entries>-<cached|reload>.json), to compare two builds'
+//   answers byte for byte.
 
 #include <algorithm>
 #include <chrono>
@@ -71,8 +74,20 @@ struct Percentiles {
   double p50, p99;
 };
 
-Percentiles Time(int port, const std::string& target, const std::string& headers, int n) {
-  LoopbackGet(port, target, headers);  // warm-up (and the first fetch)
+// Keeps the answer body of one case when SERVER_BENCH_ANSWERS asks for it.
+void KeepAnswer(const std::string& response, const std::string& name) {
+  const char* folder = getenv("SERVER_BENCH_ANSWERS");
+  size_t body = response.find("\r\n\r\n");
+  if (!folder || body == std::string::npos) return;
+  WriteOrExit(std::string(folder) + "/" + name, response.substr(body + 4));
+}
+
+Percentiles Time(int port, const std::string& target, const std::string& headers, int n,
+                 const std::string& name) {
+  // The warm-up also makes the first fetch.
+  KeepAnswer(LoopbackExchange(
+                 port, "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n"),
+             name);
   std::vector<double> ms;
   for (int r = 0; r < n; ++r) {
     Clock::time_point t = Clock::now();
@@ -105,8 +120,10 @@ void ListFigures(int requests) {
                "vendor_url=\"http://127.0.0.1:" + std::to_string(server.port()) +
                    "/feed/catalogue.json\"\n"
                    "catalogue_max_age=\"3600\"\n");
-    Percentiles reload = Time(server.port(), target + "&blforcereload=true", headers, requests);
-    Percentiles cached = Time(server.port(), target, headers, requests);
+    const std::string label = "list-" + std::to_string(entries);
+    Percentiles reload = Time(server.port(), target + "&blforcereload=true", headers, requests,
+                              label + "-reload.json");
+    Percentiles cached = Time(server.port(), target, headers, requests, label + "-cached.json");
     printf("%8d %11.1f ms %11.1f ms %11.1f ms %11.1f ms %16.4f\n", entries, cached.p50, cached.p99,
            reload.p50, reload.p99, cached.p50 / entries);
     fflush(stdout);

@@ -13,8 +13,6 @@
 #include <syslog.h>
 #include <unistd.h>
 
-#include <json/writer.h>
-
 #include "host/cgi_request.h"
 #include "host/host_api.h"
 #include "host/host_config.h"
@@ -151,9 +149,7 @@ void Serve(APIRequest* request, APIResponse* response) {
 }
 
 void WriteAnswer(APIResponse& response) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "";
-  std::string body = Json::writeString(builder, response.TakeEnvelope());
+  std::string body = response.TakeEnvelopeText();
   std::string head = "Content-Type: application/json; charset=utf-8\r\n";
   for (const std::string& h : response.Headers()) head += h + "\r\n";
   head += "Cache-Control: no-store\r\n\r\n";

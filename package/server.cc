@@ -6,13 +6,17 @@
 #include <map>
 #include <memory>
 #include <set>
+#include <sstream>
+#include <string_view>
 #include <unistd.h>
 #include <vector>
+
+#include <json/reader.h>
 
 #include "log_line.h"
 #include "package_webapi.h"
 #include "pkgserver/badge.h"
-#include "pkgserver/catalogue.h"
+#include "pkgserver/catalogue_listing.h"
 #include "pkgserver/server_image.h"
 #include "pkgtool/pms.h"
 #include "task_record.h"
@@ -28,8 +32,6 @@ bool FlagParam(APIRequest* request, const char* name) {
   if (v.isIntegral()) return v.asInt64() != 0;
   return v.isString() && (v.asString() == "true" || v.asString() == "1");
 }
-
-std::string Text(const Json::Value& v) { return v.isString() ? v.asString() : ""; }
 
 bool IsTrue(const Json::Value& v) { return v.isBool() && v.asBool(); }
 
@@ -79,23 +81,6 @@ Json::Value PackageUrls(const PackageInfo& p) {
   return urls;
 }
 
-// A dependency list of an entry in the structured form: "conf_<key>" (JSON)
-// wins over "<key>" (text); both are replaced by "<out>".
-void RewriteDependencies(Json::Value& entry, const char* conf_key, const char* text_key,
-                         const char* out_key) {
-  DepPkgVector deps;
-  if (entry.isMember(conf_key) && !entry[conf_key].empty()) {
-    PMSParseDepJSON(entry[conf_key], deps);
-    entry.removeMember(conf_key);
-  } else if (entry[text_key].isString() && !entry[text_key].asString().empty()) {
-    PMSExplodeDepPKGString(entry[text_key].asString(), deps);
-    entry.removeMember(text_key);
-  }
-  Json::Value out;
-  deps.toJSON(out);
-  entry[out_key] = std::move(out);
-}
-
 // Task `id` when the request's one listing of the package tasks holds it. A
 // catalogue has thousands of entries and few of them have a task: asking the
 // task store once per request instead of once per entry keeps the listing's
@@ -104,6 +89,148 @@ NVX::Task* ListedTask(NVX::TaskMgr& mgr, const std::set<std::string>& listed,
                       const std::string& id) {
   return listed.count(id) ? GetTaskWithTaskMgr(mgr, id) : nullptr;
 }
+
+// Marks `overlay` as an upgrade of installed package `p` to the server's
+// `version` unless the installed version is restricted; true when it did.
+bool MarkUpgrade(const PackageInfo& p, const PMSThirdPartyLimits& limits,
+                 const std::string& version, Json::Value& overlay) {
+  PackageBasicInfo have(p.getId(), p.getVersion());
+  if (!have.compare(PackageBasicInfo(overlay["package"].asString(), version), PKG_VER_LT) ||
+      limits.Restricts(p.getId(), p.getVersion())) {
+    return false;
+  }
+  overlay["blupgrade"] = true;
+  return true;
+}
+
+// Lays the appliance's state (an overlay object of the members it sets)
+// over the text of a listing entry, with one writer per request: making one
+// costs more than an entry.
+class EntryOverlay {
+ public:
+  EntryOverlay() : writer_(AnswerJsonWriter().newStreamWriter()) {}
+
+  // `text` (an object written by AnswerJsonWriter()) with the members of
+  // `overlay` but "package" in place of its own or added, as if they had
+  // been set on the parsed entry: the writer puts members in name order, so
+  // the entry's members are merged with the overlay's by name and only the
+  // overlay's values are written.
+  std::string Apply(const std::string& text, const Json::Value& overlay) {
+    std::vector<std::pair<std::string_view, std::string_view>> members;
+    if (!SplitMembers(text, &members)) return Reparsed(text, overlay);
+    std::string out = "{";
+    auto member = members.begin();
+    for (const std::string& name : overlay.getMemberNames()) {
+      if (name == "package") continue;
+      for (; member != members.end() && member->first < name; ++member)
+        Append(member->second, &out);
+      if (member != members.end() && member->first == name) ++member;
+      Append("\"" + name + "\":" + Written(overlay[name]), &out);
+    }
+    for (; member != members.end(); ++member) Append(member->second, &out);
+    return out + "}";
+  }
+
+ private:
+  static void Append(std::string_view member, std::string* out) {
+    if (out->size() > 1) *out += ',';
+    out->append(member.data(), member.size());
+  }
+
+  // The members of object text `text` as (name, member text) in their
+  // order; false for text this cannot split: a member name with an escape
+  // (its order is that of the unescaped name) or not an object.
+  static bool SplitMembers(const std::string& text,
+                           std::vector<std::pair<std::string_view, std::string_view>>* members) {
+    const std::string_view all(text);
+    if (all.size() < 2 || all.front() != '{' || all.back() != '}') return false;
+    for (size_t i = 1, end = all.size() - 1; i < end; ++i) {
+      const size_t start = i;
+      for (int depth = 0; i < end && (depth > 0 || all[i] != ','); ++i) {
+        if (all[i] == '{' || all[i] == '[') ++depth;
+        if (all[i] == '}' || all[i] == ']') --depth;
+        if (all[i] != '"') continue;
+        for (++i; i < end && all[i] != '"'; ++i) i += all[i] == '\\';
+      }
+      const std::string_view member = all.substr(start, i - start);
+      const size_t quote = member.find('"', 1);
+      if (member.size() < 2 || member[0] != '"' || quote == std::string_view::npos ||
+          member.substr(0, quote).find('\\') != std::string_view::npos) {
+        return false;
+      }
+      members->emplace_back(member.substr(1, quote - 1), member);
+    }
+    return true;
+  }
+
+  // The general way for text SplitMembers refuses: parsed, changed, written.
+  std::string Reparsed(const std::string& text, const Json::Value& overlay) {
+    Json::CharReaderBuilder builder;
+    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+    Json::Value entry;
+    if (!reader->parse(text.data(), text.data() + text.size(), &entry, nullptr) ||
+        !entry.isObject()) {
+      return text;
+    }
+    for (const std::string& name : overlay.getMemberNames()) entry[name] = overlay[name];
+    return Written(entry);
+  }
+
+  std::string Written(const Json::Value& value) {
+    std::ostringstream out;
+    writer_->write(value, &out);
+    return out.str();
+  }
+
+  std::unique_ptr<Json::StreamWriter> writer_;
+};
+
+// The answer {"blupgrade": B, "data": [...], "recommend": [...], "total": N}
+// as text, from the entries' texts: the members in name order and written
+// compactly, as AnswerJsonWriter() writes an object. "recommend" holds, for
+// each recommended name in order, the last listed entry of that name, and
+// is left out when none is listed.
+class AnswerText {
+ public:
+  explicit AnswerText(const std::vector<std::string>& recommend) : recommend_(recommend) {
+    for (const std::string& name : recommend) last_of_[name] = kNone;
+  }
+  void Add(const std::string& name, std::string text) {
+    auto recommended = last_of_.find(name);
+    if (recommended != last_of_.end()) recommended->second = data_.size();
+    bytes_ += text.size() + 1;
+    data_.push_back(std::move(text));
+  }
+  std::string Finish(bool any_upgrade) const {
+    std::string chosen;
+    for (const std::string& name : recommend_) {
+      size_t listed = last_of_.at(name);
+      if (listed == kNone) continue;
+      chosen += chosen.empty() ? ",\"recommend\":[" : ",";
+      chosen += data_[listed];
+    }
+    if (!chosen.empty()) chosen += ']';
+    std::string out;
+    out.reserve(bytes_ + chosen.size() + 80);
+    out += any_upgrade ? "{\"blupgrade\":true,\"data\":[" : "{\"blupgrade\":false,\"data\":[";
+    for (size_t i = 0; i < data_.size(); ++i) {
+      if (i) out += ',';
+      out += data_[i];
+    }
+    out += ']';
+    out += chosen;
+    out += ",\"total\":" + std::to_string(data_.size()) + "}";
+    return out;
+  }
+
+ private:
+  static constexpr size_t kNone = SIZE_MAX;
+
+  const std::vector<std::string>& recommend_;
+  std::map<std::string, size_t> last_of_;
+  std::vector<std::string> data_;
+  size_t bytes_ = 0;
+};
 
 }  // namespace
 
@@ -178,18 +305,17 @@ void PackageWebAPI::AnnotateDownload(NVX::TaskMgr& mgr, const std::set<std::stri
 }
 
 void PackageWebAPI::ListServerPackage() {
-  const bool force = FlagParam(request, "blforcereload");
   const bool others = FlagParam(request, "blloadothers");
   const std::string language = request->GetUILanguage();
-  Json::Value answer;
-  bool ok = others ? KIVOPackageServer::PMSQueryOtherPkgServer(force, language.c_str(), answer)
-                   : KIVOPackageServer::PMSQueryKivoPkgServer(force, language.c_str(), answer);
-  if (!ok) return;
-  const bool object_form = answer.isObject() && !answer.empty();
-  if (object_form && (!answer.isMember("packages") || !answer.isMember("recommend"))) return;
-  if (!object_form && !answer.isArray()) return;
-  Json::Value& list = object_form ? answer["packages"] : answer;
-  if (!list.isArray()) return;
+  // The catalogue comes rendered as far as it does not depend on this
+  // appliance (catalogue_listing.h); only the entries of installed packages
+  // and of downloads are parsed here and get the appliance's state.
+  KIVOPackageServer::CatalogueListing listing;
+  if (!KIVOPackageServer::PMSListCatalogue(
+          others ? KIVOPackageServer::ListingSide::kFeeds : KIVOPackageServer::ListingSide::kVendor,
+          FlagParam(request, "blforcereload"), language, &listing)) {
+    return;
+  }
   std::map<std::string, PackageInfo> installed;
   // Without the installed packages the catalogue shows every one as not
   // installed; the log says why.
@@ -200,58 +326,33 @@ void PackageWebAPI::ListServerPackage() {
   const std::vector<std::string> listed = mgr.listTasks("@KIVOPKG_");
   const std::set<std::string> tasks(listed.begin(), listed.end());
   const PMSThirdPartyLimits limits;
-  // The recommendation slot of each recommended name (its first place).
-  std::map<std::string, Json::ArrayIndex> slot_of;
-  Json::Value slots(Json::arrayValue), data(Json::arrayValue);
-  if (object_form && !others && answer["recommend"].isArray()) {
-    const Json::Value& recommend = answer["recommend"];
-    for (Json::ArrayIndex i = 0; i < recommend.size(); ++i) {
-      if (recommend[i].isString()) slot_of.emplace(recommend[i].asString(), i);
-    }
-    slots.resize(recommend.size());
-  }
+  EntryOverlay entries;
+  AnswerText answer(listing.recommend);
   bool any_upgrade = false;
-  for (Json::Value& element : list) {
-    if (!element.isObject() || !element["package"].isString()) continue;
-    // The answer is this request's own: its entries move into the result.
-    Json::Value entry = std::move(element);
-    const std::string name = entry["package"].asString();
-    entry["id"] = name;
-    if (entry.isMember("version") && limits.Restricts(name, Text(entry["version"]))) continue;
-    entry["blupgrade"] = false;
-    entry["source"] = others ? "others" : "kivo";
-    auto p = installed.find(name);
-    if (p != installed.end()) {
-      PackageBasicInfo have(p->second.getId(), p->second.getVersion());
-      if (have.compare(PackageBasicInfo(name, Text(entry["version"])), PKG_VER_LT) &&
-          !limits.Restricts(p->second.getId(), p->second.getVersion())) {
-        entry["blupgrade"] = true;
-        any_upgrade = true;
+  for (KIVOPackageServer::ListingEntry& e : listing.entries) {
+    if (e.has_version && limits.Restricts(e.name, e.version)) continue;
+    auto p = installed.find(e.name);
+    if (p != installed.end() || tasks.count(kDownloadPrefix + e.name)) {
+      Json::Value overlay(Json::objectValue);
+      overlay["package"] = e.name;
+      if (p != installed.end()) {
+        // The entries of installed packages have always had "version", null
+        // when the server gave none (rendering adds it beside an icon).
+        if (!e.has_version && e.icon.empty()) overlay["version"] = Json::Value();
+        any_upgrade = MarkUpgrade(p->second, limits, e.version, overlay) || any_upgrade;
+        AnnotateInstalled(mgr, tasks, p->second, overlay);
       }
-      AnnotateInstalled(mgr, tasks, p->second, entry);
+      AnnotateDownload(mgr, tasks, overlay);
+      e.text = entries.Apply(e.text, overlay);
     }
-    RewriteDependencies(entry, "conf_deppkgs", "deppkgs", "deppkgs");
-    RewriteDependencies(entry, "conf_conxpkgs", "conflictpkgs", "conflictpkgs");
-    if (entry["icon"].isString() && !entry["icon"].asString().empty()) {
-      KIVOPackageTool::PMSGetServerImage(others ? "AVAIL/OTHER" : "AVAIL/KIVO", name.c_str(),
-                                         Text(entry["version"]).c_str(), "thumb_72.png",
-                                         entry["icon"].asCString(), nullptr, 0);
+    if (!e.icon.empty()) {
+      KIVOPackageTool::PMSGetServerImage(others ? "AVAIL/OTHER" : "AVAIL/KIVO", e.name.c_str(),
+                                         e.version.c_str(), "thumb_72.png", e.icon.c_str(), nullptr,
+                                         0);
     }
-    AnnotateDownload(mgr, tasks, entry);
-    auto slot = slot_of.find(name);
-    if (slot != slot_of.end()) slots[slot->second] = entry;
-    data.append(std::move(entry));
+    answer.Add(e.name, std::move(e.text));
   }
-  Json::Value result(Json::objectValue);
-  Json::Value chosen(Json::arrayValue);
-  for (const Json::Value& slot : slots) {
-    if (!slot.isNull()) chosen.append(slot);
-  }
-  if (!chosen.empty()) result["recommend"] = chosen;
-  result["total"] = data.size();
-  result["data"] = std::move(data);
-  result["blupgrade"] = any_upgrade;
-  response->SetSuccess(std::move(result));
+  response->SetSuccessText(answer.Finish(any_upgrade));
 }
 
 void PackageWebAPI::CheckUpdate() {

@@ -100,15 +100,18 @@ bool ParseAnswer(const std::string& body, Json::Value& answer) {
   return true;
 }
 
-// The server's answer as text, from the cache or the server.
+// The server's answer as text, from the cache or the server, and the name
+// of its cache file in CacheDir().
 bool FetchText(const std::string& url, const std::string& language, bool force,
-               const Json::Value& extra, std::string& body) {
+               const Json::Value& extra, std::string& body, std::string* cache_name = nullptr) {
   if (!PMSIsServerUrl(url)) {
     CATALOGUE_LOG("%s: not an http or https address", url.c_str());
     return false;
   }
   PkgServerConfig config = PMSLoadServerConfig();
-  const std::string path = CacheDir() + "/" + CacheKey(QueryUrl(url, language, extra), language);
+  const std::string name = CacheKey(QueryUrl(url, language, extra), language);
+  if (cache_name) *cache_name = name;
+  const std::string path = CacheDir() + "/" + name;
   CachedCatalogue cached;
   bool have = !force && ReadCache(path, &cached);
   long age = have ? static_cast<long>(time(nullptr)) - cached.meta["fetched"].asInt64() : 0;
@@ -170,7 +173,9 @@ bool QueryServer(const std::string& url, bool force, const std::string& language
 
 std::string Text(const Json::Value& v) { return v.isString() ? v.asString() : ""; }
 
-std::vector<std::string> FeedUrls() {
+}  // namespace
+
+std::vector<std::string> PMSFeedUrls() {
   Json::Value feeds;
   std::vector<std::string> urls;
   if (!WebUtils::LoadJsonFile(KIVORootPath("/usr/kivo/etc/packages/feeds"), feeds) ||
@@ -183,7 +188,18 @@ std::vector<std::string> FeedUrls() {
   return urls;
 }
 
-}  // namespace
+std::string PMSVendorCatalogueUrl() {
+  PkgServerConfig config = PMSLoadServerConfig();
+  if (config.vendor_url.empty()) {
+    CATALOGUE_LOG("no vendor_url in %s", PMSServerConfigPath().c_str());
+  }
+  return config.vendor_url;
+}
+
+bool PMSCatalogueText(const std::string& url, bool forceReload, const std::string& language,
+                      std::string& body, std::string& cache_name) {
+  return FetchText(url, language, forceReload, Json::Value(), body, &cache_name);
+}
 
 const Json::Value* PMSCatalogueEntries(const Json::Value& answer) {
   if (answer.isArray()) return &answer;
@@ -192,17 +208,13 @@ const Json::Value* PMSCatalogueEntries(const Json::Value& answer) {
 }
 
 bool PMSQueryKivoPkgServer(bool forceReload, const char* language, Json::Value& answer) {
-  PkgServerConfig config = PMSLoadServerConfig();
-  if (config.vendor_url.empty()) {
-    CATALOGUE_LOG("no vendor_url in %s", PMSServerConfigPath().c_str());
-    return false;
-  }
-  return QueryServer(config.vendor_url, forceReload, language ? language : "", answer);
+  const std::string url = PMSVendorCatalogueUrl();
+  return !url.empty() && QueryServer(url, forceReload, language ? language : "", answer);
 }
 
 bool PMSQueryOtherPkgServer(bool forceReload, const char* language, Json::Value& answer) {
   answer = Json::Value(Json::arrayValue);
-  std::vector<std::string> urls = FeedUrls();
+  std::vector<std::string> urls = PMSFeedUrls();
   bool any = urls.empty();
   for (const std::string& url : urls) {
     Json::Value one;
@@ -226,7 +238,7 @@ bool PMSQueryPkgServer(const char* language, std::string& answer, const std::str
 std::string PMSFeedListing(const std::string& name, const std::string& link,
                            const std::string& language) {
   if (link.empty()) return "";
-  for (const std::string& url : FeedUrls()) {
+  for (const std::string& url : PMSFeedUrls()) {
     Json::Value answer;
     if (!QueryServer(url, false, language, answer)) continue;
     const Json::Value* entries = PMSCatalogueEntries(answer);

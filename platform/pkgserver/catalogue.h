@@ -13,6 +13,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include <json/value.h>
 
@@ -32,6 +33,18 @@ bool PMSQueryOtherPkgServer(bool forceReload, const char* language, Json::Value&
 // empty. False when the server gave no usable answer.
 bool PMSQueryPkgServer(const char* language, std::string& answer, const std::string& feed,
                        bool forceReload, const Json::Value& extra);
+
+// The vendor's catalogue address; "" (logged) when none is configured.
+std::string PMSVendorCatalogueUrl();
+
+// The feeds' catalogue addresses, in the order of the feed file.
+std::vector<std::string> PMSFeedUrls();
+
+// One server's catalogue as text, cached or fetched as the queries above do
+// it, and the name of its cache file: files derived from a catalogue are
+// named after it. False (logged) when the server gave no usable answer.
+bool PMSCatalogueText(const std::string& url, bool forceReload, const std::string& language,
+                      std::string& body, std::string& cache_name);
 
 // The entries of a catalogue answer: its "packages" (object form) or the
 // answer itself (array form); null for anything else.

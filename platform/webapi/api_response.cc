@@ -1,15 +1,34 @@
 #include "webapi/api_response.h"
 
+#include <memory>
+
+#include <json/reader.h>
+
+Json::StreamWriterBuilder AnswerJsonWriter() {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "";
+  return builder;
+}
+
 void APIResponse::SetSuccess(Json::Value data) {
   answered_ = true;
   error_code_ = 0;
   data_ = std::move(data);
+  data_text_.clear();
+}
+
+void APIResponse::SetSuccessText(std::string json) {
+  answered_ = true;
+  error_code_ = 0;
+  data_ = Json::Value();
+  data_text_ = std::move(json);
 }
 
 void APIResponse::SetError(int code, Json::Value data) {
   answered_ = true;
   error_code_ = code;
   data_ = std::move(data);
+  data_text_.clear();
 }
 
 namespace {
@@ -29,8 +48,22 @@ Json::Value Envelope(bool answered, int code, Json::Value data) {
 
 }  // namespace
 
-Json::Value APIResponse::ToEnvelope() const { return Envelope(answered_, error_code_, data_); }
+Json::Value APIResponse::ToEnvelope() const {
+  if (data_text_.empty()) return Envelope(answered_, error_code_, data_);
+  Json::Value data;
+  Json::CharReaderBuilder builder;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  // The text is this process's own writer output; should it not parse, the
+  // envelope says success without data rather than inventing any.
+  if (!reader->parse(data_text_.data(), data_text_.data() + data_text_.size(), &data, nullptr)) {
+    data = Json::Value();
+  }
+  return Envelope(answered_, error_code_, std::move(data));
+}
 
-Json::Value APIResponse::TakeEnvelope() {
-  return Envelope(answered_, error_code_, std::move(data_));
+std::string APIResponse::TakeEnvelopeText() {
+  // The writer puts an object's members in name order: "data" before
+  // "success", as the envelope of SetSuccess comes out.
+  if (!data_text_.empty()) return "{\"data\":" + std::move(data_text_) + ",\"success\":true}";
+  return Json::writeString(AnswerJsonWriter(), Envelope(answered_, error_code_, std::move(data_)));
 }

@@ -1,0 +1,301 @@
+#include "pkgserver/catalogue_listing.h"
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <set>
+#include <sstream>
+#include <syslog.h>
+
+#include <json/reader.h>
+#include <json/value.h>
+
+#include "klibc/atomic_file.h"
+#include "klibc/sysroot.h"
+#include "pkgserver/catalogue.h"
+#include "pkgtool/dependency.h"
+#include "webapi/api_response.h"
+
+#define LISTING_LOG(fmt, ...) \
+  syslog(LOG_ERR, "%s:%d " fmt, "catalogue_listing", __LINE__, ##__VA_ARGS__)
+
+namespace KIVOPackageServer {
+
+namespace {
+
+// The rendering's version. Raise it whenever what RenderEntry writes or the
+// file's layout changes: files of another version are rendered again.
+constexpr int kListingFormat = 1;
+constexpr char kMagic[] = "kivo-listing";
+
+std::string ListingDir() { return KIVORootPath("/var/cache/kivo/pkgserver/listing"); }
+
+const char* SideName(ListingSide side) { return side == ListingSide::kVendor ? "kivo" : "others"; }
+
+// A 64-bit checksum of `size` bytes: which catalogue a file was rendered
+// from, and whether the file is still what was written. It is FNV-1a over
+// 8-byte words with the high half folded back each step, a few instructions
+// per word: it runs over a megabyte or two at every request.
+uint64_t Digest(const char* data, size_t size) {
+  constexpr uint64_t kPrime = 1099511628211ULL;
+  uint64_t h = 1469598103934665603ULL ^ size;
+  size_t i = 0;
+  for (; i + 8 <= size; i += 8) {
+    uint64_t word;
+    memcpy(&word, data + i, sizeof(word));
+    h = (h ^ word) * kPrime;
+    h ^= h >> 32;
+  }
+  for (; i < size; ++i) h = (h ^ static_cast<unsigned char>(data[i])) * kPrime;
+  return h;
+}
+
+std::string Text(const Json::Value& v) { return v.isString() ? v.asString() : ""; }
+
+// A dependency list of an entry in the structured form: "conf_<key>" (JSON)
+// wins over "<key>" (text); both are replaced by "<out>".
+void RewriteDependencies(Json::Value& entry, const char* conf_key, const char* text_key,
+                         const char* out_key) {
+  DepPkgVector deps;
+  if (entry.isMember(conf_key) && !entry[conf_key].empty()) {
+    PMSParseDepJSON(entry[conf_key], deps);
+    entry.removeMember(conf_key);
+  } else if (entry[text_key].isString() && !entry[text_key].asString().empty()) {
+    PMSExplodeDepPKGString(entry[text_key].asString(), deps);
+    entry.removeMember(text_key);
+  }
+  Json::Value out;
+  deps.toJSON(out);
+  entry[out_key] = std::move(out);
+}
+
+// Renders catalogue element `element` (consumed) into `*out`: everything of
+// a listed entry that does not depend on the appliance. False for an element
+// that is not listed.
+bool RenderEntry(Json::Value& element, ListingSide side, Json::StreamWriter& writer,
+                 ListingEntry* out) {
+  if (!element.isObject() || !element["package"].isString()) return false;
+  out->name = element["package"].asString();
+  out->has_version = element.isMember("version");
+  out->version = out->has_version ? Text(element["version"]) : "";
+  element["id"] = out->name;
+  element["blupgrade"] = false;
+  element["source"] = SideName(side);
+  RewriteDependencies(element, "conf_deppkgs", "deppkgs", "deppkgs");
+  RewriteDependencies(element, "conf_conxpkgs", "conflictpkgs", "conflictpkgs");
+  // Listed entries have always carried "icon" (null when the server gave
+  // none), and "version" (null) beside an icon: clients may test for them.
+  Json::Value& icon = element["icon"];
+  if (icon.isString() && !icon.asString().empty()) {
+    out->icon = icon.asString();
+    element["version"];
+  }
+  std::ostringstream text;
+  writer.write(element, &text);
+  out->text = text.str();
+  return true;
+}
+
+// The catalogue's list of elements (and the vendor's recommendations), by
+// the rules of its side; null when the answer is no catalogue there.
+Json::Value* CatalogueList(Json::Value& answer, ListingSide side,
+                           std::vector<std::string>* recommend) {
+  if (side == ListingSide::kFeeds) {
+    return answer.isObject() && answer["packages"].isArray() ? &answer["packages"]
+           : answer.isArray()                                ? &answer
+                                                             : nullptr;
+  }
+  if (!answer.isObject() || answer.empty()) return answer.isArray() ? &answer : nullptr;
+  if (!answer.isMember("packages") || !answer.isMember("recommend") ||
+      !answer["packages"].isArray()) {
+    return nullptr;
+  }
+  const Json::Value& names = answer["recommend"];
+  std::set<std::string> seen;
+  for (Json::ArrayIndex i = 0; names.isArray() && i < names.size(); ++i) {
+    if (names[i].isString() && seen.insert(names[i].asString()).second) {
+      recommend->push_back(names[i].asString());
+    }
+  }
+  return &answer["packages"];
+}
+
+bool Render(const std::string& body, ListingSide side, const std::string& url,
+            CatalogueListing* listing) {
+  Json::CharReaderBuilder builder;
+  builder["collectComments"] = false;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value answer;
+  if (!reader->parse(body.data(), body.data() + body.size(), &answer, nullptr)) {
+    LISTING_LOG("%s: the cached answer is not a JSON catalogue", url.c_str());
+    return false;
+  }
+  std::vector<std::string> recommend;
+  Json::Value* list =
+      answer.isObject() || answer.isArray() ? CatalogueList(answer, side, &recommend) : nullptr;
+  if (!list) {
+    LISTING_LOG("%s: neither an array nor an object with \"packages\"%s", url.c_str(),
+                side == ListingSide::kVendor ? " and \"recommend\"" : "");
+    return false;
+  }
+  listing->recommend = std::move(recommend);
+  std::unique_ptr<Json::StreamWriter> writer(AnswerJsonWriter().newStreamWriter());
+  listing->entries.reserve(list->size());
+  for (Json::Value& element : *list) {
+    ListingEntry entry;
+    if (RenderEntry(element, side, *writer, &entry)) listing->entries.push_back(std::move(entry));
+  }
+  return true;
+}
+
+// The file: one header line
+//   kivo-listing FORMAT SIDE CATALOGUE-DIGEST CHECKSUM ENTRIES RECOMMENDATIONS
+// (digests in hex), then netstrings ("<length>:<bytes>,"): the recommended
+// names, then per entry its name, "=" + version (or "" without one), icon
+// and text. The checksum covers everything after the header line.
+
+void PutField(std::string* out, const std::string& field) {
+  *out += std::to_string(field.size());
+  *out += ':';
+  *out += field;
+  *out += ',';
+}
+
+std::string Header(ListingSide side, uint64_t catalogue, uint64_t checksum, size_t entries,
+                   size_t recommend) {
+  char line[160];
+  snprintf(line, sizeof(line), "%s %d %s %016llx %016llx %zu %zu\n", kMagic, kListingFormat,
+           SideName(side), static_cast<unsigned long long>(catalogue),
+           static_cast<unsigned long long>(checksum), entries, recommend);
+  return line;
+}
+
+std::string Serialize(const CatalogueListing& listing, ListingSide side, uint64_t catalogue) {
+  std::string fields;
+  for (const std::string& name : listing.recommend) PutField(&fields, name);
+  for (const ListingEntry& e : listing.entries) {
+    PutField(&fields, e.name);
+    PutField(&fields, e.has_version ? "=" + e.version : "");
+    PutField(&fields, e.icon);
+    PutField(&fields, e.text);
+  }
+  uint64_t checksum = Digest(fields.data(), fields.size());
+  return Header(side, catalogue, checksum, listing.entries.size(), listing.recommend.size()) +
+         fields;
+}
+
+// Reads netstrings from a file's text; every length is checked against
+// what is left.
+class FieldReader {
+ public:
+  FieldReader(const char* begin, const char* end) : p_(begin), end_(end) {}
+  bool Next(std::string* field) {
+    size_t length = 0;
+    const char* digits = p_;
+    while (p_ < end_ && *p_ >= '0' && *p_ <= '9' && p_ - digits < 10)
+      length = length * 10 + (*p_++ - '0');
+    if (p_ == digits || p_ >= end_ || *p_ != ':' || static_cast<size_t>(end_ - p_) < length + 2)
+      return false;
+    field->assign(p_ + 1, length);
+    p_ += length + 1;
+    return *p_++ == ',';
+  }
+  bool AtEnd() const { return p_ == end_; }
+
+ private:
+  const char* p_;
+  const char* end_;
+};
+
+bool ReadEntry(FieldReader& fields, ListingEntry* e) {
+  std::string version;
+  if (!fields.Next(&e->name) || !fields.Next(&version) || !fields.Next(&e->icon) ||
+      !fields.Next(&e->text)) {
+    return false;
+  }
+  e->has_version = !version.empty();
+  if (e->has_version && version[0] != '=') return false;
+  e->version = e->has_version ? version.substr(1) : "";
+  return !e->text.empty();
+}
+
+// The listing of file text `file` when it is whole and was rendered from the
+// catalogue with digest `catalogue` for `side`.
+bool Parse(const std::string& file, ListingSide side, uint64_t catalogue,
+           CatalogueListing* listing) {
+  size_t newline = file.find('\n');
+  if (newline == std::string::npos || newline > 160) return false;
+  const std::string header = file.substr(0, newline);
+  char magic[16], side_name[16];
+  int format = 0, used = 0;
+  unsigned long long digest = 0, checksum = 0;
+  size_t entries = 0, recommend = 0;
+  if (sscanf(header.c_str(), "%15s %d %15s %16llx %16llx %zu %zu%n", magic, &format, side_name,
+             &digest, &checksum, &entries, &recommend, &used) != 7 ||
+      static_cast<size_t>(used) != newline || std::string(magic) != kMagic ||
+      format != kListingFormat || std::string(side_name) != SideName(side) || digest != catalogue) {
+    return false;
+  }
+  const char* begin = file.data() + newline + 1;
+  const char* end = file.data() + file.size();
+  if (Digest(begin, end - begin) != checksum || entries > file.size() || recommend > file.size())
+    return false;
+  FieldReader fields(begin, end);
+  listing->recommend.resize(recommend);
+  for (std::string& name : listing->recommend) {
+    if (!fields.Next(&name)) return false;
+  }
+  listing->entries.resize(entries);
+  for (ListingEntry& e : listing->entries) {
+    if (!ReadEntry(fields, &e)) return false;
+  }
+  return fields.AtEnd();
+}
+
+// One catalogue's listing: from its file when that is current and whole,
+// else rendered and the file replaced.
+bool LoadListing(const std::string& url, const std::string& body, const std::string& cache_name,
+                 ListingSide side, CatalogueListing* listing) {
+  const uint64_t catalogue = Digest(body.data(), body.size());
+  const std::string path = ListingDir() + "/" + cache_name + "." + SideName(side);
+  std::string file;
+  if (KIVOReadFile(path, &file) && Parse(file, side, catalogue, listing)) return true;
+  *listing = CatalogueListing();
+  if (!Render(body, side, url, listing)) return false;
+  if (KIVOFSMkdirP(ListingDir().c_str()) != 0 ||
+      !KIVOWriteFileAtomic(path, Serialize(*listing, side, catalogue), SyncToDisk::No)) {
+    syslog(LOG_WARNING, "%s:%d cannot write the catalogue listing %s", "catalogue_listing",
+           __LINE__, path.c_str());
+  }
+  return true;
+}
+
+bool ListOne(const std::string& url, bool force, const std::string& language, ListingSide side,
+             CatalogueListing* listing) {
+  std::string body, cache_name;
+  return PMSCatalogueText(url, force, language, body, cache_name) &&
+         LoadListing(url, body, cache_name, side, listing);
+}
+
+}  // namespace
+
+bool PMSListCatalogue(ListingSide side, bool forceReload, const std::string& language,
+                      CatalogueListing* listing) {
+  *listing = CatalogueListing();
+  if (side == ListingSide::kVendor) {
+    const std::string url = PMSVendorCatalogueUrl();
+    return !url.empty() && ListOne(url, forceReload, language, side, listing);
+  }
+  const std::vector<std::string> urls = PMSFeedUrls();
+  bool any = urls.empty();
+  for (const std::string& url : urls) {
+    CatalogueListing one;
+    if (!ListOne(url, forceReload, language, side, &one)) continue;
+    any = true;
+    for (ListingEntry& e : one.entries) listing->entries.push_back(std::move(e));
+  }
+  return any;
+}
+
+}  // namespace KIVOPackageServer
