@@ -48,6 +48,8 @@ before(async () => {
   browser = await launch();
   page = await openPage(await browser.newContext(), appliance.url, watch);
   await signIn(page);
+  // The first visit asks for the terms of service (e2e/settings.test.ts tests that).
+  await page.getByRole('button', { name: 'I agree' }).click();
 });
 
 after(async () => {

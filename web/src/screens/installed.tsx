@@ -1,4 +1,5 @@
 import './installed.css';
+import { Component } from 'preact';
 import { useCallback, useEffect, useRef, useState } from 'preact/hooks';
 import type { Api, ApiFailure, Result } from '../api/client';
 import { routeHref } from '../route';
@@ -120,6 +121,43 @@ function Row({ pkg, upgrade, onChanged }: { pkg: InstalledPackage; upgrade: stri
   );
 }
 
+interface RowsProps {
+  packages: InstalledPackage[];
+  from: number;
+  upgrades: Map<string, string>;
+  onChanged: () => void;
+}
+
+// kRowsPerFrame rows from `from` on. A chunk renders again only when the
+// list, the upgrades or the callback changed, so growing the list by one
+// chunk does not go over the chunks already shown.
+class Rows extends Component<RowsProps> {
+  shouldComponentUpdate(next: RowsProps): boolean {
+    const p = this.props;
+    return next.packages !== p.packages || next.from !== p.from || next.upgrades !== p.upgrades || next.onChanged !== p.onChanged;
+  }
+
+  render({ packages, from, upgrades, onChanged }: RowsProps) {
+    return packages
+      .slice(from, from + kRowsPerFrame)
+      .map((pkg) => <Row key={pkg.id} pkg={pkg} upgrade={upgrades.get(pkg.id)} onChanged={onChanged} />);
+  }
+}
+
+// Rows put in the document per frame: the first screenful appears at once
+// and a long list grows behind it without holding the page up.
+const kRowsPerFrame = 50;
+
+function useGrowingCount(total: number): number {
+  const [count, setCount] = useState(kRowsPerFrame);
+  useEffect(() => {
+    if (count >= total) return;
+    const frame = requestAnimationFrame(() => setCount((c) => c + kRowsPerFrame));
+    return () => cancelAnimationFrame(frame);
+  }, [count, total]);
+  return Math.min(count, total);
+}
+
 const anyBusy = (data: { packages: InstalledPackage[] }) => data.packages.some((p) => isBusyStatus(p.additional?.status));
 
 export function InstalledScreen() {
@@ -130,6 +168,8 @@ export function InstalledScreen() {
   );
   const { result, reload } = usePolled(load, anyBusy);
   const { upgrades, error: upgradeError } = useUpgrades(api);
+  const packages = result?.ok ? result.data.packages : [];
+  const shown = useGrowingCount(packages.length);
   return (
     <section class="installed" aria-labelledby="installed-title">
       <h1 id="installed-title">Installed packages</h1>
@@ -140,11 +180,11 @@ export function InstalledScreen() {
           Could not ask the package servers for upgrades: <ErrorText error={upgradeError} />
         </div>
       )}
-      {result?.ok && result.data.packages.length === 0 && <p class="hint">No packages are installed.</p>}
-      {result?.ok && result.data.packages.length > 0 && (
+      {result?.ok && packages.length === 0 && <p class="hint">No packages are installed.</p>}
+      {packages.length > 0 && (
         <ul class="installed-list" aria-label="Installed packages">
-          {result.data.packages.map((pkg) => (
-            <Row key={pkg.id} pkg={pkg} upgrade={upgrades.get(pkg.id)} onChanged={reload} />
+          {Array.from({ length: Math.ceil(shown / kRowsPerFrame) }, (_, i) => (
+            <Rows key={i} packages={packages} from={i * kRowsPerFrame} upgrades={upgrades} onChanged={reload} />
           ))}
         </ul>
       )}
