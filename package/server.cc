@@ -3,6 +3,7 @@
 // the addresses of running packages; and the update badge.
 
 #include <cstdlib>
+#include <deque>
 #include <map>
 #include <memory>
 #include <set>
@@ -115,7 +116,7 @@ class EntryOverlay {
   // been set on the parsed entry: the writer puts members in name order, so
   // the entry's members are merged with the overlay's by name and only the
   // overlay's values are written.
-  std::string Apply(const std::string& text, const Json::Value& overlay) {
+  std::string Apply(std::string_view text, const Json::Value& overlay) {
     std::vector<std::pair<std::string_view, std::string_view>> members;
     if (!SplitMembers(text, &members)) return Reparsed(text, overlay);
     std::string out = "{";
@@ -140,9 +141,8 @@ class EntryOverlay {
   // The members of object text `text` as (name, member text) in their
   // order; false for text this cannot split: a member name with an escape
   // (its order is that of the unescaped name) or not an object.
-  static bool SplitMembers(const std::string& text,
+  static bool SplitMembers(std::string_view all,
                            std::vector<std::pair<std::string_view, std::string_view>>* members) {
-    const std::string_view all(text);
     if (all.size() < 2 || all.front() != '{' || all.back() != '}') return false;
     for (size_t i = 1, end = all.size() - 1; i < end; ++i) {
       const size_t start = i;
@@ -164,13 +164,13 @@ class EntryOverlay {
   }
 
   // The general way for text SplitMembers refuses: parsed, changed, written.
-  std::string Reparsed(const std::string& text, const Json::Value& overlay) {
+  std::string Reparsed(std::string_view text, const Json::Value& overlay) {
     Json::CharReaderBuilder builder;
     std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
     Json::Value entry;
     if (!reader->parse(text.data(), text.data() + text.size(), &entry, nullptr) ||
         !entry.isObject()) {
-      return text;
+      return std::string(text);
     }
     for (const std::string& name : overlay.getMemberNames()) entry[name] = overlay[name];
     return Written(entry);
@@ -195,11 +195,16 @@ class AnswerText {
   explicit AnswerText(const std::vector<std::string>& recommend) : recommend_(recommend) {
     for (const std::string& name : recommend) last_of_[name] = kNone;
   }
-  void Add(const std::string& name, std::string text) {
+  // `text` must live until Finish.
+  void Add(const std::string& name, std::string_view text) {
     auto recommended = last_of_.find(name);
     if (recommended != last_of_.end()) recommended->second = data_.size();
     bytes_ += text.size() + 1;
-    data_.push_back(std::move(text));
+    data_.push_back(text);
+  }
+  void AddOwned(const std::string& name, std::string text) {
+    owned_.push_back(std::move(text));
+    Add(name, owned_.back());
   }
   std::string Finish(bool any_upgrade) const {
     std::string chosen;
@@ -207,7 +212,7 @@ class AnswerText {
       size_t listed = last_of_.at(name);
       if (listed == kNone) continue;
       chosen += chosen.empty() ? ",\"recommend\":[" : ",";
-      chosen += data_[listed];
+      chosen.append(data_[listed].data(), data_[listed].size());
     }
     if (!chosen.empty()) chosen += ']';
     std::string out;
@@ -215,7 +220,7 @@ class AnswerText {
     out += any_upgrade ? "{\"blupgrade\":true,\"data\":[" : "{\"blupgrade\":false,\"data\":[";
     for (size_t i = 0; i < data_.size(); ++i) {
       if (i) out += ',';
-      out += data_[i];
+      out.append(data_[i].data(), data_[i].size());
     }
     out += ']';
     out += chosen;
@@ -228,7 +233,8 @@ class AnswerText {
 
   const std::vector<std::string>& recommend_;
   std::map<std::string, size_t> last_of_;
-  std::vector<std::string> data_;
+  std::vector<std::string_view> data_;
+  std::deque<std::string> owned_;  // texts of annotated entries
   size_t bytes_ = 0;
 };
 
@@ -308,8 +314,9 @@ void PackageWebAPI::ListServerPackage() {
   const bool others = FlagParam(request, "blloadothers");
   const std::string language = request->GetUILanguage();
   // The catalogue comes rendered as far as it does not depend on this
-  // appliance (catalogue_listing.h); only the entries of installed packages
-  // and of downloads are parsed here and get the appliance's state.
+  // appliance (catalogue_listing.h): the entries of installed packages and
+  // of downloads get the appliance's state laid over their text, the others
+  // are copied as they are.
   KIVOPackageServer::CatalogueListing listing;
   if (!KIVOPackageServer::PMSListCatalogue(
           others ? KIVOPackageServer::ListingSide::kFeeds : KIVOPackageServer::ListingSide::kVendor,
@@ -343,14 +350,15 @@ void PackageWebAPI::ListServerPackage() {
         AnnotateInstalled(mgr, tasks, p->second, overlay);
       }
       AnnotateDownload(mgr, tasks, overlay);
-      e.text = entries.Apply(e.text, overlay);
+      answer.AddOwned(e.name, entries.Apply(e.text, overlay));
+    } else {
+      answer.Add(e.name, e.text);
     }
     if (!e.icon.empty()) {
       KIVOPackageTool::PMSGetServerImage(others ? "AVAIL/OTHER" : "AVAIL/KIVO", e.name.c_str(),
                                          e.version.c_str(), "thumb_72.png", e.icon.c_str(), nullptr,
                                          0);
     }
-    answer.Add(e.name, std::move(e.text));
   }
   response->SetSuccessText(answer.Finish(any_upgrade));
 }

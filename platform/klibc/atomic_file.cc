@@ -61,6 +61,11 @@ bool KIVOReadFile(const std::string& path, std::string* content, size_t limit) {
     KLIBCErrSet(errno == ENOENT ? KLIBC_ERR_NOT_FOUND : KLIBC_ERR_FILE_OPEN);
     return false;
   }
+  // Reading into the file's size at once spares a large file the copies of
+  // a string that grows block by block.
+  struct stat st;
+  if (fstat(fd, &st) == 0 && st.st_size > 0)
+    content->reserve(std::min(static_cast<size_t>(st.st_size), limit));
   char buf[65536];
   bool ok = true;
   while (content->size() < limit) {

@@ -72,7 +72,10 @@ bool ReadCache(const std::string& path, CachedCatalogue* cached) {
       !cached->meta.isObject()) {
     return false;
   }
-  cached->body = text.substr(newline + 1);
+  // The body moves out of the file's text (erased in place, not copied): a
+  // catalogue may be megabytes.
+  text.erase(0, newline + 1);
+  cached->body = std::move(text);
   return true;
 }
 

@@ -70,16 +70,23 @@ void RewriteDependencies(Json::Value& entry, const char* conf_key, const char* t
   entry[out_key] = std::move(out);
 }
 
-// Renders catalogue element `element` (consumed) into `*out`: everything of
-// a listed entry that does not depend on the appliance. False for an element
-// that is not listed.
+void PutField(std::string* out, const std::string& field) {
+  *out += std::to_string(field.size());
+  *out += ':';
+  *out += field;
+  *out += ',';
+}
+
+// Renders catalogue element `element` (consumed) into the fields of a
+// listing file (see Render): everything of a listed entry that does not
+// depend on the appliance. False for an element that is not listed.
 bool RenderEntry(Json::Value& element, ListingSide side, Json::StreamWriter& writer,
-                 ListingEntry* out) {
+                 std::string* fields) {
   if (!element.isObject() || !element["package"].isString()) return false;
-  out->name = element["package"].asString();
-  out->has_version = element.isMember("version");
-  out->version = out->has_version ? Text(element["version"]) : "";
-  element["id"] = out->name;
+  const std::string name = element["package"].asString();
+  PutField(fields, name);
+  PutField(fields, element.isMember("version") ? "=" + Text(element["version"]) : "");
+  element["id"] = name;
   element["blupgrade"] = false;
   element["source"] = SideName(side);
   RewriteDependencies(element, "conf_deppkgs", "deppkgs", "deppkgs");
@@ -87,13 +94,12 @@ bool RenderEntry(Json::Value& element, ListingSide side, Json::StreamWriter& wri
   // Listed entries have always carried "icon" (null when the server gave
   // none), and "version" (null) beside an icon: clients may test for them.
   Json::Value& icon = element["icon"];
-  if (icon.isString() && !icon.asString().empty()) {
-    out->icon = icon.asString();
-    element["version"];
-  }
+  const bool has_icon = icon.isString() && !icon.asString().empty();
+  PutField(fields, has_icon ? icon.asString() : "");
+  if (has_icon) element["version"];
   std::ostringstream text;
   writer.write(element, &text);
-  out->text = text.str();
+  PutField(fields, text.str());
   return true;
 }
 
@@ -121,8 +127,25 @@ Json::Value* CatalogueList(Json::Value& answer, ListingSide side,
   return &answer["packages"];
 }
 
-bool Render(const std::string& body, ListingSide side, const std::string& url,
-            CatalogueListing* listing) {
+// The file: one header line
+//   kivo-listing FORMAT SIDE CATALOGUE-DIGEST CHECKSUM ENTRIES RECOMMENDATIONS
+// (digests in hex), then netstrings ("<length>:<bytes>,"): the recommended
+// names, then per entry its name, "=" + version (or "" without one), icon
+// and text. The checksum covers everything after the header line.
+
+std::string Header(ListingSide side, uint64_t catalogue, uint64_t checksum, size_t entries,
+                   size_t recommend) {
+  char line[160];
+  snprintf(line, sizeof(line), "%s %d %s %016llx %016llx %zu %zu\n", kMagic, kListingFormat,
+           SideName(side), static_cast<unsigned long long>(catalogue),
+           static_cast<unsigned long long>(checksum), entries, recommend);
+  return line;
+}
+
+// Renders catalogue text `body` (with digest `catalogue`) into the text of
+// a listing file; false (logged) when it is no catalogue for `side`.
+bool Render(const std::string& body, uint64_t catalogue, ListingSide side, const std::string& url,
+            std::string* file) {
   Json::CharReaderBuilder builder;
   builder["collectComments"] = false;
   std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
@@ -139,50 +162,14 @@ bool Render(const std::string& body, ListingSide side, const std::string& url,
                 side == ListingSide::kVendor ? " and \"recommend\"" : "");
     return false;
   }
-  listing->recommend = std::move(recommend);
-  std::unique_ptr<Json::StreamWriter> writer(AnswerJsonWriter().newStreamWriter());
-  listing->entries.reserve(list->size());
-  for (Json::Value& element : *list) {
-    ListingEntry entry;
-    if (RenderEntry(element, side, *writer, &entry)) listing->entries.push_back(std::move(entry));
-  }
-  return true;
-}
-
-// The file: one header line
-//   kivo-listing FORMAT SIDE CATALOGUE-DIGEST CHECKSUM ENTRIES RECOMMENDATIONS
-// (digests in hex), then netstrings ("<length>:<bytes>,"): the recommended
-// names, then per entry its name, "=" + version (or "" without one), icon
-// and text. The checksum covers everything after the header line.
-
-void PutField(std::string* out, const std::string& field) {
-  *out += std::to_string(field.size());
-  *out += ':';
-  *out += field;
-  *out += ',';
-}
-
-std::string Header(ListingSide side, uint64_t catalogue, uint64_t checksum, size_t entries,
-                   size_t recommend) {
-  char line[160];
-  snprintf(line, sizeof(line), "%s %d %s %016llx %016llx %zu %zu\n", kMagic, kListingFormat,
-           SideName(side), static_cast<unsigned long long>(catalogue),
-           static_cast<unsigned long long>(checksum), entries, recommend);
-  return line;
-}
-
-std::string Serialize(const CatalogueListing& listing, ListingSide side, uint64_t catalogue) {
   std::string fields;
-  for (const std::string& name : listing.recommend) PutField(&fields, name);
-  for (const ListingEntry& e : listing.entries) {
-    PutField(&fields, e.name);
-    PutField(&fields, e.has_version ? "=" + e.version : "");
-    PutField(&fields, e.icon);
-    PutField(&fields, e.text);
-  }
-  uint64_t checksum = Digest(fields.data(), fields.size());
-  return Header(side, catalogue, checksum, listing.entries.size(), listing.recommend.size()) +
-         fields;
+  for (const std::string& name : recommend) PutField(&fields, name);
+  std::unique_ptr<Json::StreamWriter> writer(AnswerJsonWriter().newStreamWriter());
+  size_t entries = 0;
+  for (Json::Value& element : *list) entries += RenderEntry(element, side, *writer, &fields);
+  *file = Header(side, catalogue, Digest(fields.data(), fields.size()), entries, recommend.size()) +
+          fields;
+  return true;
 }
 
 // Reads netstrings from a file's text; every length is checked against
@@ -191,13 +178,19 @@ class FieldReader {
  public:
   FieldReader(const char* begin, const char* end) : p_(begin), end_(end) {}
   bool Next(std::string* field) {
+    std::string_view view;
+    if (!Next(&view)) return false;
+    field->assign(view.data(), view.size());
+    return true;
+  }
+  bool Next(std::string_view* field) {
     size_t length = 0;
     const char* digits = p_;
     while (p_ < end_ && *p_ >= '0' && *p_ <= '9' && p_ - digits < 10)
       length = length * 10 + (*p_++ - '0');
     if (p_ == digits || p_ >= end_ || *p_ != ':' || static_cast<size_t>(end_ - p_) < length + 2)
       return false;
-    field->assign(p_ + 1, length);
+    *field = std::string_view(p_ + 1, length);
     p_ += length + 1;
     return *p_++ == ',';
   }
@@ -209,14 +202,14 @@ class FieldReader {
 };
 
 bool ReadEntry(FieldReader& fields, ListingEntry* e) {
-  std::string version;
+  std::string_view version;
   if (!fields.Next(&e->name) || !fields.Next(&version) || !fields.Next(&e->icon) ||
       !fields.Next(&e->text)) {
     return false;
   }
   e->has_version = !version.empty();
   if (e->has_version && version[0] != '=') return false;
-  e->version = e->has_version ? version.substr(1) : "";
+  if (e->has_version) e->version.assign(version.data() + 1, version.size() - 1);
   return !e->text.empty();
 }
 
@@ -253,21 +246,30 @@ bool Parse(const std::string& file, ListingSide side, uint64_t catalogue,
   return fields.AtEnd();
 }
 
-// One catalogue's listing: from its file when that is current and whole,
-// else rendered and the file replaced.
+// One catalogue's listing added to `*listing`: from its file when that is
+// current and whole, else rendered and the file replaced.
 bool LoadListing(const std::string& url, const std::string& body, const std::string& cache_name,
                  ListingSide side, CatalogueListing* listing) {
   const uint64_t catalogue = Digest(body.data(), body.size());
   const std::string path = ListingDir() + "/" + cache_name + "." + SideName(side);
-  std::string file;
-  if (KIVOReadFile(path, &file) && Parse(file, side, catalogue, listing)) return true;
-  *listing = CatalogueListing();
-  if (!Render(body, side, url, listing)) return false;
-  if (KIVOFSMkdirP(ListingDir().c_str()) != 0 ||
-      !KIVOWriteFileAtomic(path, Serialize(*listing, side, catalogue), SyncToDisk::No)) {
-    syslog(LOG_WARNING, "%s:%d cannot write the catalogue listing %s", "catalogue_listing",
-           __LINE__, path.c_str());
+  auto file = std::make_unique<std::string>();
+  CatalogueListing one;
+  if (!KIVOReadFile(path, file.get()) || !Parse(*file, side, catalogue, &one)) {
+    one = CatalogueListing();
+    if (!Render(body, catalogue, side, url, file.get())) return false;
+    if (KIVOFSMkdirP(ListingDir().c_str()) != 0 ||
+        !KIVOWriteFileAtomic(path, *file, SyncToDisk::No)) {
+      syslog(LOG_WARNING, "%s:%d cannot write the catalogue listing %s", "catalogue_listing",
+             __LINE__, path.c_str());
+    }
+    if (!Parse(*file, side, catalogue, &one)) {
+      LISTING_LOG("%s: the rendered listing does not read back", url.c_str());
+      return false;
+    }
   }
+  listing->files.push_back(std::move(file));
+  for (ListingEntry& e : one.entries) listing->entries.push_back(std::move(e));
+  if (listing->recommend.empty()) listing->recommend = std::move(one.recommend);
   return true;
 }
 
@@ -287,14 +289,11 @@ bool PMSListCatalogue(ListingSide side, bool forceReload, const std::string& lan
     const std::string url = PMSVendorCatalogueUrl();
     return !url.empty() && ListOne(url, forceReload, language, side, listing);
   }
+  // Feeds have no recommendations: their listings are rendered without.
   const std::vector<std::string> urls = PMSFeedUrls();
   bool any = urls.empty();
-  for (const std::string& url : urls) {
-    CatalogueListing one;
-    if (!ListOne(url, forceReload, language, side, &one)) continue;
-    any = true;
-    for (ListingEntry& e : one.entries) listing->entries.push_back(std::move(e));
-  }
+  for (const std::string& url : urls)
+    any = ListOne(url, forceReload, language, side, listing) || any;
   return any;
 }
 

@@ -18,7 +18,9 @@
 // costs the next request the rendering.
 #pragma once
 
+#include <memory>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace KIVOPackageServer {
@@ -31,8 +33,9 @@ struct ListingEntry {
   std::string version;       // its text; "" when it is not a string
   std::string icon;          // "icon" when a non-empty string, else ""
   // The rendered entry: one JSON object written with AnswerJsonWriter()
-  // (api_response.h), so that it can stand in an answer as it is.
-  std::string text;
+  // (api_response.h), so that it can stand in an answer as it is. It views
+  // the listing's `files` and lives as long as the listing.
+  std::string_view text;
 };
 
 struct CatalogueListing {
@@ -40,6 +43,9 @@ struct CatalogueListing {
   // Vendor side: the distinct names of the server's "recommend" list, in
   // its order (a name counts at its first place).
   std::vector<std::string> recommend;
+  // The listing files' text that the entries view: a megabyte of entries
+  // is read once and not copied.
+  std::vector<std::unique_ptr<const std::string>> files;
 };
 
 // The vendor's catalogue (kVendor) or every feed's catalogue one after the
