@@ -85,7 +85,7 @@ export function initialWizardValues(steps: WizardStep[]): WizardValues {
       else if (item.type === 'combobox') values[sub.key] = String(sub.defaultValue ?? optionValues(sub)[0]?.value ?? '');
       else values[sub.key] = sub.defaultValue === undefined ? '' : String(sub.defaultValue);
     }
-    if (item.type === 'singleselect' && item.subitems.length > 0 && !item.subitems.some((s) => values[s.key] === true))
+    if (item.type === 'singleselect' && item.subitems.length > 1 && !item.subitems.some((s) => values[s.key] === true))
       values[item.subitems[0].key] = true;
   }
   return values;
@@ -129,7 +129,9 @@ function Field({
   const id = `wizard-${sub.key}`;
   const set = (value: string | boolean) => onChange({ ...values, [sub.key]: value });
   const label = sub.desc ?? sub.key;
-  if (item.type === 'singleselect') {
+  // A single choice with one option is a yes/no question: a lone radio
+  // button could never be unticked.
+  if (item.type === 'singleselect' && item.subitems.length > 1) {
     const pick = () => {
       const next = { ...values };
       for (const other of item.subitems) next[other.key] = other.key === sub.key;
@@ -141,7 +143,7 @@ function Field({
       </label>
     );
   }
-  if (item.type === 'multiselect') {
+  if (isChoice(item.type)) {
     return (
       <label class="choice">
         <input type="checkbox" checked={values[sub.key] === true} onChange={(e) => set(e.currentTarget.checked)} /> {label}
