@@ -141,7 +141,7 @@ test('a package with an uninstall wizard is removed with the answers given', asy
   await dialog.getByText('Removing demo-wizard deletes the data it keeps.').waitFor();
   await dialog.getByRole('button', { name: 'Continue anyway' }).click();
   await dialog.getByRole('group', { name: 'Keep a copy of the greeting?' }).waitFor();
-  assert.ok(await dialog.getByRole('radio', { name: 'Keep a copy' }).isChecked());
+  assert.ok(await dialog.getByRole('checkbox', { name: 'Keep a copy' }).isChecked());
   await screenshot(page, 'uninstall-wizard');
   await checkAccessibility(page, 'uninstall-wizard');
   await dialog.getByRole('button', { name: 'Next' }).click();
