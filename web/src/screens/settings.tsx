@@ -318,6 +318,7 @@ function VolumeChoice({ stored, value, onChange }: { stored: StoredSettings; val
       <label for="default-volume">Default volume for new packages</label>
       <select id="default-volume" value={value} onChange={(e) => onChange(e.currentTarget.value)}>
         {value === '' && <option value="">Not chosen: ask at each install</option>}
+        {value !== '' && !volumes.some((v) => v.volume_path === value) && <option value={value}>{value} (not available)</option>}
         {volumes.map((v) => (
           <option key={v.volume_path} value={v.volume_path}>
             {v.volume_path}
