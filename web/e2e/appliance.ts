@@ -5,7 +5,7 @@
 // other's installs.
 
 import { execFileSync, spawn, type ChildProcess } from 'node:child_process';
-import { mkdtempSync, rmSync } from 'node:fs';
+import { mkdirSync, mkdtempSync, readFileSync, rmSync, writeFileSync } from 'node:fs';
 import { createServer } from 'node:net';
 import { tmpdir } from 'node:os';
 import { join, resolve } from 'node:path';
@@ -57,12 +57,38 @@ export class Appliance {
     server.stderr?.on('data', (chunk: Buffer) => process.env.KIVO_E2E_VERBOSE && process.stderr.write(chunk));
     const url = `http://127.0.0.1:${port}/`;
     await waitForPage(url, server);
-    return new Appliance(root, url, server);
+    const appliance = new Appliance(root, url, server);
+    appliance.expectDemoRunning();
+    return appliance;
+  }
+
+  // The demo runs demo-web on the fixed port 8095, and demo-notes needs it:
+  // an appliance elsewhere on this machine holding that port (a demo left
+  // running) would leave both out and every test here failing for no
+  // visible reason, so say so at once.
+  private expectDemoRunning(): void {
+    const listed = this.kivoctl('list');
+    for (const id of ['demo-web', 'demo-notes']) {
+      if (!new RegExp(`^${id} .* running$`, 'm').test(listed)) {
+        throw new Error(`${id} does not run in the test appliance; is another demo holding port 8095?\n${listed}`);
+      }
+    }
   }
 
   // Runs kivoctl on this appliance's root, e.g. kivoctl('status', 'demo-web').
   kivoctl(...args: string[]): string {
     return execFileSync(join(kRepo, 'build/bin/kivoctl'), ['--root', this.root, ...args], { encoding: 'utf8' });
+  }
+
+  // Records that `account` agreed to the terms of service the demo's vendor
+  // server publishes now, as the page stores it after "I agree": for tests
+  // of other screens, which the terms would otherwise stand in front of.
+  agreeToTerms(account = 'admin'): void {
+    const info = JSON.parse(readFileSync(this.file('/usr/kivo/www/feed/company-info.json'), 'utf8')) as { content_hash: string };
+    const folder = this.file(`/usr/kivo/etc/users/${account}`);
+    mkdirSync(folder, { recursive: true });
+    const agreed = { termofservice: true, termofservice_4_2: true, agreed_tos_hash: info.content_hash };
+    writeFileSync(join(folder, 'settings.json'), JSON.stringify({ 'KIVO.PXS.PkgManApp.Instance': agreed }));
   }
 
   // A path inside the root, e.g. file('/volume1/public/packages/demo-beta.kpk').

@@ -45,6 +45,9 @@ export async function signIn(page: Page, account = 'admin', password = kPassword
 
 export async function screenshot(page: Page, name: string): Promise<void> {
   mkdirSync(kScreenshots, { recursive: true });
+  // A full-page shot of a scrolled page would paint the sticky header where
+  // the view happened to be.
+  await page.evaluate(() => window.scrollTo(0, 0));
   await page.screenshot({ path: join(kScreenshots, `${name}.png`), fullPage: true });
 }
 

@@ -7,8 +7,7 @@
 import { after, before, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { execFileSync } from 'node:child_process';
-import { mkdirSync, readdirSync, readFileSync, writeFileSync } from 'node:fs';
-import { join } from 'node:path';
+import { readdirSync, readFileSync } from 'node:fs';
 import { createServer, type Server } from 'node:http';
 import type { AddressInfo } from 'node:net';
 import type { Browser, Locator, Page } from 'playwright-core';
@@ -100,35 +99,9 @@ function downloadFolders(): string[] {
   return readdirSync(appliance.file('/volume1/@tmp')).filter((name) => name.startsWith('download-'));
 }
 
-// demo-web must be installed for its upgrade to show. The demo root cannot
-// install it while another appliance's demo-web holds its port (283), as
-// other test files may; then it is installed here, not started, once the
-// port is free.
-async function installDemoWeb(): Promise<void> {
-  for (let attempt = 0; !/demo-web\s/.test(appliance.kivoctl('list')); ++attempt) {
-    try {
-      appliance.kivoctl('install', appliance.file('/volume1/public/packages/demo-web.kpk'));
-    } catch (error) {
-      if (attempt >= 240 || !String(error).includes('[283]')) throw error;
-      await new Promise((r) => setTimeout(r, 500));
-    }
-  }
-}
-
-// The terms of service are another screen's business: the account agreed
-// to the current ones already, as the package center stores it.
-function agreeToTerms(): void {
-  const { content_hash } = JSON.parse(readFileSync(appliance.file('/usr/kivo/www/feed/company-info.json'), 'utf8')) as { content_hash: string };
-  const folder = appliance.file('/usr/kivo/etc/users/admin');
-  mkdirSync(folder, { recursive: true });
-  const agreed = { termofservice: true, termofservice_4_2: true, agreed_tos_hash: content_hash };
-  writeFileSync(join(folder, 'settings.json'), JSON.stringify({ 'KIVO.PXS.PkgManApp.Instance': agreed }));
-}
-
 before(async () => {
   appliance = await Appliance.start();
-  agreeToTerms();
-  await installDemoWeb();
+  appliance.agreeToTerms();
   slowServer = await startSlowServer();
   slowFeed = `http://127.0.0.1:${(slowServer.address() as AddressInfo).port}/catalogue.json`;
   await addFeed(slowFeed, 'slow');

@@ -6,7 +6,6 @@
 import { after, before, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { existsSync, readFileSync } from 'node:fs';
-import { createServer } from 'node:net';
 import type { Browser, Locator, Page } from 'playwright-core';
 import { Appliance } from './appliance.ts';
 import { checkAccessibility, launch, openPage, screenshot, signIn, type Watch } from './browser.ts';
@@ -15,24 +14,6 @@ let appliance: Appliance;
 let browser: Browser;
 let page: Page;
 const watch: Watch = { problems: [] };
-
-function portFree(port: number): Promise<boolean> {
-  return new Promise((done) => {
-    const server = createServer();
-    server.once('error', () => done(false));
-    server.listen(port, '0.0.0.0', () => server.close(() => done(true)));
-  });
-}
-
-// demo-web serves on port 8095, which only one appliance on this machine can
-// hold: when another one's demo-web had it as the root was made, the sample
-// was left uninstalled; install it once the port is free again.
-async function ensureDemoWebRuns(): Promise<void> {
-  if (/running/.test(statusOf('demo-web'))) return;
-  for (let i = 0; i < 600 && !(await portFree(8095)); ++i) await new Promise((r) => setTimeout(r, 100));
-  for (const id of ['demo-web', 'demo-notes'])
-    if (!/running/.test(statusOf(id))) appliance.kivoctl('install', appliance.file(`/volume1/public/packages/${id}.kpk`), '--run');
-}
 
 function statusOf(id: string): string {
   try {
@@ -44,7 +25,6 @@ function statusOf(id: string): string {
 
 before(async () => {
   appliance = await Appliance.start();
-  await ensureDemoWebRuns();
   browser = await launch();
   page = await openPage(await browser.newContext(), appliance.url, watch);
   await signIn(page);

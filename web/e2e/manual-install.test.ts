@@ -7,8 +7,7 @@
 import { after, before, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { execFileSync } from 'node:child_process';
-import { createHash } from 'node:crypto';
-import { cpSync, mkdirSync, mkdtempSync, readdirSync, readFileSync, rmSync, writeFileSync } from 'node:fs';
+import { cpSync, mkdtempSync, readdirSync, readFileSync, rmSync, writeFileSync } from 'node:fs';
 import { tmpdir } from 'node:os';
 import { join } from 'node:path';
 import type { Browser, BrowserContext, Page } from 'playwright-core';
@@ -23,18 +22,9 @@ const watch: Watch = { problems: [] };
 const kSamples = '/volume1/public/packages';
 const kLicence = 'Demo Licensed may be used for testing only.\nNo warranty of any kind.';
 
-// The terms of service belong to the settings screen and its test: here the
-// account has agreed to the current ones already, as after an earlier visit.
-function agreeToTerms(): void {
-  const hash = createHash('sha256').update(readFileSync(join(kRepo, 'examples/terms-of-service.txt'))).digest('hex');
-  const folder = appliance.file('/usr/kivo/etc/users/admin');
-  mkdirSync(folder, { recursive: true });
-  writeFileSync(join(folder, 'settings.json'), JSON.stringify({ 'KIVO.PXS.PkgManApp.Instance': { termofservice: true, termofservice_4_2: true, agreed_tos_hash: hash } }));
-}
-
 before(async () => {
   appliance = await Appliance.start();
-  agreeToTerms();
+  appliance.agreeToTerms();
   browser = await launch();
   context = await browser.newContext();
   page = await openPage(context, appliance.url, watch);

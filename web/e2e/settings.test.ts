@@ -6,7 +6,7 @@
 import { after, before, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { execFileSync } from 'node:child_process';
-import { mkdtempSync, readFileSync, rmSync, writeFileSync } from 'node:fs';
+import { mkdtempSync, readFileSync, rmSync, writeFileSync, renameSync } from 'node:fs';
 import { tmpdir } from 'node:os';
 import { join } from 'node:path';
 import type { Browser, BrowserContext, Page } from 'playwright-core';
@@ -201,4 +201,24 @@ test('a public key file is imported and deleted; a secret key and garbage are re
   await confirm.getByRole('button', { name: 'Delete key' }).click();
   await keyring.getByRole('cell', { name: /^Test Publisher/ }).waitFor({ state: 'detached' });
   await keyring.getByRole('cell', { name: /^KIVO Demo Publisher/ }).waitFor();
+});
+
+test('when the vendor cannot confirm its terms, the installed packages can still be managed', async () => {
+  // The terms' hash must be asked again (an hour passed) from a server that
+  // no longer answers.
+  const settings = JSON.parse(readFileSync(appliance.file(kSettingsFile), 'utf8'));
+  settings[kApp].tos_hash_timestamp = Math.floor(Date.now() / 1000) - 3600;
+  writeFileSync(appliance.file(kSettingsFile), JSON.stringify(settings));
+  const vendor = appliance.file('/usr/kivo/www/feed');
+  renameSync(vendor, `${vendor}.gone`);
+  try {
+    await page.goto(`${appliance.url}#/installed`);
+    await page.reload();
+    await page.getByRole('alert').filter({ hasText: 'could not be confirmed' }).waitFor();
+    assert.ok(await page.getByRole('button', { name: 'I agree' }).isDisabled());
+    await page.getByRole('button', { name: 'Continue for now' }).click();
+    await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
+  } finally {
+    renameSync(`${vendor}.gone`, vendor);
+  }
 });

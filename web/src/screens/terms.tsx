@@ -58,7 +58,15 @@ export function TermsGate({ children }: { children: ComponentChildren }) {
           </button>
         </section>
       )}
-      {gate.kind === 'ask' && <TermsScreen changed={gate.changed} hash={gate.hash} onAgreed={check} onRetry={check} />}
+      {gate.kind === 'ask' && (
+        <TermsScreen
+          changed={gate.changed}
+          hash={gate.hash}
+          onAgreed={check}
+          onRetry={check}
+          onContinue={() => setGate({ kind: 'open' })}
+        />
+      )}
     </main>
   );
 }
@@ -68,11 +76,13 @@ function TermsScreen({
   hash,
   onAgreed,
   onRetry,
+  onContinue,
 }: {
   changed: boolean;
   hash: string;
   onAgreed: () => Promise<void>;
   onRetry: () => Promise<void>;
+  onContinue: () => void;
 }) {
   const { api } = useSession();
   const [text, setText] = useState<string | null>(null);
@@ -120,15 +130,21 @@ function TermsScreen({
       )}
       {!confirmed && (
         <p class="error" role="alert">
-          The current terms could not be confirmed with the vendor's server, so they cannot be agreed to now. Try again later.
+          The current terms could not be confirmed with the vendor's server, so they cannot be agreed to now. Try again later,
+          or continue for now: the installed packages can be managed without the vendor's server.
         </p>
       )}
       <ErrorText error={error} />
       <div class="buttons">
         {!confirmed && (
-          <button type="button" onClick={() => void onRetry()}>
-            Try again
-          </button>
+          <>
+            <button type="button" onClick={onContinue}>
+              Continue for now
+            </button>
+            <button type="button" onClick={() => void onRetry()}>
+              Try again
+            </button>
+          </>
         )}
         <button type="button" class="primary" disabled={busy || text === null || !confirmed} onClick={() => void agree()}>
           I agree
