@@ -70,3 +70,15 @@ export const PackageCode = {
   KeySecret: 4594,
   KeyringUnwritable: 4595,
 } as const;
+
+// The "code" of the "error" a failed download or install leaves in its task
+// (platform/pkgserver/download.h): the download worker's own, not the API's.
+export const DownloadCode = {
+  Network: 1,
+  Http: 2,
+  TooLarge: 3,
+  Checksum: 4,
+  Disk: 5,
+  Install: 6,
+  Request: 7,
+} as const;

@@ -8,6 +8,7 @@ import './task-progress.css';
 import { useEffect, useRef, useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
 import { messageFor } from '../api/messages';
+import { DownloadCode } from '../api/codes';
 import { useSession } from '../session';
 import { ErrorText } from './error-text';
 import { formatBytes } from './install-pages';
@@ -44,13 +45,13 @@ export type TaskEnd =
 
 // Words for the download worker's own error codes (not API codes).
 const kDownloadProblems: Record<number, string> = {
-  1: 'The package server could not be reached, or the connection broke off.',
-  2: 'The package server refused the download.',
-  3: 'The package server sent more than the catalogue announced.',
-  4: 'The downloaded file is not the one the catalogue describes (its checksum differs).',
-  5: 'The downloaded file could not be stored on the volume.',
-  6: 'The package could not be installed.',
-  7: 'The catalogue gives no usable address for this package, or no folder could be made for it.',
+  [DownloadCode.Network]: 'The package server could not be reached, or the connection broke off.',
+  [DownloadCode.Http]: 'The package server refused the download.',
+  [DownloadCode.TooLarge]: 'The package server sent more than the catalogue announced.',
+  [DownloadCode.Checksum]: 'The downloaded file is not the one the catalogue describes (its checksum differs).',
+  [DownloadCode.Disk]: 'The downloaded file could not be stored on the volume.',
+  [DownloadCode.Install]: 'The package could not be installed.',
+  [DownloadCode.Request]: 'The catalogue gives no usable address for this package, or no folder could be made for it.',
 };
 
 // The reason a task failed, in words, or null when it did not fail.
@@ -58,7 +59,8 @@ export function taskFailure(data: TaskData): string | null {
   const { error } = data;
   if (typeof error === 'number') return messageFor({ code: error, errors: data.message ? { message: data.message } : undefined });
   if (error && typeof error === 'object') {
-    const summary = (error.code !== undefined && kDownloadProblems[error.code]) || 'The download failed.';
+    const known = error.code !== undefined ? kDownloadProblems[error.code] : undefined;
+    const summary = known ?? `The download failed (error ${error.code ?? 'unknown'}).`;
     return error.message ? `${summary} ${error.message}` : summary;
   }
   return data.status === 'failed' ? 'The download failed.' : null;
