@@ -47,7 +47,7 @@ void UserSettingsSet(const APIRequest& request, const std::string& account, APIR
     ParameterError("app",
                    !app.IsSet()      ? "required"
                    : app.IsInvalid() ? "type"
-                                     : "invalid",
+                                     : "condition",
                    response);
     return;
   }
@@ -56,27 +56,21 @@ void UserSettingsSet(const APIRequest& request, const std::string& account, APIR
     ParameterError("settings", settings.IsSet() ? "type" : "required", response);
     return;
   }
-  // Read, change and replace: another writer of the same account's document
-  // between the read and the rename loses its change (the later rename wins,
-  // as kivo_settings.h says); both writers are the same person's pages.
-  KivoSettings store(account);
-  Json::Value document;
-  if (!store.loadUserJsonSettings(document)) {
-    syslog(LOG_ERR, "%s:%d cannot read the settings of [%s]", "user_settings", __LINE__,
-           account.c_str());
-    response->SetError(kErrUnknown);
-    return;
-  }
-  Json::Value& object = document[app.Get()];
-  if (!object.isObject()) object = Json::Value(Json::objectValue);
-  for (const std::string& name : settings.Get().getMemberNames())
-    object[name] = settings.Get()[name];
-  if (SerializedSize(document) > kMaxSettingsBytes) {
-    ParameterError("settings", "too large", response);
-    return;
-  }
-  if (!store.saveUserJsonSettings(document)) {
-    syslog(LOG_ERR, "%s:%d cannot write the settings of [%s]", "user_settings", __LINE__,
+  // Under the document's lock: the module caches the terms' hash in the
+  // same document, and a change made between a read and a write would be
+  // lost.
+  bool too_large = false;
+  auto merge = [&](Json::Value& document) {
+    Json::Value& object = document[app.Get()];
+    if (!object.isObject()) object = Json::Value(Json::objectValue);
+    for (const std::string& name : settings.Get().getMemberNames())
+      object[name] = settings.Get()[name];
+    too_large = SerializedSize(document) > kMaxSettingsBytes;
+    return !too_large;
+  };
+  if (!KivoSettings(account).updateUserJsonSettings(merge)) {
+    if (too_large) return ParameterError("settings", "condition", response);
+    syslog(LOG_ERR, "%s:%d cannot store the settings of [%s]", "user_settings", __LINE__,
            account.c_str());
     response->SetError(kErrUnknown);
     return;

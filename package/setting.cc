@@ -354,11 +354,17 @@ void PackageWebAPI::FillTermsOfService(Json::Value& reply) {
   if (!known && FetchTosHash(hash)) {
     known = true;
     timestamp = static_cast<int>(time(nullptr));
-    Json::Value& app = settings[kPkgManKey];
-    if (!app.isObject()) app = Json::Value(Json::objectValue);
-    app["tos_hash"] = hash;
-    app["tos_hash_timestamp"] = timestamp;
-    if (!user.saveUserJsonSettings(settings)) PKG_LOG_ERR("Failed to save user settings");
+    // The fetch took a while: the user may have agreed meanwhile in another
+    // tab. Only the cached hash is written, into the document as it is now.
+    auto cache = [&](Json::Value& current) {
+      Json::Value& app = current[kPkgManKey];
+      if (!app.isObject()) app = Json::Value(Json::objectValue);
+      app["tos_hash"] = hash;
+      app["tos_hash_timestamp"] = timestamp;
+      settings = current;
+      return true;
+    };
+    if (!user.updateUserJsonSettings(cache)) PKG_LOG_ERR("Failed to save user settings");
   }
   if (known) {
     reply["tos_hash"] = hash;

@@ -3,15 +3,18 @@
 // application's object, and the package center's information reads back the
 // terms-of-service agreement stored this way.
 
+#include <chrono>
 #include <ctime>
 #include <fstream>
 #include <sstream>
+#include <thread>
 
 #include <gtest/gtest.h>
 #include <json/reader.h>
 #include <json/writer.h>
 
 #include "testing/cgi_client.h"
+#include "testing/http_test_server.h"
 #include "testing/temp_root.h"
 
 namespace {
@@ -114,6 +117,34 @@ TEST_F(UserSettingsTest, AnAgreementStoredHereEndsTheTermsPrompt) {
   EXPECT_EQ("no", show_tos());
   ASSERT_TRUE(Set(admin, kApp, R"({"agreed_tos_hash":"h0"})").Success());
   EXPECT_EQ("change", show_tos());
+}
+
+// The information fetches the terms' hash from a slow server and then
+// caches it in the same document; an agreement stored meanwhile (another tab)
+// must survive that write.
+TEST_F(UserSettingsTest, AnAgreementStoredWhileTheHashIsFetchedIsKept) {
+  HttpTestServer vendor;
+  HttpRoute info;
+  info.body = R"({"content_hash":"h2"})";
+  info.delay_ms = 1500;
+  vendor.Set("/company-info.json", info);
+  root_.Write("/etc/kivo/pkgserver.conf",
+              "company_info_url=\"" + vendor.Url("/company-info.json") + "\"\n");
+  ApiClient admin("admin", "secret");
+  ASSERT_TRUE(admin.signed_in());
+
+  CgiAnswer asked;
+  std::thread tab([&] { asked = admin.Call("KIVO.Core.Package.Info", "get", 1); });
+  while (vendor.Requests("/company-info.json") == 0)
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  ASSERT_TRUE(Set(admin, kApp, R"({"termofservice":true,"agreed_tos_hash":"h2"})").Success());
+  tab.join();
+
+  ASSERT_TRUE(asked.Success()) << asked.body;
+  Json::Value app = Document("admin")[kApp];
+  EXPECT_EQ("h2", app["tos_hash"].asString());
+  EXPECT_EQ("h2", app["agreed_tos_hash"].asString());
+  EXPECT_TRUE(app["termofservice"].asBool());
 }
 
 }  // namespace

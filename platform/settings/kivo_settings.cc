@@ -2,6 +2,7 @@
 
 #include "klibc/account_name.h"
 #include "klibc/atomic_file.h"
+#include "klibc/file_lock.h"
 #include "klibc/last_error.h"
 #include "klibc/sysroot.h"
 #include "settings/web_utils.h"
@@ -37,4 +38,27 @@ bool KivoSettings::saveUserJsonSettings(const Json::Value& settings) const {
     return false;
   }
   return WebUtils::SaveJsonFile(path_, settings);
+}
+
+bool KivoSettings::updateUserJsonSettings(const std::function<bool(Json::Value&)>& change) const {
+  if (path_.empty()) {
+    KLIBCErrSet(KLIBC_ERR_BAD_PARAMETER);
+    return false;
+  }
+  if (KIVOFSMkdirP(path_.substr(0, path_.rfind('/')).c_str()) != 0) {
+    KLIBCErrSet(KLIBC_ERR_FILE_WRITE);
+    return false;
+  }
+  FileLock lock(path_ + ".lock");
+  if (!lock.held()) {
+    KLIBCErrSet(KLIBC_ERR_FILE_WRITE);
+    return false;
+  }
+  Json::Value settings;
+  if (!loadUserJsonSettings(settings)) return false;
+  if (!change(settings)) {
+    KLIBCErrSet(KLIBC_ERR_BAD_PARAMETER);
+    return false;
+  }
+  return saveUserJsonSettings(settings);
 }

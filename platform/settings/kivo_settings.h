@@ -3,10 +3,13 @@
 // each application keeping its own object under its own key.
 //
 // Writes replace the whole document atomically (temporary file + rename), so
-// a reader sees the old or the new document, never half of one. Two writers
-// of the same user's document do not merge: the later rename wins.
+// a reader sees the old or the new document, never half of one. Two plain
+// saves of the same user's document do not merge: the later rename wins.
+// Writers that change only their own members use updateUserJsonSettings,
+// which holds the document's lock from the read to the rename.
 #pragma once
 
+#include <functional>
 #include <string>
 
 #include <json/value.h>
@@ -25,6 +28,12 @@ class KivoSettings {
   // last error set on an invalid user name, a value that is not an object, or
   // a failed write; the old document is then left as it was.
   [[nodiscard]] bool saveUserJsonSettings(const Json::Value& settings) const;
+  // Reads the document, lets `change` edit it and saves it, all under the
+  // lock file "settings.json.lock" beside it, so that concurrent updates of
+  // different members all survive. `change` answers false to leave the
+  // document unwritten. False (last error set) when the lock, the read or
+  // the save fails, or when `change` refused.
+  [[nodiscard]] bool updateUserJsonSettings(const std::function<bool(Json::Value&)>& change) const;
 
   // The document's path, "" when the user name is not valid.
   const std::string& path() const { return path_; }
