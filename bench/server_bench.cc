@@ -84,16 +84,18 @@ void KeepAnswer(const std::string& response, const std::string& name) {
 
 Percentiles Time(int port, const std::string& target, const std::string& headers, int n,
                  const std::string& name) {
-  // The warm-up also makes the first fetch.
-  KeepAnswer(LoopbackExchange(
-                 port, "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n"),
-             name);
+  LoopbackGet(port, target, headers);  // warm-up (and the first fetch)
   std::vector<double> ms;
   for (int r = 0; r < n; ++r) {
     Clock::time_point t = Clock::now();
     LoopbackGet(port, target, headers);
     ms.push_back(Ms(t));
   }
+  // The answer kept is one after the timed ones: the first may still see
+  // the catalogue the web server had cached before it was replaced.
+  KeepAnswer(LoopbackExchange(
+                 port, "GET " + target + " HTTP/1.0\r\nHost: 127.0.0.1\r\n" + headers + "\r\n"),
+             name);
   std::sort(ms.begin(), ms.end());
   return {ms[ms.size() / 2], ms[std::min(ms.size() - 1, ms.size() * 99 / 100)]};
 }

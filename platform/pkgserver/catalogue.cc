@@ -1,7 +1,10 @@
 #include "pkgserver/catalogue.h"
 
 #include <cctype>
+#include <cstdint>
 #include <cstdio>
+#include <cstdlib>
+#include <cstring>
 #include <ctime>
 #include <memory>
 #include <syslog.h>
@@ -56,26 +59,51 @@ std::string QueryUrl(const std::string& url, const std::string& language,
   return q;
 }
 
+// The head of a cache file is read alone when the body may not be needed;
+// a longer meta line is read with the whole file.
+constexpr size_t kCacheHeadBytes = 8192;
+
 struct CachedCatalogue {
-  Json::Value meta;  // "url", "etag", "last_modified", "fetched"
+  Json::Value meta;  // "url", "etag", "last_modified", "fetched", "digest"
   std::string body;
+  bool body_read = false;
 };
 
-bool ReadCache(const std::string& path, CachedCatalogue* cached) {
+// The cache file's meta and, unless `head_only`, its body.
+bool ReadCache(const std::string& path, bool head_only, CachedCatalogue* cached) {
   std::string text;
-  if (!KIVOReadFile(path, &text)) return false;
+  if (!KIVOReadFile(path, &text, head_only ? kCacheHeadBytes : SIZE_MAX)) return false;
   size_t newline = text.find('\n');
-  if (newline == std::string::npos) return false;
+  if (newline == std::string::npos) return head_only && ReadCache(path, false, cached);
   Json::CharReaderBuilder builder;
   std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   if (!reader->parse(text.data(), text.data() + newline, &cached->meta, nullptr) ||
       !cached->meta.isObject()) {
     return false;
   }
+  cached->body_read = !head_only;
+  if (head_only) return true;
   // The body moves out of the file's text (erased in place, not copied): a
   // catalogue may be megabytes.
   text.erase(0, newline + 1);
   cached->body = std::move(text);
+  return true;
+}
+
+std::string DigestText(uint64_t digest) {
+  char hex[17];
+  snprintf(hex, sizeof(hex), "%016llx", static_cast<unsigned long long>(digest));
+  return hex;
+}
+
+// The digest the meta names, when it names a well-formed one.
+bool MetaDigest(const Json::Value& meta, uint64_t* digest) {
+  const Json::Value& text = meta["digest"];
+  if (!text.isString() || text.asString().size() != 16 ||
+      text.asString().find_first_not_of("0123456789abcdef") != std::string::npos) {
+    return false;
+  }
+  *digest = strtoull(text.asCString(), nullptr, 16);
   return true;
 }
 
@@ -103,25 +131,11 @@ bool ParseAnswer(const std::string& body, Json::Value& answer) {
   return true;
 }
 
-// The server's answer as text, from the cache or the server, and the name
-// of its cache file in CacheDir().
-bool FetchText(const std::string& url, const std::string& language, bool force,
-               const Json::Value& extra, std::string& body, std::string* cache_name = nullptr) {
-  if (!PMSIsServerUrl(url)) {
-    CATALOGUE_LOG("%s: not an http or https address", url.c_str());
-    return false;
-  }
-  PkgServerConfig config = PMSLoadServerConfig();
-  const std::string name = CacheKey(QueryUrl(url, language, extra), language);
-  if (cache_name) *cache_name = name;
-  const std::string path = CacheDir() + "/" + name;
-  CachedCatalogue cached;
-  bool have = !force && ReadCache(path, &cached);
-  long age = have ? static_cast<long>(time(nullptr)) - cached.meta["fetched"].asInt64() : 0;
-  if (have && age >= 0 && age < config.catalogue_max_age_s) {
-    body = std::move(cached.body);
-    return true;
-  }
+// Asks the server, conditionally when `cached` (read whole) is given, and
+// leaves the answer in `*cached` and the cache file.
+bool FetchFromServer(const std::string& url, const std::string& query, const std::string& language,
+                     const PkgServerConfig& config, const std::string& path,
+                     CachedCatalogue* cached, bool have) {
   std::string error;
   const PackageServerNetOps* net = PMSServerNetOps(&error);
   if (!net) {
@@ -129,19 +143,22 @@ bool FetchText(const std::string& url, const std::string& language, bool force,
     return false;
   }
   HttpFetch fetch;
-  fetch.url = QueryUrl(url, language, extra);
+  fetch.url = query;
   if (have) {
-    fetch.if_none_match = cached.meta["etag"].asString();
-    fetch.if_modified_since = cached.meta["last_modified"].asString();
+    fetch.if_none_match = cached->meta["etag"].asString();
+    fetch.if_modified_since = cached->meta["last_modified"].asString();
   }
   if (!net->fetch(config.CatalogueLimits(), fetch)) {
     CATALOGUE_LOG("%s: %s", url.c_str(), fetch.error.c_str());
     return false;
   }
   if (have && fetch.status == 304) {
-    cached.meta["fetched"] = static_cast<Json::Int64>(time(nullptr));
-    WriteCache(path, cached);
-    body = std::move(cached.body);
+    cached->meta["fetched"] = static_cast<Json::Int64>(time(nullptr));
+    // A cache written before the meta named its digest gets it now.
+    uint64_t digest;
+    if (!MetaDigest(cached->meta, &digest))
+      cached->meta["digest"] = DigestText(PMSCatalogueDigest(cached->body));
+    WriteCache(path, *cached);
     return true;
   }
   Json::Value parsed;
@@ -153,15 +170,55 @@ bool FetchText(const std::string& url, const std::string& language, bool force,
     CATALOGUE_LOG("%s: the answer is not a JSON catalogue", url.c_str());
     return false;
   }
-  CachedCatalogue fresh;
-  fresh.meta["url"] = url;
-  fresh.meta["language"] = language;
-  fresh.meta["etag"] = fetch.etag;
-  fresh.meta["last_modified"] = fetch.last_modified;
-  fresh.meta["fetched"] = static_cast<Json::Int64>(time(nullptr));
-  fresh.body = fetch.body;
-  WriteCache(path, fresh);
-  body = std::move(fetch.body);
+  cached->meta = Json::Value(Json::objectValue);
+  cached->meta["url"] = url;
+  cached->meta["language"] = language;
+  cached->meta["etag"] = fetch.etag;
+  cached->meta["last_modified"] = fetch.last_modified;
+  cached->meta["fetched"] = static_cast<Json::Int64>(time(nullptr));
+  cached->meta["digest"] = DigestText(PMSCatalogueDigest(fetch.body));
+  cached->body = std::move(fetch.body);
+  WriteCache(path, *cached);
+  return true;
+}
+
+// The server's answer from the cache or the server into `*out`; with
+// kIfNeeded the body of a fresh cache whose meta names its digest is not
+// read.
+bool FetchText(const std::string& url, const std::string& language, bool force,
+               const Json::Value& extra, CatalogueBody want, CatalogueText* out) {
+  if (!PMSIsServerUrl(url)) {
+    CATALOGUE_LOG("%s: not an http or https address", url.c_str());
+    return false;
+  }
+  PkgServerConfig config = PMSLoadServerConfig();
+  const std::string query = QueryUrl(url, language, extra);
+  out->cache_name = CacheKey(query, language);
+  const std::string path = CacheDir() + "/" + out->cache_name;
+  CachedCatalogue cached;
+  bool have = !force && ReadCache(path, want == CatalogueBody::kIfNeeded, &cached);
+  long age = have ? static_cast<long>(time(nullptr)) - cached.meta["fetched"].asInt64() : 0;
+  const bool fresh = have && age >= 0 && age < config.catalogue_max_age_s;
+  if (fresh && !cached.body_read && MetaDigest(cached.meta, &out->digest)) {
+    out->body.clear();
+    out->has_body = false;
+    return true;
+  }
+  if (have && !cached.body_read) have = ReadCache(path, false, &cached);
+  if (!(fresh && have) && !FetchFromServer(url, query, language, config, path, &cached, have)) {
+    return false;
+  }
+  if (!MetaDigest(cached.meta, &out->digest)) out->digest = PMSCatalogueDigest(cached.body);
+  out->body = std::move(cached.body);
+  out->has_body = true;
+  return true;
+}
+
+bool FetchText(const std::string& url, const std::string& language, bool force,
+               const Json::Value& extra, std::string& body) {
+  CatalogueText text;
+  if (!FetchText(url, language, force, extra, CatalogueBody::kAlways, &text)) return false;
+  body = std::move(text.body);
   return true;
 }
 
@@ -200,8 +257,22 @@ std::string PMSVendorCatalogueUrl() {
 }
 
 bool PMSCatalogueText(const std::string& url, bool forceReload, const std::string& language,
-                      std::string& body, std::string& cache_name) {
-  return FetchText(url, language, forceReload, Json::Value(), body, &cache_name);
+                      CatalogueBody want, CatalogueText* text) {
+  return FetchText(url, language, forceReload, Json::Value(), want, text);
+}
+
+uint64_t PMSCatalogueDigest(std::string_view text) {
+  constexpr uint64_t kPrime = 1099511628211ULL;
+  uint64_t h = 1469598103934665603ULL ^ text.size();
+  size_t i = 0;
+  for (; i + 8 <= text.size(); i += 8) {
+    uint64_t word;
+    memcpy(&word, text.data() + i, sizeof(word));
+    h = (h ^ word) * kPrime;
+    h ^= h >> 32;
+  }
+  for (; i < text.size(); ++i) h = (h ^ static_cast<unsigned char>(text[i])) * kPrime;
+  return h;
 }
 
 const Json::Value* PMSCatalogueEntries(const Json::Value& answer) {

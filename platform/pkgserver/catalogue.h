@@ -12,7 +12,9 @@
 // cached or returned. Every failure is logged with the server and the reason.
 #pragma once
 
+#include <cstdint>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include <json/value.h>
@@ -40,11 +42,27 @@ std::string PMSVendorCatalogueUrl();
 // The feeds' catalogue addresses, in the order of the feed file.
 std::vector<std::string> PMSFeedUrls();
 
-// One server's catalogue as text, cached or fetched as the queries above do
-// it, and the name of its cache file: files derived from a catalogue are
-// named after it. False (logged) when the server gave no usable answer.
+// A 64-bit digest of catalogue text: which catalogue a file derived from
+// one was made from. FNV-1a over 8-byte words with the high half folded back
+// at each step: a few instructions per word, for it runs over megabytes at
+// every request, and any one changed word changes it.
+uint64_t PMSCatalogueDigest(std::string_view text);
+
+struct CatalogueText {
+  std::string cache_name;  // the cache file's name: derived files are named after it
+  uint64_t digest = 0;     // PMSCatalogueDigest of the text
+  bool has_body = false;
+  std::string body;  // the text, when has_body
+};
+enum class CatalogueBody { kAlways, kIfNeeded };
+
+// One server's catalogue, cached or fetched as the queries above do it.
+// With kIfNeeded the text of a fresh cached copy is not read (the cache
+// names its digest): a caller that has what it derived from that digest
+// needs no more; otherwise it asks again with kAlways. False (logged) when
+// the server gave no usable answer.
 bool PMSCatalogueText(const std::string& url, bool forceReload, const std::string& language,
-                      std::string& body, std::string& cache_name);
+                      CatalogueBody want, CatalogueText* text);
 
 // The entries of a catalogue answer: its "packages" (object form) or the
 // answer itself (array form); null for anything else.

@@ -28,27 +28,16 @@ namespace {
 // file's layout changes: files of another version are rendered again.
 constexpr int kListingFormat = 1;
 constexpr char kMagic[] = "kivo-listing";
+// A listing is about as large as its catalogue (at most catalogue_max_bytes,
+// 16 MiB by default); a larger file is no listing of ours.
+constexpr size_t kMaxListingBytes = 64 << 20;
 
 std::string ListingDir() { return KIVORootPath("/var/cache/kivo/pkgserver/listing"); }
 
 const char* SideName(ListingSide side) { return side == ListingSide::kVendor ? "kivo" : "others"; }
 
-// A 64-bit checksum of `size` bytes: which catalogue a file was rendered
-// from, and whether the file is still what was written. It is FNV-1a over
-// 8-byte words with the high half folded back each step, a few instructions
-// per word: it runs over a megabyte or two at every request.
 uint64_t Digest(const char* data, size_t size) {
-  constexpr uint64_t kPrime = 1099511628211ULL;
-  uint64_t h = 1469598103934665603ULL ^ size;
-  size_t i = 0;
-  for (; i + 8 <= size; i += 8) {
-    uint64_t word;
-    memcpy(&word, data + i, sizeof(word));
-    h = (h ^ word) * kPrime;
-    h ^= h >> 32;
-  }
-  for (; i < size; ++i) h = (h ^ static_cast<unsigned char>(data[i])) * kPrime;
-  return h;
+  return PMSCatalogueDigest(std::string_view(data, size));
 }
 
 std::string Text(const Json::Value& v) { return v.isString() ? v.asString() : ""; }
@@ -215,11 +204,10 @@ bool ReadEntry(FieldReader& fields, ListingEntry* e) {
 
 // The listing of file text `file` when it is whole and was rendered from the
 // catalogue with digest `catalogue` for `side`.
-bool Parse(const std::string& file, ListingSide side, uint64_t catalogue,
-           CatalogueListing* listing) {
+bool Parse(std::string_view file, ListingSide side, uint64_t catalogue, CatalogueListing* listing) {
   size_t newline = file.find('\n');
   if (newline == std::string::npos || newline > 160) return false;
-  const std::string header = file.substr(0, newline);
+  const std::string header(file.substr(0, newline));
   char magic[16], side_name[16];
   int format = 0, used = 0;
   unsigned long long digest = 0, checksum = 0;
@@ -246,38 +234,50 @@ bool Parse(const std::string& file, ListingSide side, uint64_t catalogue,
   return fields.AtEnd();
 }
 
+// The listing of catalogue `cat` from its file, when that is current and
+// whole.
+bool ReadListing(const std::string& path, const CatalogueText& cat, ListingSide side,
+                 CatalogueListing::Text* file, CatalogueListing* one) {
+  return file->mapped.Open(path, kMaxListingBytes) &&
+         Parse(file->mapped.text(), side, cat.digest, one);
+}
+
+// Renders catalogue `cat` (its text read now if need be) and replaces the
+// listing file.
+bool RenderListing(const std::string& url, const std::string& language, const std::string& path,
+                   CatalogueText* cat, ListingSide side, CatalogueListing::Text* file,
+                   CatalogueListing* one) {
+  if (!cat->has_body && !PMSCatalogueText(url, false, language, CatalogueBody::kAlways, cat)) {
+    return false;
+  }
+  if (!Render(cat->body, cat->digest, side, url, &file->rendered)) return false;
+  if (KIVOFSMkdirP(ListingDir().c_str()) != 0 ||
+      !KIVOWriteFileAtomic(path, file->rendered, SyncToDisk::No)) {
+    syslog(LOG_WARNING, "%s:%d cannot write the catalogue listing %s", "catalogue_listing",
+           __LINE__, path.c_str());
+  }
+  if (Parse(file->rendered, side, cat->digest, one)) return true;
+  LISTING_LOG("%s: the rendered listing does not read back", url.c_str());
+  return false;
+}
+
 // One catalogue's listing added to `*listing`: from its file when that is
 // current and whole, else rendered and the file replaced.
-bool LoadListing(const std::string& url, const std::string& body, const std::string& cache_name,
-                 ListingSide side, CatalogueListing* listing) {
-  const uint64_t catalogue = Digest(body.data(), body.size());
-  const std::string path = ListingDir() + "/" + cache_name + "." + SideName(side);
-  auto file = std::make_unique<std::string>();
+bool ListOne(const std::string& url, bool force, const std::string& language, ListingSide side,
+             CatalogueListing* listing) {
+  CatalogueText cat;
+  if (!PMSCatalogueText(url, force, language, CatalogueBody::kIfNeeded, &cat)) return false;
+  const std::string path = ListingDir() + "/" + cat.cache_name + "." + SideName(side);
+  auto file = std::make_unique<CatalogueListing::Text>();
   CatalogueListing one;
-  if (!KIVOReadFile(path, file.get()) || !Parse(*file, side, catalogue, &one)) {
+  if (!ReadListing(path, cat, side, file.get(), &one)) {
     one = CatalogueListing();
-    if (!Render(body, catalogue, side, url, file.get())) return false;
-    if (KIVOFSMkdirP(ListingDir().c_str()) != 0 ||
-        !KIVOWriteFileAtomic(path, *file, SyncToDisk::No)) {
-      syslog(LOG_WARNING, "%s:%d cannot write the catalogue listing %s", "catalogue_listing",
-             __LINE__, path.c_str());
-    }
-    if (!Parse(*file, side, catalogue, &one)) {
-      LISTING_LOG("%s: the rendered listing does not read back", url.c_str());
-      return false;
-    }
+    if (!RenderListing(url, language, path, &cat, side, file.get(), &one)) return false;
   }
   listing->files.push_back(std::move(file));
   for (ListingEntry& e : one.entries) listing->entries.push_back(std::move(e));
   if (listing->recommend.empty()) listing->recommend = std::move(one.recommend);
   return true;
-}
-
-bool ListOne(const std::string& url, bool force, const std::string& language, ListingSide side,
-             CatalogueListing* listing) {
-  std::string body, cache_name;
-  return PMSCatalogueText(url, force, language, body, cache_name) &&
-         LoadListing(url, body, cache_name, side, listing);
 }
 
 }  // namespace

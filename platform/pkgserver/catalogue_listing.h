@@ -23,6 +23,8 @@
 #include <string_view>
 #include <vector>
 
+#include "pkgserver/mapped_file.h"
+
 namespace KIVOPackageServer {
 
 enum class ListingSide { kVendor, kFeeds };
@@ -43,9 +45,13 @@ struct CatalogueListing {
   // Vendor side: the distinct names of the server's "recommend" list, in
   // its order (a name counts at its first place).
   std::vector<std::string> recommend;
-  // The listing files' text that the entries view: a megabyte of entries
-  // is read once and not copied.
-  std::vector<std::unique_ptr<const std::string>> files;
+  // The listing files' text that the entries view (mapped, or rendered
+  // when the file was not usable): a megabyte of entries is not copied.
+  struct Text {
+    MappedFile mapped;
+    std::string rendered;
+  };
+  std::vector<std::unique_ptr<Text>> files;
 };
 
 // The vendor's catalogue (kVendor) or every feed's catalogue one after the
