@@ -4,6 +4,7 @@
 // while it is rendered all answered alike.
 
 #include <dirent.h>
+#include <functional>
 #include <sys/stat.h>
 #include <thread>
 #include <vector>
@@ -81,22 +82,28 @@ class ServerListingTest : public ::testing::Test {
     if (stat(ListingFile().c_str(), &st) != 0) return -1;
     return st.st_mtim.tv_sec * 1000000000LL + st.st_mtim.tv_nsec;
   }
-  // Makes the cached catalogue look fetched long ago, so that the next
-  // listing asks the server with its ETag.
-  void ExpireCachedCatalogue() {
+  // Applies `edit` to the text of every cached catalogue file.
+  void EditCachedCatalogues(const std::function<void(std::string*)>& edit) {
     std::string dir = root_.Path("/var/cache/kivo/pkgserver");
     DIR* d = opendir(dir.c_str());
     ASSERT_NE(nullptr, d);
     while (struct dirent* e = readdir(d)) {
       std::string path = dir + "/" + e->d_name, text;
       if (e->d_type != DT_REG || !KIVOReadFile(path, &text)) continue;
-      size_t at = text.find("\"fetched\":");
-      ASSERT_NE(std::string::npos, at) << path;
-      at += 10;
-      text.replace(at, text.find_first_not_of("0123456789", at) - at, "0");
+      edit(&text);
       ASSERT_TRUE(KIVOWriteFileAtomic(path, text, SyncToDisk::No));
     }
     closedir(d);
+  }
+  // Makes the cached catalogue look fetched long ago, so that the next
+  // listing asks the server with its ETag.
+  void ExpireCachedCatalogue() {
+    EditCachedCatalogues([](std::string* text) {
+      size_t at = text->find("\"fetched\":");
+      ASSERT_NE(std::string::npos, at);
+      at += 10;
+      text->replace(at, text->find_first_not_of("0123456789", at) - at, "0");
+    });
   }
 
   TempRoot root_;
@@ -135,6 +142,30 @@ TEST_F(ServerListingTest, ChangedCatalogueIsRenderedAgainAndAnUnchangedOneIsNot)
   EXPECT_NE(rendered, ReadListing());
   // And the same answer again from the new listing.
   EXPECT_EQ(changed.body, List().body);
+}
+
+TEST_F(ServerListingTest, CacheWithoutADigestIsListedAndGetsOneFromA304) {
+  feed_.Publish("\"v1\"");
+  client();
+  CgiAnswer first = List();
+  ASSERT_TRUE(first.Success()) << first.body;
+  // As a cache written before its meta named the text's digest.
+  auto drop_digest = [](std::string* text) {
+    size_t at = text->find("\"digest\":\"");
+    ASSERT_NE(std::string::npos, at);
+    text->erase(at, text->find(',', at) + 1 - at);
+  };
+  EditCachedCatalogues(drop_digest);
+  const long long written = ListingWritten();
+  EXPECT_EQ(first.body, List().body);
+  EXPECT_EQ(written, ListingWritten());  // the text's own digest matched
+  ExpireCachedCatalogue();
+  EXPECT_EQ(first.body, List().body);
+  EXPECT_EQ(2, server_.Requests("/feed/catalogue.json"));
+  std::string named;
+  EditCachedCatalogues([&named](std::string* text) { named = text->substr(0, text->find('\n')); });
+  EXPECT_NE(std::string::npos, named.find("\"digest\":\"")) << named;
+  EXPECT_EQ(first.body, List().body);
 }
 
 TEST_F(ServerListingTest, InstalledAndUninstalledPackagesShowAtOnce) {
