@@ -2,7 +2,6 @@
 
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
 #include <memory>
 #include <set>
 #include <sstream>
@@ -35,10 +34,6 @@ constexpr size_t kMaxListingBytes = 64 << 20;
 std::string ListingDir() { return KIVORootPath("/var/cache/kivo/pkgserver/listing"); }
 
 const char* SideName(ListingSide side) { return side == ListingSide::kVendor ? "kivo" : "others"; }
-
-uint64_t Digest(const char* data, size_t size) {
-  return PMSCatalogueDigest(std::string_view(data, size));
-}
 
 std::string Text(const Json::Value& v) { return v.isString() ? v.asString() : ""; }
 
@@ -156,8 +151,7 @@ bool Render(const std::string& body, uint64_t catalogue, ListingSide side, const
   std::unique_ptr<Json::StreamWriter> writer(AnswerJsonWriter().newStreamWriter());
   size_t entries = 0;
   for (Json::Value& element : *list) entries += RenderEntry(element, side, *writer, &fields);
-  *file = Header(side, catalogue, Digest(fields.data(), fields.size()), entries, recommend.size()) +
-          fields;
+  *file = Header(side, catalogue, PMSCatalogueDigest(fields), entries, recommend.size()) + fields;
   return true;
 }
 
@@ -220,8 +214,12 @@ bool Parse(std::string_view file, ListingSide side, uint64_t catalogue, Catalogu
   }
   const char* begin = file.data() + newline + 1;
   const char* end = file.data() + file.size();
-  if (Digest(begin, end - begin) != checksum || entries > file.size() || recommend > file.size())
+  // Every entry takes four fields of at least three bytes ("0:,"), every
+  // name one: larger counts are no listing of ours.
+  if (PMSCatalogueDigest(std::string_view(begin, end - begin)) != checksum ||
+      entries > file.size() / 12 || recommend > file.size() / 3) {
     return false;
+  }
   FieldReader fields(begin, end);
   listing->recommend.resize(recommend);
   for (std::string& name : listing->recommend) {
