@@ -126,6 +126,8 @@ class EntryOverlay {
       for (; member != members.end() && member->first < name; ++member)
         Append(member->second, &out);
       if (member != members.end() && member->first == name) ++member;
+      // The overlay's names are the plain ones of this file ("status",
+      // "url", ...): quoted as they stand, as the writer quotes them.
       Append("\"" + name + "\":" + Written(overlay[name]), &out);
     }
     for (; member != members.end(); ++member) Append(member->second, &out);
@@ -170,6 +172,9 @@ class EntryOverlay {
     Json::Value entry;
     if (!reader->parse(text.data(), text.data() + text.size(), &entry, nullptr) ||
         !entry.isObject()) {
+      // Listing texts are checked against their file's checksum, so this is
+      // a fault of ours: the entry goes out without the appliance's state.
+      PKG_LOG_ERR("A listing entry is not a JSON object: %.80s", std::string(text).c_str());
       return std::string(text);
     }
     for (const std::string& name : overlay.getMemberNames()) entry[name] = overlay[name];
