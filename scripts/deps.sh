@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the project needs to build, test and run,
 # when any is missing. Needs root for the install (apt-get update first).
+# --tests adds what only the tests need.
 set -euo pipefail
 
 # The page is built with Node.js and npm, which the machine brings (20.19 or
@@ -15,8 +16,9 @@ PACKAGES=(
   libjsoncpp-dev libcrypt-dev libgtest-dev googletest
   libarchive-dev libsqlite3-dev libcurl4-openssl-dev libgpgme-dev libpoco-dev libssl-dev libpng-dev
   lighttpd php-cli gnupg curl procps
-  chromium
 )
+# The page's browser tests drive Debian's chromium; the demo does not need it.
+[ "${1:-}" = --tests ] && PACKAGES+=(chromium)
 
 missing=()
 for p in "${PACKAGES[@]}"; do

@@ -9,7 +9,7 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
-scripts/deps.sh
+scripts/deps.sh --tests
 
 # The committed .clang-format is the style; a change that drifts from it
 # fails here, before any build, so reviews never argue about layout.
