@@ -60,6 +60,14 @@ test('the list shows each installed package with its state and the upgrade a ser
   await page.waitForFunction((img) => img instanceof HTMLImageElement && img.complete && img.naturalWidth > 0, icon);
   await screenshot(page, 'installed');
   await checkAccessibility(page, 'installed');
+
+  // Nothing runs, so the page asks the appliance nothing while it is shown.
+  const calls: string[] = [];
+  const count = (r: { url: () => string }) => r.url().includes('/webapi/') && calls.push(r.url());
+  page.on('request', count);
+  await new Promise((r) => setTimeout(r, 4000));
+  page.off('request', count);
+  assert.deepEqual(calls, []);
 });
 
 test('a package shows its details, its web address while it runs, what it needs, and its log', async () => {
