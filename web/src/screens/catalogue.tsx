@@ -96,14 +96,16 @@ function entriesOf(catalogue: Catalogue): ServerEntry[] {
 }
 
 // The tasks the appliance reports win; the page's own notes stay until the
-// package has a task again.
+// package has a task again. A download the page follows stays followed even
+// when the answer does not report it: the list may have been asked before
+// the download started, and the progress itself sees when the task ends.
 function mergePhases(previous: Record<string, Phase>, entries: ServerEntry[]): Record<string, Phase> {
   const next: Record<string, Phase> = {};
   for (const entry of entries) {
     const reported = phaseOf(entry);
     const kept = previous[entry.id];
     if (reported) next[entry.id] = reported;
-    else if (kept && (kept.kind === 'note' || kept.kind === 'starting')) next[entry.id] = kept;
+    else if (kept && (kept.kind === 'note' || kept.kind === 'starting' || kept.kind === 'running')) next[entry.id] = kept;
   }
   return next;
 }
@@ -213,11 +215,16 @@ export function CatalogueScreen() {
   // Packages whose download this page started: their wizard opens by itself
   // when the download is done (another tab only offers to continue).
   const mine = useRef(new Set<string>());
+  // Loads can overlap (a refresh while the one after an install runs): only
+  // the latest one's answer is shown, never an older one that came last.
+  const latestLoad = useRef(0);
 
   const load = useCallback(
     async (reload = false) => {
+      const ticket = ++latestLoad.current;
       setLoading(true);
       const next = await loadCatalogue(api, reload);
+      if (ticket !== latestLoad.current) return;
       setCatalogue(next);
       setPhases((previous) => mergePhases(previous, entriesOf(next)));
       setLoading(false);
