@@ -10,7 +10,7 @@ import { execFileSync } from 'node:child_process';
 import { readdirSync, readFileSync } from 'node:fs';
 import { createServer, type Server } from 'node:http';
 import type { AddressInfo } from 'node:net';
-import type { Browser, Locator, Page } from 'playwright-core';
+import type { Browser, BrowserContext, Locator, Page } from 'playwright-core';
 import { Appliance, kPassword } from './appliance.ts';
 import { checkAccessibility, launch, openPage, screenshot, signIn, type Watch } from './browser.ts';
 
@@ -84,6 +84,15 @@ async function openCatalogue(page: Page): Promise<void> {
   await listed.waitFor();
 }
 
+// A browser context of its own, signed in and showing the catalogue.
+async function signedInCatalogue(): Promise<{ context: BrowserContext; page: Page }> {
+  const context = await browser.newContext();
+  const page = await openPage(context, appliance.url, watch);
+  await signIn(page);
+  await openCatalogue(page);
+  return { context, page };
+}
+
 // The download bar's value, waiting until the bar shows a number.
 async function downloadPercent(scope: Locator): Promise<number> {
   const bar = scope.getByRole('progressbar');
@@ -117,10 +126,7 @@ after(async () => {
 });
 
 test('the catalogue shows icons, recommendations first in the server order, the beta mark, the upgrade and the feed', async () => {
-  const context = await browser.newContext();
-  const page = await openPage(context, appliance.url, watch);
-  await signIn(page);
-  await openCatalogue(page);
+  const { context, page } = await signedInCatalogue();
 
   const recommended = page.getByRole('list').first();
   assert.deepEqual(await recommended.getByRole('heading').allTextContents(), ['Demo Web', 'Demo Beta']);
@@ -150,10 +156,7 @@ test('the catalogue shows icons, recommendations first in the server order, the 
 });
 
 test('demo-wizard installs from the server through its wizard, with progress, and its answer arrives', async () => {
-  const context = await browser.newContext();
-  const page = await openPage(context, appliance.url, watch);
-  await signIn(page);
-  await openCatalogue(page);
+  const { context, page } = await signedInCatalogue();
 
   await card(page, 'Demo Wizard').getByRole('button', { name: 'Install Demo Wizard' }).click();
   const dialog = page.getByRole('dialog', { name: 'Install Demo Wizard' });
@@ -177,10 +180,7 @@ test('demo-wizard installs from the server through its wizard, with progress, an
 });
 
 test('a download goes on across a reload and shows in a second tab; cancelling it ends it everywhere', async () => {
-  const context = await browser.newContext();
-  const page = await openPage(context, appliance.url, watch);
-  await signIn(page);
-  await openCatalogue(page);
+  const { context, page } = await signedInCatalogue();
 
   await card(page, 'Demo Slow').getByRole('button', { name: 'Install Demo Slow' }).click();
   const before = await downloadPercent(card(page, 'Demo Slow'));
@@ -213,10 +213,7 @@ test('a download goes on across a reload and shows in a second tab; cancelling i
 });
 
 test('a withdrawn package file fails with the server message, and a community package installs from its feed', async () => {
-  const context = await browser.newContext();
-  const page = await openPage(context, appliance.url, watch);
-  await signIn(page);
-  await openCatalogue(page);
+  const { context, page } = await signedInCatalogue();
 
   await card(page, 'Demo Gone').getByRole('button', { name: 'Install Demo Gone' }).click();
   await card(page, 'Demo Gone').getByRole('alert').filter({ hasText: 'the server answered HTTP 404' }).waitFor();

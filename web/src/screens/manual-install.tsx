@@ -10,11 +10,9 @@ import { ProgressBar } from '../ui/progress';
 import { Steps, type StepPage } from '../ui/steps';
 import {
   CheckRefusal,
-  initialChoices,
+  checkEnvironment,
   installPages,
   installParams,
-  loadDefaultVolume,
-  readVolumes,
   type InstallChoices,
   type PackageFacts,
   type Volume,
@@ -86,11 +84,6 @@ function checkParams(upload: UploadAnswer) {
 }
 
 async function prepare(api: Api, upload: UploadAnswer): Promise<Result<Prepared>> {
-  const [check, defaultVolume] = await Promise.all([
-    api.call<CheckAnswer>(kApi, 'check', 2, checkParams(upload)),
-    loadDefaultVolume(api),
-  ]);
-  if (!check.ok) return check;
   const facts: PackageFacts = {
     id: upload.id,
     name: upload.name,
@@ -98,12 +91,10 @@ async function prepare(api: Api, upload: UploadAnswer): Promise<Result<Prepared>
     licence: upload.licence,
     installPages: upload.install_pages,
   };
-  const volumes = readVolumes(check.data);
-  const initial = initialChoices(facts, volumes, check.data.volume_path ?? '', defaultVolume.ok ? defaultVolume.data : '');
-  return {
-    ok: true,
-    data: { upload, facts, volumes, busy: check.data.is_occupied === true, defaultVolumeError: defaultVolume.ok ? null : defaultVolume.error, initial },
-  };
+  const environment = await checkEnvironment<CheckAnswer>(api, facts, checkParams(upload));
+  if (!environment.ok) return environment;
+  const { answer, volumes, choices, defaultVolumeError } = environment.data;
+  return { ok: true, data: { upload, facts, volumes, busy: answer.is_occupied === true, defaultVolumeError, initial: choices } };
 }
 
 function clean(api: Api, taskId: string): void {

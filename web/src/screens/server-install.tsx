@@ -13,11 +13,9 @@ import { Dialog } from '../ui/dialog';
 import { ErrorText } from '../ui/error-text';
 import {
   CheckRefusal,
-  initialChoices,
+  checkEnvironment,
   installPages,
   installParams,
-  loadDefaultVolume,
-  readVolumes,
   type InstallChoices,
   type PackageFacts,
   type Volume,
@@ -74,22 +72,18 @@ export function ServerInstall({ entry, taskId, onClose }: { entry: ServerEntry; 
         licence: file.data.license,
         installPages: file.data.install_pages,
       };
-      const [environment, defaultVolume] = await Promise.all([
-        api.call<{ volume_path?: string }>('KIVO.Core.Package.Installation', 'check', 2, {
-          id: facts.id,
-          ver: facts.version,
-          size: entry.size ?? 0,
-          deppkgs: entry.deppkgs,
-          conflictpkgs: entry.conflictpkgs,
-          depsers: entry.install_dep_services,
-        }),
-        loadDefaultVolume(api),
-      ]);
+      const environment = await checkEnvironment<{ volume_path?: string }>(api, facts, {
+        id: facts.id,
+        ver: facts.version,
+        size: entry.size ?? 0,
+        deppkgs: entry.deppkgs,
+        conflictpkgs: entry.conflictpkgs,
+        depsers: entry.install_dep_services,
+      });
       if (stale) return;
       if (!environment.ok) return setState({ kind: 'refused', error: environment.error, downloadGone: false });
-      const volumes = readVolumes(environment.data);
-      setChoices(initialChoices(facts, volumes, environment.data.volume_path ?? '', defaultVolume.ok ? defaultVolume.data : ''));
-      setState({ kind: 'ready', facts, volumes });
+      setChoices(environment.data.choices);
+      setState({ kind: 'ready', facts, volumes: environment.data.volumes });
     })();
     return () => {
       stale = true;

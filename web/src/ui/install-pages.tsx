@@ -24,7 +24,7 @@
 //   appliance with none set answers an empty string, not a failure.
 
 import './install-pages.css';
-import type { Api, ApiFailure, Result } from '../api/client';
+import type { Api, ApiFailure, Params, Result } from '../api/client';
 import { explain } from '../api/messages';
 import type { StepPage } from './steps';
 import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from './wizard';
@@ -81,6 +81,35 @@ export function decodeLicence(encoded: unknown): string | null {
   } catch {
     return encoded;
   }
+}
+
+// What the environment check says, made ready for the install pages.
+export interface Environment<T> {
+  answer: T;
+  volumes: Volume[];
+  choices: InstallChoices;
+  // The default volume could not be read: the volume page still works, with
+  // no default preselected.
+  defaultVolumeError: ApiFailure | null;
+}
+
+// Runs the environment check ("Installation" "check", version 2, with
+// `params`) and reads the default volume at the same time, then offers the
+// check's volumes with the right one preselected. A refused check answers
+// its failure.
+export async function checkEnvironment<T extends { volume_path?: string }>(
+  api: Api,
+  facts: PackageFacts,
+  params: Params,
+): Promise<Result<Environment<T>>> {
+  const [check, defaultVolume] = await Promise.all([
+    api.call<T>('KIVO.Core.Package.Installation', 'check', 2, params),
+    loadDefaultVolume(api),
+  ]);
+  if (!check.ok) return check;
+  const volumes = readVolumes(check.data);
+  const choices = initialChoices(facts, volumes, check.data.volume_path ?? '', defaultVolume.ok ? defaultVolume.data : '');
+  return { ok: true, data: { answer: check.data, volumes, choices, defaultVolumeError: defaultVolume.ok ? null : defaultVolume.error } };
 }
 
 // `installedOn` is the volume of an already installed version (check's
