@@ -166,7 +166,10 @@ void WorkerDownload(const std::string& url, const std::string& md5, const char* 
   struct rusage usage;
   wait4(pid, &status, 0, &usage);
   double ms = Ms(t);
-  printf("%-28s %9.0f ms  peak memory %6.1f MiB%s\n", label, ms, usage.ru_maxrss / 1024.0,
+  double cpu_ms = (usage.ru_utime.tv_sec + usage.ru_stime.tv_sec) * 1e3 +
+                  (usage.ru_utime.tv_usec + usage.ru_stime.tv_usec) / 1e3;
+  printf("%-28s %9.0f ms  cpu %6.0f ms  peak memory %6.1f MiB%s\n", label, ms, cpu_ms,
+         usage.ru_maxrss / 1024.0,
          WIFEXITED(status) && WEXITSTATUS(status) == 0 ? "" : "  (FAILED)");
   close(fds[0]);
   close(fds[1]);

@@ -21,14 +21,30 @@ struct Server {
   int listen_fd;
   int signal_fd;
   ScgiServerOptions options;
+  // The signals not handled by default here, which each child resets.
+  sigset_t not_default;
   int live = 0;
 };
 
+// The signals whose handling is not the default in this process. Asked once,
+// so that a child resets only these instead of asking the kernel about every
+// signal on each request.
+sigset_t SignalsNotDefault() {
+  sigset_t found;
+  sigemptyset(&found);
+  for (int sig = 1; sig < NSIG; ++sig) {
+    struct sigaction current;
+    if (sigaction(sig, nullptr, &current) == 0 && current.sa_handler != SIG_DFL)
+      sigaddset(&found, sig);
+  }
+  return found;
+}
+
 // A child starts like a program the web server runs: default handling for
 // every signal, none blocked.
-void RestoreDefaultSignals() {
+void RestoreDefaultSignals(const sigset_t& not_default) {
   for (int sig = 1; sig < NSIG; ++sig) {
-    if (sig != SIGKILL && sig != SIGSTOP) signal(sig, SIG_DFL);
+    if (sigismember(&not_default, sig) == 1) signal(sig, SIG_DFL);
   }
   sigset_t none;
   sigemptyset(&none);
@@ -62,7 +78,7 @@ void StartChild(Server* server, int conn) {
   if (pid == 0) {
     close(server->listen_fd);
     close(server->signal_fd);
-    RestoreDefaultSignals();
+    RestoreDefaultSignals(server->not_default);
     ServeScgiConnection(conn, server->options.read_timeout_seconds);
   }
   close(conn);
@@ -96,7 +112,8 @@ int RunScgiServer(int listen_fd, const ScgiServerOptions& options) {
   // Blocked, these signals queue on a descriptor that poll watches with the
   // listening socket: no handler runs between accept and fork.
   sigprocmask(SIG_BLOCK, &watched, nullptr);
-  Server server{listen_fd, signalfd(-1, &watched, SFD_CLOEXEC | SFD_NONBLOCK), options};
+  Server server{listen_fd, signalfd(-1, &watched, SFD_CLOEXEC | SFD_NONBLOCK), options,
+                SignalsNotDefault()};
   if (server.signal_fd < 0 ||
       fcntl(listen_fd, F_SETFL, fcntl(listen_fd, F_GETFL) | O_NONBLOCK) != 0) {
     syslog(LOG_ERR, "%s:%d cannot set up the server: %m", "scgi_server", __LINE__);

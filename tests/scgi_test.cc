@@ -40,6 +40,17 @@ std::string Get(const WebServer& server, const std::string& query) {
       server.port(), "GET /webapi/entry.cgi?" + query + " HTTP/1.0\r\nHost: 127.0.0.1\r\n\r\n");
 }
 
+// The hexadecimal signal mask on line `field` ("SigBlk", "SigIgn", "SigCgt")
+// of /proc/<pid>/status; empty when the process is gone.
+std::string SignalMask(pid_t pid, const std::string& field) {
+  std::string status;
+  if (!KIVOReadFile("/proc/" + std::to_string(pid) + "/status", &status)) return "";
+  size_t at = status.find("\n" + field + ":\t");
+  if (at == std::string::npos) return "";
+  at += field.size() + 3;
+  return status.substr(at, status.find('\n', at) - at);
+}
+
 bool Succeeded(const std::string& response) {
   return response.compare(0, 15, "HTTP/1.0 200 OK") == 0 &&
          response.find("\"success\":true") != std::string::npos;
@@ -162,7 +173,11 @@ TEST_F(ScgiTest, RawAnswersAndLongLivedWorkersBehaveAlikeInBothModes) {
     for (const char* name : {"worker.pid", "worker.done"})
       unlink(root_.Path(std::string("/tmp/") + name).c_str());
     unlink(root_.Path("/tmp/release").c_str());
+    // An ignored signal that the server inherits: a request process must
+    // still start with every signal handled by default and none blocked.
+    signal(SIGUSR2, SIG_IGN);
     WebServer server(root_.dir(), Options(mode));
+    signal(SIGUSR2, SIG_DFL);
     ASSERT_TRUE(server.running());
     std::string raw = Frame(server, "raw_status");
     EXPECT_EQ(0u, raw.find("HTTP/1.0 404 Not Found")) << raw;
@@ -175,6 +190,11 @@ TEST_F(ScgiTest, RawAnswersAndLongLivedWorkersBehaveAlikeInBothModes) {
     pid_t worker = PidFile(root_, "worker.pid");
     EXPECT_EQ(0, kill(worker, 0));
     EXPECT_FALSE(PidFile(root_, "worker.done"));
+    if (mode == WebMode::kScgi) {
+      EXPECT_NE(0u, std::stoull(SignalMask(server.WebdPid(), "SigIgn"), nullptr, 16));
+      for (const char* field : {"SigBlk", "SigIgn", "SigCgt"})
+        EXPECT_EQ(0u, std::stoull(SignalMask(worker, field), nullptr, 16)) << field;
+    }
     root_.Write("/tmp/release", "");
     EXPECT_TRUE(Eventually([&] { return PidFile(root_, "worker.done") == worker; }));
   }
