@@ -14,6 +14,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <string>
+#include <sys/auxv.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -120,9 +121,13 @@ int ListenAt(const std::string& path) {
 // The variable is dropped once the loader has read it, so that programs the
 // request code runs start as usual.
 void BindEverythingNow(char** argv) {
+  const char* bind_now = getenv("LD_BIND_NOW");
   char self[4096];
-  ssize_t size = readlink("/proc/self/exe", self, sizeof(self) - 1);
-  if (!getenv("LD_BIND_NOW") && size > 0) {
+  ssize_t size = readlink("/proc/self/exe", self, sizeof(self));
+  // A set-id start may lose the variable on the way: it would start again
+  // for ever, so it goes on lazily bound.
+  if ((!bind_now || !*bind_now) && size > 0 && size < static_cast<ssize_t>(sizeof(self)) &&
+      !getauxval(AT_SECURE)) {
     // Through its own file name, so that the process keeps its name.
     self[size] = '\0';
     setenv("LD_BIND_NOW", "1", 1);
