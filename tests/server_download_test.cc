@@ -183,8 +183,19 @@ TEST_F(ServerDownloadTest, ChecksumMismatchAndOversizeFailInWordsAndLeaveNothing
 }
 
 TEST_F(ServerDownloadTest, DroppedConnectionResumesFromTheBytesOnDisk) {
+  // Several of the digest threads' blocks, dropped inside the second one: the
+  // bytes on disk and the resumed rest must make the catalogue's md5 and
+  // sha256, or the install is refused.
+  TestPackage big;
+  big.id = "dl-app";
+  big.daemon = false;
+  big.files = {{"data.bin", Noise(3 * 1024 * 1024)}};
+  feed_.Add(big);
+  ASSERT_TRUE(feed_.Index());
+  ASSERT_FALSE(feed_.Entry("dl-app")["sha256"].asString().empty());
+  Republish();
   HttpRoute drop;
-  drop.drop_after = 100 * 1024;
+  drop.drop_after = 1536 * 1024;
   drop.drop_times = 1;
   feed_.SetFileRoute("dl-app", drop);
   ASSERT_TRUE(Call("install", {{"name", "dl-app"}, {"blqinst", "true"}}).Success());
@@ -193,7 +204,7 @@ TEST_F(ServerDownloadTest, DroppedConnectionResumesFromTheBytesOnDisk) {
   const std::string path =
       "/feed/" + feed_.FilePath("dl-app").substr(feed_.FilePath("dl-app").rfind('/') + 1);
   EXPECT_EQ(2, server_.Requests(path));
-  EXPECT_NE(std::string::npos, server_.LastHeaders(path).find("Range: bytes=102400-"))
+  EXPECT_NE(std::string::npos, server_.LastHeaders(path).find("Range: bytes=1572864-"))
       << server_.LastHeaders(path);
 }
 

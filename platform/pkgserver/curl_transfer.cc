@@ -163,7 +163,9 @@ std::string Hex(const unsigned char* digest, unsigned size) {
 // A digest of a download on a thread of its own, so that hashing
 // one block overlaps receiving and writing the next: inline, the digests
 // took most of the worker's time and the server waited on a full socket.
-// At most kMaxQueued blocks wait, so memory stays flat in the file size.
+// Both digest threads read the same block, which nobody changes once it is
+// queued. At most kMaxQueued blocks wait, so memory stays flat in the file
+// size.
 class DigestThread {
  public:
   DigestThread(EVP_MD_CTX* md5, EVP_MD_CTX* sha256) : md5_(md5), sha256_(sha256) {}
@@ -178,12 +180,12 @@ class DigestThread {
   DigestThread(const DigestThread&) = delete;
   DigestThread& operator=(const DigestThread&) = delete;
 
-  void Feed(const char* data, size_t size) {
+  void Feed(const std::shared_ptr<const std::string>& block) {
     if (!md5_ && !sha256_) return;
     if (!thread_.joinable()) thread_ = std::thread(&DigestThread::Run, this);
     std::unique_lock<std::mutex> lock(mutex_);
     changed_.wait(lock, [this] { return queue_.size() < kMaxQueued; });
-    queue_.emplace_back(data, size);
+    queue_.push_back(block);
     changed_.notify_all();
   }
   // Returns once every block fed so far is in the digests.
@@ -193,20 +195,20 @@ class DigestThread {
   }
 
  private:
-  static constexpr size_t kMaxQueued = 8;
+  static constexpr size_t kMaxQueued = 4;
 
   void Run() {
     std::unique_lock<std::mutex> lock(mutex_);
     for (;;) {
       changed_.wait(lock, [this] { return closing_ || !queue_.empty(); });
       if (queue_.empty()) return;
-      std::string block = std::move(queue_.front());
+      std::shared_ptr<const std::string> block = std::move(queue_.front());
       queue_.pop_front();
       busy_ = true;
       changed_.notify_all();
       lock.unlock();
-      if (md5_) EVP_DigestUpdate(md5_, block.data(), block.size());
-      if (sha256_) EVP_DigestUpdate(sha256_, block.data(), block.size());
+      if (md5_) EVP_DigestUpdate(md5_, block->data(), block->size());
+      if (sha256_) EVP_DigestUpdate(sha256_, block->data(), block->size());
       lock.lock();
       busy_ = false;
       changed_.notify_all();
@@ -217,7 +219,7 @@ class DigestThread {
   EVP_MD_CTX* sha256_;
   std::mutex mutex_;
   std::condition_variable changed_;
-  std::deque<std::string> queue_;
+  std::deque<std::shared_ptr<const std::string>> queue_;
   bool busy_ = false;
   bool closing_ = false;
   std::thread thread_;
@@ -225,6 +227,10 @@ class DigestThread {
 
 class FileSink {
  public:
+  // Received pieces are gathered into blocks of this size before the digest
+  // threads get them: libcurl hands over a few kilobytes at a time, and
+  // waking both threads for each piece cost about a second of CPU per GiB.
+  static constexpr size_t kHashBlock = 1 << 20;
   FileSink(HttpDownload& d) : d_(d) {}
   ~FileSink() {
     if (fd_ >= 0) close(fd_);
@@ -262,6 +268,7 @@ class FileSink {
   }
   uint64_t have() const { return have_; }
   void Finish() {
+    FlushPending();
     Drain();
     unsigned char digest[EVP_MAX_MD_SIZE];
     unsigned size = 0;
@@ -276,13 +283,25 @@ class FileSink {
     sha256_hasher_->Drain();
   }
   bool ResetDigests() {
+    pending_.reset();
     Drain();
     return (!md5_ || EVP_DigestInit_ex(md5_.get(), EVP_md5(), nullptr)) &&
            (!sha256_ || EVP_DigestInit_ex(sha256_.get(), EVP_sha256(), nullptr));
   }
   void Hash(const char* data, size_t size) {
-    md5_hasher_->Feed(data, size);
-    sha256_hasher_->Feed(data, size);
+    if (!md5_ && !sha256_) return;
+    if (!pending_) {
+      pending_ = std::make_shared<std::string>();
+      pending_->reserve(kHashBlock);
+    }
+    pending_->append(data, size);
+    if (pending_->size() >= kHashBlock) FlushPending();
+  }
+  void FlushPending() {
+    if (!pending_) return;
+    std::shared_ptr<const std::string> block = std::move(pending_);
+    md5_hasher_->Feed(block);
+    sha256_hasher_->Feed(block);
   }
   // Bytes left by an earlier attempt count once the server resumes after them.
   bool HashExisting(uint64_t size) {
@@ -299,6 +318,7 @@ class FileSink {
   HttpDownload& d_;
   int fd_ = -1;
   uint64_t have_ = 0;
+  std::shared_ptr<std::string> pending_;
   Digest md5_, sha256_;
   // Declared after the digests it updates: it ends before they are freed.
   std::unique_ptr<DigestThread> md5_hasher_, sha256_hasher_;
