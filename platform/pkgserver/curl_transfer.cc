@@ -228,7 +228,7 @@ class DigestThread {
 class FileSink {
  public:
   // Received pieces are gathered into blocks of this size before the digest
-  // threads get them: libcurl hands over a few kilobytes at a time, and
+  // threads get them: libcurl hands over 16 KiB at a time, and
   // waking both threads for each piece cost about a second of CPU per GiB.
   static constexpr size_t kHashBlock = 1 << 20;
   FileSink(HttpDownload& d) : d_(d) {}
