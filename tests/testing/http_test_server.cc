@@ -190,8 +190,12 @@ void HttpTestServer::Serve(int fd) {
   size_t chunk = route.slow_chunk ? route.slow_chunk : limit;
   for (size_t sent = 0; sent < limit && !stopping_;) {
     size_t n = std::min(chunk, limit - sent);
+    if (sent < route.hold_after) n = std::min(n, route.hold_after - sent);
     if (!SendAll(fd, body.data() + sent, n)) return;
     sent += n;
+    if (sent == route.hold_after) {
+      while (!released_ && !stopping_) Pause(10);
+    }
     if (route.chunk_delay_ms && sent < limit) Pause(route.chunk_delay_ms);
   }
   if (drop) Pause(50);  // the client has the bytes before the connection goes

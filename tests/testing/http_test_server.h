@@ -25,6 +25,7 @@ struct HttpRoute {
   size_t drop_after = 0;   // when set: close after this many body bytes ...
   int drop_times = 0;      // ... for this many requests
   bool endless = false;    // a body without length that never ends
+  size_t hold_after = 0;   // when set: after this many body bytes, wait for Release()
 };
 
 class HttpTestServer {
@@ -43,6 +44,8 @@ class HttpTestServer {
   std::string LastHeaders(const std::string& path);
   // The query string of the last request for `path`.
   std::string LastQuery(const std::string& path);
+  // Lets every body held at its route's hold_after go on.
+  void Release() { released_ = true; }
 
  private:
   void Accept();
@@ -51,6 +54,7 @@ class HttpTestServer {
   int listen_fd_ = -1;
   int port_ = 0;
   std::atomic<bool> stopping_{false};
+  std::atomic<bool> released_{false};
   std::mutex mu_;
   std::map<std::string, HttpRoute> routes_;
   std::map<std::string, int> counts_;
