@@ -81,11 +81,11 @@ class ServerDownloadTest : public ::testing::Test {
                     .Call("KIVO.Core.Package.Server", "list", 1, {{"blforcereload", "true"}})
                     .Success());
   }
-  void Slow() {
-    HttpRoute slow;
-    slow.slow_chunk = 16 * 1024;
-    slow.chunk_delay_ms = 40;
-    feed_.SetFileRoute("dl-app", slow);
+  // The package file stops halfway until server_.Release().
+  void HoldHalfway() {
+    HttpRoute halfway;
+    halfway.hold_after = feed_.FileBody("dl-app").size() / 2;
+    feed_.SetFileRoute("dl-app", halfway);
   }
 
   TempRoot root_;
@@ -95,10 +95,7 @@ class ServerDownloadTest : public ::testing::Test {
 };
 
 TEST_F(ServerDownloadTest, DownloadShowsProgressThenChecksAndInstalls) {
-  // The server stops halfway until the test has seen the progress move.
-  HttpRoute halfway;
-  halfway.hold_after = feed_.FileBody("dl-app").size() / 2;
-  feed_.SetFileRoute("dl-app", halfway);
+  HoldHalfway();  // until the test has seen the progress move
   CgiAnswer start = Call("install", {{"name", "dl-app"}});
   ASSERT_TRUE(start.Success()) << start.body;
   EXPECT_EQ(kTask, start.Data()["taskid"].asString());
@@ -146,7 +143,7 @@ TEST_F(ServerDownloadTest, QuickInstallEndsInTheListAndLeavesNoFile) {
 }
 
 TEST_F(ServerDownloadTest, SecondRequestReportsTheRunningDownloadAndCancelCleansUp) {
-  Slow();
+  HoldHalfway();
   CgiAnswer first = Call("install", {{"name", "dl-app"}});
   ASSERT_TRUE(first.Success()) << first.body;
   CgiAnswer second = Call("install", {{"name", "dl-app"}});
