@@ -1,5 +1,6 @@
 #include "testing/cgi_client.h"
 
+#include <csignal>
 #include <cstdlib>
 #include <fcntl.h>
 #include <memory>
@@ -12,13 +13,24 @@
 
 namespace {
 
+// Writes `data` to a child's stdin. A request refused before its body is read
+// closes that pipe: the rest is not wanted, and the write must fail with
+// EPIPE instead of killing the test. SIGPIPE is blocked in this thread
+// meanwhile, and one that came is taken off before it is unblocked.
 void WriteAll(int fd, const std::string& data) {
-  size_t done = 0;
-  while (done < data.size()) {
+  sigset_t pipe_signal, old;
+  sigemptyset(&pipe_signal);
+  sigaddset(&pipe_signal, SIGPIPE);
+  pthread_sigmask(SIG_BLOCK, &pipe_signal, &old);
+  for (size_t done = 0; done < data.size();) {
     ssize_t n = write(fd, data.data() + done, data.size() - done);
-    if (n <= 0) return;
+    if (n <= 0) break;
     done += static_cast<size_t>(n);
   }
+  const timespec no_wait{};
+  while (sigtimedwait(&pipe_signal, nullptr, &no_wait) == SIGPIPE) {
+  }
+  pthread_sigmask(SIG_SETMASK, &old, nullptr);
 }
 
 std::string ReadAll(int fd) {
