@@ -5,10 +5,10 @@
 // other's installs.
 
 import { execFileSync, spawn, type ChildProcess } from 'node:child_process';
-import { mkdirSync, mkdtempSync, readFileSync, rmSync, writeFileSync } from 'node:fs';
+import { mkdirSync, mkdtempSync, readFileSync, renameSync, rmSync, writeFileSync } from 'node:fs';
 import { createServer } from 'node:net';
 import { tmpdir } from 'node:os';
-import { join, resolve } from 'node:path';
+import { dirname, join, resolve } from 'node:path';
 
 export const kRepo = resolve(import.meta.dirname, '../..');
 export const kPassword = 'admin';
@@ -85,10 +85,36 @@ export class Appliance {
   // of other screens, which the terms would otherwise stand in front of.
   agreeToTerms(account = 'admin'): void {
     const info = JSON.parse(readFileSync(this.file('/usr/kivo/www/feed/company-info.json'), 'utf8')) as { content_hash: string };
-    const folder = this.file(`/usr/kivo/etc/users/${account}`);
-    mkdirSync(folder, { recursive: true });
     const agreed = { termofservice: true, termofservice_4_2: true, agreed_tos_hash: info.content_hash };
-    writeFileSync(join(folder, 'settings.json'), JSON.stringify({ 'KIVO.PXS.PkgManApp.Instance': agreed }));
+    this.replace(`/usr/kivo/etc/users/${account}/settings.json`, JSON.stringify({ 'KIVO.PXS.PkgManApp.Instance': agreed }));
+  }
+
+  // Replaces a file under the root the way the appliance writes the files
+  // others read: a whole new file renamed over the old one. The web server
+  // and the web API read these files while tests change them; a file
+  // rewritten in place can be caught half written (lighttpd, told the old
+  // size, then sends a truncated answer).
+  replace(path: string, content: string): void {
+    const target = this.file(path);
+    mkdirSync(dirname(target), { recursive: true });
+    const temporary = join(dirname(target), `.${Date.now()}-${process.pid}.tmp`);
+    writeFileSync(temporary, content);
+    renameSync(temporary, target);
+  }
+
+  // Replaces a file that this appliance's web server serves at `address`
+  // (relative to its url) and waits until the server answers with the new
+  // content: lighttpd may go on serving a replaced file from what it cached
+  // of the old one for a moment, and a test that has the appliance fetch it
+  // then would read the old text.
+  async replaceServed(path: string, address: string, content: string): Promise<void> {
+    this.replace(path, content);
+    const url = new URL(address, this.url);
+    for (let i = 0; i < 200; ++i) {
+      if ((await (await fetch(url, { cache: 'no-store' })).text()) === content) return;
+      await new Promise((r) => setTimeout(r, 50));
+    }
+    throw new Error(`${url} still serves its old content`);
   }
 
   // A path inside the root, e.g. file('/volume1/public/packages/demo-beta.kpk').

@@ -43,6 +43,16 @@ export async function signIn(page: Page, account = 'admin', password = kPassword
   await page.getByRole('button', { name: 'Sign out' }).waitFor();
 }
 
+// A browser context of its own, on `url`, signed in. Every test opens one
+// and closes it when done, so a test that fails part way leaves no screen,
+// dialog or session behind for the next one: one fault, one failed test.
+export async function signedInPage(browser: Browser, url: string, watch: Watch, account = 'admin'): Promise<{ context: BrowserContext; page: Page }> {
+  const context = await browser.newContext();
+  const page = await openPage(context, url, watch);
+  await signIn(page, account);
+  return { context, page };
+}
+
 export async function screenshot(page: Page, name: string): Promise<void> {
   mkdirSync(kScreenshots, { recursive: true });
   // A full-page shot of a scrolled page would paint the sticky header where

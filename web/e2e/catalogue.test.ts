@@ -12,7 +12,7 @@ import { createServer, type Server } from 'node:http';
 import type { AddressInfo } from 'node:net';
 import type { Browser, BrowserContext, Locator, Page } from 'playwright-core';
 import { Appliance, kPassword } from './appliance.ts';
-import { checkAccessibility, launch, openPage, screenshot, signIn, type Watch } from './browser.ts';
+import { checkAccessibility, launch, openPage, screenshot, signedInPage, type Watch } from './browser.ts';
 
 let appliance: Appliance;
 let browser: Browser;
@@ -86,9 +86,7 @@ async function openCatalogue(page: Page): Promise<void> {
 
 // A browser context of its own, signed in and showing the catalogue.
 async function signedInCatalogue(): Promise<{ context: BrowserContext; page: Page }> {
-  const context = await browser.newContext();
-  const page = await openPage(context, appliance.url, watch);
-  await signIn(page);
+  const { context, page } = await signedInPage(browser, appliance.url, watch);
   await openCatalogue(page);
   return { context, page };
 }

@@ -3,15 +3,16 @@
 // (a stop refused while a dependent runs, with the reason shown), and an
 // uninstall through the package's own wizard.
 
-import { after, before, test } from 'node:test';
+import { after, afterEach, before, beforeEach, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { existsSync, readFileSync } from 'node:fs';
-import type { Browser, Locator, Page } from 'playwright-core';
+import type { Browser, BrowserContext, Locator, Page } from 'playwright-core';
 import { Appliance } from './appliance.ts';
-import { checkAccessibility, launch, openPage, screenshot, signIn, type Watch } from './browser.ts';
+import { checkAccessibility, launch, screenshot, signedInPage, type Watch } from './browser.ts';
 
 let appliance: Appliance;
 let browser: Browser;
+let context: BrowserContext | undefined;
 let page: Page;
 const watch: Watch = { problems: [] };
 
@@ -25,11 +26,21 @@ function statusOf(id: string): string {
 
 before(async () => {
   appliance = await Appliance.start();
+  // The first visit would ask for the terms of service (e2e/settings.test.ts tests that).
+  appliance.agreeToTerms();
   browser = await launch();
-  page = await openPage(await browser.newContext(), appliance.url, watch);
-  await signIn(page);
-  // The first visit asks for the terms of service (e2e/settings.test.ts tests that).
-  await page.getByRole('button', { name: 'I agree' }).click();
+});
+
+// Each test starts signed in on the installed list, in a browser context
+// of its own.
+beforeEach(async () => {
+  ({ context, page } = await signedInPage(browser, appliance.url, watch));
+  await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
+});
+
+afterEach(async () => {
+  await context?.close();
+  context = undefined;
 });
 
 after(async () => {

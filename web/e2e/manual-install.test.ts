@@ -4,7 +4,7 @@
 // unsigned package, refusals of the environment check in words, and an
 // abandoned wizard that leaves nothing in the upload area.
 
-import { after, before, test } from 'node:test';
+import { after, afterEach, before, beforeEach, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { execFileSync } from 'node:child_process';
 import { cpSync, mkdtempSync, readdirSync, readFileSync, rmSync, writeFileSync } from 'node:fs';
@@ -12,11 +12,11 @@ import { tmpdir } from 'node:os';
 import { join } from 'node:path';
 import type { Browser, BrowserContext, Page } from 'playwright-core';
 import { Appliance, kRepo } from './appliance.ts';
-import { checkAccessibility, launch, openPage, screenshot, signIn, type Watch } from './browser.ts';
+import { checkAccessibility, launch, screenshot, signedInPage, type Watch } from './browser.ts';
 
 let appliance: Appliance;
 let browser: Browser;
-let context: BrowserContext;
+let context: BrowserContext | undefined;
 let page: Page;
 const watch: Watch = { problems: [] };
 const kSamples = '/volume1/public/packages';
@@ -26,11 +26,19 @@ before(async () => {
   appliance = await Appliance.start();
   appliance.agreeToTerms();
   browser = await launch();
-  context = await browser.newContext();
-  page = await openPage(context, appliance.url, watch);
-  await signIn(page);
+});
+
+// Each test starts signed in on the manual install screen, in a browser
+// context of its own.
+beforeEach(async () => {
+  ({ context, page } = await signedInPage(browser, appliance.url, watch));
   await page.getByRole('link', { name: 'Manual install' }).click();
   await page.getByRole('heading', { name: 'Manual install' }).waitFor();
+});
+
+afterEach(async () => {
+  await context?.close();
+  context = undefined;
 });
 
 after(async () => {
@@ -85,7 +93,7 @@ function buildLicensedPackage(): string {
 
 test('a package with a wizard page is uploaded with progress, its question answered and the answer reaches the package', async () => {
   // Slow the upload down so its progress is seen on the way.
-  const cdp = await context.newCDPSession(page);
+  const cdp = await page.context().newCDPSession(page);
   await cdp.send('Network.enable');
   await cdp.send('Network.emulateNetworkConditions', { offline: false, latency: 0, downloadThroughput: -1, uploadThroughput: 4096 });
   await chooseAndUpload(appliance.file(`${kSamples}/demo-wizard.kpk`));

@@ -3,24 +3,26 @@
 // reload, the community feed added, renamed and deleted, and a key file
 // imported into the keyring and deleted, with bad key files refused in words.
 
-import { after, before, test } from 'node:test';
+import { after, afterEach, before, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { execFileSync } from 'node:child_process';
-import { mkdtempSync, readFileSync, rmSync, writeFileSync, renameSync } from 'node:fs';
+import { mkdtempSync, readFileSync, rmSync, writeFileSync } from 'node:fs';
+import { createServer, type Server } from 'node:http';
+import type { AddressInfo } from 'node:net';
 import { tmpdir } from 'node:os';
 import { join } from 'node:path';
 import type { Browser, BrowserContext, Page } from 'playwright-core';
-import { Appliance } from './appliance.ts';
-import { checkAccessibility, kScreenshots, launch, openPage, screenshot, signIn, type Watch } from './browser.ts';
+import { Appliance, kPassword } from './appliance.ts';
+import { checkAccessibility, kScreenshots, launch, screenshot, signedInPage, type Watch } from './browser.ts';
 
 let appliance: Appliance;
 let browser: Browser;
-let context: BrowserContext;
-let page: Page;
+let context: BrowserContext | undefined;
 let keys: string;
 const watch: Watch = { problems: [] };
 
-const kSettingsFile = '/usr/kivo/etc/users/admin/settings.json';
+const kCompanyInfo = '/usr/kivo/www/feed/company-info.json';
+const kCompanyInfoAddress = 'feed/company-info.json';
 const kApp = 'KIVO.PXS.PkgManApp.Instance';
 
 // A publisher's key pair made for this run, exported as the files a user
@@ -43,9 +45,11 @@ before(async () => {
   keys = mkdtempSync(join(tmpdir(), 'kivo-keys-'));
   makeKeyFiles(keys);
   browser = await launch();
-  context = await browser.newContext();
-  page = await openPage(context, appliance.url, watch);
-  await signIn(page);
+});
+
+afterEach(async () => {
+  await context?.close();
+  context = undefined;
 });
 
 after(async () => {
@@ -55,11 +59,36 @@ after(async () => {
   assert.deepEqual(watch.problems, []);
 });
 
-function storedAgreement(): Record<string, unknown> {
-  return JSON.parse(readFileSync(appliance.file(kSettingsFile), 'utf8'))[kApp];
+// A page of the test's own, signed in as an administrator of the test's
+// own: the agreement to the terms is per account, so no test (nor a request
+// of another test's page still under way) can change what this one finds.
+// With `agreed`, the account has agreed to the current terms.
+async function signedIn(account: string, agreed: boolean): Promise<Page> {
+  appliance.kivoctl('user-add', account, '--password', kPassword, '--group', 'administrators');
+  if (agreed) appliance.agreeToTerms(account);
+  const opened = await signedInPage(browser, appliance.url, watch, account);
+  context = opened.context;
+  return opened.page;
+}
+
+// The terms' hash is trusted for up to an hour after it was fetched: make it
+// an hour old, as that hour passing would.
+function ageTermsHash(account: string): void {
+  const settings = JSON.parse(readFileSync(appliance.file(settingsFile(account)), 'utf8'));
+  settings[kApp].tos_hash_timestamp = Math.floor(Date.now() / 1000) - 3600;
+  appliance.replace(settingsFile(account), JSON.stringify(settings));
+}
+
+function settingsFile(account: string): string {
+  return `/usr/kivo/etc/users/${account}/settings.json`;
+}
+
+function storedAgreement(account: string): Record<string, unknown> {
+  return JSON.parse(readFileSync(appliance.file(settingsFile(account)), 'utf8'))[kApp];
 }
 
 test('the terms of service are asked on the first visit and again when they change', async () => {
+  const page = await signedIn('first-visit', false);
   await page.getByRole('heading', { name: 'Terms of service' }).waitFor();
   await page.getByRole('region', { name: 'Text of the terms of service' }).getByText(/terms/i).first().waitFor();
   await screenshot(page, 'terms');
@@ -67,7 +96,7 @@ test('the terms of service are asked on the first visit and again when they chan
   await page.getByRole('button', { name: 'I agree' }).click();
   await page.getByRole('heading', { name: 'Terms of service' }).waitFor({ state: 'detached' });
   // The agreement is the appliance's, per account, and in no browser store.
-  const agreed = storedAgreement();
+  const agreed = storedAgreement('first-visit');
   assert.equal(agreed.termofservice, true);
   assert.equal(agreed.agreed_tos_hash, agreed.tos_hash);
   const stored = await page.evaluate(() => JSON.stringify({ ...localStorage }) + JSON.stringify({ ...sessionStorage }));
@@ -78,21 +107,25 @@ test('the terms of service are asked on the first visit and again when they chan
   await page.getByRole('heading', { name: 'Settings', level: 1 }).waitFor();
   assert.equal(await page.getByRole('heading', { name: /terms of service/i }).count(), 0);
 
-  // The vendor publishes new terms. The appliance trusts the hash it fetched
-  // for up to an hour; age it as that hour passing would.
-  writeFileSync(appliance.file('/usr/kivo/www/feed/company-info.json'), JSON.stringify({ content_hash: 'a'.repeat(64) }));
-  const settings = JSON.parse(readFileSync(appliance.file(kSettingsFile), 'utf8'));
-  settings[kApp].tos_hash_timestamp = Math.floor(Date.now() / 1000) - 3600;
-  writeFileSync(appliance.file(kSettingsFile), JSON.stringify(settings));
-  await page.reload();
-  await page.getByRole('heading', { name: 'The terms of service have changed' }).waitFor();
-  assert.equal(await page.getByRole('heading', { name: 'Settings', level: 1 }).count(), 0);
-  await page.getByRole('button', { name: 'I agree' }).click();
-  await page.getByRole('heading', { name: 'Settings', level: 1 }).waitFor();
-  assert.equal(storedAgreement().agreed_tos_hash, 'a'.repeat(64));
+  // The vendor publishes new terms, and the hour the appliance trusts the
+  // hash it fetched has passed.
+  const published = readFileSync(appliance.file(kCompanyInfo), 'utf8');
+  await appliance.replaceServed(kCompanyInfo, kCompanyInfoAddress, JSON.stringify({ content_hash: 'a'.repeat(64) }));
+  try {
+    ageTermsHash('first-visit');
+    await page.reload();
+    await page.getByRole('heading', { name: 'The terms of service have changed' }).waitFor();
+    assert.equal(await page.getByRole('heading', { name: 'Settings', level: 1 }).count(), 0);
+    await page.getByRole('button', { name: 'I agree' }).click();
+    await page.getByRole('heading', { name: 'Settings', level: 1 }).waitFor();
+    assert.equal(storedAgreement('first-visit').agreed_tos_hash, 'a'.repeat(64));
+  } finally {
+    await appliance.replaceServed(kCompanyInfo, kCompanyInfoAddress, published);
+  }
 });
 
 test('preferences are saved on the appliance and come back after a reload', async () => {
+  const page = await signedIn('preferences', true);
   await page.goto(`${appliance.url}#/settings`);
   const preferences = page.getByRole('region', { name: 'Preferences' });
   await preferences.getByRole('radio', { name: 'Stable versions only' }).waitFor();
@@ -137,6 +170,7 @@ test('preferences are saved on the appliance and come back after a reload', asyn
 });
 
 test('the community feed is added with its keys, renamed and deleted; a dead feed is refused', async () => {
+  const page = await signedIn('feeds', true);
   await page.goto(`${appliance.url}#/settings`);
   const feeds = page.getByRole('region', { name: 'Feeds' });
   await feeds.getByText('No feed is added.').waitFor();
@@ -174,6 +208,7 @@ test('the community feed is added with its keys, renamed and deleted; a dead fee
 });
 
 test('a public key file is imported and deleted; a secret key and garbage are refused in words', async () => {
+  const page = await signedIn('keys', true);
   await page.goto(`${appliance.url}#/settings`);
   const keyring = page.getByRole('region', { name: 'Code-signing keys' });
   await keyring.getByRole('cell', { name: /^KIVO Demo Publisher/ }).waitFor();
@@ -203,22 +238,66 @@ test('a public key file is imported and deleted; a secret key and garbage are re
   await keyring.getByRole('cell', { name: /^KIVO Demo Publisher/ }).waitFor();
 });
 
-test('when the vendor cannot confirm its terms, the installed packages can still be managed', async () => {
-  // The terms' hash must be asked again (an hour passed) from a server that
-  // no longer answers.
-  const settings = JSON.parse(readFileSync(appliance.file(kSettingsFile), 'utf8'));
-  settings[kApp].tos_hash_timestamp = Math.floor(Date.now() / 1000) - 3600;
-  writeFileSync(appliance.file(kSettingsFile), JSON.stringify(settings));
-  const vendor = appliance.file('/usr/kivo/www/feed');
-  renameSync(vendor, `${vendor}.gone`);
+// The vendor's company-information endpoint as a server that misbehaves on
+// request: an answer cut short (the connection closed before the length it
+// announced), an error status, or a whole answer naming `hash`.
+type VendorAnswer = 'cut short' | 'error' | { hash: string };
+
+function startVendor(answer: () => VendorAnswer): Promise<Server> {
+  const server = createServer((_request, response) => {
+    const now = answer();
+    if (now === 'error') return void response.writeHead(503).end('down');
+    const body = now === 'cut short' ? '{"content_hash":"' + 'b'.repeat(64) + '"}' : JSON.stringify({ content_hash: now.hash });
+    response.writeHead(200, { 'Content-Type': 'application/json', 'Content-Length': body.length });
+    if (now !== 'cut short') return void response.end(body);
+    response.write(body.slice(0, 20));
+    response.socket?.destroy();
+  });
+  return new Promise((done) => server.listen(0, '127.0.0.1', () => done(server)));
+}
+
+// Clicks "Try again" and waits for the start-up information it asks for.
+async function tryAgain(page: Page): Promise<void> {
+  const asked = page.waitForResponse((r) => r.request().postData()?.includes('api=KIVO.Core.Package.Info') === true);
+  await page.getByRole('button', { name: 'Try again' }).click();
+  await asked;
+}
+
+test('when the vendor cannot confirm its terms, packages can still be managed, and Try again works once it answers whole', async () => {
+  let answer: VendorAnswer = 'cut short';
+  const vendor = await startVendor(() => answer);
+  const configured = /^company_info_url=(.*)$/m.exec(appliance.kivoctl('server-config'))?.[1] ?? '';
+  assert.notEqual(configured, '');
+  appliance.kivoctl('server-config', '--company-info', `http://127.0.0.1:${(vendor.address() as AddressInfo).port}/company-info`);
   try {
-    await page.goto(`${appliance.url}#/installed`);
-    await page.reload();
-    await page.getByRole('alert').filter({ hasText: 'could not be confirmed' }).waitFor();
+    // The account agreed before; the hash must now be asked again, and the
+    // vendor's answer is cut short.
+    const page = await signedIn('unconfirmed', true);
+    const unconfirmed = page.getByRole('alert').filter({ hasText: 'could not be confirmed' });
+    await unconfirmed.waitFor();
+    assert.ok(await page.getByRole('button', { name: 'I agree' }).isDisabled());
+    await screenshot(page, 'terms-unconfirmed');
+
+    answer = 'error';
+    await tryAgain(page);
+    await unconfirmed.waitFor();
     assert.ok(await page.getByRole('button', { name: 'I agree' }).isDisabled());
     await page.getByRole('button', { name: 'Continue for now' }).click();
     await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
+    await page.reload();
+    await unconfirmed.waitFor();
+
+    // The vendor answers whole again, with terms newer than those agreed to.
+    answer = { hash: 'c'.repeat(64) };
+    await tryAgain(page);
+    await page.getByRole('heading', { name: 'The terms of service have changed' }).waitFor();
+    assert.equal(await unconfirmed.count(), 0);
+    await page.getByRole('button', { name: 'I agree' }).click();
+    await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
+    assert.equal(storedAgreement('unconfirmed').agreed_tos_hash, 'c'.repeat(64));
   } finally {
-    renameSync(`${vendor}.gone`, vendor);
+    appliance.kivoctl('server-config', '--company-info', configured);
+    vendor.closeAllConnections();
+    vendor.close();
   }
 });
