@@ -5,6 +5,8 @@
 #include <errno.h>
 #include <unistd.h>
 
+#include "webapi/host_fields.h"
+
 namespace {
 
 std::string Env(const char* name) {
@@ -79,6 +81,14 @@ bool ReadFormBody(int fd, uint64_t max_upload, CgiRequest* out, std::string* rea
   return true;
 }
 
+// The first field of `fields` that a client may not send (see host_fields.h).
+const std::string* HostFieldIn(const FormFields& fields) {
+  for (const auto& field : fields) {
+    if (IsHostField(field.first)) return &field.first;
+  }
+  return nullptr;
+}
+
 }  // namespace
 
 bool ReadCgiRequest(int body_fd, uint64_t max_upload, CgiRequest* out, std::string* reason) {
@@ -99,6 +109,12 @@ bool ReadCgiRequest(int body_fd, uint64_t max_upload, CgiRequest* out, std::stri
   if (out->query.size() + out->body.size() > kMaxFields) {
     *reason = "too many parameters";
     return false;
+  }
+  for (const FormFields* fields : {&out->query, &out->body}) {
+    if (const std::string* name = HostFieldIn(*fields)) {
+      *reason = "the field " + *name + " is set by the appliance only";
+      return false;
+    }
   }
   return true;
 }

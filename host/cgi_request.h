@@ -26,8 +26,9 @@ constexpr size_t kMaxFields = 1000;
 // short reason for the client when the request is malformed: an invalid
 // percent-escape, an unsupported method or content type, an urlencoded body
 // larger than kMaxBodyBytes or shorter than its CONTENT_LENGTH, a multipart
-// body larger than `max_upload` or without a boundary, too many fields. A
-// multipart body is not read here: it streams to the handler (`boundary`).
+// body larger than `max_upload` or without a boundary, too many fields, a
+// field that only the host sets (webapi/host_fields.h). A multipart body is
+// not read here: it streams to the handler (`boundary`).
 bool ReadCgiRequest(int body_fd, uint64_t max_upload, CgiRequest* out, std::string* reason);
 
 // The value of cookie `name` in a Cookie header; empty when absent.

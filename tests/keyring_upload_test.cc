@@ -131,6 +131,61 @@ TEST_F(KeyringUploadTest, PostedKeyFileIsImportedOrRefusedAndNeverStays) {
   EXPECT_TRUE(TmpFiles().empty());
 }
 
+TEST_F(KeyringUploadTest, AStoredFileNamedByTheClientIsRefusedOnEveryRoute) {
+  // A file the client names as if the host had stored it for the request:
+  // the handlers read and delete such a path, so it must never get there.
+  const std::string victim = root_.Path("/tmp/victim");
+  ASSERT_TRUE(KIVOWriteFileAtomic(victim, "precious\n"));
+  const std::string stored = "upload_keyring_tmp=" + victim;
+  const std::string form =
+      "api=KIVO.Core.Package.Feed.Keyring&version=1&method=add"
+      "&upload_keyring=k.asc&" +
+      stored;
+  CgiEnv signed_in = {{"HTTP_COOKIE", "id=" + client().sid()},
+                      {"HTTP_X_KIVO_TOKEN", client().token()},
+                      {"HTTP_HOST", "nas.example:5000"}};
+  auto post = [&](const std::string& query, const std::string& body) {
+    CgiEnv env = signed_in;
+    env["REQUEST_METHOD"] = "POST";
+    env["QUERY_STRING"] = query;
+    env["CONTENT_TYPE"] = "application/x-www-form-urlencoded";
+    env["CONTENT_LENGTH"] = std::to_string(body.size());
+    return RunEntryCgi(env, body);
+  };
+  const struct {
+    const char* route;
+    CgiAnswer answer;
+  } refused[] = {
+      {"urlencoded body", post("", form)},
+      {"query string", post(form, "")},
+      {"query string of a GET",
+       [&] {
+         CgiEnv env = signed_in;
+         env["REQUEST_METHOD"] = "GET";
+         env["QUERY_STRING"] = form;
+         return RunEntryCgi(env);
+       }()},
+      {"the package file's path", post("",
+                                       "api=KIVO.Core.Package.Installation&version=1"
+                                       "&method=install&file_tmp=" +
+                                           victim)},
+      {"the package file's name", post("",
+                                       "api=KIVO.Core.Package.Installation&version=1"
+                                       "&method=upload&file_name=x.kpk")},
+      {"multipart field",
+       Post(Part("upload_keyring", "k.asc") + Part("upload_keyring_tmp", victim) + Closing())},
+  };
+  for (const auto& r : refused) {
+    EXPECT_EQ(101, r.answer.Code()) << r.route << ": " << r.answer.body;
+    // The multipart reader refuses the whole body as malformed.
+    EXPECT_NE(std::string::npos, r.answer.body.find(r.route == std::string("multipart field")
+                                                        ? "malformed multipart body"
+                                                        : "set by the appliance only"))
+        << r.route << ": " << r.answer.body;
+    EXPECT_EQ(0, access(victim.c_str(), F_OK)) << r.route;
+  }
+}
+
 // Runs curl with `args`; the parsed JSON body.
 Json::Value Curl(const std::vector<std::string>& args) {
   std::vector<std::string> argv = {"curl", "-s"};

@@ -18,6 +18,7 @@
 
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"
+#include "webapi/host_fields.h"
 #include "webapi/upload_area.h"
 
 namespace {
@@ -160,7 +161,7 @@ class MultipartSource : public UploadSource {
       // A name ending in "_tmp" names a stored file, and so do these two; a
       // client's field must never pass for one (the handler reads and
       // deletes that path).
-      if (name == "file_name" || EndsWithTmp(name)) {
+      if (IsHostField(name)) {
         throw std::runtime_error("a field named like a stored file");
       }
       if (params.has("filename") && name != "file") {
@@ -177,10 +178,6 @@ class MultipartSource : public UploadSource {
       if (seen_.isMember(name + "_tmp")) throw std::runtime_error("a field named like a file");
       seen_[name] = ReadField();
     }
-  }
-
-  static bool EndsWithTmp(const std::string& name) {
-    return name.size() >= 4 && name.compare(name.size() - 4, 4, "_tmp") == 0;
   }
 
   // Stores the current part, a file part named `name` other than the
