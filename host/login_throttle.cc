@@ -129,8 +129,12 @@ class ThrottleState {
                     }));
   }
 
-  void CountFailure(const std::string& account, const std::string& address) {
-    Json::Value& a = state_[kAddresses][address];
+  // Returns when the address's wait started before this attempt (-1 when it
+  // had no record), for a success to give it back.
+  long long CountFailure(const std::string& account, const std::string& address) {
+    Json::Value& addresses = state_[kAddresses];
+    const long long before = addresses.isMember(address) ? LastOf(addresses[address]) : -1;
+    Json::Value& a = addresses[address];
     a[kLast] = Json::Int64(now_);
     Json::Value& failures = a[kFailures];
     if (!failures.isMember(account) && failures.size() >= kMaxAccountsPerAddress) {
@@ -140,12 +144,14 @@ class ThrottleState {
       failures[account] = Json::Int64(IntOf(failures[account]) + 1);
     }
     KeepNewest(&state_[kAddresses], kMaxAddresses);
-    if (account.empty()) return;
-    Json::Value& acc = state_[kAccounts][account];
-    acc[kLast] = Json::Int64(now_);
-    acc[kAddresses][address] = Json::Int64(now_);
-    KeepNewest(&acc[kAddresses], kMaxAddressesPerAccount);
-    KeepNewest(&state_[kAccounts], kMaxAccounts);
+    if (!account.empty()) {
+      Json::Value& acc = state_[kAccounts][account];
+      acc[kLast] = Json::Int64(now_);
+      acc[kAddresses][address] = Json::Int64(now_);
+      KeepNewest(&acc[kAddresses], kMaxAddressesPerAccount);
+      KeepNewest(&state_[kAccounts], kMaxAccounts);
+    }
+    return before;
   }
 
   // Starts the waits of `address` and `account` anew: a failure is known
@@ -158,12 +164,22 @@ class ThrottleState {
       accounts[account][kLast] = Json::Int64(now_);
   }
 
-  void ForgetFailures(const std::string& account, const std::string& address) {
+  // A success: forgets the attempt that `admission` counted and, when no
+  // other attempt came since, gives the address back the wait it had, so a
+  // right password never makes the next person on that address wait longer.
+  void ForgetFailures(const std::string& account, const std::string& address,
+                      const LoginThrottle::Admission& admission) {
     state_[kAccounts].removeMember(account);
     Json::Value& a = state_[kAddresses][address];
     a[kFailures].removeMember(account);
-    if (AddressFailures(a) == 0) state_[kAddresses].removeMember(address);
+    if (AddressFailures(a) == 0) {
+      state_[kAddresses].removeMember(address);
+    } else if (admission.address_last_before_ms >= 0 && LastOf(a) == admission.admitted_at_ms) {
+      a[kLast] = Json::Int64(admission.address_last_before_ms);
+    }
   }
+
+  long long now() const { return now_; }
 
  private:
   // The wait a record imposes: none for its first free failures, then the
@@ -221,7 +237,8 @@ LoginAdmission LoginThrottle::Admit(const std::string& account, const std::strin
     *retry_after_seconds = static_cast<long>((wait_ms + 999) / 1000);
     return LoginAdmission::Throttled;
   }
-  state.CountFailure(name, address);
+  admission_.admitted_at_ms = state.now();
+  admission_.address_last_before_ms = state.CountFailure(name, address);
   return state.Save(state_path_) ? LoginAdmission::Admitted : LoginAdmission::Unavailable;
 }
 
@@ -232,8 +249,9 @@ bool LoginThrottle::Failed(const std::string& account, const std::string& addres
 }
 
 bool LoginThrottle::Succeeded(const std::string& account, const std::string& address) {
-  return UpdateState(limits_, lock_path_, state_path_,
-                     [&](ThrottleState* state) { state->ForgetFailures(account, address); });
+  return UpdateState(limits_, lock_path_, state_path_, [&](ThrottleState* state) {
+    state->ForgetFailures(account, address, admission_);
+  });
 }
 
 std::string LoginAddressKey(const char* remote_addr) {

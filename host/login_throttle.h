@@ -18,7 +18,9 @@
 //  - A refused attempt is not counted (waiting does not grow the wait).
 //  - A success forgets the account's record and the address's failures on
 //    that account (not its failures on other accounts, so signing in to an
-//    account of one's own does not buy more guesses at another).
+//    account of one's own does not buy more guesses at another), and gives
+//    the address back the wait it had before the attempt: on a shared
+//    address a right password never makes the next person wait again.
 //  - Records quiet for a day are forgotten; the file's size is bounded.
 #pragma once
 
@@ -51,10 +53,18 @@ class LoginThrottle {
   [[nodiscard]] bool Failed(const std::string& account, const std::string& address);
   // Forgets what Admit counted for a sign-in that succeeded. False when the
   // state cannot be written (the attempt then stays counted).
+  // REQUIRES: Admit admitted this attempt on this object.
   [[nodiscard]] bool Succeeded(const std::string& account, const std::string& address);
+
+  // What Admit changed, for Succeeded to undo.
+  struct Admission {
+    long long admitted_at_ms = -1;
+    long long address_last_before_ms = -1;  // -1: the address had no record
+  };
 
  private:
   LoginLimits limits_;
+  Admission admission_;
   std::string state_path_;
   std::string lock_path_;
 };

@@ -107,6 +107,24 @@ TEST_F(AuthTest, FailedSignInsHoldBackTheirAddressUntilTheBackOffPasses) {
   ExpectThrottled(SignIn("admin", "secret", first), 1, 2);
 }
 
+TEST_F(AuthTest, ASuccessOnASharedAddressDoesNotLengthenTheNextPersonsWait) {
+  Configure("login_free_failures=\"1\"\nlogin_backoff_base=\"1\"\nlogin_backoff_max=\"60\"\n");
+  const std::string office = "192.0.2.80";
+  // Someone at the office mistypes ops's password twice: the second try
+  // already waits, and after it the office waits 2 seconds.
+  EXPECT_EQ(kWrongPassword, SignIn("ops", "typo", office).Code());
+  WaitSeconds(1.2);
+  EXPECT_EQ(kWrongPassword, SignIn("ops", "typo", office).Code());
+  ExpectThrottled(SignIn("admin", "secret", office), 1, 2);
+  WaitSeconds(2.2);
+  // Once that wait is over, one colleague after another signs in rightly:
+  // none of them is made to wait by the one before.
+  for (int i = 0; i < 3; ++i) {
+    CgiAnswer a = SignIn("admin", "secret", office);
+    EXPECT_TRUE(a.Success()) << i << ": " << a.body;
+  }
+}
+
 TEST_F(AuthTest, AddressesAreCountedApartAndGuessesSpreadOverManyHoldBackTheAccount) {
   Configure("login_free_failures=\"3\"\nlogin_backoff_base=\"60\"\n");
   const std::string attacker = "192.0.2.66";
