@@ -138,7 +138,8 @@ CgiAnswer ApiClient::Call(const std::string& api, const std::string& method, int
 }
 
 std::string MultipartBody(const Params& fields, const std::string& file_name,
-                          const std::string& content, std::string* content_type) {
+                          const std::string& content, std::string* content_type,
+                          const std::string& part) {
   const std::string boundary = "----kivo-test-boundary-7d1f";
   *content_type = "multipart/form-data; boundary=" + boundary;
   std::string body;
@@ -146,9 +147,9 @@ std::string MultipartBody(const Params& fields, const std::string& file_name,
     body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"" + f.first +
             "\"\r\n\r\n" + f.second + "\r\n";
   }
-  body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"file\"; filename=\"" +
-          file_name + "\"\r\nContent-Type: application/octet-stream\r\n\r\n" + content + "\r\n--" +
-          boundary + "--\r\n";
+  body += "--" + boundary + "\r\nContent-Disposition: form-data; name=\"" + part +
+          "\"; filename=\"" + file_name + "\"\r\nContent-Type: application/octet-stream\r\n\r\n" +
+          content + "\r\n--" + boundary + "--\r\n";
   return body;
 }
 
@@ -159,8 +160,15 @@ CgiAnswer ApiClient::Upload(const std::string& api, const std::string& method, i
   char buf[65536];
   for (size_t n; f && (n = fread(buf, 1, sizeof(buf), f)) > 0;) content.append(buf, n);
   if (f) fclose(f);
-  std::string body =
-      MultipartBody(fields, path.substr(path.rfind('/') + 1), content, &content_type);
+  return PostFilePart(api, method, version, "file", path.substr(path.rfind('/') + 1), content,
+                      fields);
+}
+
+CgiAnswer ApiClient::PostFilePart(const std::string& api, const std::string& method, int version,
+                                  const std::string& part, const std::string& file_name,
+                                  const std::string& content, const Params& fields) const {
+  std::string content_type;
+  std::string body = MultipartBody(fields, file_name, content, &content_type, part);
   return RunEntryCgi(
       {{"REQUEST_METHOD", "POST"},
        {"QUERY_STRING",

@@ -27,7 +27,8 @@ using Params = std::vector<std::pair<std::string, std::string>>;
 // A multipart/form-data body of `fields` and a file part "file" with
 // `content`; *content_type gets the header value.
 std::string MultipartBody(const Params& fields, const std::string& file_name,
-                          const std::string& content, std::string* content_type);
+                          const std::string& content, std::string* content_type,
+                          const std::string& part = "file");
 
 // Runs entry.cgi with `env` (plus KIVO_ROOT and PATH) and `body` on stdin.
 CgiAnswer RunEntryCgi(const CgiEnv& env, const std::string& body = "");
@@ -53,6 +54,11 @@ class ApiClient {
   // with api, method and version in the query string, as the desktop does.
   CgiAnswer Upload(const std::string& api, const std::string& method, int version,
                    const Params& fields, const std::string& path) const;
+  // Posts `content` as the multipart file part `part` named `file_name`,
+  // with api, method and version in the query string.
+  CgiAnswer PostFilePart(const std::string& api, const std::string& method, int version,
+                         const std::string& part, const std::string& file_name,
+                         const std::string& content, const Params& fields = {}) const;
 
  private:
   std::string sid_;
