@@ -6,10 +6,9 @@
 #include <unistd.h>
 #include <vector>
 
-#include <json/reader.h>
-
 #include "error_codes.h"
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
 #include "log_line.h"
@@ -28,11 +27,10 @@ namespace {
 
 using KIVOPackageServer::PMSFeedFilePath;
 
-bool ParseStrict(const std::string& text, Json::Value* out, std::string* errors) {
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-  return reader->parse(text.data(), text.data() + text.size(), out, errors);
+// A feed's answer and a request's "list" are strict JSON with an object or
+// an array at the root.
+bool ParseDocument(const std::string& text, Json::Value* out) {
+  return KIVOParseJson(text, out) && (out->isObject() || out->isArray());
 }
 
 // A missing or empty feed file is an empty list; anything else must load as
@@ -90,7 +88,7 @@ bool ProbeFeed(const std::string& language, const std::string& feed, Json::Value
     std::string text;
     if (KIVOPackageServer::PMSQueryPkgServer(language.c_str(), text, feed, force,
                                              Json::Value(Json::objectValue)) &&
-        ParseStrict(text, answer, nullptr)) {
+        ParseDocument(text, answer)) {
       return true;
     }
   }
@@ -201,9 +199,8 @@ void PackageWebAPI::ListKeyring() {
     return response->SetError(kErrFailed, Json::Value());
   }
   Json::Value answer(Json::objectValue);
-  std::string errors;
-  if (!ParseStrict(line.data(), &answer["items"], &errors) || !answer["items"].isArray()) {
-    PKG_LOG_ERR("%s", errors.c_str());
+  if (!KIVOParseJson(line.data(), &answer["items"]) || !answer["items"].isArray()) {
+    PKG_LOG_ERR("%s --listkey did not list keys as a JSON array", script.c_str());
     return response->SetError(kErrFailed, Json::Value());
   }
   answer["total"] = answer["items"].size();
@@ -224,9 +221,8 @@ void PackageWebAPI::DelKeyring() {
 }
 
 bool PackageWebAPI::ReadFeedRequest(Json::Value* parsed) {
-  std::string errors;
-  if (!ParseStrict(request->GetParam("list", "").asString(), parsed, &errors)) {
-    PKG_LOG_ERR("%s", errors.c_str());
+  if (!ParseDocument(request->GetParam("list", "").asString(), parsed)) {
+    PKG_LOG_ERR("list is not a JSON array or object");
     response->SetError(kErrFailed, Json::Value());
     return false;
   }

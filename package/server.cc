@@ -12,8 +12,7 @@
 #include <unistd.h>
 #include <vector>
 
-#include <json/reader.h>
-
+#include "klibc/json_text.h"
 #include "log_line.h"
 #include "package_webapi.h"
 #include "pkgserver/badge.h"
@@ -167,11 +166,8 @@ class EntryOverlay {
 
   // The general way for text SplitMembers refuses: parsed, changed, written.
   std::string Reparsed(std::string_view text, const Json::Value& overlay) {
-    Json::CharReaderBuilder builder;
-    std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
     Json::Value entry;
-    if (!reader->parse(text.data(), text.data() + text.size(), &entry, nullptr) ||
-        !entry.isObject()) {
+    if (!KIVOParseJson(text, &entry, JsonSyntax::Lenient) || !entry.isObject()) {
       // Listing texts are checked against their file's checksum, so this is
       // a fault of ours: the entry goes out without the appliance's state.
       PKG_LOG_ERR("A listing entry is not a JSON object: %.80s", std::string(text).c_str());

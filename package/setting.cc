@@ -9,10 +9,9 @@
 #include <string>
 #include <unistd.h>
 
-#include <json/reader.h>
-
 #include "error_codes.h"
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/key_value_file.h"
 #include "klibc/last_error.h"
 #include "klibc/string_list.h"
@@ -106,10 +105,7 @@ std::string TextParam(const APIRequest& request, const char* name, const char* d
 }
 
 bool ParseJson(const std::string& text, Json::Value& out) {
-  Json::CharReaderBuilder builder;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-  std::string errors;
-  return reader->parse(text.data(), text.data() + text.size(), &out, &errors);
+  return KIVOParseJson(text, &out, JsonSyntax::Lenient);
 }
 
 // The chosen list of the "set" request: an array as sent, or a JSON text.

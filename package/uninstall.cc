@@ -2,9 +2,8 @@
 
 #include <unistd.h>
 
-#include <json/reader.h>
-
 #include "error_codes.h"
+#include "klibc/json_text.h"
 #include "log_line.h"
 #include "package_webapi.h"
 #include "pkgtool/result_codes.h"
@@ -39,10 +38,8 @@ void PackageWebAPI::Uninstall() {
     response->SetError(kErrFailed, Json::Value());
   } else {
     const std::string extra = request->GetParam("extra_values", "").asString();
-    Json::Reader reader(Json::Features::strictMode());
-    if (!extra.empty() && !reader.parse(extra, wizard)) {
-      PKG_LOG_ERR("Error: parsing error, reason = %s\n",
-                  reader.getFormattedErrorMessages().c_str());
+    if (!extra.empty() && !KIVOParseJson(extra, &wizard)) {
+      PKG_LOG_ERR("extra_values is not a JSON document");
       response->SetError(kErrUninstallBadValues, Json::Value());
     } else {
       called = true;

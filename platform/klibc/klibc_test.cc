@@ -8,6 +8,7 @@
 #include <gtest/gtest.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/key_value_file.h"
 #include "klibc/last_error.h"
 #include "klibc/process.h"
@@ -165,6 +166,27 @@ TEST(StringListTest, ListAndHash) {
   EXPECT_EQ(1u, hash->entries.size());
   EXPECT_EQ(-1, KLIBCSzHashSetValue(&hash, nullptr, "x"));
   KLIBCSzHashFree(hash);
+}
+
+TEST(JsonTextTest, DeepOrMalformedTextIsRefusedWithoutThrowing) {
+  Json::Value v(42);
+  const std::string deep = std::string(100000, '[') + std::string(100000, ']');
+  EXPECT_FALSE(KIVOParseJson(deep, &v));
+  EXPECT_TRUE(v.isNull());
+  EXPECT_FALSE(KIVOParseJson(deep, &v, JsonSyntax::Lenient));
+  const std::string at_limit =
+      std::string(kMaxJsonDepth - 1, '[') + std::string(kMaxJsonDepth - 1, ']');
+  EXPECT_TRUE(KIVOParseJson(at_limit, &v));
+  for (const char* bad : {"", "{", "[1,]", "{\"a\":1} x", "nul"}) {
+    EXPECT_FALSE(KIVOParseJson(bad, &v)) << bad;
+  }
+  // Comments are what only the lenient syntax allows; any value may be the
+  // root of either.
+  EXPECT_FALSE(KIVOParseJson("// note\n{\"a\": 1}", &v));
+  EXPECT_TRUE(KIVOParseJson("// note\n{\"a\": 1}", &v, JsonSyntax::Lenient));
+  EXPECT_EQ(1, v["a"].asInt());
+  EXPECT_TRUE(KIVOParseJson("\"text\"", &v));
+  EXPECT_EQ("text", v.asString());
 }
 
 }  // namespace

@@ -10,10 +10,10 @@
 #include <syslog.h>
 #include <vector>
 
-#include <json/reader.h>
 #include <json/writer.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
 #include "pkgserver/server_config.h"
@@ -75,9 +75,8 @@ bool ReadCache(const std::string& path, bool head_only, CachedCatalogue* cached)
   if (!KIVOReadFile(path, &text, head_only ? kCacheHeadBytes : SIZE_MAX)) return false;
   size_t newline = text.find('\n');
   if (newline == std::string::npos) return head_only && ReadCache(path, false, cached);
-  Json::CharReaderBuilder builder;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-  if (!reader->parse(text.data(), text.data() + newline, &cached->meta, nullptr) ||
+  if (!KIVOParseJson(std::string_view(text).substr(0, newline), &cached->meta,
+                     JsonSyntax::Lenient) ||
       !cached->meta.isObject()) {
     return false;
   }
@@ -121,11 +120,8 @@ void WriteCache(const std::string& path, const CachedCatalogue& cached) {
 }
 
 bool ParseAnswer(const std::string& body, Json::Value& answer) {
-  Json::CharReaderBuilder builder;
-  builder["collectComments"] = false;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value value;
-  if (!reader->parse(body.data(), body.data() + body.size(), &value, nullptr)) return false;
+  if (!KIVOParseJson(body, &value, JsonSyntax::Lenient)) return false;
   if (!value.isObject() && !value.isArray()) return false;
   answer = std::move(value);
   return true;

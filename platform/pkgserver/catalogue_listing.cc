@@ -7,10 +7,10 @@
 #include <sstream>
 #include <syslog.h>
 
-#include <json/reader.h>
 #include <json/value.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/sysroot.h"
 #include "pkgserver/catalogue.h"
 #include "pkgtool/dependency.h"
@@ -130,11 +130,8 @@ std::string Header(ListingSide side, uint64_t catalogue, uint64_t checksum, size
 // a listing file; false (logged) when it is no catalogue for `side`.
 bool Render(const std::string& body, uint64_t catalogue, ListingSide side, const std::string& url,
             std::string* file) {
-  Json::CharReaderBuilder builder;
-  builder["collectComments"] = false;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value answer;
-  if (!reader->parse(body.data(), body.data() + body.size(), &answer, nullptr)) {
+  if (!KIVOParseJson(body, &answer, JsonSyntax::Lenient)) {
     LISTING_LOG("%s: the cached answer is not a JSON catalogue", url.c_str());
     return false;
   }

@@ -2,10 +2,10 @@
 
 #include <memory>
 
-#include <json/reader.h>
 #include <json/writer.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/last_error.h"
 
 namespace WebUtils {
@@ -14,11 +14,8 @@ bool LoadJsonFile(const std::string& path, Json::Value& out) {
   out = Json::Value();
   std::string text;
   if (!KIVOReadFile(path, &text)) return false;
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-  std::string errors;
-  if (!reader->parse(text.data(), text.data() + text.size(), &out, &errors)) {
+  // Files hold an object or an array, never a bare value.
+  if (!KIVOParseJson(text, &out) || !(out.isObject() || out.isArray())) {
     out = Json::Value();
     KLIBCErrSet(KLIBC_ERR_FILE_READ);
     return false;

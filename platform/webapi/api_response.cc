@@ -2,7 +2,7 @@
 
 #include <memory>
 
-#include <json/reader.h>
+#include "klibc/json_text.h"
 
 Json::StreamWriterBuilder AnswerJsonWriter() {
   Json::StreamWriterBuilder builder;
@@ -51,13 +51,9 @@ Json::Value Envelope(bool answered, int code, Json::Value data) {
 Json::Value APIResponse::ToEnvelope() const {
   if (data_text_.empty()) return Envelope(answered_, error_code_, data_);
   Json::Value data;
-  Json::CharReaderBuilder builder;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   // The text is this process's own writer output; should it not parse, the
   // envelope says success without data rather than inventing any.
-  if (!reader->parse(data_text_.data(), data_text_.data() + data_text_.size(), &data, nullptr)) {
-    data = Json::Value();
-  }
+  (void)KIVOParseJson(data_text_, &data, JsonSyntax::Lenient);
   return Envelope(answered_, error_code_, std::move(data));
 }
 

@@ -1,28 +1,12 @@
 #include "webapi/webapi_util.h"
 
 #include <algorithm>
-#include <exception>
 #include <memory>
 
-#include <json/reader.h>
+#include "klibc/json_text.h"
 
 namespace WebAPIUtil {
 namespace {
-
-// Strict JSON, any root type, bounded nesting. jsoncpp throws when the
-// nesting limit is passed, so callers catch.
-bool ParseStrict(const std::string& text, Json::Value* out) {
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  builder["strictRoot"] = false;
-  builder["stackLimit"] = 200;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-  try {
-    return reader->parse(text.data(), text.data() + text.size(), out, nullptr);
-  } catch (const std::exception&) {
-    return false;
-  }
-}
 
 bool MayBeJson(const std::string& raw) {
   if (raw.empty()) return false;
@@ -56,8 +40,8 @@ bool HoldsNul(const Json::Value& value) {
 
 bool ParseJson(const std::string& text, Json::Value& out) {
   Json::Value parsed;
-  if (!ParseStrict(text, &parsed)) return false;
-  out = parsed;
+  if (!KIVOParseJson(text, &parsed)) return false;
+  out = std::move(parsed);
   return true;
 }
 
@@ -71,7 +55,7 @@ bool JsonArrayHasString(const Json::Value& array, const std::string& value) {
 
 Json::Value DecodeParamValue(const std::string& raw) {
   Json::Value value;
-  if (!MayBeJson(raw) || !ParseStrict(raw, &value)) return Json::Value(raw);
+  if (!MayBeJson(raw) || !KIVOParseJson(raw, &value)) return Json::Value(raw);
   // Reals keep their text, and so do integers too large for 64 bits, which
   // jsoncpp reads as reals.
   if (value.type() == Json::realValue) return Json::Value(raw);
