@@ -23,14 +23,7 @@ class KeyringTest : public ::testing::Test {
     root_.AddAccount("admin", "secret", {"administrators"});
     client_.reset(new ApiClient("admin", "secret"));
   }
-  std::string Export(const std::string& fpr, bool secret) {
-    std::string out;
-    EXPECT_EQ(0, RunProgram({"gpg", "--homedir", keys_.home(), "--batch", "--pinentry-mode",
-                             "loopback", "--passphrase", "", "--armor",
-                             secret ? "--export-secret-keys" : "--export", fpr},
-                            &out));
-    return out;
-  }
+  std::string Export(const std::string& fpr, bool secret) { return keys_.Export(fpr, secret); }
   // Posts `content` as the key file, as the page does: the host keeps it in
   // the root's tmp/ for the request, and nothing of it may stay there.
   CgiAnswer Import(const std::string& content) {
@@ -69,6 +62,7 @@ TEST_F(KeyringTest, ImportsPublicKeysAndRefusesEverythingElse) {
 
   CgiAnswer secret = Import(Export(fpr, true));
   EXPECT_EQ(4594, secret.Code()) << secret.body;
+  EXPECT_EQ(4594, Import(InPublicArmor(Export(fpr, true))).Code());
   EXPECT_EQ(4593, Import("garbage\n").Code());
   EXPECT_TRUE(List().empty());
 

@@ -6,6 +6,7 @@
 
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"
+#include "pkgserver/openpgp_key_block.h"
 #include "settings/web_utils.h"
 
 #define FEED_KEYS_LOG(fmt, ...) syslog(LOG_ERR, "%s:%d " fmt, "feed_keys", __LINE__, ##__VA_ARGS__)
@@ -39,6 +40,9 @@ Json::Value AcceptedKeys(const std::string& feed, const Json::Value& keys) {
   for (Json::ArrayIndex i = 0; i < keys.size(); ++i) {
     if (keys[i].isString() && PMSIsArmoredPublicKey(keys[i].asString())) {
       accepted.append(Trimmed(keys[i].asString()));
+    } else if (keys[i].isString() &&
+               PMSKeyBlockContent(keys[i].asString()) == KeyBlockContent::kSecretKey) {
+      FEED_KEYS_LOG("%s: keyrings[%u] holds a secret key, refused", feed.c_str(), i);
     } else {
       FEED_KEYS_LOG("%s: keyrings[%u] is not an armored public key, refused", feed.c_str(), i);
     }
@@ -55,9 +59,11 @@ bool PMSIsArmoredPublicKey(const std::string& text) {
       block.compare(block.size() - end, end, kEnd) != 0) {
     return false;
   }
-  // One block only: a second header could smuggle a secret key in.
+  // One block only: a second header could smuggle a secret key in. And the
+  // packets decide, not the header's words.
   return block.find("-----BEGIN", 1) == std::string::npos &&
-         block.find("-----END") == block.size() - end && block.find('\0') == std::string::npos;
+         block.find("-----END") == block.size() - end && block.find('\0') == std::string::npos &&
+         PMSKeyBlockContent(block) == KeyBlockContent::kPublicKey;
 }
 
 bool PMSUpdatePkgServerKey(const std::string& feed, const Json::Value& keys) {

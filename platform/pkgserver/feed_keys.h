@@ -22,9 +22,9 @@ namespace KIVOPackageServer {
 // The stored keys of `feed` (armored public key blocks); empty when none.
 std::vector<std::string> PMSFeedKeys(const std::string& feed);
 
-// True when `text` is exactly one armored OpenPGP public key block (the
-// armor only: whether the block holds a usable key is gpgme's to say when
-// it imports it).
+// True when `text` is exactly one armored OpenPGP public key block whose
+// packets are public keys and nothing secret (whether the key is usable is
+// gpgme's to say when it imports it).
 bool PMSIsArmoredPublicKey(const std::string& text);
 
 }  // namespace KIVOPackageServer

@@ -37,6 +37,26 @@ std::string TestKeys::Create(const std::string& uid, bool expired) {
   return Trim(out);
 }
 
+std::string InPublicArmor(std::string block) {
+  for (const char* line : {"BEGIN", "END"}) {
+    const std::string from = std::string("-----") + line + " PGP PRIVATE KEY BLOCK-----";
+    const size_t at = block.find(from);
+    EXPECT_NE(std::string::npos, at) << "not a secret key block";
+    if (at != std::string::npos)
+      block.replace(at, from.size(), std::string("-----") + line + " PGP PUBLIC KEY BLOCK-----");
+  }
+  return block;
+}
+
+std::string TestKeys::Export(const std::string& fpr, bool secret) const {
+  std::string out;
+  EXPECT_EQ(0, RunProgram({"gpg", "--homedir", home_, "--batch", "--pinentry-mode", "loopback",
+                           "--passphrase", "", "--armor",
+                           secret ? "--export-secret-keys" : "--export", fpr},
+                          &out));
+  return out;
+}
+
 void TestKeys::Revoke(const std::string& fpr) {
   // gpg keeps a revocation certificate for every key it makes; its armour
   // is commented out with ':' until it is needed.

@@ -4,6 +4,10 @@
 
 #include <string>
 
+// An armored secret key block relabelled as a public one: the header's
+// words changed, the packets not.
+std::string InPublicArmor(std::string secret_block);
+
 class TestKeys {
  public:
   // Makes a GnuPG home in `dir`.
@@ -12,6 +16,9 @@ class TestKeys {
   // Creates a signing key for `uid`; with `expired` it was valid for one day
   // in 2020. Returns its fingerprint.
   std::string Create(const std::string& uid, bool expired = false);
+  // `fpr` exported as an armored block: its public key, or with `secret`
+  // its secret key (the keys here have no passphrase).
+  std::string Export(const std::string& fpr, bool secret = false) const;
   // Revokes `fpr` (its revocation certificate, imported here and exported
   // to the appliance keyring by Trust).
   void Revoke(const std::string& fpr);
