@@ -79,6 +79,30 @@ TEST_F(KeyringTest, ImportsPublicKeysAndRefusesEverythingElse) {
   EXPECT_FALSE(items[0]["revoked"].asBool());
 }
 
+TEST_F(KeyringTest, AKeyWithManyLongUserIdsIsListedShortenedAndCanBeDeleted) {
+  const std::string fpr = keys_.Create("Large Publisher <large@example.org>");
+  // 70 more user ids of about 1.9 KB each: the whole key would not fit the
+  // listing's line.
+  std::string out;
+  ASSERT_EQ(0, RunProgram({"sh", "-c",
+                           "for i in $(seq 1 70); do gpg --homedir '" + keys_.home() +
+                               "' --batch --quiet --passphrase '' --quick-add-uid " + fpr +
+                               " \"Publisher $i $(printf 'x%.0s' $(seq 1 1900))\" || exit 1; done"},
+                          &out))
+      << out;
+  ASSERT_TRUE(Import(Export(fpr, false)).Success());
+  Json::Value items = List();
+  ASSERT_EQ(1u, items.size());
+  const Json::Value& uids = items[0]["uids"];
+  ASSERT_EQ(9u, uids.size());
+  for (Json::ArrayIndex i = 0; i < 8; ++i) EXPECT_LE(uids[i].asString().size(), 203u) << i;
+  EXPECT_EQ("(and 63 more user ids)", uids[8].asString());
+  Json::Value one(Json::arrayValue);
+  one.append(fpr);
+  EXPECT_TRUE(Delete(one).Success());
+  EXPECT_TRUE(List().empty());
+}
+
 TEST_F(KeyringTest, DeletesInOrderAndStopsAtTheFirstFailure) {
   const std::string a = keys_.Create("A <a@example.org>");
   const std::string c = keys_.Create("C <c@example.org>");

@@ -80,6 +80,27 @@ function unescape_colons(string $text): string {
     return preg_replace_callback('/\\\\x([0-9a-fA-F]{2})/', fn($m) => chr(hexdec($m[1])), $text);
 }
 
+// A key may carry any number of user ids of any length, and the web API reads
+// the listing as one line of at most 128 KiB: each key lists at most
+// MAX_LISTED_UIDS of them, each cut to MAX_UID_BYTES, and says how many more
+// it has, so that one large key cannot make the keyring unlistable.
+const MAX_LISTED_UIDS = 8;
+const MAX_UID_BYTES = 200;
+
+function shortened_uid(string $uid): string {
+    if (strlen($uid) <= MAX_UID_BYTES) return $uid;
+    // Cut on a character boundary: drop a trailing partial UTF-8 sequence.
+    $cut = preg_replace('/[\xC0-\xFF][\x80-\xBF]*$/', '', substr($uid, 0, MAX_UID_BYTES));
+    return $cut . '…';
+}
+
+function listed_uids(array $uids): array {
+    $listed = array_map('shortened_uid', array_slice($uids, 0, MAX_LISTED_UIDS));
+    $more = count($uids) - MAX_LISTED_UIDS;
+    if ($more > 0) $listed[] = sprintf('(and %d more user ids)', $more);
+    return $listed;
+}
+
 // One JSON line: [{"fingerprint", "uids", "created", "expires", "revoked"}].
 function list_keys(): int {
     $home = keyring_home();
@@ -103,7 +124,10 @@ function list_keys(): int {
         }
         if ($key !== null) $keys[] = $key;
     }
-    echo json_encode($keys, JSON_UNESCAPED_SLASHES | JSON_UNESCAPED_UNICODE), "\n";
+    foreach ($keys as &$listed) $listed['uids'] = listed_uids($listed['uids']);
+    unset($listed);
+    $flags = JSON_UNESCAPED_SLASHES | JSON_UNESCAPED_UNICODE | JSON_INVALID_UTF8_SUBSTITUTE;
+    echo json_encode($keys, $flags), "\n";
     return 0;
 }
 
