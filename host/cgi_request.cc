@@ -14,14 +14,15 @@ std::string Env(const char* name) {
   return v ? v : "";
 }
 
-// Reads exactly `length` bytes; false when the stream ends first.
-bool ReadBody(int fd, size_t length, std::string* body) {
+// Reads exactly `length` bytes by `deadline_ms`. False with `*reason` when
+// the stream ends first or the deadline passes.
+bool ReadBody(int fd, size_t length, int64_t deadline_ms, std::string* body, std::string* reason) {
   body->resize(length);
   size_t done = 0;
   while (done < length) {
-    ssize_t n = read(fd, &(*body)[done], length - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
+    ssize_t n = ReadBeforeDeadline(fd, &(*body)[done], length - done, deadline_ms);
+    if (n < 0 && errno == ETIMEDOUT) return (*reason = "request body not whole in time"), false;
+    if (n <= 0) return (*reason = "request body shorter than its length"), false;
     done += static_cast<size_t>(n);
   }
   return true;
@@ -52,11 +53,13 @@ std::string Boundary(const std::string& content_type) {
   return b.size() <= 70 ? b : "";
 }
 
-bool ReadFormBody(int fd, uint64_t max_upload, CgiRequest* out, std::string* reason) {
+bool ReadFormBody(int fd, uint64_t max_upload, const RequestClock& clock, CgiRequest* out,
+                  std::string* reason) {
   size_t length = 0;
   if (!ParseLength(Env("CONTENT_LENGTH"), &length))
     return (*reason = "invalid CONTENT_LENGTH"), false;
   if (length == 0) return true;
+  out->body_deadline_ms = BodyDeadlineMs(clock, length);
   std::string type = MediaType(Env("CONTENT_TYPE"));
   if (type == "multipart/form-data") {
     out->boundary = Boundary(Env("CONTENT_TYPE"));
@@ -74,8 +77,7 @@ bool ReadFormBody(int fd, uint64_t max_upload, CgiRequest* out, std::string* rea
   }
   if (length > kMaxBodyBytes) return (*reason = "request body too large"), false;
   std::string body;
-  if (!ReadBody(fd, length, &body))
-    return (*reason = "request body shorter than its length"), false;
+  if (!ReadBody(fd, length, out->body_deadline_ms, &body, reason)) return false;
   std::string error;
   if (!ParseUrlEncoded(body, &out->body, &error)) return (*reason = "body: " + error), false;
   return true;
@@ -91,7 +93,8 @@ const std::string* HostFieldIn(const FormFields& fields) {
 
 }  // namespace
 
-bool ReadCgiRequest(int body_fd, uint64_t max_upload, CgiRequest* out, std::string* reason) {
+bool ReadCgiRequest(int body_fd, uint64_t max_upload, const RequestClock& clock, CgiRequest* out,
+                    std::string* reason) {
   out->method = Env("REQUEST_METHOD");
   out->cookie = Env("HTTP_COOKIE");
   out->token = Env("HTTP_X_KIVO_TOKEN");
@@ -105,7 +108,7 @@ bool ReadCgiRequest(int body_fd, uint64_t max_upload, CgiRequest* out, std::stri
     *reason = "query string: " + error;
     return false;
   }
-  if (out->method == "POST" && !ReadFormBody(body_fd, max_upload, out, reason)) return false;
+  if (out->method == "POST" && !ReadFormBody(body_fd, max_upload, clock, out, reason)) return false;
   if (out->query.size() + out->body.size() > kMaxFields) {
     *reason = "too many parameters";
     return false;

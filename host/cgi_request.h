@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <string>
 
+#include "host/request_deadline.h"
 #include "webapi/url_encoded.h"
 
 struct CgiRequest {
@@ -16,6 +17,9 @@ struct CgiRequest {
   FormFields body;              // fields of an urlencoded body, in order
   std::string boundary;         // multipart/form-data: its boundary (the body is left unread)
   uint64_t content_length = 0;
+  // When the whole body must have arrived (BodyDeadlineMs); a multipart
+  // reader reads the rest of it against the same deadline.
+  int64_t body_deadline_ms = 0;
 };
 
 // Limits that keep a hostile request from costing memory or time.
@@ -25,11 +29,13 @@ constexpr size_t kMaxFields = 1000;
 // Reads the request from the environment and `body_fd`. Returns false with a
 // short reason for the client when the request is malformed: an invalid
 // percent-escape, an unsupported method or content type, an urlencoded body
-// larger than kMaxBodyBytes or shorter than its CONTENT_LENGTH, a multipart
-// body larger than `max_upload` or without a boundary, too many fields, a
-// field that only the host sets (webapi/host_fields.h). A multipart body is
-// not read here: it streams to the handler (`boundary`).
-bool ReadCgiRequest(int body_fd, uint64_t max_upload, CgiRequest* out, std::string* reason);
+// larger than kMaxBodyBytes, shorter than its CONTENT_LENGTH or not whole by
+// its deadline (from `clock`), a multipart body larger than `max_upload` or
+// without a boundary, too many fields, a field that only the host sets
+// (webapi/host_fields.h). A multipart body is not read here: it streams to
+// the handler (`boundary`, `body_deadline_ms`).
+bool ReadCgiRequest(int body_fd, uint64_t max_upload, const RequestClock& clock, CgiRequest* out,
+                    std::string* reason);
 
 // The value of cookie `name` in a Cookie header; empty when absent.
 std::string CookieValue(const std::string& header, const std::string& name);

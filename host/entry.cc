@@ -5,4 +5,6 @@
 
 #include "host/entry_main.h"
 
-int main() { return RunEntryRequest(); }
+// The request's deadline counts from the start of this program: the web
+// server starts it once the head is in (and, but for uploads, the body).
+int main() { return RunEntryRequest(RequestClock{MonotonicMs(), kDefaultRequestSeconds}); }

@@ -109,7 +109,8 @@ std::unique_ptr<UploadSource> OpenUpload(const CgiRequest& cgi, APIRequest* requ
   auto open =
       handle ? reinterpret_cast<KivoOpenMultipartFn>(dlsym(handle, "KivoOpenMultipart")) : nullptr;
   std::unique_ptr<UploadSource> source(
-      open ? open(STDIN_FILENO, cgi.content_length, cgi.boundary.c_str()) : nullptr);
+      open ? open(STDIN_FILENO, cgi.content_length, cgi.boundary.c_str(), cgi.body_deadline_ms)
+           : nullptr);
   Json::Value fields(Json::objectValue);
   if (!source || source->ReadFields(fields) != UPLOAD_OK) {
     *reason = source ? "malformed multipart body" : "cannot read multipart bodies";
@@ -120,10 +121,10 @@ std::unique_ptr<UploadSource> OpenUpload(const CgiRequest& cgi, APIRequest* requ
   return source;
 }
 
-void Serve(APIRequest* request, APIResponse* response) {
+void Serve(const RequestClock& clock, APIRequest* request, APIResponse* response) {
   CgiRequest cgi;
   std::string reason;
-  if (!ReadCgiRequest(STDIN_FILENO, LoadUploadLimit(), &cgi, &reason)) {
+  if (!ReadCgiRequest(STDIN_FILENO, LoadUploadLimit(), clock, &cgi, &reason)) {
     return response->SetError(kErrBadRequest, Reason(reason));
   }
   for (const auto& field : cgi.query) request->AddRawParam(field.first, field.second);
@@ -160,13 +161,13 @@ void WriteAnswer(APIResponse& response) {
 
 }  // namespace
 
-int RunEntryRequest() {
+int RunEntryRequest(const RequestClock& clock) {
   openlog("entry.cgi", LOG_PID | LOG_PERROR, LOG_USER);
   const pid_t self = getpid();
   APIRequest request;
   APIResponse response;
   try {
-    Serve(&request, &response);
+    Serve(clock, &request, &response);
   } catch (const std::exception& e) {
     if (getpid() == self) {
       syslog(LOG_ERR, "%s:%d %s %s failed: %s", "entry", __LINE__, request.GetAPIClass().c_str(),

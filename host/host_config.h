@@ -10,7 +10,10 @@
 //   login_backoff_base       seconds of the first back-off; each further
 //                            failure doubles it (1)
 //   login_backoff_max        seconds the back-off grows to at most (900)
-//   max_upload_bytes         the largest multipart body accepted (4 GiB)
+//   max_upload_bytes         the largest multipart body accepted, and so the
+//                            largest package file an appliance takes
+//                            (kDefaultMaxUploadBytes); `kivoctl web-config`
+//                            gives lighttpd the same limit
 #pragma once
 
 #include <cstdint>
@@ -18,10 +21,13 @@
 #include "host/login_throttle.h"
 #include "host/session_store.h"
 
+// The default of max_upload_bytes: 4 GiB.
+constexpr uint64_t kDefaultMaxUploadBytes = 4ULL << 30;
+
 struct HostConfig {
   SessionLimits session;
   LoginLimits login;
-  uint64_t max_upload_bytes = 4ULL << 30;
+  uint64_t max_upload_bytes = kDefaultMaxUploadBytes;
 };
 
 HostConfig LoadHostConfig();

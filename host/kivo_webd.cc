@@ -3,7 +3,13 @@
 // the request code's libraries once, then forks a child for each connection
 // that runs exactly entry.cgi's request code (host/entry_main.h).
 //
-//   kivo-webd [--socket PATH] [--max-children N] [--read-timeout SECONDS]
+//   kivo-webd [--socket PATH] [--max-children N] [--max-per-address N]
+//             [--read-timeout SECONDS]
+//
+// --max-children caps the request processes; --max-per-address caps those of
+// one client address (default half of them); --read-timeout is the time a
+// request's head and small body may take to arrive, and the allowance of a
+// larger body's deadline (host/scgi_server.h).
 //
 // Without --socket it serves the listening socket on its stdin, as the web
 // server hands it to a backend it spawns (and respawns). --socket PATH makes
@@ -35,7 +41,8 @@ struct Options {
 int Usage(const char* why) {
   fprintf(stderr,
           "kivo-webd: %s\n"
-          "usage: kivo-webd [--socket PATH] [--max-children N] [--read-timeout SECONDS]\n",
+          "usage: kivo-webd [--socket PATH] [--max-children N] [--max-per-address N]\n"
+          "                 [--read-timeout SECONDS]\n",
           why);
   return 2;
 }
@@ -59,6 +66,9 @@ bool ParseOptions(int argc, char** argv, Options* options, const char** why) {
     } else if (arg == "--max-children") {
       options->server.max_children = PositiveNumber(value, 4096);
       if (!options->server.max_children) return (*why = "--max-children: 1 to 4096"), false;
+    } else if (arg == "--max-per-address") {
+      options->server.max_per_address = PositiveNumber(value, 4096);
+      if (!options->server.max_per_address) return (*why = "--max-per-address: 1 to 4096"), false;
     } else if (arg == "--read-timeout") {
       options->server.read_timeout_seconds = PositiveNumber(value, 86400);
       if (!options->server.read_timeout_seconds)

@@ -1,7 +1,7 @@
 #include "host/scgi_request.h"
 
 #include <cerrno>
-#include <cstring>
+#include <cstdlib>
 #include <unistd.h>
 
 namespace {
@@ -10,21 +10,24 @@ namespace {
 // so a stream of digits cannot keep the reader going.
 constexpr size_t kMaxLengthDigits = 8;
 
-// Reads exactly `size` bytes into `out`; false when the stream ends first.
-bool ReadExactly(int fd, char* out, size_t size) {
-  size_t done = 0;
-  while (done < size) {
-    ssize_t n = read(fd, out + done, size - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    done += static_cast<size_t>(n);
-  }
-  return true;
-}
-
 bool IsDecimal(const std::string& text) {
   return !text.empty() && text.size() <= 18 &&
          text.find_first_not_of("0123456789") == std::string::npos;
+}
+
+enum class Got { kBytes, kNothingYet, kEnd };
+
+// Reads up to `size` bytes onto the end of `out`.
+Got ReadSome(int fd, size_t size, std::string* out) {
+  char buf[16384];
+  for (;;) {
+    ssize_t n = read(fd, buf, size < sizeof(buf) ? size : sizeof(buf));
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) return Got::kNothingYet;
+    if (n <= 0) return Got::kEnd;
+    out->append(buf, static_cast<size_t>(n));
+    return Got::kBytes;
+  }
 }
 
 }  // namespace
@@ -46,21 +49,82 @@ bool ParseScgiHeaders(const std::string& content, ScgiHeaders* headers) {
          IsDecimal(headers->front().second);
 }
 
-ScgiHeadResult ReadScgiHead(int fd, ScgiHeaders* headers) {
-  // One byte at a time up to the ':', so not a byte of the body is taken.
-  std::string digits;
-  for (char c = 0;;) {
-    if (!ReadExactly(fd, &c, 1)) return ScgiHeadResult::kClosed;
-    if (c == ':') break;
-    if (c < '0' || c > '9' || digits.size() == kMaxLengthDigits) return ScgiHeadResult::kMalformed;
-    digits += c;
+std::string ScgiRequestReader::Header(const std::string& name) const {
+  for (const auto& header : headers_) {
+    if (header.first == name) return header.second;
   }
-  if (digits.empty() || (digits.size() > 1 && digits[0] == '0')) return ScgiHeadResult::kMalformed;
-  size_t length = std::stoul(digits);
-  if (length > kMaxScgiHeadBytes) return ScgiHeadResult::kTooLarge;
-  std::string content(length + 1, '\0');  // the headers and the closing ','
-  if (!ReadExactly(fd, &content[0], content.size())) return ScgiHeadResult::kClosed;
-  if (content.back() != ',') return ScgiHeadResult::kMalformed;
-  content.pop_back();
-  return ParseScgiHeaders(content, headers) ? ScgiHeadResult::kOk : ScgiHeadResult::kMalformed;
+  return "";
+}
+
+bool ScgiRequestReader::Fail(ScgiReadResult result) {
+  state_ = State::kFailed;
+  failure_ = result;
+  return false;
+}
+
+size_t ScgiRequestReader::Wanted() const {
+  switch (state_) {
+    case State::kDigits:
+      return 1;  // one byte at a time up to the ':', so not a byte more is taken
+    case State::kContent:
+      return head_length_ + 1 - content_.size();  // the headers and the closing ','
+    case State::kBody:
+      return content_length_ - body_.size();
+    default:
+      return 0;
+  }
+}
+
+std::string* ScgiRequestReader::Buffer() {
+  return state_ == State::kDigits ? &digits_ : state_ == State::kContent ? &content_ : &body_;
+}
+
+bool ScgiRequestReader::Advance() {
+  if (state_ == State::kDigits) return DigitRead();
+  if (state_ == State::kContent && content_.size() == head_length_ + 1) return HeadRead();
+  if (state_ == State::kBody && body_.size() == content_length_) state_ = State::kDone;
+  return true;
+}
+
+bool ScgiRequestReader::DigitRead() {
+  char c = digits_.back();
+  if (c != ':') {
+    if (c >= '0' && c <= '9' && digits_.size() <= kMaxLengthDigits) return true;
+    return Fail(ScgiReadResult::kMalformed);
+  }
+  digits_.pop_back();
+  if (digits_.empty() || (digits_.size() > 1 && digits_[0] == '0'))
+    return Fail(ScgiReadResult::kMalformed);
+  head_length_ = std::strtoul(digits_.c_str(), nullptr, 10);
+  if (head_length_ > kMaxScgiHeadBytes) return Fail(ScgiReadResult::kTooLarge);
+  state_ = State::kContent;
+  return true;
+}
+
+// The netstring is whole in content_: checks its end and parses it.
+bool ScgiRequestReader::HeadRead() {
+  if (content_.back() != ',') return Fail(ScgiReadResult::kMalformed);
+  content_.pop_back();
+  if (!ParseScgiHeaders(content_, &headers_)) return Fail(ScgiReadResult::kMalformed);
+  content_.clear();
+  content_length_ = std::strtoull(headers_.front().second.c_str(), nullptr, 10);
+  state_ = content_length_ <= max_body_ ? State::kBody : State::kDone;
+  return Advance();  // an empty body is whole already
+}
+
+ScgiReadResult ScgiRequestReader::ReadFrom(int fd) {
+  for (;;) {
+    if (state_ == State::kDone) return ScgiReadResult::kOk;
+    if (state_ == State::kFailed) return failure_;
+    switch (ReadSome(fd, Wanted(), Buffer())) {
+      case Got::kNothingYet:
+        return ScgiReadResult::kMore;
+      case Got::kEnd:
+        Fail(ScgiReadResult::kClosed);
+        break;
+      case Got::kBytes:
+        Advance();
+        break;
+    }
+  }
 }

@@ -131,6 +131,7 @@ bool PackageWebAPI::DeterminePackageInfo(DownloadRequest& d) const {
   d.install_and_run = FlagParamOr(request, "installrunpackage", false);
   d.volume = request->GetParam("volume_path", "").asString();
   d.wizard_values = request->GetParam("customuivalues", "").asString();
+  d.origin_change = OriginChangeParam();
   if (!PMSIsValidPackageId(d.name)) {
     Json::Value details(Json::objectValue);
     details["name"] = "name";
@@ -173,7 +174,7 @@ bool PackageWebAPI::DeterminePackageInfo(DownloadRequest& d) const {
 
 pid_t PackageWebAPI::ForkProcess(NVX::Task* task, Json::Value& result, const std::string& name,
                                  uint64_t size, const std::string& link, const std::string& folder,
-                                 bool quickInstall) {
+                                 bool quickInstall, PMSOriginChange originChange) {
   if (name.empty() || !task || link.empty() || folder.empty()) return -1;
   pid_t pid = KLIBCProcFork();
   if (pid < 0) {
@@ -187,7 +188,8 @@ pid_t PackageWebAPI::ForkProcess(NVX::Task* task, Json::Value& result, const std
     task->waitForDataReady("data", 60);
     return 0;
   }
-  if (KIVOPackageServer::InitDownload(task, name, size, link, folder, quickInstall, pid)) {
+  if (KIVOPackageServer::InitDownload(task, name, size, link, folder, quickInstall, pid,
+                                      originChange)) {
     result["taskid"] = task->getTaskId();
     result["progress"] = "0.00001";  // a string, as clients have always received it
   }
@@ -216,7 +218,8 @@ bool PackageWebAPI::DownloadAndInstallPackage(const DownloadRequest& d, Json::Va
     KIVOPackageServer::PMSRemoveDownloadDir(folder);
     return false;
   }
-  pid_t pid = ForkProcess(task.get(), result, d.name, d.size, d.link, folder, d.quick_install);
+  pid_t pid = ForkProcess(task.get(), result, d.name, d.size, d.link, folder, d.quick_install,
+                          d.origin_change);
   if (pid < 0) {
     KIVOPackageServer::PMSRemoveDownloadDir(folder);
     return false;

@@ -39,6 +39,7 @@ enum ApiError : int {
   kErrExtractFailed = 4540,
   kErrUnsafePayload = 4541,  // the install found a hostile member
   kErrUpgradeRolledBack = 4542,
+  kErrOtherOrigin = 4543,  // an upgrade from another origin or signer than the installed one's
   kErrBadWizardValues = 4544,
   kErrInstallNotInstalled = 4545,  // an installed package was expected
   kErrNotNewer = 4546,

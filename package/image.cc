@@ -31,8 +31,6 @@ constexpr int kFallbackMaxAge = 10;
 
 constexpr const char* kSmallIcon = "thumb_72.png";
 constexpr const char* kLargeIcon = "thumb_256.png";
-constexpr const char* kSourceVendor = "AVAIL/KIVO";
-constexpr const char* kSourceOther = "AVAIL/OTHER";
 
 constexpr const char* kFallback72 = "%s/modules/PkgManApp/images/package_center_72.png";
 constexpr const char* kFallback256 = "%s/modules/PkgManApp/images/package_center_256.png";
@@ -49,11 +47,6 @@ std::string TextParam(const APIRequest* request, const char* name) {
 int IntParam(const APIRequest* request, const char* name) {
   Json::Value v = request->GetParam(name, "");
   return v.isInt() ? v.asInt() : 0;
-}
-
-bool BoolParam(const APIRequest* request, const char* name) {
-  Json::Value v = request->GetParam(name, "");
-  return v.isBool() && v.asBool();
 }
 
 void FallbackPath(const char* format, char* buffer) {
@@ -98,23 +91,11 @@ bool PackageWebAPI::GetVXImage(const std::vector<int>& kinds, const char* file, 
   return false;
 }
 
-bool PackageWebAPI::GetServerImage(const std::vector<std::string>& files, char* buffer,
-                                   size_t size) {
-  if (!buffer || files.empty()) return false;
-  const char* source = BoolParam(request, "bls") ? kSourceVendor : kSourceOther;
-  std::string name = TextParam(request, "name");
-  std::string ver = TextParam(request, "ver");
-  std::string link = TextParam(request, "link");
-  for (size_t i = 0; i < files.size(); ++i) {
-    // Only the first choice is fetched; later ones are taken from the cache
-    // alone, since the link names the first one's image.
-    const char* link_or_none = i == 0 && !link.empty() ? link.c_str() : nullptr;
-    if (KIVOPackageTool::PMSGetServerImage(source, name.c_str(), ver.c_str(), files[i].c_str(),
-                                           link_or_none, buffer, size)) {
-      return true;
-    }
-  }
-  return false;
+bool PackageWebAPI::GetServerImage(std::string* path) {
+  // "bls" (whether the entry is the vendor's or a feed's) is not needed:
+  // the link names the image and the server it comes from.
+  return KIVOPackageTool::PMSServerImagePath(TextParam(request, "name"), TextParam(request, "ver"),
+                                             TextParam(request, "link"), path);
 }
 
 void PackageWebAPI::GetVXIcon() {
@@ -140,18 +121,13 @@ void PackageWebAPI::GetVXIcon() {
   DumpImage(path, kFallbackMaxAge);
 }
 
+// A server package's icon is the image its link names, whatever the size
+// asked: the desktop passes the catalogue's "icon" or "icon_256" as it needs.
 void PackageWebAPI::GetServerIcon() {
+  std::string found;
+  if (GetServerImage(&found)) DumpImage(found.c_str(), kFoundMaxAge);
   char path[kPathBufferSize] = {};
-  std::string name = TextParam(request, "name");
-  std::string ver = name.empty() ? "" : TextParam(request, "ver");
-  int size = IntParam(request, "size");
-  if (!name.empty() && !ver.empty()) {
-    bool large = size == 96 || size == 128 || size == 144 || size == 256;
-    std::vector<std::string> files = large ? std::vector<std::string>{kLargeIcon, kSmallIcon}
-                                           : std::vector<std::string>{kSmallIcon};
-    if (GetServerImage(files, path, sizeof(path))) DumpImage(path, kFoundMaxAge);
-  }
-  FallbackPath(size == 72 ? kFallback72 : kServerFallback256, path);
+  FallbackPath(IntParam(request, "size") == 72 ? kFallback72 : kServerFallback256, path);
   DumpImage(path, kFallbackMaxAge);
 }
 
@@ -190,11 +166,11 @@ void PackageWebAPI::GetVXScreenshot() {
 void PackageWebAPI::GetServerScreenshot() {
   std::string file;
   if (!ReadScreenshotRequest(file)) return;
-  char path[kPathBufferSize] = {};
-  if (!GetServerImage({file}, path, sizeof(path))) {
+  std::string path;
+  if (!GetServerImage(&path)) {
     return response->SetError(kErrImageNotFound, ImageError("screenshot not available"));
   }
-  DumpImage(path, kFoundMaxAge);
+  DumpImage(path.c_str(), kFoundMaxAge);
   response->SetError(kErrImageNotFound, ImageError("screenshot not available"));
 }
 

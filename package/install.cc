@@ -78,6 +78,7 @@ constexpr ToolCodeMapping kInstallErrors[] = {
     {PKG_ERR_NO_VOLUME, kErrNoVolume},
     {PKG_ERR_CANCELLED, kErrCancelled},
     {PKG_ERR_UPGRADE_ROLLED_BACK, kErrUpgradeRolledBack},
+    {PKG_ERR_OTHER_ORIGIN, kErrOtherOrigin},
 };
 
 bool IsCodesignCode(int code) {
@@ -358,9 +359,12 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;
+  // An uploaded file, or one on the device: a file's origin.
+  PMSInstallSource source;
+  source.change = OriginChangeParam();
   bool ok = InstallPackageFileImpl(request->GetLoginUserName(), path, volume, 0, extra, type_flag,
                                    request->GetUILanguage(), message, code, details, force,
-                                   check_codesign);
+                                   check_codesign, &source);
   Json::Value result(Json::objectValue);
   if (!message.empty()) result["message"] = message;
   result["worker_message"] =
@@ -387,8 +391,18 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
     default:
       break;
   }
-  response->SetError(MapToolCode(kInstallErrors, code), result);
+  // The install checks the signature under the trust level itself (also
+  // when the caller confirmed it unchecked): its refusal answers as the
+  // signature's outcome does everywhere.
+  const int signature_error = MapToolCode(kCodesignErrors, code);
+  response->SetError(
+      signature_error != kErrFailed ? signature_error : MapToolCode(kInstallErrors, code), result);
   return false;
+}
+
+PMSOriginChange PackageWebAPI::OriginChangeParam() const {
+  Json::Value v = request->GetParam("switch_origin", false);
+  return v.isBool() && v.asBool() ? PMSOriginChange::kAllow : PMSOriginChange::kRefuse;
 }
 
 void PackageWebAPI::CancelProgress() {

@@ -108,6 +108,10 @@ class PackageWebAPI {
   NVX::Task* ClaimInstallTask(NVX::TaskMgr& mgr, const PackageInfo& info);
   void RecordFailure(NVX::Task& task);
   bool InstallPackageFile(const char* path);
+  // "switch_origin" (bool, default false) of an install: the administrator
+  // switches the package to the origin of this file or download
+  // (pkgtool/package_origin.h).
+  PMSOriginChange OriginChangeParam() const;
   bool VolumeListGet(Json::Value& out);
   bool TinboxSpaceOk(const std::string& install_type);
   bool CheckEnvConflicts(PackageManager& manager, const std::string& id, const std::string& version,
@@ -125,12 +129,14 @@ class PackageWebAPI {
     std::string name, link, checksum, volume, wizard_values;
     uint64_t size = 0;
     bool quick_install = false, install_and_run = false, type_flag = false;
+    PMSOriginChange origin_change = PMSOriginChange::kRefuse;
   };
   void Download();
   bool DeterminePackageInfo(DownloadRequest& d) const;
   bool DownloadAndInstallPackage(const DownloadRequest& d, Json::Value& result);
   pid_t ForkProcess(NVX::Task* task, Json::Value& result, const std::string& name, uint64_t size,
-                    const std::string& link, const std::string& folder, bool quickInstall);
+                    const std::string& link, const std::string& folder, bool quickInstall,
+                    PMSOriginChange originChange = PMSOriginChange::kRefuse);
   // The progress a download task reports: 1.0 only once its file is there,
   // never below 0.
   static double DownloadTaskProgress(NVX::Task& task, const Json::Value& data);
@@ -150,11 +156,12 @@ class PackageWebAPI {
 
   // Images (image.cc). DumpImage sends the file at `path` with a cache
   // time of `max_age` seconds and ends the process; it returns false only
-  // when the file cannot be read. The lookups write the found image's path
-  // into `buffer`.
+  // when the file cannot be read. GetVXImage writes the found image's path
+  // into `buffer`; GetServerImage gives the path of the image the request's
+  // `link` names, cached or fetched (server_image.h).
   bool DumpImage(const char* path, int max_age);
   bool GetVXImage(const std::vector<int>& kinds, const char* file, char* buffer, size_t size);
-  bool GetServerImage(const std::vector<std::string>& files, char* buffer, size_t size);
+  bool GetServerImage(std::string* path);
   // The screenshot file name the request asks for; false with 4500 answered
   // when the name, version or number is missing or out of range.
   bool ReadScreenshotRequest(std::string& file);

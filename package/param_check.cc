@@ -282,7 +282,8 @@ bool CheckInstall(APIRequest* req, APIResponse* resp) {
            {"checksum", Type::String, kOpt},
            {"installrunpackage", Type::Bool, kOpt},
            {"force", Type::Bool, kOpt},
-           {"check_codesign", Type::Bool, kOpt}});
+           {"check_codesign", Type::Bool, kOpt},
+           {"switch_origin", Type::Bool, kOpt}});
   if (!c.TypesOk()) return false;
   auto filled = [&c](const char* name) {
     const ReadParam& p = c[name];

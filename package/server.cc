@@ -18,6 +18,7 @@
 #include "pkgserver/badge.h"
 #include "pkgserver/catalogue_listing.h"
 #include "pkgserver/server_image.h"
+#include "pkgtool/package_origin.h"
 #include "pkgtool/pms.h"
 #include "task_record.h"
 
@@ -92,11 +93,22 @@ NVX::Task* ListedTask(NVX::TaskMgr& mgr, const std::set<std::string>& listed,
 
 // Marks `overlay` as an upgrade of installed package `p` to the server's
 // `version` unless the installed version is restricted; true when it did.
-bool MarkUpgrade(const PackageInfo& p, const PMSThirdPartyLimits& limits,
-                 const std::string& version, Json::Value& overlay) {
+// Only the catalogue the package came from offers its upgrades: a newer
+// version from another catalogue (`source`) is no upgrade, and the overlay
+// names the package's origin in "other_origin" instead, for an
+// administrator who may switch it to this source. The origin is read only
+// for a newer version: most installed packages are up to date.
+bool MarkUpgrade(const PackageInfo& p, const PMSPackageOrigin& source,
+                 const PMSThirdPartyLimits& limits, const std::string& version,
+                 Json::Value& overlay) {
   PackageBasicInfo have(p.getId(), p.getVersion());
   if (!have.compare(PackageBasicInfo(overlay["package"].asString(), version), PKG_VER_LT) ||
       limits.Restricts(p.getId(), p.getVersion())) {
+    return false;
+  }
+  const PMSPackageOrigin installed_from = PMSInstalledOrigin(p.getId());
+  if (!PMSSameSource(installed_from, source)) {
+    overlay["other_origin"] = PMSSourceText(installed_from);
     return false;
   }
   overlay["blupgrade"] = true;
@@ -347,7 +359,9 @@ void PackageWebAPI::ListServerPackage() {
         // The entries of installed packages have always had "version", null
         // when the server gave none (rendering adds it beside an icon).
         if (!e.has_version && e.icon.empty()) overlay["version"] = Json::Value();
-        any_upgrade = MarkUpgrade(p->second, limits, e.version, overlay) || any_upgrade;
+        any_upgrade =
+            MarkUpgrade(p->second, listing.sources[e.source], limits, e.version, overlay) ||
+            any_upgrade;
         AnnotateInstalled(mgr, tasks, p->second, overlay);
       }
       AnnotateDownload(mgr, tasks, overlay);
@@ -355,11 +369,7 @@ void PackageWebAPI::ListServerPackage() {
     } else {
       answer.Add(e.name, e.text);
     }
-    if (!e.icon.empty()) {
-      KIVOPackageTool::PMSGetServerImage(others ? "AVAIL/OTHER" : "AVAIL/KIVO", e.name.c_str(),
-                                         e.version.c_str(), "thumb_72.png", e.icon.c_str(), nullptr,
-                                         0);
-    }
+    if (!e.icon.empty()) KIVOPackageTool::PMSQueueServerImage(e.name, e.version, e.icon);
   }
   response->SetSuccessText(answer.Finish(any_upgrade));
 }

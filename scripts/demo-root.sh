@@ -27,24 +27,49 @@ gpg --homedir "$ROOT/usr/kivo/etc/packages/gnupg" --batch --quiet --import \
   build/examples/demo-publisher.asc 2>/dev/null
 mkdir -p "$ROOT/volume1/public/packages"
 cp build/examples/*.kpk "$ROOT/volume1/public/packages/"
-for pkg in demo-web demo-notes; do
-  $K status $pkg >/dev/null 2>&1 || $K install "build/examples/$pkg.kpk" --run || true
-done
+
+# The two installed packages come from the vendor's package server, as on an
+# appliance, so that their records name the vendor as their origin and the
+# vendor's later catalogue (below) offers them upgrades. At first the server
+# offers just these versions, served for the moment by PHP's built-in web
+# server on the demo's port (lighttpd does not run yet); the catalogue it
+# leaves in the cache goes with it.
+FEED=$ROOT/usr/kivo/www/feed
+if ! $K status demo-web >/dev/null 2>&1 || ! $K status demo-notes >/dev/null 2>&1; then
+  rm -rf "$FEED" && mkdir -p "$FEED"
+  cp build/examples/demo-web.kpk build/examples/demo-notes.kpk "$FEED/"
+  $K index "$FEED" --base-url "http://127.0.0.1:$PORT/feed" >/dev/null
+  $K server-config --vendor "http://127.0.0.1:$PORT/feed/catalogue.json" >/dev/null
+  php -S "127.0.0.1:$PORT" -t "$ROOT/usr/kivo/www" >/dev/null 2>&1 &
+  SERVER=$!
+  for _ in $(seq 50); do
+    (exec 3<>"/dev/tcp/127.0.0.1/$PORT") 2>/dev/null && break
+    sleep 0.1
+  done
+  for pkg in demo-web demo-notes; do
+    $K status $pkg >/dev/null 2>&1 || $K install-server $pkg --run || true
+  done
+  kill "$SERVER" && wait "$SERVER" 2>/dev/null || true
+  rm -rf "$ROOT/var/cache/kivo/pkgserver"
+fi
 
 # The vendor's package server: a static catalogue that kivoctl index makes
 # from the sample packages, served by the same lighttpd under /feed/. It
 # offers packages that are not installed (one of them a beta), a newer
 # demo-web (an upgrade badge), and demo-gone, whose file is withdrawn after
 # indexing so that its download fails cleanly.
-FEED=$ROOT/usr/kivo/www/feed
 rm -rf "$FEED" && mkdir -p "$FEED"
 for pkg in demo-beta demo-db demo-notes demo-web-update demo-wizard demo-gone; do
   cp "build/examples/$pkg.kpk" "$FEED/"
 done
 $K index "$FEED" --base-url "http://127.0.0.1:$PORT/feed" --recommend demo-web --recommend demo-beta >/dev/null
 rm "$FEED/demo-gone.kpk"
+# Both catalogues are served on loopback, so this root lets package images
+# come from loopback and private addresses, which an appliance refuses by
+# default (docs/images.md).
 $K server-config --vendor "http://127.0.0.1:$PORT/feed/catalogue.json" \
-  --company-info "http://127.0.0.1:$PORT/feed/company-info.json" >/dev/null
+  --company-info "http://127.0.0.1:$PORT/feed/company-info.json" \
+  --allow-private-image-addresses yes >/dev/null
 # The terms-of-service endpoint answers the hash of the current terms; the
 # package center asks the user to agree again whenever it changes.
 cp examples/terms-of-service.txt "$FEED/terms-of-service.txt"

@@ -1,5 +1,6 @@
 // kivoctl auto-update on a system root against a package server on the
-// loopback: an upgradable package is upgraded and runs again, a beta is
+// loopback, for packages installed from that server: an upgradable package
+// is upgraded and runs again, a beta is
 // held back on the stable channel and taken on the beta channel, a failing
 // upgrade leaves the old version running and fails the run, the settings
 // "off" and the chosen list are honoured, and --dry-run changes nothing.
@@ -33,12 +34,16 @@ class AutoUpdateTest : public ::testing::Test {
                     enable + "\"\npkg_autoupdate_all=\"" + all + "\"\npackage_update_channel=\"" +
                     channel + "\"\n");
   }
-  // Installs and starts version 1.0 of `id`.
+  // Installs and starts version 1.0 of `id` from the vendor's server:
+  // automatic updates come from the origin a package was installed from.
   void InstallOld(const std::string& id) {
     TestPackage v1;
     v1.id = id;
+    vendor_.Add(v1);
+    ASSERT_TRUE(vendor_.Index());
+    vendor_.Publish();
     std::string out;
-    ASSERT_EQ(0, Kivoctl({"install", v1.Build(local_), "--run"}, &out)) << out;
+    ASSERT_EQ(0, Kivoctl({"install-server", id, "--run"}, &out)) << out;
   }
   // The vendor offers version 2.0 of `id` (with `scripts`), as a beta when
   // `beta`. Call Serve() after the last.
@@ -48,7 +53,7 @@ class AutoUpdateTest : public ::testing::Test {
     v2.id = id;
     v2.version = "2.0";
     v2.scripts = scripts;
-    vendor_.Add(v2);
+    vendor_.Replace(v2);
     if (beta) betas_.push_back(id);
   }
   void Serve() {
@@ -71,7 +76,6 @@ class AutoUpdateTest : public ::testing::Test {
 
   TempRoot root_;
   HttpTestServer server_;
-  std::string local_ = root_.Path("/local-packages");
   CatalogueFeed vendor_{server_, root_.Path("/vendor-files"), "/vendor"};
   std::vector<std::string> betas_;
 };
@@ -135,9 +139,10 @@ TEST_F(AutoUpdateTest, OffChosenListAndRestrictions) {
   Serve();
   std::string out;
   Settings("no", "yes", "stable");
+  const int asked = server_.Requests("/vendor/catalogue.json");
   ASSERT_EQ(0, AutoUpdate(&out)) << out;
   EXPECT_EQ("automatic update is off\n", out);
-  EXPECT_EQ(0, server_.Requests("/vendor/catalogue.json"));
+  EXPECT_EQ(asked, server_.Requests("/vendor/catalogue.json"));
 
   Settings("yes", "no", "stable");
   root_.Write("/usr/kivo/etc/packages/autoupdate.json", "[\"au-b\", \"au-c\"]");

@@ -258,20 +258,38 @@ TEST_F(InstallFlowTest, CodeSignatureIsLenientAtUploadAndStrictAtInstall) {
   ASSERT_TRUE(task);
   EXPECT_TRUE(task->isFinished());
 
+  // The trust level binds: at "trusted publishers only" not even the
+  // administrator's confirmation installs an unsigned package or a stranger's.
   TestPackage unsigned_app;
   unsigned_app.id = "unsigned";
-  CgiAnswer up2 = Upload(unsigned_app.Build(dir_));
-  EXPECT_EQ(4531, up2.Data()["codesign_error"].asInt());
-  CgiAnswer lenient =
-      Call("install", {{"task_id", up2.Data()["task_id"].asString()}, {"check_codesign", "false"}});
-  EXPECT_TRUE(lenient.Success()) << lenient.body;
+  const std::string unsigned_file = unsigned_app.Build(dir_);
+  auto confirmed_install = [&](const std::string& path, int codesign_error) {
+    CgiAnswer up = Upload(path);
+    EXPECT_EQ(codesign_error, up.Data()["codesign_error"].asInt()) << up.body;
+    return Call("install",
+                {{"task_id", up.Data()["task_id"].asString()}, {"check_codesign", "false"}});
+  };
+  EXPECT_EQ(4531, confirmed_install(unsigned_file, 4531).Code());
+  EXPECT_EQ(4533, confirmed_install(file, 4533).Code());
+  EXPECT_FALSE(PackageRegistry::IsInstalled("unsigned"));
+  EXPECT_FALSE(PackageRegistry::IsInstalled("test-app"));
 
+  // A tampered file is refused at every level, confirmed or not.
   std::string tampered_file = dir_ + "/tampered.kpk";
   std::string data;
   ASSERT_TRUE(KIVOReadFile(file, &data));
   data[data.find("\x1f\x8b\x08", data.find("package.tgz")) + 30] ^= 0x40;
   ASSERT_TRUE(KIVOWriteFileAtomic(tampered_file, data, SyncToDisk::No));
-  EXPECT_EQ(4532, Upload(tampered_file).Data()["codesign_error"].asInt());
+  Trust(2);
+  EXPECT_EQ(4532, confirmed_install(tampered_file, 4532).Code());
+  EXPECT_FALSE(PackageRegistry::IsInstalled("test-app"));
+
+  // A level that only warns (unsigned packages accepted) lets the
+  // confirmation through for a stranger's signature.
+  Trust(1);
+  CgiAnswer lenient = confirmed_install(file, 4533);
+  EXPECT_TRUE(lenient.Success()) << lenient.body;
+  EXPECT_TRUE(PackageRegistry::IsInstalled("test-app"));
 }
 
 TEST_F(InstallFlowTest, EnvironmentCheckVersionsServicesAndLock) {

@@ -68,10 +68,14 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
   TestPackage a;
   a.id = "app-a";
   a.info = {{"adminport", "8123"}, {"adminurl", "ui"}, {"adminprotocol", "https"}};
-  TestPackage installed_a = a;
-  ASSERT_EQ(0, Kivoctl({"install", installed_a.Build(root_.Path("/tmp")), "--run"}));
-  a.version = "2.0";
+  // Version 1.0 installed from this server, which then offers 2.0.
   feed_.Add(a);
+  ASSERT_TRUE(feed_.Index());
+  feed_.Publish();
+  std::string out;
+  ASSERT_EQ(0, Kivoctl({"install-server", "app-a", "--run"}, &out)) << out;
+  a.version = "2.0";
+  feed_.Replace(a);
   TestPackage b;
   b.id = "app-b";
   b.info = {{"install_dep_packages", "app-a>=1.0"}, {"beta", "yes"}};
@@ -94,7 +98,7 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
   ASSERT_TRUE(task->setProperty("data", data));
   ASSERT_TRUE(task->setProperty("progress", 1.0));
 
-  CgiAnswer list = List();
+  CgiAnswer list = List({{"blforcereload", "true"}});
   ASSERT_TRUE(list.Success()) << list.body;
   EXPECT_EQ(2u, list.Data()["total"].asUInt());
   EXPECT_TRUE(list.Data()["blupgrade"].asBool());

@@ -28,10 +28,7 @@ class ServerListingTest : public ::testing::Test {
   void SetUp() override {
     root_.AddAccount("admin", "secret", {"administrators"});
     root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
-    root_.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + feed_.Url() +
-                                                "\"\nconnect_timeout=\"2\"\n"
-                                                "catalogue_timeout=\"5\"\n"
-                                                "catalogue_max_age=\"600\"\n");
+    Vendor(feed_.Url());
     for (const char* id : {"list-a", "list-b", "list-c"}) {
       TestPackage p;
       p.id = id;
@@ -42,6 +39,27 @@ class ServerListingTest : public ::testing::Test {
     ASSERT_TRUE(feed_.Index());
     feed_.catalogue()["recommend"] = Json::Value(Json::arrayValue);
     feed_.catalogue()["recommend"].append("list-b");
+  }
+  void Vendor(const std::string& url) {
+    root_.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + url +
+                                                "\"\nconnect_timeout=\"2\"\n"
+                                                "catalogue_timeout=\"5\"\n"
+                                                "catalogue_max_age=\"600\"\n");
+  }
+  // Installs `p` from the vendor's server as it was before it offered 2.0:
+  // a catalogue of its own, where the vendor's address points for the
+  // install alone, so the catalogue under test is asked nothing.
+  void InstallFromTheVendor(const TestPackage& p, bool run) {
+    CatalogueFeed earlier(server_, root_.Path("/earlier"), "/earlier");
+    earlier.Add(p);
+    ASSERT_TRUE(earlier.Index());
+    earlier.Publish();
+    Vendor(earlier.Url());
+    std::vector<std::string> args = {"install-server", p.id};
+    if (run) args.push_back("--run");
+    std::string out;
+    EXPECT_EQ(0, Kivoctl(args, &out)) << out;
+    Vendor(feed_.Url());
   }
   void TearDown() override {
     for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
@@ -179,7 +197,7 @@ TEST_F(ServerListingTest, InstalledAndUninstalledPackagesShowAtOnce) {
   TestPackage old;
   old.id = "list-a";
   old.info = {{"adminport", "8125"}};
-  ASSERT_EQ(0, Kivoctl({"install", old.Build(root_.Path("/tmp")), "--run"}));
+  InstallFromTheVendor(old, true);
   CgiAnswer installed = List();
   ASSERT_TRUE(installed.Success()) << installed.body;
   Json::Value a = Find(installed, "list-a");
@@ -242,7 +260,7 @@ TEST_F(ServerListingTest, EntriesWithEscapedMemberNamesGetTheirStateToo) {
   feed_.Publish();
   TestPackage old;
   old.id = "list-a";
-  ASSERT_EQ(0, Kivoctl({"install", old.Build(root_.Path("/tmp"))}));
+  InstallFromTheVendor(old, false);
   client();
   CgiAnswer list = List();
   ASSERT_TRUE(list.Success()) << list.body;

@@ -16,6 +16,7 @@
 #include <Poco/Net/MultipartReader.h>
 #include <Poco/Net/NameValueCollection.h>
 
+#include "host/request_deadline.h"
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"
 #include "webapi/host_fields.h"
@@ -25,9 +26,11 @@ namespace {
 
 // Reads at most `limit` bytes from a descriptor, so a body shorter than its
 // CONTENT_LENGTH shows as an early end and nothing after the body is read.
+// Bytes not there by `deadline_ms` are an early end too.
 class FdStreamBuf : public std::streambuf {
  public:
-  FdStreamBuf(int fd, uint64_t limit) : fd_(fd), left_(limit), buf_(1 << 20) {}
+  FdStreamBuf(int fd, uint64_t limit, int64_t deadline_ms)
+      : fd_(fd), left_(limit), deadline_ms_(deadline_ms), buf_(1 << 20) {}
   // The body ended before its announced length.
   bool ended_early() const { return ended_early_; }
 
@@ -36,10 +39,7 @@ class FdStreamBuf : public std::streambuf {
     if (gptr() < egptr()) return traits_type::to_int_type(*gptr());
     if (left_ == 0) return traits_type::eof();
     size_t want = left_ < buf_.size() ? static_cast<size_t>(left_) : buf_.size();
-    ssize_t n;
-    do {
-      n = read(fd_, buf_.data(), want);
-    } while (n < 0 && errno == EINTR);
+    ssize_t n = ReadBeforeDeadline(fd_, buf_.data(), want, deadline_ms_);
     if (n <= 0) {
       ended_early_ = true;
       return traits_type::eof();
@@ -52,6 +52,7 @@ class FdStreamBuf : public std::streambuf {
  private:
   int fd_;
   uint64_t left_;
+  int64_t deadline_ms_;
   std::vector<char> buf_;
   bool ended_early_ = false;
 };
@@ -84,8 +85,8 @@ constexpr size_t kSmallFileLimit = 4u << 20;
 // refused, and nothing is stored for them.
 class MultipartSource : public UploadSource {
  public:
-  MultipartSource(int fd, uint64_t length, const std::string& boundary)
-      : length_(length), buf_(fd, length), in_(&buf_), reader_(in_, boundary) {}
+  MultipartSource(int fd, uint64_t length, const std::string& boundary, int64_t deadline_ms)
+      : length_(length), buf_(fd, length, deadline_ms), in_(&buf_), reader_(in_, boundary) {}
   ~MultipartSource() override {
     for (const std::string& path : small_files_) unlink(path.c_str());
   }
@@ -266,10 +267,11 @@ class MultipartSource : public UploadSource {
 
 }  // namespace
 
-extern "C" UploadSource* KivoOpenMultipart(int fd, uint64_t length, const char* boundary) {
+extern "C" UploadSource* KivoOpenMultipart(int fd, uint64_t length, const char* boundary,
+                                           int64_t deadline_ms) {
   if (fd < 0 || !boundary || !*boundary) return nullptr;
   try {
-    return new MultipartSource(fd, length, boundary);
+    return new MultipartSource(fd, length, boundary, deadline_ms);
   } catch (const std::exception&) {
     return nullptr;
   }

@@ -9,8 +9,11 @@
 #include "webapi/api_upload.h"
 
 extern "C" {
-// Opens a reader of `length` bytes of body on `fd` with `boundary`. The
-// caller deletes it. Null on bad arguments.
-using KivoOpenMultipartFn = UploadSource* (*)(int fd, uint64_t length, const char* boundary);
-UploadSource* KivoOpenMultipart(int fd, uint64_t length, const char* boundary);
+// Opens a reader of `length` bytes of body on `fd` with `boundary`; bytes
+// that have not come by `deadline_ms` (MonotonicMs(), host/request_deadline.h)
+// count as missing, as if the body ended there. The caller deletes it. Null
+// on bad arguments.
+using KivoOpenMultipartFn = UploadSource* (*)(int fd, uint64_t length, const char* boundary,
+                                              int64_t deadline_ms);
+UploadSource* KivoOpenMultipart(int fd, uint64_t length, const char* boundary, int64_t deadline_ms);
 }

@@ -7,6 +7,7 @@
 #include "klibc/sysroot.h"
 #include "pkgserver/catalogue.h"
 #include "pkgtool/package_manager.h"
+#include "pkgtool/package_origin.h"
 #include "pkgtool/pms.h"
 #include "settings/web_utils.h"
 
@@ -49,8 +50,12 @@ int updateBadgeCount(bool forceReload) {
     auto it = installed.find(id);
     if (it == installed.end()) continue;
     const std::string& have = it->second.getVersion();
-    if (PMSCompareVersion(have, version) < 0 && !limits.Restricts(id, have))
+    // The vendor's catalogue offers upgrades only of the packages that came
+    // from the vendor's server.
+    if (PMSCompareVersion(have, version) < 0 && !limits.Restricts(id, have) &&
+        PMSSameSource(PMSInstalledOrigin(id), PMSPackageOrigin::Vendor())) {
       badge["packages"].append(id);
+    }
   }
   badge["count"] = badge["packages"].size();
   badge["time"] = static_cast<Json::Int64>(time(nullptr));

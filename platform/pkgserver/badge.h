@@ -1,5 +1,5 @@
-// The update badge of the desktop: how many installed packages the vendor's
-// server offers a newer, unrestricted version of.
+// The update badge of the desktop: how many of the installed packages that
+// came from the vendor's server it offers a newer, unrestricted version of.
 #pragma once
 
 #include <string>

@@ -1,5 +1,6 @@
 #include "pkgserver/catalogue.h"
 
+#include <algorithm>
 #include <cctype>
 #include <cstdint>
 #include <cstdio>
@@ -282,20 +283,27 @@ bool PMSQueryKivoPkgServer(bool forceReload, const char* language, Json::Value& 
   return !url.empty() && QueryServer(url, forceReload, language ? language : "", answer);
 }
 
+bool PMSQueryFeedServer(const std::string& url, bool forceReload, const char* language,
+                        Json::Value& entries) {
+  Json::Value one;
+  if (!QueryServer(url, forceReload, language ? language : "", one)) return false;
+  if (!PMSCatalogueEntries(one)) {
+    CATALOGUE_LOG("%s: neither an array nor an object with \"packages\"", url.c_str());
+    return false;
+  }
+  entries = one.isArray() ? std::move(one) : std::move(one["packages"]);
+  return true;
+}
+
 bool PMSQueryOtherPkgServer(bool forceReload, const char* language, Json::Value& answer) {
   answer = Json::Value(Json::arrayValue);
   std::vector<std::string> urls = PMSFeedUrls();
   bool any = urls.empty();
   for (const std::string& url : urls) {
-    Json::Value one;
-    if (!QueryServer(url, forceReload, language ? language : "", one)) continue;
-    const Json::Value* entries = PMSCatalogueEntries(one);
-    if (!entries) {
-      CATALOGUE_LOG("%s: neither an array nor an object with \"packages\"", url.c_str());
-      continue;
-    }
+    Json::Value entries;
+    if (!PMSQueryFeedServer(url, forceReload, language, entries)) continue;
     any = true;
-    for (const Json::Value& entry : *entries) answer.append(entry);
+    for (const Json::Value& entry : entries) answer.append(entry);
   }
   return any;
 }
@@ -305,27 +313,50 @@ bool PMSQueryPkgServer(const char* language, std::string& answer, const std::str
   return FetchText(feed, language ? language : "", forceReload, extra, answer);
 }
 
-std::string PMSFeedListing(const std::string& name, const std::string& link,
-                           const std::string& language) {
-  if (link.empty()) return "";
-  for (const std::string& url : PMSFeedUrls()) {
-    Json::Value answer;
-    if (!QueryServer(url, false, language, answer)) continue;
-    const Json::Value* entries = PMSCatalogueEntries(answer);
-    if (!entries) continue;
-    for (const Json::Value& e : *entries) {
-      if (e.isObject() && Text(e["package"]) == name && Text(e["link"]) == link) return url;
-    }
+namespace {
+
+// True when the catalogue at `url` lists package `name` with exactly `link`.
+bool Lists(const std::string& url, const std::string& name, const std::string& link,
+           const std::string& language) {
+  Json::Value answer;
+  if (url.empty() || !QueryServer(url, false, language, answer)) return false;
+  const Json::Value* entries = PMSCatalogueEntries(answer);
+  if (!entries) return false;
+  for (const Json::Value& e : *entries) {
+    if (e.isObject() && Text(e["package"]) == name && Text(e["link"]) == link) return true;
   }
-  return "";
+  return false;
 }
 
-bool PMSFindServerEntry(const std::string& name, bool isKivo, const std::string& language,
-                        Json::Value& entry) {
-  Json::Value answer;
-  bool ok = isKivo ? PMSQueryKivoPkgServer(false, language.c_str(), answer)
-                   : PMSQueryOtherPkgServer(false, language.c_str(), answer);
-  const Json::Value* entries = ok ? PMSCatalogueEntries(answer) : nullptr;
+}  // namespace
+
+PMSPackageOrigin PMSListingOrigin(const std::string& name, const std::string& link,
+                                  const std::string& language, const PMSPackageOrigin& preferred) {
+  if (link.empty()) return PMSPackageOrigin::File();
+  std::vector<PMSPackageOrigin> sources;
+  const std::vector<std::string> feeds = PMSFeedUrls();
+  // A feed that is no longer listed is no source any more.
+  const bool preferred_listed =
+      preferred.kind == PMSOriginKind::kVendor ||
+      (preferred.kind == PMSOriginKind::kFeed &&
+       std::find(feeds.begin(), feeds.end(), preferred.feed) != feeds.end());
+  if (preferred_listed) sources.push_back(preferred);
+  sources.push_back(PMSPackageOrigin::Vendor());
+  for (const std::string& url : feeds) sources.push_back(PMSPackageOrigin::Feed(url));
+  const std::string vendor_url = PMSLoadServerConfig().vendor_url;
+  for (const PMSPackageOrigin& source : sources) {
+    const bool vendor = source.kind == PMSOriginKind::kVendor;
+    if (Lists(vendor ? vendor_url : source.feed, name, link, language)) {
+      PMSPackageOrigin found = source;
+      found.signer.clear();
+      return found;
+    }
+  }
+  return PMSPackageOrigin::File();
+}
+
+bool PMSNewestEntry(const Json::Value& answer, const std::string& name, Json::Value& entry) {
+  const Json::Value* entries = PMSCatalogueEntries(answer);
   if (!entries) return false;
   bool found = false;
   for (const Json::Value& e : *entries) {
@@ -335,6 +366,31 @@ bool PMSFindServerEntry(const std::string& name, bool isKivo, const std::string&
     found = true;
   }
   return found;
+}
+
+namespace {
+
+// The entry of `name` in the feed an installed package came from, when that
+// feed is still listed and lists it: its upgrades come from there, not from
+// whichever feed offers the highest version.
+bool EntryOfOwnFeed(const std::string& name, const std::string& language, Json::Value& entry) {
+  const PMSPackageOrigin origin = PMSInstalledOrigin(name);
+  if (origin.kind != PMSOriginKind::kFeed) return false;
+  const std::vector<std::string> feeds = PMSFeedUrls();
+  if (std::find(feeds.begin(), feeds.end(), origin.feed) == feeds.end()) return false;
+  Json::Value answer;
+  return QueryServer(origin.feed, false, language, answer) && PMSNewestEntry(answer, name, entry);
+}
+
+}  // namespace
+
+bool PMSFindServerEntry(const std::string& name, bool isKivo, const std::string& language,
+                        Json::Value& entry) {
+  if (!isKivo && EntryOfOwnFeed(name, language, entry)) return true;
+  Json::Value answer;
+  bool ok = isKivo ? PMSQueryKivoPkgServer(false, language.c_str(), answer)
+                   : PMSQueryOtherPkgServer(false, language.c_str(), answer);
+  return ok && PMSNewestEntry(answer, name, entry);
 }
 
 }  // namespace KIVOPackageServer

@@ -19,6 +19,8 @@
 
 #include <json/value.h>
 
+#include "pkgtool/package_origin.h"
+
 namespace KIVOPackageServer {
 
 // The vendor's catalogue in `language` into `answer`. False when no server
@@ -29,6 +31,12 @@ bool PMSQueryKivoPkgServer(bool forceReload, const char* language, Json::Value& 
 // object contributes its "packages"). True with an empty array when there
 // are no feeds; false only when every feed failed.
 bool PMSQueryOtherPkgServer(bool forceReload, const char* language, Json::Value& answer);
+
+// The entries of the catalogue of the feed at `url` (an array), cached or
+// fetched as above. False (logged) when the feed gave no usable answer or
+// its answer is no catalogue.
+bool PMSQueryFeedServer(const std::string& url, bool forceReload, const char* language,
+                        Json::Value& entries);
 
 // One server's answer as text, for the feed probe. `forceReload` bypasses
 // the cache; `extra` (an object of further query parameters) may be null or
@@ -68,14 +76,25 @@ bool PMSCatalogueText(const std::string& url, bool forceReload, const std::strin
 // answer itself (array form); null for anything else.
 const Json::Value* PMSCatalogueEntries(const Json::Value& answer);
 
-// The address of the feed whose (cached or fetched) catalogue lists package
-// `name` with exactly `link`; "" when no listed feed does. A download from
-// that link is a download from that feed, whatever the client said.
-std::string PMSFeedListing(const std::string& name, const std::string& link,
-                           const std::string& language);
+// Where a download of package `name` from `link` comes from: the source
+// whose (cached or fetched) catalogue lists the package with exactly that
+// link, whatever link the client named. `preferred` (the installed
+// package's origin) is asked first, then the vendor's server, then the
+// feeds in their order; a feed no longer listed is no source. A link that
+// no catalogue lists is a file's (PMSPackageOrigin::File()). The signer is
+// left empty: the package tool finds it.
+PMSPackageOrigin PMSListingOrigin(const std::string& name, const std::string& link,
+                                  const std::string& language, const PMSPackageOrigin& preferred);
+
+// The entry of package `name` with the highest version in catalogue answer
+// `answer` (an object with "packages", or an array of entries). False when
+// it lists none.
+bool PMSNewestEntry(const Json::Value& answer, const std::string& name, Json::Value& entry);
 
 // The entry of package `name` from the vendor's (isKivo) or the feeds'
-// cached-or-fetched catalogue; the highest version when several match.
+// cached-or-fetched catalogue; the highest version when several match. On
+// the feeds' side, a package installed from a feed that is still listed and
+// lists it gets the entry of that feed.
 bool PMSFindServerEntry(const std::string& name, bool isKivo, const std::string& language,
                         Json::Value& entry);
 

@@ -256,10 +256,11 @@ bool RenderListing(const std::string& url, const std::string& language, const st
   return false;
 }
 
-// One catalogue's listing added to `*listing`: from its file when that is
-// current and whole, else rendered and the file replaced.
-bool ListOne(const std::string& url, bool force, const std::string& language, ListingSide side,
-             CatalogueListing* listing) {
+// One catalogue's listing added to `*listing`, its entries marked as coming
+// from `source`: from its file when that is current and whole, else rendered
+// and the file replaced.
+bool ListOne(const std::string& url, const PMSPackageOrigin& source, bool force,
+             const std::string& language, ListingSide side, CatalogueListing* listing) {
   CatalogueText cat;
   if (!PMSCatalogueText(url, force, language, CatalogueBody::kIfNeeded, &cat)) return false;
   const std::string path = ListingDir() + "/" + cat.cache_name + "." + SideName(side);
@@ -270,7 +271,11 @@ bool ListOne(const std::string& url, bool force, const std::string& language, Li
     if (!RenderListing(url, language, path, &cat, side, file.get(), &one)) return false;
   }
   listing->files.push_back(std::move(file));
-  for (ListingEntry& e : one.entries) listing->entries.push_back(std::move(e));
+  listing->sources.push_back(source);
+  for (ListingEntry& e : one.entries) {
+    e.source = listing->sources.size() - 1;
+    listing->entries.push_back(std::move(e));
+  }
   if (listing->recommend.empty()) listing->recommend = std::move(one.recommend);
   return true;
 }
@@ -282,13 +287,14 @@ bool PMSListCatalogue(ListingSide side, bool forceReload, const std::string& lan
   *listing = CatalogueListing();
   if (side == ListingSide::kVendor) {
     const std::string url = PMSVendorCatalogueUrl();
-    return !url.empty() && ListOne(url, forceReload, language, side, listing);
+    return !url.empty() &&
+           ListOne(url, PMSPackageOrigin::Vendor(), forceReload, language, side, listing);
   }
   // Feeds have no recommendations: their listings are rendered without.
   const std::vector<std::string> urls = PMSFeedUrls();
   bool any = urls.empty();
   for (const std::string& url : urls)
-    any = ListOne(url, forceReload, language, side, listing) || any;
+    any = ListOne(url, PMSPackageOrigin::Feed(url), forceReload, language, side, listing) || any;
   return any;
 }
 

@@ -24,6 +24,7 @@
 #include <vector>
 
 #include "pkgserver/mapped_file.h"
+#include "pkgtool/package_origin.h"
 
 namespace KIVOPackageServer {
 
@@ -34,6 +35,7 @@ struct ListingEntry {
   bool has_version = false;  // whether the server's entry has "version" at all
   std::string version;       // its text; "" when it is not a string
   std::string icon;          // "icon" when a non-empty string, else ""
+  size_t source = 0;         // its catalogue: an index into CatalogueListing::sources
   // The rendered entry: one JSON object written with AnswerJsonWriter()
   // (api_response.h), so that it can stand in an answer as it is. It views
   // the listing's `files` and lives as long as the listing.
@@ -42,6 +44,8 @@ struct ListingEntry {
 
 struct CatalogueListing {
   std::vector<ListingEntry> entries;  // catalogue order
+  // The catalogues the entries come from: the vendor's, or each feed's.
+  std::vector<PMSPackageOrigin> sources;
   // Vendor side: the distinct names of the server's "recommend" list, in
   // its order (a name counts at its first place).
   std::vector<std::string> recommend;

@@ -8,6 +8,7 @@
 #include <fcntl.h>
 #include <memory>
 #include <mutex>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <thread>
 #include <unistd.h>
@@ -16,6 +17,8 @@
 
 #include "pkgserver/server_net.h"
 
+#include <arpa/inet.h>
+#include <netinet/in.h>
 #include <openssl/evp.h>
 #include <strings.h>
 
@@ -33,9 +36,13 @@ struct SlistDeleter {
 struct DigestDeleter {
   void operator()(EVP_MD_CTX* c) const { EVP_MD_CTX_free(c); }
 };
+struct UrlDeleter {
+  void operator()(CURLU* u) const { curl_url_cleanup(u); }
+};
 using CurlHandle = std::unique_ptr<CURL, CurlDeleter>;
 using HeaderList = std::unique_ptr<curl_slist, SlistDeleter>;
 using Digest = std::unique_ptr<EVP_MD_CTX, DigestDeleter>;
+using UrlHandle = std::unique_ptr<CURLU, UrlDeleter>;
 
 bool GlobalInit() {
   static const bool ok = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
@@ -87,6 +94,7 @@ struct FetchState {
   HttpFetch* fetch;
   uint64_t max_bytes;
   bool too_large = false;
+  std::string redirect{};  // where a redirect that was not followed points
 };
 
 size_t FetchBody(char* data, size_t size, size_t n, void* user) {
@@ -116,11 +124,130 @@ size_t FetchHeader(char* line, size_t size, size_t n, void* user) {
   return bytes;
 }
 
-bool Fetch(const HttpLimits& limits, HttpFetch& fetch) {
+// --- Guards for addresses that a server's answer names --------------------
+
+// An IPv4 address (host byte order) in a block that is not the public
+// internet: this network, private, carrier NAT, loopback, link-local,
+// protocol assignments, documentation, benchmarking, multicast, reserved.
+bool IsNonPublic4(uint32_t a) {
+  static const struct {
+    uint32_t net;
+    int bits;
+  } kBlocks[] = {{0x00000000, 8},  {0x0A000000, 8},  {0x64400000, 10}, {0x7F000000, 8},
+                 {0xA9FE0000, 16}, {0xAC100000, 12}, {0xC0000000, 24}, {0xC0000200, 24},
+                 {0xC0A80000, 16}, {0xC6120000, 15}, {0xC6336400, 24}, {0xCB007100, 24},
+                 {0xE0000000, 3}};
+  for (const auto& b : kBlocks) {
+    if ((a >> (32 - b.bits)) == (b.net >> (32 - b.bits))) return true;
+  }
+  return false;
+}
+
+uint32_t Read4(const unsigned char* p) {
+  return uint32_t{p[0]} << 24 | uint32_t{p[1]} << 16 | uint32_t{p[2]} << 8 | p[3];
+}
+
+// An IPv6 address that is not the public internet, an IPv4 address carried
+// in one (mapped, compatible, NAT64, 6to4) judged as that address.
+bool IsNonPublic6(const unsigned char* b) {
+  static const unsigned char kZero[12] = {};
+  static const unsigned char kMapped[12] = {0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0xff, 0xff};
+  static const unsigned char kNat64[12] = {0, 0x64, 0xff, 0x9b};
+  if (memcmp(b, kZero, 12) == 0 || memcmp(b, kMapped, 12) == 0 || memcmp(b, kNat64, 12) == 0) {
+    return IsNonPublic4(Read4(b + 12));  // ::, ::1 and ::a.b.c.d land in 0.0.0.0/8
+  }
+  if (b[0] == 0x20 && b[1] == 0x02) return IsNonPublic4(Read4(b + 2));            // 6to4
+  if (b[0] == 0x20 && b[1] == 0x01 && b[2] == 0x0d && b[3] == 0xb8) return true;  // documentation
+  return (b[0] & 0xfe) == 0xfc ||                                                 // unique local
+         (b[0] == 0xfe && (b[1] & 0xc0) == 0x80) ||                               // link-local
+         (b[0] == 0xfe && (b[1] & 0xc0) == 0xc0) ||                               // site-local
+         b[0] == 0xff;                                                            // multicast
+}
+
+// The address as text, for the log.
+std::string AddressText(const sockaddr* a) {
+  char text[INET6_ADDRSTRLEN] = "?";
+  if (a->sa_family == AF_INET) {
+    inet_ntop(AF_INET, &reinterpret_cast<const sockaddr_in*>(a)->sin_addr, text, sizeof(text));
+  } else if (a->sa_family == AF_INET6) {
+    inet_ntop(AF_INET6, &reinterpret_cast<const sockaddr_in6*>(a)->sin6_addr, text, sizeof(text));
+  }
+  return text;
+}
+
+bool IsPublic(const sockaddr* a) {
+  if (a->sa_family == AF_INET) {
+    return !IsNonPublic4(ntohl(reinterpret_cast<const sockaddr_in*>(a)->sin_addr.s_addr));
+  }
+  if (a->sa_family == AF_INET6) {
+    return !IsNonPublic6(reinterpret_cast<const sockaddr_in6*>(a)->sin6_addr.s6_addr);
+  }
+  return false;
+}
+
+// Opens the socket of each connection only to a public address: libcurl
+// calls it with the resolved address, for the first request and for every
+// redirect, so a name that resolves to loopback is caught as well.
+curl_socket_t OpenPublicSocket(void* user, curlsocktype, curl_sockaddr* address) {
+  auto* refused = static_cast<std::string*>(user);
+  if (!IsPublic(&address->addr)) {
+    *refused = AddressText(&address->addr);
+    return CURL_SOCKET_BAD;
+  }
+  return socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+}
+
+// An address parsed by libcurl's own URL parser, which the transfer then
+// uses as it is: what is judged is what is fetched.
+UrlHandle ParseUrl(const std::string& url) {
+  UrlHandle u(curl_url());
+  if (!u || curl_url_set(u.get(), CURLUPART_URL, url.c_str(), 0) != CURLUE_OK) return nullptr;
+  return u;
+}
+
+// "host:port" of a parsed address (the scheme's port when none is given),
+// the host in lower case; "" when it has none.
+std::string ServerOf(CURLU* u) {
+  char* host = nullptr;
+  char* port = nullptr;
+  std::string server;
+  if (curl_url_get(u, CURLUPART_HOST, &host, 0) == CURLUE_OK &&
+      curl_url_get(u, CURLUPART_PORT, &port, CURLU_DEFAULT_PORT) == CURLUE_OK && *host) {
+    for (const char* c = host; *c; ++c) server += static_cast<char>(tolower(*c));
+    server += std::string(":") + port;
+  }
+  curl_free(host);
+  curl_free(port);
+  return server;
+}
+
+bool OnListedServer(CURLU* u, const std::vector<std::string>& servers) {
+  const std::string server = ServerOf(u);
+  if (server.empty()) return false;
+  for (const std::string& listed : servers) {
+    UrlHandle l = ParseUrl(listed);
+    if (l && ServerOf(l.get()) == server) return true;
+  }
+  return false;
+}
+
+// --- Fetch into memory (continued) -----------------------------------------
+
+// One request of `fetch` for `url` (a parsed address when the caller judged
+// it); libcurl follows redirects itself unless `follow` is false. The curl
+// result code; the answer is in `fetch` and `state`.
+CURLcode FetchOnce(const HttpLimits& limits, HttpFetch& fetch, CURLU* url, bool follow,
+                   FetchState& state, std::string& refused_address) {
   CurlHandle c = NewHandle(fetch.url, limits);
-  if (!c) return (fetch.error = "cannot set up the transfer"), false;
+  if (!c) return CURLE_FAILED_INIT;
   CURL* h = c.get();
-  FetchState state{&fetch, limits.max_bytes};
+  if (url) curl_easy_setopt(h, CURLOPT_CURLU, url);
+  if (!follow) curl_easy_setopt(h, CURLOPT_FOLLOWLOCATION, 0L);
+  if (fetch.public_only) {
+    curl_easy_setopt(h, CURLOPT_PROXY, "");
+    curl_easy_setopt(h, CURLOPT_OPENSOCKETFUNCTION, OpenPublicSocket);
+    curl_easy_setopt(h, CURLOPT_OPENSOCKETDATA, &refused_address);
+  }
   HeaderList headers;
   if (!fetch.if_none_match.empty())
     headers.reset(
@@ -137,12 +264,50 @@ bool Fetch(const HttpLimits& limits, HttpFetch& fetch) {
   curl_easy_setopt(h, CURLOPT_HEADERDATA, &state);
   CURLcode rc = curl_easy_perform(h);
   fetch.status = Status(h);
+  char* location = nullptr;
+  state.redirect.clear();
+  if (rc == CURLE_OK && curl_easy_getinfo(h, CURLINFO_REDIRECT_URL, &location) == CURLE_OK &&
+      location) {
+    state.redirect = location;
+  }
+  return rc;
+}
+
+bool Fetch(const HttpLimits& limits, HttpFetch& fetch) {
+  FetchState state{&fetch, limits.max_bytes};
+  std::string refused_address;
+  const bool guarded = fetch.servers_only;
+  std::string url = fetch.url;
+  CURLcode rc = CURLE_OK;
+  // Unguarded, libcurl follows redirects; guarded, each one is judged here
+  // before it is asked for.
+  for (int hop = 0;; ++hop) {
+    UrlHandle parsed = guarded ? ParseUrl(url) : nullptr;
+    if (guarded && !(parsed && OnListedServer(parsed.get(), fetch.servers))) {
+      fetch.error = url + " is not on the server of a catalogue";
+      return false;
+    }
+    rc = FetchOnce(limits, fetch, parsed.get(), !guarded, state, refused_address);
+    if (!guarded || rc != CURLE_OK || state.redirect.empty() || fetch.status < 300 ||
+        fetch.status > 399) {
+      break;
+    }
+    if (hop == kMaxRedirects) {
+      fetch.error = "more than " + std::to_string(kMaxRedirects) + " redirects";
+      return false;
+    }
+    url = state.redirect;
+  }
   if (state.too_large) {
     fetch.error = "answer larger than " + std::to_string(limits.max_bytes) + " bytes";
     return false;
   }
   if (rc != CURLE_OK) {
-    fetch.error = curl_easy_strerror(rc);
+    // A refused address fails the transfer when no other address of the
+    // name could be reached.
+    fetch.error = refused_address.empty()
+                      ? curl_easy_strerror(rc)
+                      : "not connecting to " + refused_address + ": not a public address";
     return false;
   }
   return true;

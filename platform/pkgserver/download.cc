@@ -100,14 +100,16 @@ void Fail(NVX::Task* task, int code, const std::string& message, int result = 0)
 }
 
 // Puts into the task's data which key signed the file and who vouched for
-// it ("signature"), and the feed that listed the link ("feed", "" when
-// none), so that the desktop can show them with the outcome.
-[[nodiscard]] bool RecordSignature(NVX::Task* task, const std::string& feed,
+// it ("signature"), the source whose catalogue listed the link ("origin", in
+// words) and the feed that did ("feed", "" for another source), so that the
+// desktop can show them with the outcome.
+[[nodiscard]] bool RecordSignature(NVX::Task* task, const PMSPackageOrigin& origin,
                                    const std::string& note) {
   if (!TaskExists(task)) return false;
   Json::Value data = task->getProperty("data");
   if (!data.isObject()) data = Json::Value(Json::objectValue);
-  data["feed"] = feed;
+  data["origin"] = PMSSourceText(origin);
+  data["feed"] = origin.kind == PMSOriginKind::kFeed ? origin.feed : "";
   data["signature"] = note;
   return WriteTaskData(task, data, -2.0);
 }
@@ -184,7 +186,7 @@ bool IsInstalling(const std::string& name) {
 }
 
 bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const std::string& link,
-                  const std::string& folder, bool quickInstall, pid_t pid) {
+                  const std::string& folder, bool quickInstall, pid_t pid, PMSOriginChange change) {
   if (!task) return false;
   Json::Value data(Json::objectValue);
   data["id"] = name;
@@ -195,6 +197,7 @@ bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const
   data["size"] = static_cast<Json::UInt64>(size);
   data["tmp_folder"] = folder;
   data["blqinst"] = quickInstall;
+  if (change == PMSOriginChange::kAllow) data["switch_origin"] = true;
   data["installing"] = false;
   data["status"] = "downloading";
   return task->setFinishValue(false) && WriteTaskData(task, data, 0.0);
@@ -246,10 +249,13 @@ bool Install(NVX::Task* task, const std::string& user, const std::string& volume
   // A file that a feed lists may be vouched for by that feed's keys; any
   // other download is checked against the appliance keyring alone.
   Json::Value data = task->getProperty("data");
-  PMSSourceKeys source;
-  source.source =
-      PMSFeedListing(name, data["link"].isString() ? data["link"].asString() : "", language);
-  if (!source.source.empty()) source.keys = PMSFeedKeys(source.source);
+  PMSInstallSource source;
+  source.origin = PMSListingOrigin(name, data["link"].isString() ? data["link"].asString() : "",
+                                   language, PMSInstalledOrigin(name));
+  if (source.origin.kind == PMSOriginKind::kFeed)
+    source.feed_keys = PMSFeedKeys(source.origin.feed);
+  if (data["switch_origin"].isBool() && data["switch_origin"].asBool())
+    source.change = PMSOriginChange::kAllow;
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;
@@ -257,10 +263,9 @@ bool Install(NVX::Task* task, const std::string& user, const std::string& volume
                                    code, details, typeFlag, true, &source);
   PMSRemoveDownloadDir(folder);
   if (details["signature"].isString()) {
-    DOWNLOAD_LOG("%s from %s: %s", name.c_str(),
-                 source.source.empty() ? "a source that is no feed" : source.source.c_str(),
+    DOWNLOAD_LOG("%s from %s: %s", name.c_str(), PMSSourceText(source.origin).c_str(),
                  details["signature"].asCString());
-    if (!RecordSignature(task, source.source, details["signature"].asString())) {
+    if (!RecordSignature(task, source.origin, details["signature"].asString())) {
       DOWNLOAD_LOG("cannot record the signature of %s in its task", name.c_str());
     }
   }

@@ -7,11 +7,16 @@
 //   "size"         announced size (0: unknown)
 //   "tmp_folder"   the download folder; the file is tmp_folder + "/" + taskid
 //   "blqinst"      true: install right after the download (quick install)
+//   "switch_origin" true: the administrator switches the package to the
+//                  origin of this download (package_origin.h)
 //   "installing"   true while the package tool installs the file
 //   "status"       "downloading", "downloaded", "installing", "upgrading",
 //                  "installed" or "failed"
 //   "error"        on failure: {"code": PMSDownloadError, "message": text,
 //                  and for an install "result": the package tool's code}
+//   "origin", "feed", "signature"  once the file was checked: the source in
+//                  words, the feed's address ("" for another source), and
+//                  which key signed the file and who vouched for it
 //
 // and the task's number property "progress": 0 to 1 while downloading
 // (written a few times a second), 1.0 once the file is complete and checked,
@@ -24,6 +29,7 @@
 #include <string>
 #include <sys/types.h>
 
+#include "pkgtool/package_origin.h"
 #include "taskmgr/task.h"
 
 // The "code" of the "error" a failed download or install leaves in its task.
@@ -44,10 +50,12 @@ namespace KIVOPackageServer {
 bool IsInstalling(const std::string& name);
 
 // Records a new download in `task`: the "data" above with "status"
-// "downloading", "progress" 0, not finished. False when the task cannot be
+// "downloading", "progress" 0, not finished. `change` kAllow records that
+// the install may switch the package's origin. False when the task cannot be
 // written.
 bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const std::string& link,
-                  const std::string& folder, bool quickInstall, pid_t pid);
+                  const std::string& folder, bool quickInstall, pid_t pid,
+                  PMSOriginChange change = PMSOriginChange::kRefuse);
 
 // In the worker: makes SIGTERM cancel the transfer under way instead of
 // ending the process at once, so the worker can clean up.
@@ -66,7 +74,10 @@ bool DownloadPackage(NVX::Task* task, const std::string& user, const std::string
 // In the worker, after DownloadPackage: installs the downloaded file onto
 // `volume` ("" for the default) with the wizard answers `wizardValues`,
 // starting it when `run`. `typeFlag` true allows reinstalling the same or a
-// lower version. Publishes "installing" with the package tool's progress,
+// lower version. The file's origin is the source whose catalogue lists the
+// task's link (catalogue.h, PMSListingOrigin), with that feed's keys; the
+// task's "switch_origin" says whether it may replace a package of another
+// origin. Publishes "installing" with the package tool's progress,
 // removes the download folder, and finishes the task. False on failure.
 bool Install(NVX::Task* task, const std::string& user, const std::string& volume,
              const std::string& name, const std::string& folder, bool run,

@@ -60,6 +60,7 @@ PkgServerConfig PMSLoadServerConfig() {
       Positive(map, "download_stall_timeout", config.download_stall_timeout_s);
   config.download_retries =
       static_cast<int>(Positive(map, "download_retries", config.download_retries));
+  config.allow_private_image_addresses = map[kPrivateImageAddressesKey] == "yes";
   return config;
 }
 

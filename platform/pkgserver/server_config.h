@@ -9,6 +9,11 @@
 //   catalogue_max_age="300"         seconds a cached catalogue is used as it is
 //   download_stall_timeout="30"     seconds a download may receive nothing
 //   download_retries="3"            resumed attempts after a dropped download
+//   allow_private_image_addresses="no"
+//                                   "yes": icons and screenshots may come from
+//                                   loopback, link-local and private addresses
+//                                   (server_image.h); for roots whose package
+//                                   servers run on such addresses (a demo, tests)
 //
 // Missing keys, and values that are not positive numbers, take these
 // defaults.
@@ -28,6 +33,7 @@ struct PkgServerConfig {
   long catalogue_max_age_s = 300;
   long download_stall_timeout_s = 30;
   int download_retries = 3;
+  bool allow_private_image_addresses = false;
 
   HttpLimits CatalogueLimits() const;
   // Downloads have no total bound (a large file takes long); a stall ends
@@ -36,6 +42,10 @@ struct PkgServerConfig {
   // Images and small requests.
   HttpLimits SmallLimits(uint64_t max_bytes) const;
 };
+
+// The key of allow_private_image_addresses, which `kivoctl server-config`
+// sets too.
+inline constexpr char kPrivateImageAddressesKey[] = "allow_private_image_addresses";
 
 // The configuration file's path under the system root.
 std::string PMSServerConfigPath();

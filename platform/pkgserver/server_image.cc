@@ -1,18 +1,22 @@
 #include "pkgserver/server_image.h"
 
-#include <cstring>
 #include <fcntl.h>
-#include <string>
+#include <string_view>
 #include <syslog.h>
 #include <unistd.h>
+#include <vector>
 
 #include "klibc/atomic_file.h"
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
+#include "pkgserver/catalogue.h"
 #include "pkgserver/server_config.h"
 #include "pkgserver/server_net.h"
+#include "pkgserver/text_sha256.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/version.h"
+
+#define IMAGE_LOG(fmt, ...) syslog(LOG_ERR, "%s:%d " fmt, "server_image", __LINE__, ##__VA_ARGS__)
 
 namespace KIVOPackageTool {
 
@@ -20,44 +24,71 @@ namespace {
 
 constexpr uint64_t kMaxImageBytes = 2 << 20;
 
-bool IsPlainFileName(const std::string& name) {
-  if (name.empty() || name.size() > 128 || name[0] == '.') return false;
-  for (char c : name) {
-    if (!isalnum(static_cast<unsigned char>(c)) && c != '.' && c != '_' && c != '-') return false;
-  }
-  return true;
-}
-
-// The cache path of an image, "" when any part is not acceptable.
-std::string ImagePath(const char* source, const char* package, const char* version,
-                      const char* file) {
-  if (!source || !package || !version || !file) return "";
-  std::string kind = strcmp(source, "AVAIL/KIVO") == 0    ? "kivo"
-                     : strcmp(source, "AVAIL/OTHER") == 0 ? "other"
-                                                          : "";
-  if (kind.empty() || !PMSIsValidPackageId(package) || !PMSIsValidVersion(version) ||
-      !IsPlainFileName(file)) {
+// The cache path of the image `link` names for `package` at `version`; ""
+// when a name is not valid. Each is judged whole before it becomes a path.
+std::string ImagePath(const std::string& package, const std::string& version,
+                      const std::string& link) {
+  if (!PMSIsValidPackageId(package) || !PMSIsValidVersion(version) || !PMSIsServerUrl(link)) {
     return "";
   }
-  return KIVORootPath("/var/cache/kivo/pkgserver/images/") + kind + "/" + package + "/" + version +
-         "/" + file;
+  return KIVORootPath("/var/cache/kivo/pkgserver/images/") + package + "/" + version + "/" +
+         PMSTextSha256Hex(link);
 }
 
-bool Fetch(const std::string& link, const std::string& path) {
+// A PNG, JPEG, GIF or WebP image by its first bytes: what a browser shows
+// as a picture, never a page or a script.
+bool IsImage(std::string_view body) {
+  auto at = [body](size_t offset, std::string_view magic) {
+    return body.size() >= offset + magic.size() && body.substr(offset, magic.size()) == magic;
+  };
+  return at(0, "\x89PNG\r\n\x1a\n") || at(0, "\xff\xd8\xff") || at(0, "GIF87a") ||
+         at(0, "GIF89a") || (at(0, "RIFF") && at(8, "WEBP"));
+}
+
+// Where images may come from (server_image.h): the catalogues' addresses
+// and whether private addresses are allowed. Read once per caller.
+struct ImageRules {
+  PkgServerConfig config;
+  std::vector<std::string> servers;
+};
+
+ImageRules LoadRules() {
+  ImageRules rules;
+  rules.config = PMSLoadServerConfig();
+  if (!rules.config.vendor_url.empty()) rules.servers.push_back(rules.config.vendor_url);
+  for (std::string& feed : KIVOPackageServer::PMSFeedUrls()) rules.servers.push_back(feed);
+  return rules;
+}
+
+bool Fetch(const ImageRules& rules, const std::string& link, const std::string& path) {
   std::string error;
   const PackageServerNetOps* net = PMSServerNetOps(&error);
-  if (!net || !PMSIsServerUrl(link)) return false;
-  HttpFetch fetch;
-  fetch.url = link;
-  if (!net->fetch(PMSLoadServerConfig().SmallLimits(kMaxImageBytes), fetch) ||
-      fetch.status != 200 || fetch.body.empty()) {
-    syslog(LOG_ERR, "%s:%d %s: %s", "server_image", __LINE__, link.c_str(),
-           fetch.error.empty() ? ("HTTP " + std::to_string(fetch.status)).c_str()
-                               : fetch.error.c_str());
+  if (!net) {
+    IMAGE_LOG("%s: %s", link.c_str(), error.c_str());
     return false;
   }
-  if (KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str()) != 0) return false;
-  return KIVOWriteFileAtomic(path, fetch.body, SyncToDisk::No);
+  HttpFetch fetch;
+  fetch.url = link;
+  fetch.servers_only = true;
+  fetch.servers = rules.servers;
+  fetch.public_only = !rules.config.allow_private_image_addresses;
+  if (!net->fetch(rules.config.SmallLimits(kMaxImageBytes), fetch) || fetch.status != 200) {
+    IMAGE_LOG("%s: %s", link.c_str(),
+              fetch.error.empty()
+                  ? ("the server answered HTTP " + std::to_string(fetch.status)).c_str()
+                  : fetch.error.c_str());
+    return false;
+  }
+  if (!IsImage(fetch.body)) {
+    IMAGE_LOG("%s: the answer is not a PNG, JPEG, GIF or WebP image", link.c_str());
+    return false;
+  }
+  if (KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str()) != 0 ||
+      !KIVOWriteFileAtomic(path, fetch.body, SyncToDisk::No)) {
+    IMAGE_LOG("cannot write %s", path.c_str());
+    return false;
+  }
+  return true;
 }
 
 // Fetches queued images in one detached child per process, fed through a
@@ -94,6 +125,7 @@ class BackgroundFetcher {
     setsid();
     int null = open("/dev/null", O_RDWR);
     for (int std_fd = 0; std_fd < 3; ++std_fd) dup2(null, std_fd);
+    const ImageRules rules = LoadRules();
     FILE* lines = fdopen(in, "r");
     char buffer[4096];
     while (lines && fgets(buffer, sizeof(buffer), lines)) {
@@ -101,7 +133,7 @@ class BackgroundFetcher {
       size_t tab = line.find('\t');
       if (tab == std::string::npos || line.back() != '\n') continue;
       std::string path = line.substr(tab + 1, line.size() - tab - 2);
-      if (access(path.c_str(), F_OK) != 0) Fetch(line.substr(0, tab), path);
+      if (access(path.c_str(), F_OK) != 0) Fetch(rules, line.substr(0, tab), path);
     }
     _exit(0);
   }
@@ -111,21 +143,21 @@ class BackgroundFetcher {
 
 }  // namespace
 
-int PMSGetServerImage(const char* source, const char* package, const char* version,
-                      const char* file, const char* link, char* buffer, size_t size) {
-  std::string path = ImagePath(source, package, version, file);
-  if (path.empty()) return 0;
-  bool cached = access(path.c_str(), R_OK) == 0;
-  bool have_link = link && *link && PMSIsServerUrl(link);
-  if (!buffer || size == 0) {
-    static BackgroundFetcher fetcher;
-    if (!cached && have_link) fetcher.Queue(link, path);
-    return cached ? 1 : 0;
-  }
-  if (!cached && !(have_link && Fetch(link, path))) return 0;
-  if (path.size() + 1 > size) return 0;
-  memcpy(buffer, path.c_str(), path.size() + 1);
-  return 1;
+bool PMSServerImagePath(const std::string& package, const std::string& version,
+                        const std::string& link, std::string* path) {
+  std::string cached = ImagePath(package, version, link);
+  if (cached.empty()) return false;
+  if (access(cached.c_str(), R_OK) != 0 && !Fetch(LoadRules(), link, cached)) return false;
+  *path = std::move(cached);
+  return true;
+}
+
+void PMSQueueServerImage(const std::string& package, const std::string& version,
+                         const std::string& link) {
+  std::string path = ImagePath(package, version, link);
+  if (path.empty() || access(path.c_str(), F_OK) == 0) return;
+  static BackgroundFetcher fetcher;
+  fetcher.Queue(link, path);
 }
 
 }  // namespace KIVOPackageTool

@@ -10,6 +10,7 @@
 
 #include <cstdint>
 #include <string>
+#include <vector>
 
 constexpr int kMaxRedirects = 3;
 
@@ -27,6 +28,17 @@ struct HttpFetch {
   std::string form;               // "a=1&b=2": POST it
   std::string if_none_match;      // conditional request when set
   std::string if_modified_since;  // conditional request when set
+
+  // For addresses that a server's answer names (images), not the operator.
+  // With `servers_only`, the address and every redirect must lie on the host
+  // and port of one of `servers` (none: nothing may be fetched), judged by
+  // the transfer's own URL parser; a redirect elsewhere fails the transfer.
+  // With `public_only`, every connection must go to a public address: it is
+  // checked after the name is resolved, on each connection (redirects too),
+  // and no proxy is used, so the address checked is the one asked.
+  bool servers_only = false;
+  std::vector<std::string> servers;
+  bool public_only = false;
 
   long status = 0;  // HTTP status of the last answer (0: none)
   std::string body;

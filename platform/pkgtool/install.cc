@@ -7,6 +7,7 @@
 #include <ctime>
 #include <memory>
 #include <sys/stat.h>
+#include <syslog.h>
 #include <unistd.h>
 
 #include "klibc/atomic_file.h"
@@ -17,6 +18,7 @@
 #include "pkgtool/package_file.h"
 #include "pkgtool/package_file_ops.h"
 #include "pkgtool/package_manager.h"
+#include "pkgtool/package_origin.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
@@ -47,15 +49,35 @@ void InfoFromHeader(const std::string& path, const PackageFileHeader& header,
   info->setWizardMask(mask);
 }
 
-// The signature outcome under the appliance's trust level. `source_keys`
-// (may be null) are the keys of the feed the file came from; `*who` gets a
-// line saying which key signed the file and who vouched for it.
+// What one check of a file's signature found, before any trust level.
+struct SignatureSeen {
+  int outcome = PKG_ERR_SIGNATURE_UNCHECKABLE;
+  std::string signer;   // the fingerprint the signature names
+  std::string voucher;  // who vouched for a good signature
+  std::string error;
+};
+
+SignatureSeen CheckFileSignature(const PackageFileHeader& header,
+                                 const PMSSourceKeys* source_keys) {
+  SignatureSeen seen;
+  seen.outcome = PMSCheckSignature(header.manifest, header.signature, &seen.signer, &seen.error,
+                                   source_keys, &seen.voucher);
+  return seen;
+}
+
+// The signature outcome under the appliance's trust level, with or without
+// the administrator's confirmation. `source_keys` (may be null) are the keys
+// of the feed the file came from; `*who` gets a line saying which key signed
+// the file and who vouched for it, `*check` (when given) what the check
+// found.
 int SignatureVerdict(const PackageFileHeader& header, const PMSSourceKeys* source_keys,
-                     std::string* message, std::string* who = nullptr) {
-  std::string signer, error, voucher;
-  int outcome =
-      PMSCheckSignature(header.manifest, header.signature, &signer, &error, source_keys, &voucher);
-  int verdict = PMSApplyTrustLevel(outcome, PMSTrustLevel());
+                     SignatureConfirmed confirmed, std::string* message, std::string* who = nullptr,
+                     SignatureSeen* check = nullptr) {
+  SignatureSeen seen = CheckFileSignature(header, source_keys);
+  const int outcome = seen.outcome;
+  const std::string &signer = seen.signer, &error = seen.error, &voucher = seen.voucher;
+  if (check) *check = seen;
+  int verdict = PMSApplyTrustLevel(outcome, PMSTrustLevel(), confirmed);
   if (verdict != PKG_OK) *message = PMSResultText(verdict) + (error.empty() ? "" : ": " + error);
   if (who) {
     if (outcome == PKG_OK) {
@@ -123,13 +145,16 @@ struct InstallJob {
   std::string path, volume, user, language;
   Json::Value wizard;
   bool run_after = false, force = true, check_codesign = true;
-  const PMSSourceKeys* source_keys = nullptr;  // the feed's keys for a file from a feed
+  PMSInstallSource source;  // where the file comes from; a file unless the caller says
 };
 
 class Installer {
  public:
   Installer(const InstallJob& job, std::string* message, Json::Value* details)
-      : job_(job), message_(message), details_(details) {}
+      : job_(job), message_(message), details_(details) {
+    source_keys_.source = job.source.origin.feed;
+    source_keys_.keys = job.source.feed_keys;
+  }
 
   int Run();
   // Hands the operation's log text and worker messages to the caller and
@@ -142,6 +167,14 @@ class Installer {
     return code;
   }
   int CheckVersions(const PackageInfo& info);
+  // The keys of the feed the file comes from; null for any other source.
+  const PMSSourceKeys* SourceKeys() const {
+    return job_.source.origin.kind == PMSOriginKind::kFeed ? &source_keys_ : nullptr;
+  }
+  // Records where the file comes from and who signed it (`found`, what the
+  // signature check saw), and for an upgrade applies the origin rule
+  // (package_origin.h).
+  int CheckOrigin(const SignatureSeen& found);
   int Stage(PackageFileReader* reader, const PackageInfo& info, Staging* s);
   int RunScriptsAndPublish(const PackageInfo& info, Staging* s);
   // preinst; or, for an upgrade, stopping the old version and preupgrade.
@@ -165,6 +198,8 @@ class Installer {
   std::string old_record_;
   std::string id_;
   std::string signature_note_;  // which key signed the file, who vouched for it
+  PMSSourceKeys source_keys_;   // the feed's keys, for a file from a feed
+  PMSPackageOrigin incoming_;   // the file's origin and signer, recorded with it
 };
 
 int Installer::CheckVersions(const PackageInfo& info) {
@@ -195,6 +230,34 @@ int Installer::CheckVersions(const PackageInfo& info) {
   return PKG_OK;
 }
 
+int Installer::CheckOrigin(const SignatureSeen& found) {
+  PMSIncoming incoming;
+  incoming.origin = job_.source.origin;
+  // Only a signature that verified names its signer: the key an unverified
+  // signature names is a claim anybody can make.
+  incoming.origin.signer = found.outcome == PKG_OK ? found.signer : "";
+  incoming.origin.recorded = true;
+  incoming.by_keyring = found.outcome == PKG_OK && found.voucher == kPMSKeyringVoucher;
+  incoming_ = incoming.origin;
+  if (!upgrade_) return PKG_OK;
+  const PMSPackageOrigin installed = PMSReadOrigin(PackageRegistry::Dir() + "/" + old_record_);
+  std::string why;
+  if (PMSJudgeUpgradeOrigin(id_, installed, incoming, PMSOriginChange::kRefuse, &why) == PKG_OK)
+    return PKG_OK;
+  if (job_.source.change == PMSOriginChange::kRefuse) {
+    op_->Log("origin: " + why);
+    return Refuse(PKG_ERR_OTHER_ORIGIN, why);
+  }
+  // The administrator's explicit act: it stays in the operation's log and
+  // the system log.
+  const std::string note = "origin switched by " + job_.user + ": " + PMSSourceText(installed) +
+                           " -> " + PMSSourceText(incoming_) + ", signer " +
+                           (incoming_.signer.empty() ? "none" : incoming_.signer);
+  op_->Log("origin: " + note);
+  syslog(LOG_NOTICE, "pkgtool: %s %s", id_.c_str(), note.c_str());
+  return PKG_OK;
+}
+
 int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging* s) {
   VolumeConfig volume;
   std::string text;
@@ -216,7 +279,8 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
   installed["installed_time"] = std::to_string(time(nullptr));
   installed["installed_by"] = job_.user;
   if (KIVOFSMkdirP(s->target.c_str()) != 0 || KIVOFSMkdirP(s->data.c_str()) != 0 ||
-      !WriteRecordMembers(reader->header(), installed, *s)) {
+      !WriteRecordMembers(reader->header(), installed, *s) ||
+      !KIVOWriteFileAtomic(s->record + "/ORIGIN", PMSOriginText(incoming_), SyncToDisk::No)) {
     return Refuse(KLIBCErrGet() == KLIBC_ERR_NO_SPACE ? PKG_ERR_NO_SPACE : PKG_ERR_INTERNAL,
                   "cannot prepare the package's folders");
   }
@@ -337,11 +401,16 @@ int Installer::Run() {
   if (code != PKG_OK) return code;
   if ((code = PMSCheckPackageFits(info, PKG_ERR_NOT_SUPPORTED, message_, details_)) != PKG_OK)
     return code;
-  if (job_.check_codesign) {
-    code = SignatureVerdict(reader.header(), job_.source_keys, message_, &signature_note_);
-    op_->Log("signature: " + signature_note_);
-    if (code != PKG_OK) return code;
-  }
+  // Not checking the signature is the administrator's confirmation of its
+  // warning, never a way past the trust level.
+  SignatureSeen seen;
+  code = SignatureVerdict(reader.header(), SourceKeys(),
+                          job_.check_codesign ? SignatureConfirmed::No : SignatureConfirmed::Yes,
+                          message_, &signature_note_, &seen);
+  op_->Log("signature: " + signature_note_);
+  if (code != PKG_OK) return code;
+  code = CheckOrigin(seen);
+  if (code != PKG_OK) return code;
   Staging staging;
   if ((code = Stage(&reader, info, &staging)) != PKG_OK) return code;
   if ((code = RunScriptsAndPublish(info, &staging)) != PKG_OK) return code;
@@ -429,7 +498,8 @@ bool CheckFile(const char* language, const std::string& path, std::string& messa
   }
   // The signature comes last, so that a package that cannot be installed
   // says why before it says who signed it.
-  if (result == PKG_OK) result = SignatureVerdict(reader.header(), nullptr, &message);
+  if (result == PKG_OK)
+    result = SignatureVerdict(reader.header(), nullptr, SignatureConfirmed::No, &message);
   code = static_cast<PKG_ERRCODE>(result);
   return result == PKG_OK;
 }
@@ -438,9 +508,9 @@ bool InstallFile(const std::string& user, const std::string& path, const std::st
                  int reserved, const std::string& extraValues, bool typeFlag,
                  const std::string& language, std::string& message, PKG_ERRCODE& code,
                  Json::Value& details, bool force, bool checkCodesign,
-                 const PMSSourceKeys* sourceKeys) {
-  InstallJob job{path,     volume, user,          language,  Json::Value(),
-                 typeFlag, force,  checkCodesign, sourceKeys};
+                 const PMSInstallSource* source) {
+  const PMSInstallSource from = source ? *source : PMSInstallSource();
+  InstallJob job{path, volume, user, language, Json::Value(), typeFlag, force, checkCodesign, from};
   details = Json::Value(Json::objectValue);
   details["workerMessage"] = Json::Value(Json::arrayValue);
   if (!extraValues.empty() && !WebAPIUtil::ParseJson(extraValues, job.wizard)) {

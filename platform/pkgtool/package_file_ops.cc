@@ -65,12 +65,12 @@ bool InstallPackageFileImpl(const std::string& user, const std::string& path,
                             const std::string& volume, int reserved, const std::string& extraValues,
                             bool typeFlag, const std::string& language, std::string& message,
                             PKG_ERRCODE& code, Json::Value& details, bool force, bool checkCodesign,
-                            const PMSSourceKeys* sourceKeys) {
+                            const PMSInstallSource* source) {
   const PackageFileOps* ops = PMSPackageFileOps(&message);
   if (!ops) {
     code = PKG_ERR_INTERNAL;
     return false;
   }
   return ops->install(user, path, volume, reserved, extraValues, typeFlag, language, message, code,
-                      details, force, checkCodesign, sourceKeys);
+                      details, force, checkCodesign, source);
 }

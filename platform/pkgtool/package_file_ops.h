@@ -10,6 +10,7 @@
 #include <json/value.h>
 
 #include "pkgtool/package_info.h"
+#include "pkgtool/package_origin.h"
 #include "pkgtool/result_codes.h"
 #include "pkgtool/signature.h"
 
@@ -24,7 +25,7 @@ struct PackageFileOps {
                   int reserved, const std::string& extra_values, bool type_flag,
                   const std::string& language, std::string& message, PKG_ERRCODE& code,
                   Json::Value& details, bool force, bool check_codesign,
-                  const PMSSourceKeys* source_keys);
+                  const PMSInstallSource* source);
 };
 
 extern "C" {

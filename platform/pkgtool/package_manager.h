@@ -21,6 +21,7 @@
 #include "pkgtool/dependency.h"
 #include "pkgtool/operation.h"
 #include "pkgtool/package_info.h"
+#include "pkgtool/package_origin.h"
 #include "pkgtool/result_codes.h"
 #include "pkgtool/signature.h"
 
@@ -173,15 +174,18 @@ class PackageManager {
 // starts the package when installed. `details` receives "workerMessage",
 // "installReboot", "curVersion"/"insVersion" and "deppkg" where they apply,
 // and "signature" (which key signed the file, who vouched for it) once it
-// was checked. `sourceKeys` are the keys of the feed the file was downloaded
-// from (null for any other file: an upload, a path, another source).
+// was checked. `source` says where the file comes from (null: a file, an
+// upload or a path), with the keys of the feed it was downloaded from, and
+// whether the administrator switches the package to that origin. The origin
+// and the signer are recorded with the package; an upgrade from another
+// origin or signer is refused with 306 (package_origin.h).
 [[nodiscard]] bool InstallPackageFileImpl(const std::string& user, const std::string& path,
                                           const std::string& volume, int reserved,
                                           const std::string& extraValues, bool typeFlag,
                                           const std::string& language, std::string& message,
                                           PKG_ERRCODE& code, Json::Value& details, bool force,
                                           bool checkCodesign,
-                                          const PMSSourceKeys* sourceKeys = nullptr);
+                                          const PMSInstallSource* source = nullptr);
 
 // The log text of a package log file; when it is larger than 1 MiB, its last
 // 1 MiB. "" when it cannot be read.

@@ -3,6 +3,7 @@
 //   var/packages/<id>              symlink to .records/<id>.<nonce>
 //   var/packages/.records/<id>.<n> one version's record:
 //       INFO        the package's INFO as installed
+//       ORIGIN      where it came from and who signed it (package_origin.h)
 //       scripts/, WIZARD_UIFILES/, LICENSE, PACKAGE_ICON*.PNG
 //       target ->   <volume>/@appstore/<id>.<n>  (the payload)
 //       var    ->   <volume>/@appdata/<id>       (data, kept across upgrades)

@@ -78,6 +78,8 @@ const char* PMSResultText(int code) {
       return "the operation was cancelled";
     case PKG_ERR_UPGRADE_ROLLED_BACK:
       return "the upgrade failed; the previous version was restored";
+    case PKG_ERR_OTHER_ORIGIN:
+      return "the package was installed from another source or signed by another key";
   }
   return "unknown result";
 }

@@ -42,6 +42,9 @@ enum PKG_ERRCODE {
   PKG_ERR_OS_TOO_OLD = 303,  // the OS is below the package's os_min_ver
   PKG_ERR_CANCELLED = 304,
   PKG_ERR_UPGRADE_ROLLED_BACK = 305,
+  // an upgrade from another source, or signed by another key, than the
+  // installed version's, without the administrator switching its origin
+  PKG_ERR_OTHER_ORIGIN = 306,
 };
 
 // A short English text for a code, for logs and the command line.

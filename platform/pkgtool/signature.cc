@@ -197,12 +197,16 @@ int PMSCheckSignature(const std::string& data, const std::string& signature, std
   return by_source;
 }
 
-int PMSApplyTrustLevel(int outcome, int trust_level) {
+int PMSApplyTrustLevel(int outcome, int trust_level, SignatureConfirmed confirmed) {
   if (outcome == PKG_OK || outcome == PKG_ERR_SIGNATURE_UNCHECKABLE) return outcome;
   if (outcome == PKG_ERR_BAD_SIGNATURE || outcome == PKG_ERR_REVOKED_KEY) return outcome;
+  const bool unknown_signer = outcome == PKG_ERR_UNKNOWN_SIGNER || outcome == PKG_ERR_EXPIRED_KEY;
   if (outcome == PKG_ERR_NO_SIGNATURE && trust_level >= PKG_TRUST_UNSIGNED) return PKG_OK;
-  if ((outcome == PKG_ERR_UNKNOWN_SIGNER || outcome == PKG_ERR_EXPIRED_KEY) &&
-      trust_level >= PKG_TRUST_ANY) {
+  if (unknown_signer && trust_level >= PKG_TRUST_ANY) return PKG_OK;
+  // Levels above the strictest only warn: the administrator's confirmation
+  // is the answer to that warning.
+  if (confirmed == SignatureConfirmed::Yes && trust_level > PKG_TRUST_KEYRING &&
+      (outcome == PKG_ERR_NO_SIGNATURE || unknown_signer)) {
     return PKG_OK;
   }
   return outcome;

@@ -46,8 +46,18 @@ constexpr const char* kPMSKeyringVoucher = "appliance keyring";
                                     const PMSSourceKeys* source_keys = nullptr,
                                     std::string* voucher = nullptr);
 
+// Whether the administrator confirmed installing a package whose signature
+// the trust level would otherwise refuse (the page's "Install it anyway",
+// kivoctl's --no-codesign).
+enum class SignatureConfirmed { No, Yes };
+
 // Applies the trust level to an outcome: PKG_OK when the package may be used.
-[[nodiscard]] int PMSApplyTrustLevel(int outcome, int trust_level);
+// The level binds whatever the caller asks: at PKG_TRUST_KEYRING nothing but
+// a good signature by a trusted key passes. Above it, a confirmation lets an
+// unsigned package or one of an unknown or expired signer through. A bad
+// signature, a revoked key and a signature that cannot be checked pass never.
+[[nodiscard]] int PMSApplyTrustLevel(int outcome, int trust_level,
+                                     SignatureConfirmed confirmed = SignatureConfirmed::No);
 
 // Signs `data` with `key` (fingerprint, id or user id) of the keyring in
 // `gnupg_home`; *signature gets an armored detached signature.

@@ -1,5 +1,7 @@
 #include "testing/catalogue_feed.h"
 
+#include <unistd.h>
+
 #include <gtest/gtest.h>
 
 #include "klibc/atomic_file.h"
@@ -15,6 +17,13 @@ std::string CatalogueFeed::Add(const TestPackage& package) {
   std::string path = package.Build(dir_);
   files_[package.id] = path.substr(path.rfind('/') + 1);
   return path;
+}
+
+std::string CatalogueFeed::Replace(const TestPackage& package) {
+  auto old = files_.find(package.id);
+  if (old != files_.end() && unlink((dir_ + "/" + old->second).c_str()) != 0)
+    ADD_FAILURE() << "cannot remove " << old->second;
+  return Add(package);
 }
 
 std::string CatalogueFeed::FilePath(const std::string& id) const {

@@ -19,6 +19,9 @@ class CatalogueFeed {
 
   // Builds `package` into the folder. Returns the file's path.
   std::string Add(const TestPackage& package);
+  // Builds `package` in place of the file of the same id that the folder
+  // held (removed), so the next Index() offers only this version.
+  std::string Replace(const TestPackage& package);
   // Runs kivoctl index over the folder and serves every file; the catalogue
   // is then catalogue() (object form), served at Url() after Publish().
   bool Index();

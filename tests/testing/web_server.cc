@@ -68,6 +68,7 @@ WebServer::WebServer(const std::string& root, const WebServerOptions& o) {
   options.module_dir = o.module_dir;
   options.max_children = o.max_children;
   options.read_timeout_seconds = o.read_timeout_seconds;
+  options.max_upload_bytes = o.max_upload_bytes;
   options.port = port_ = FreeLoopbackPort();
   std::string conf = root + "/lighttpd-" + std::to_string(port_) + ".conf";
   if (!WebConfigProblem(options).empty()) return;

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 #include <sys/types.h>
 
@@ -13,7 +14,8 @@ struct WebServerOptions {
   std::string entry_cgi;   // cgi: replaces the build's entry.cgi (benchmarks serve a baseline)
   std::string module_dir;  // empty: the build's modules folder
   int max_children = 16;   // scgi: kivo-webd's cap
-  int read_timeout_seconds = 30;
+  int read_timeout_seconds = kDefaultRequestSeconds;
+  uint64_t max_upload_bytes = kDefaultMaxUploadBytes;  // lighttpd's limit on uploads
 };
 
 // "cgi" / "scgi", for test names and benchmark rows.

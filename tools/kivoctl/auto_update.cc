@@ -2,30 +2,22 @@
 
 #include <iostream>
 #include <map>
-#include <memory>
 #include <syslog.h>
-#include <unistd.h>
 
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
 #include "pkgserver/auto_update.h"
 #include "pkgserver/catalogue.h"
-#include "pkgserver/download.h"
 #include "pkgserver/server_config.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/version.h"
-#include "taskmgr/task.h"
+#include "tools/kivoctl/server_install.h"
 
 namespace {
 
 constexpr char kInfoConf[] = "/etc/kivoinfo.conf";
 constexpr char kLanguage[] = "enu";
-// The download runs in the same task the desktop's downloads use, so the
-// desktop sees it and never starts a second download of the same package.
-constexpr char kTaskOwner[] = "@administrators";
-constexpr char kTaskPrefix[] = "@KIVOPKG_DOWNLOAD_";
-constexpr char kUser[] = "root";
 
 enum class Mode { kOff, kAll, kChosen };
 
@@ -47,75 +39,41 @@ void Report(const std::string& line, bool failure) {
   if (failure) std::cerr << "kivoctl: " << line << "\n";
 }
 
-// The vendor's and the feeds' entries in one array. False when a server
-// that is configured gave no usable answer: the run cannot tell what is
-// newest, so it counts as failed (what the other servers offer is still
+void AddOffers(const PMSPackageOrigin& source, const Json::Value& entries,
+               std::vector<CatalogueOffer>& offers) {
+  for (const Json::Value& e : entries) offers.push_back({source, e});
+}
+
+// The vendor's and every feed's entries, each with its source. False when a
+// server that is configured gave no usable answer: the run cannot tell what
+// is newest, so it counts as failed (what the other servers offer is still
 // applied).
-bool ReadCatalogues(Json::Value& entries) {
-  entries = Json::Value(Json::arrayValue);
+bool ReadCatalogues(std::vector<CatalogueOffer>& offers) {
   bool ok = true;
   Json::Value vendor;
   if (!PMSLoadServerConfig().vendor_url.empty()) {
     const Json::Value* listed = nullptr;
     if (KIVOPackageServer::PMSQueryKivoPkgServer(true, kLanguage, vendor) &&
         (listed = KIVOPackageServer::PMSCatalogueEntries(vendor)) != nullptr) {
-      for (const Json::Value& e : *listed) entries.append(e);
+      AddOffers(PMSPackageOrigin::Vendor(), *listed, offers);
     } else {
       Report("catalogue: the vendor's catalogue cannot be read", true);
       ok = false;
     }
   }
-  Json::Value feeds;
-  if (KIVOPackageServer::PMSQueryOtherPkgServer(true, kLanguage, feeds) && feeds.isArray()) {
-    for (const Json::Value& e : feeds) entries.append(e);
-  } else {
-    Report("catalogue: no feed's catalogue can be read", true);
-    ok = false;
+  for (const std::string& url : KIVOPackageServer::PMSFeedUrls()) {
+    Json::Value entries;
+    if (KIVOPackageServer::PMSQueryFeedServer(url, true, kLanguage, entries)) {
+      AddOffers(PMSPackageOrigin::Feed(url), entries, offers);
+    } else {
+      Report("catalogue: the catalogue of the feed " + url + " cannot be read", true);
+      ok = false;
+    }
   }
   return ok;
 }
 
 bool IsBeta(const Json::Value& entry) { return entry["beta"].isBool() && entry["beta"].asBool(); }
-
-// Downloads the plan's file and upgrades the package with it, in a task of
-// its own; false with `message` and `code` (the package tool's result, 0
-// for a download failure) on failure.
-bool Upgrade(const AutoUpdatePlan& plan, bool run, std::string& message, int& code) {
-  const Json::Value& e = plan.entry;
-  const std::string link = e["link"].isString() ? e["link"].asString() : "";
-  const std::string md5 = e["md5"].isString() ? e["md5"].asString() : "";
-  const uint64_t size = e["size"].isUInt64() ? e["size"].asUInt64() : 0;
-  code = 0;
-  if (KIVOPackageServer::IsInstalling(plan.id)) {
-    message = "a download of it is under way";
-    return false;
-  }
-  std::string volume, folder;
-  if (!PMSGetPackageVol(plan.id, volume)) volume.clear();
-  if (!PMSCreateDownloadTmpDir(volume, plan.id, static_cast<int64_t>(size), folder)) {
-    message = "no room for the download";
-    return false;
-  }
-  NVX::TaskMgr mgr(kTaskOwner);
-  std::unique_ptr<NVX::Task> task(mgr.createTask(kTaskPrefix + plan.id));
-  if (!task ||
-      !KIVOPackageServer::InitDownload(task.get(), plan.id, size, link, folder, true, getpid())) {
-    (void)KIVOPackageServer::PMSRemoveDownloadDir(folder);
-    message = "the download task cannot be written";
-    return false;
-  }
-  std::string path;
-  bool ok = KIVOPackageServer::DownloadPackage(task.get(), kUser, plan.id, link, md5, true, folder,
-                                               kLanguage, path) &&
-            KIVOPackageServer::Install(task.get(), kUser, volume, plan.id, folder, run, "", false,
-                                       kLanguage);
-  if (ok) return true;
-  // Both steps leave their reason in the task.
-  Json::Value error = task->getProperty("data")["error"];
-  message = error["message"].isString() ? error["message"].asString() : "the upgrade failed";
-  code = error["result"].isInt() ? error["result"].asInt() : 0;
-  return false;
-}
 
 // Carries out one plan (or says what it would do); false when it failed.
 bool Apply(PackageManager& manager, const AutoUpdatePlan& plan, bool dry_run) {
@@ -131,7 +89,8 @@ bool Apply(PackageManager& manager, const AutoUpdatePlan& plan, bool dry_run) {
   const bool run = (manager.getPkgRoughStatus(plan.id) & 2) != 0;
   std::string message;
   int code = 0;
-  if (!Upgrade(plan, run, message, code)) {
+  if (!KivoctlDownloadAndInstall(plan.id, plan.entry, run, "", PMSOriginChange::kRefuse, message,
+                                 code)) {
     Report(plan.id + ": failed " + step + ": " + message +
                (code ? " [" + std::to_string(code) + "]" : ""),
            true);
@@ -169,7 +128,8 @@ bool ChosenPackages(PackageManager& manager, Mode mode, std::map<std::string, st
 }  // namespace
 
 AutoUpdatePlan PlanAutoUpdate(const std::string& id, const std::string& installed,
-                              const Json::Value& entries, bool beta) {
+                              const PMSPackageOrigin& origin,
+                              const std::vector<CatalogueOffer>& offers, bool beta) {
   AutoUpdatePlan plan;
   plan.id = id;
   plan.installed = installed;
@@ -179,7 +139,9 @@ AutoUpdatePlan PlanAutoUpdate(const std::string& id, const std::string& installe
     return plan;
   }
   bool beta_held_back = false;
-  for (const Json::Value& e : entries) {
+  const CatalogueOffer* elsewhere = nullptr;  // the newest offer of another source
+  for (const CatalogueOffer& offer : offers) {
+    const Json::Value& e = offer.entry;
     if (!e.isObject() || !e["package"].isString() || e["package"].asString() != id ||
         !e["version"].isString() || !e["link"].isString())
       continue;
@@ -191,6 +153,11 @@ AutoUpdatePlan PlanAutoUpdate(const std::string& id, const std::string& installe
       beta_held_back = true;
       continue;
     }
+    if (!PMSSameSource(origin, offer.source)) {
+      if (!elsewhere || PMSCompareVersion(version, elsewhere->entry["version"].asString()) > 0)
+        elsewhere = &offer;
+      continue;
+    }
     if (plan.action == AutoUpdatePlan::Action::kSkip ||
         PMSCompareVersion(version, plan.version) > 0) {
       plan.action = AutoUpdatePlan::Action::kUpgrade;
@@ -198,8 +165,15 @@ AutoUpdatePlan PlanAutoUpdate(const std::string& id, const std::string& installe
       plan.entry = e;
     }
   }
-  if (plan.action == AutoUpdatePlan::Action::kSkip && beta_held_back)
+  if (plan.action == AutoUpdatePlan::Action::kUpgrade) return plan;
+  if (elsewhere) {
+    plan.reason = elsewhere->entry["version"].asString() + " is offered by " +
+                  PMSSourceText(elsewhere->source) + ", but " + id + " was installed from " +
+                  PMSSourceText(origin) +
+                  "; only an administrator who switches its origin can upgrade it from there";
+  } else if (beta_held_back) {
     plan.reason = "only a beta version is newer and the update channel is stable";
+  }
   return plan;
 }
 
@@ -222,11 +196,12 @@ int KivoctlAutoUpdate(const std::vector<std::string>& args) {
   std::map<std::string, std::string> chosen;
   if (!manager.init() || !ChosenPackages(manager, mode, chosen)) return 1;
   if (chosen.empty()) return 0;
-  Json::Value entries;
-  bool ok = ReadCatalogues(entries);
+  std::vector<CatalogueOffer> offers;
+  bool ok = ReadCatalogues(offers);
   const bool beta = InfoIs("package_update_channel", "beta");
   for (const auto& [id, version] : chosen) {
-    ok = Apply(manager, PlanAutoUpdate(id, version, entries, beta), dry_run) && ok;
+    const AutoUpdatePlan plan = PlanAutoUpdate(id, version, PMSInstalledOrigin(id), offers, beta);
+    ok = Apply(manager, plan, dry_run) && ok;
   }
   return ok ? 0 : 1;
 }

@@ -5,9 +5,10 @@
 // The settings say off, all installed packages, or the chosen list
 // ("enable_pkg_autoupdate_all" / "pkg_autoupdate_all" of /etc/kivoinfo.conf
 // and KIVOPackageServer::List). For each chosen installed package the newest
-// entry of the vendor's and the feeds' catalogues that is newer than the
-// installed version is taken, unless the update channel is "stable" and the
-// entry is a beta, or the restriction list refuses it. Each is downloaded
+// entry of the catalogue it came from (the vendor's or its feed's, never
+// another's: package_origin.h) that is newer than the installed version is
+// taken, unless the update channel is "stable" and the entry is a beta, or
+// the restriction list refuses it. Each is downloaded
 // with the catalogue's checksums and upgraded by the package tool under its
 // lock, one package at a time, with the trust level and signature checks of
 // any install; a package that ran before runs again afterwards. A failed
@@ -18,6 +19,8 @@
 #include <vector>
 
 #include <json/value.h>
+
+#include "pkgtool/package_origin.h"
 
 // What happens to one installed package.
 struct AutoUpdatePlan {
@@ -30,11 +33,21 @@ struct AutoUpdatePlan {
   Json::Value entry;      // the catalogue entry to upgrade to (kUpgrade)
 };
 
-// The plan for package `id` at version `installed` against the catalogue
-// `entries` (vendor and feeds together). `beta` is true on the "beta" update
-// channel. Restricted versions (PMSThirdPartyCheckLimit) are never taken.
+// One catalogue entry, with the source that offers it.
+struct CatalogueOffer {
+  PMSPackageOrigin source;
+  Json::Value entry;
+};
+
+// The plan for package `id` at version `installed`, which came from
+// `origin`, against the entries of every catalogue (vendor and feeds
+// together). Only entries of `origin` are taken; a newer version that only
+// other sources offer is skipped, and the reason names who offers it.
+// `beta` is true on the "beta" update channel. Restricted versions
+// (PMSThirdPartyCheckLimit) are never taken.
 AutoUpdatePlan PlanAutoUpdate(const std::string& id, const std::string& installed,
-                              const Json::Value& entries, bool beta);
+                              const PMSPackageOrigin& origin,
+                              const std::vector<CatalogueOffer>& offers, bool beta);
 
 // `kivoctl auto-update [--dry-run]`: one line per installed package on
 // stdout, each outcome also to syslog. Exit status 0 when nothing failed, 1

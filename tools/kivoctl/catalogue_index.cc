@@ -100,9 +100,9 @@ bool WriteIcons(const PackageFileHeader& h, const CatalogueIndexOptions& o, cons
   return true;
 }
 
-// Screenshots go to screenshots/<package>-<version>/screenshot_<n>.png, the
-// name the package center caches a server screenshot under; the entry lists
-// their addresses in order.
+// Screenshots go to screenshots/<package>-<version>/screenshot_<n>.png,
+// beside the catalogue (the package center fetches images only from a
+// catalogue's server); the entry lists their addresses in order.
 bool WriteScreenshots(const PackageFileHeader& h, const CatalogueIndexOptions& o,
                       const std::string& stem, Json::Value& entry, std::string* error) {
   const std::string folder = o.folder + "/screenshots/" + stem;
@@ -219,8 +219,11 @@ int KivoctlIndex(const std::vector<std::string>& args) {
 }
 
 int KivoctlServerConfig(const std::vector<std::string>& args) {
-  const std::pair<const char*, const char*> kOptions[] = {{"--vendor", "vendor_url"},
-                                                          {"--company-info", "company_info_url"}};
+  constexpr char kPrivateImages[] = "--allow-private-image-addresses";
+  const std::pair<const char*, const char*> kOptions[] = {
+      {"--vendor", "vendor_url"},
+      {"--company-info", "company_info_url"},
+      {kPrivateImages, kPrivateImageAddressesKey}};
   for (size_t i = 0; i < args.size(); i += 2) {
     const char* key = nullptr;
     for (const auto& [option, name] : kOptions) {
@@ -230,7 +233,12 @@ int KivoctlServerConfig(const std::vector<std::string>& args) {
       std::cerr << "kivoctl: unknown option for server-config: " << args[i] << "\n";
       return 2;
     }
-    if (!PMSIsServerUrl(args[i + 1])) {
+    if (args[i] == kPrivateImages) {
+      if (args[i + 1] != "yes" && args[i + 1] != "no") {
+        std::cerr << "kivoctl: " << kPrivateImages << " takes yes or no\n";
+        return 2;
+      }
+    } else if (!PMSIsServerUrl(args[i + 1])) {
       std::cerr << "kivoctl: not an http or https address: " << args[i + 1] << "\n";
       return 2;
     }
@@ -241,6 +249,8 @@ int KivoctlServerConfig(const std::vector<std::string>& args) {
   }
   PkgServerConfig config = PMSLoadServerConfig();
   std::cout << "vendor_url=" << config.vendor_url << "\n"
-            << "company_info_url=" << config.company_info_url << "\n";
+            << "company_info_url=" << config.company_info_url << "\n"
+            << kPrivateImageAddressesKey << "="
+            << (config.allow_private_image_addresses ? "yes" : "no") << "\n";
   return 0;
 }

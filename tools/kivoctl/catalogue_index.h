@@ -20,6 +20,7 @@ bool KivoctlWriteCatalogue(const CatalogueIndexOptions& options, int* count, std
 
 // The command line: index FOLDER --base-url URL [--output NAME] [--recommend ID]...
 int KivoctlIndex(const std::vector<std::string>& args);
-// server-config [--vendor URL] [--company-info URL]: changes pkgserver.conf
-// of the root and prints the resulting settings.
+// server-config [--vendor URL] [--company-info URL]
+// [--allow-private-image-addresses yes|no]: changes pkgserver.conf of the
+// root and prints the resulting settings.
 int KivoctlServerConfig(const std::vector<std::string>& args);

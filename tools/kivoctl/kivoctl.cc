@@ -5,6 +5,7 @@
 //   kivoctl [--root DIR] web-config [--mode cgi|scgi] [--port N] [--address A] [--cgi PATH]
 //                                   [--webd PATH] [--max-children N] [--read-timeout S]
 //   kivoctl [--root DIR] server-config [--vendor URL] [--company-info URL]
+//                                      [--allow-private-image-addresses yes|no]
 //   kivoctl build|sign|inspect|index ...      (package authors)
 //   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
 //   kivoctl [--root DIR] auto-update [--dry-run]
@@ -17,10 +18,12 @@
 #include <vector>
 
 #include "accounts/accounts.h"
+#include "host/host_config.h"
 #include "tools/kivoctl/auto_update.h"
 #include "tools/kivoctl/catalogue_index.h"
 #include "tools/kivoctl/package_commands.h"
 #include "tools/kivoctl/root_setup.h"
+#include "tools/kivoctl/server_install.h"
 #include "tools/kivoctl/web_config.h"
 
 namespace {
@@ -38,10 +41,14 @@ const char kUsage[] =
     "             [--webd PATH] [--max-children N] [--read-timeout SECONDS]\n"
     "                           print the lighttpd configuration that serves the\n"
     "                           root's web API (default 127.0.0.1:5000, the entry.cgi\n"
-    "                           beside this program)\n"
+    "                           beside this program); uploads up to the root's\n"
+    "                           max_upload_bytes (etc/kivo/webapi.conf)\n"
     "  server-config [--vendor URL] [--company-info URL]\n"
+    "                [--allow-private-image-addresses yes|no]\n"
     "                           set the vendor's catalogue and company-information\n"
-    "                           addresses (etc/kivo/pkgserver.conf) and print them\n"
+    "                           addresses (etc/kivo/pkgserver.conf), and whether\n"
+    "                           package images may come from loopback and private\n"
+    "                           addresses, and print them\n"
     "\n"
     "package authors:\n"
     "  build SOURCE OUT.kpk [--level N]   build a package file from a source folder\n"
@@ -53,7 +60,13 @@ const char kUsage[] =
     "\n"
     "operators (on the system root):\n"
     "  install FILE.kpk [--volume V] [--wizard JSON] [--run] [--no-codesign] [--no-force]\n"
-    "                                     install, or upgrade an installed package\n"
+    "                 [--switch-origin]   install, or upgrade an installed package\n"
+    "                                     (--switch-origin: also one that came from\n"
+    "                                     another source or signer, which from then\n"
+    "                                     on has this file's origin)\n"
+    "  install-server ID [--feed URL] [--volume V] [--run] [--switch-origin]\n"
+    "                                     install, or upgrade to, the newest ID the\n"
+    "                                     vendor's server (or the listed feed) offers\n"
     "  uninstall ID [--wizard JSON]       remove a package\n"
     "  start ID | stop ID | status ID     control a package\n"
     "  list                               installed packages\n"
@@ -116,6 +129,8 @@ int WebConfig(const std::vector<std::string>& args) {
   options.mode = WebMode::kScgi;
   options.entry_cgi = BesideUs("entry.cgi");
   options.webd = BesideUs("kivo-webd");
+  // lighttpd lets through the uploads the root's web API takes.
+  options.max_upload_bytes = LoadUploadLimit();
   for (size_t i = 0; i < args.size(); ++i) {
     bool has_value = i + 1 < args.size();
     if (args[i] == "--mode" && has_value) {
@@ -172,6 +187,7 @@ int main(int argc, char** argv) {
   if (command == "list") return KivoctlList(args);
   if (command == "log") return KivoctlLog(args);
   if (command == "auto-update") return KivoctlAutoUpdate(args);
+  if (command == "install-server") return KivoctlInstallServer(args);
   std::cerr << kUsage;
   return Fail("unknown command: " + command);
 }

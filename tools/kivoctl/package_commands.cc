@@ -138,16 +138,20 @@ int KivoctlInstall(const std::vector<std::string>& args) {
   if (pos.size() != 1) {
     return Usage(
         "kivoctl install FILE.kpk [--volume /volumeN] [--wizard JSON] [--run] "
-        "[--no-codesign] [--no-force]");
+        "[--no-codesign] [--no-force] [--switch-origin]");
   }
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;
   const char* user = getenv("USER");
-  bool ok =
-      InstallPackageFileImpl(user ? user : "root", pos[0], Option(args, "--volume"), 0,
-                             Option(args, "--wizard"), Flag(args, "--run"), "enu", message, code,
-                             details, !Flag(args, "--no-force"), !Flag(args, "--no-codesign"));
+  // A file named on the command line has a file's origin; replacing a
+  // package that came from elsewhere takes --switch-origin.
+  PMSInstallSource source;
+  if (Flag(args, "--switch-origin")) source.change = PMSOriginChange::kAllow;
+  bool ok = InstallPackageFileImpl(user ? user : "root", pos[0], Option(args, "--volume"), 0,
+                                   Option(args, "--wizard"), Flag(args, "--run"), "enu", message,
+                                   code, details, !Flag(args, "--no-force"),
+                                   !Flag(args, "--no-codesign"), &source);
   if (!message.empty()) std::cerr << message << (message.back() == '\n' ? "" : "\n");
   for (const Json::Value& m : details["workerMessage"]) std::cout << m.asString() << "\n";
   if (!ok) return Fail(pos[0] + ": " + PMSResultText(code) + " [" + std::to_string(code) + "]");

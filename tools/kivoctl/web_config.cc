@@ -2,6 +2,8 @@
 
 #include <sys/un.h>
 
+#include "host/cgi_request.h"
+
 namespace {
 
 // Paths go into quoted configuration strings, and kivo-webd's into a command
@@ -82,6 +84,32 @@ std::string PageSection() {
          "}\n";
 }
 
+// lighttpd's request size limits are in KiB.
+std::string KiB(uint64_t bytes) { return std::to_string((bytes + 1023) / 1024); }
+
+// How lighttpd takes request bodies. It reads each body whole before it
+// starts entry.cgi or hands the request to kivo-webd, so that no request
+// process ever waits for a slow client: lighttpd holds such a client at the
+// cost of a connection, and drops it after read_timeout_seconds without a
+// byte. Only uploads stream through as they arrive (a package file is not
+// written twice); kivo-webd and the request code bound those by their
+// deadline. Each kind has the limit the web API applies to it, so that
+// lighttpd never holds more than the API would take.
+std::string BodySection(const WebConfigOptions& o) {
+  return "server.stream-request-body = 0\n"
+         "server.max-request-size = " +
+         KiB(kMaxBodyBytes) +
+         "\n"
+         "$REQUEST_HEADER[\"Content-Type\"] =~ \"(?i)^multipart/form-data\" {\n"
+         "  server.stream-request-body = 2\n"
+         "  server.max-request-size = " +
+         KiB(o.max_upload_bytes) +
+         "\n"
+         "}\n"
+         "server.max-read-idle = " +
+         std::to_string(o.read_timeout_seconds) + "\n";
+}
+
 }  // namespace
 
 bool ParseWebMode(const std::string& text, WebMode* mode) {
@@ -100,12 +128,15 @@ std::string WebConfigProblem(const WebConfigOptions& o) {
   if (!o.module_dir.empty() && !Plain(o.module_dir))
     return "the modules folder must be an absolute path without spaces or quotes";
   if (o.port <= 0 || o.port > 65535) return "the port must be 1 to 65535";
+  if (o.read_timeout_seconds < 1 || o.read_timeout_seconds > 86400)
+    return "the read time limit must be 1 to 86400 seconds";
+  // lighttpd keeps its limit in KiB in 32 bits.
+  if (o.max_upload_bytes < 1 || (o.max_upload_bytes + 1023) / 1024 > 0xffffffffULL)
+    return "the upload limit must be 1 byte to 4 TiB";
   if (o.mode == WebMode::kCgi)
     return Plain(o.entry_cgi) ? "" : "entry.cgi must be an absolute path without spaces or quotes";
   if (!Plain(o.webd)) return "kivo-webd must be an absolute path without spaces or quotes";
   if (o.max_children < 1 || o.max_children > 4096) return "max children must be 1 to 4096";
-  if (o.read_timeout_seconds < 1 || o.read_timeout_seconds > 86400)
-    return "the read time limit must be 1 to 86400 seconds";
   // The web server adds "-0" to the socket's name.
   if (WebdSocketPath(o).size() + 2 >= sizeof(sockaddr_un::sun_path))
     return "the root's path is too long for kivo-webd's socket";
@@ -133,14 +164,9 @@ std::string KIVOWebConfig(const WebConfigOptions& o) {
          Quoted(o.root + "/tmp") +
          ")\n"
          "server.errorlog-use-syslog = \"disable\"\n"
-         "server.tag = \"kivo\"\n"
-         // The web API decodes the body itself; hand it over as it arrives
-         // instead of buffering whole uploads in the web server.
-         "server.stream-request-body = 2\n"
-         // Uploads stream through; the web API applies its own limit
-         // ("max_upload_bytes"), so the web server only caps at 4 GiB.
-         "server.max-request-size = 4194304\n" +
-         (o.mode == WebMode::kScgi ? ScgiSection(o) : CgiSection(o)) + PageSection() +
+         "server.tag = \"kivo\"\n" +
+         BodySection(o) + (o.mode == WebMode::kScgi ? ScgiSection(o) : CgiSection(o)) +
+         PageSection() +
          // Every request's environment, in both modes (SCGI carries it in
          // the request's head).
          "setenv.add-environment = " + Environment(o) + "\n";

@@ -4,18 +4,26 @@
 // module (a forked child per request, no program start).
 #pragma once
 
+#include <cstdint>
 #include <string>
+
+#include "host/host_config.h"
+#include "host/request_deadline.h"
 
 enum class WebMode { kCgi, kScgi };
 
 struct WebConfigOptions {
   std::string root;  // the system root (KIVO_ROOT of every request)
   WebMode mode = WebMode::kCgi;
-  std::string entry_cgi;          // cgi: absolute path of entry.cgi
-  std::string webd;               // scgi: absolute path of kivo-webd
-  int max_children = 16;          // scgi: requests served at once; more wait
-  int read_timeout_seconds = 30;  // scgi: a request's limit without a byte from its client
-  std::string module_dir;         // the modules folder; empty: the one beside the program
+  std::string entry_cgi;  // cgi: absolute path of entry.cgi
+  std::string webd;       // scgi: absolute path of kivo-webd
+  int max_children = 16;  // scgi: requests served at once; more wait
+  // lighttpd: the longest pause in a request it reads; scgi: the time a
+  // request's head and small body may take (host/scgi_server.h).
+  int read_timeout_seconds = kDefaultRequestSeconds;
+  // The largest upload lighttpd lets through: the root's max_upload_bytes.
+  uint64_t max_upload_bytes = kDefaultMaxUploadBytes;
+  std::string module_dir;  // the modules folder; empty: the one beside the program
   std::string address = "127.0.0.1";
   int port = 5000;
 };
@@ -32,7 +40,9 @@ std::string WebdSocketPath(const WebConfigOptions& options);
 // The lighttpd configuration text for usable `options`. It keeps lighttpd in
 // the foreground's terms: errors on stderr, no pid file, no user switch. In
 // scgi mode lighttpd starts kivo-webd itself, hands it the listening socket
-// and starts it again when it ends.
+// and starts it again when it ends. lighttpd reads every request body whole
+// before the web API sees it, uploads excepted, and refuses bodies over the
+// web API's own limits (docs/scgi.md, docs/http-api.md).
 std::string KIVOWebConfig(const WebConfigOptions& options);
 
 // "cgi" / "scgi" to a mode; false for anything else.

@@ -158,12 +158,47 @@ test('a licence must be accepted before the install goes on', async () => {
   }
 });
 
-test('an unsigned package asks for confirmation, and abandoning its wizard removes the upload', async () => {
+// Sets the appliance's trust level (0: trusted publishers only).
+function setTrustLevel(level: number): void {
+  const info = '/etc/kivoinfo.conf';
+  const text = readFileSync(appliance.file(info), 'utf8');
+  appliance.replace(info, text.replace(/^pkg_source_trust_level=.*$/m, `pkg_source_trust_level="${level}"`));
+}
+
+test('an unverified package is refused in words at "Trusted publishers only", with a way to the setting', async () => {
   await chooseAndUpload(appliance.file(`${kSamples}/demo-unsigned.kpk`));
   const dialog = page.getByRole('dialog', { name: 'Install Demo Unsigned' });
   await dialog.getByText('Step 1 of 3: Signature').waitFor();
+  await dialog.getByText(/installs only packages signed by a trusted publisher/).waitFor();
+  assert.ok(await dialog.getByRole('button', { name: 'Next' }).isDisabled());
+  assert.equal(await dialog.getByRole('checkbox', { name: 'Install it anyway' }).count(), 0);
+  await screenshot(page, 'manual-trust-level-refusal');
+  await checkAccessibility(page, 'manual install trust level refusal');
+  await dialog.getByRole('link', { name: 'Change the trust level in Settings' }).click();
+  await page.getByRole('heading', { name: 'Settings', level: 1 }).waitFor();
+  await waitForEmptyUploadArea();
+  assert.doesNotMatch(installed(), /^demo-unsigned /m);
+});
+
+test("at a level that only warns, a stranger's package asks for confirmation, and abandoning its wizard removes the upload", async () => {
+  setTrustLevel(1);
+  try {
+    await confirmAndAbandon();
+  } finally {
+    setTrustLevel(0);
+  }
+});
+
+// The community feed's copy of Demo Unsigned, signed by a key that only the
+// feed vouches for: uploaded by hand, its signer is a stranger's.
+const kStrangers = '/usr/kivo/www/community/demo-unsigned.kpk';
+
+async function confirmAndAbandon(): Promise<void> {
+  await chooseAndUpload(appliance.file(kStrangers));
+  const dialog = page.getByRole('dialog', { name: 'Install Demo Unsigned' });
+  await dialog.getByText('Step 1 of 3: Signature').waitFor();
   await dialog.getByText("This package's signature could not be verified.").waitFor();
-  await dialog.getByText('This package is not signed.').waitFor();
+  await dialog.getByText(/signed by a key this appliance does not trust/).waitFor();
   assert.ok(await dialog.getByRole('button', { name: 'Next' }).isDisabled());
   await screenshot(page, 'manual-codesign-warning');
   await checkAccessibility(page, 'manual install signature warning');
@@ -179,25 +214,25 @@ test('an unsigned package asks for confirmation, and abandoning its wizard remov
 
   // Escape abandons the wizard the same way, and so do leaving the screen
   // and reloading the page.
-  await chooseAndUpload(appliance.file(`${kSamples}/demo-unsigned.kpk`));
+  await chooseAndUpload(appliance.file(kStrangers));
   await dialog.getByText('Step 1 of 3: Signature').waitFor();
   await page.keyboard.press('Escape');
   await dialog.waitFor({ state: 'detached' });
   await waitForEmptyUploadArea();
 
-  await chooseAndUpload(appliance.file(`${kSamples}/demo-unsigned.kpk`));
+  await chooseAndUpload(appliance.file(kStrangers));
   await dialog.getByText('Step 1 of 3: Signature').waitFor();
   await page.evaluate(() => (location.hash = '#/installed'));
   await dialog.waitFor({ state: 'detached' });
   await waitForEmptyUploadArea();
   await page.goBack();
 
-  await chooseAndUpload(appliance.file(`${kSamples}/demo-unsigned.kpk`));
+  await chooseAndUpload(appliance.file(kStrangers));
   await dialog.getByText('Step 1 of 3: Signature').waitFor();
   await page.reload();
   await page.getByRole('heading', { name: 'Manual install' }).waitFor();
   await waitForEmptyUploadArea();
-});
+}
 
 test('packages the appliance refuses say why in words and leave no upload behind', async () => {
   await chooseAndUpload(appliance.file(`${kSamples}/demo-future.kpk`));
@@ -227,4 +262,36 @@ test('packages the appliance refuses say why in words and leave no upload behind
   await dialog.getByRole('button', { name: 'Close' }).click();
   await waitForEmptyUploadArea();
   assert.match(installed(), /^demo-web 1\.0\.0-0001 /m);
+});
+
+test('a file replaces a package from the vendor only once the administrator switches its origin', async () => {
+  // Demo Web came from the vendor's server; Demo Notes, which runs on it,
+  // steps aside for the upgrade.
+  appliance.kivoctl('stop', 'demo-notes');
+  try {
+    await chooseAndUpload(appliance.file(`${kSamples}/demo-web-update.kpk`));
+    const dialog = page.getByRole('dialog', { name: 'Install Demo Web' });
+    await dialog.getByText('Step 1 of 2: Volume').waitFor();
+    await dialog.getByRole('button', { name: 'Next' }).click();
+    await dialog.getByText('Step 2 of 2: Summary').waitFor();
+    await dialog.getByRole('button', { name: 'Install' }).click();
+
+    await dialog.getByText('This package came from another source, or was signed by another key.', { exact: false }).waitFor();
+    await dialog.getByText('Demo Web came from another source, or was signed by another key.').waitFor();
+    await dialog.getByText(/from now on Demo Web is updated only from files installed by hand/).waitFor();
+    const switchButton = dialog.getByRole('button', { name: 'Switch and install' });
+    assert.ok(await switchButton.isDisabled());
+    assert.match(installed(), /^demo-web 1\.0\.0-0001 /m);
+    await screenshot(page, 'manual-origin-switch');
+    await checkAccessibility(page, 'manual install origin switch');
+
+    await dialog.getByRole('checkbox', { name: 'Update Demo Web from files installed by hand from now on' }).check();
+    await switchButton.click();
+    await dialog.getByText('Demo Web 1.1.0-0001 is installed.').waitFor();
+    await dialog.getByRole('button', { name: 'Close' }).click();
+    assert.match(installed(), /^demo-web 1\.1\.0-0001 /m);
+    assert.match(readFileSync(appliance.file('/var/packages/demo-web/ORIGIN'), 'utf8'), /^origin="file"$/m);
+  } finally {
+    appliance.kivoctl('start', 'demo-notes');
+  }
 });

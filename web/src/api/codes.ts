@@ -45,6 +45,7 @@ export const PackageCode = {
   ExtractFailed: 4540,
   UnsafePayload: 4541,
   UpgradeRolledBack: 4542,
+  OtherOrigin: 4543,
   BadWizardValues: 4544,
   InstallNotInstalled: 4545,
   NotNewer: 4546,
@@ -69,6 +70,13 @@ export const PackageCode = {
   KeyNotPublic: 4593,
   KeySecret: 4594,
   KeyringUnwritable: 4595,
+} as const;
+
+// The package tool's result codes that the page acts on (docs/package-tool.md):
+// a failed install from a package server carries one in its task's
+// "error"."result".
+export const ToolCode = {
+  OtherOrigin: 306,
 } as const;
 
 // The "code" of the "error" a failed download or install leaves in its task

@@ -53,6 +53,8 @@ const messages: Record<number, string> = {
   [PackageCode.ExtractFailed]: 'The package\'s contents could not be unpacked. The file may be damaged, or the volume full.',
   [PackageCode.UnsafePayload]: 'The package\'s contents hold unsafe files; the install was stopped.',
   [PackageCode.UpgradeRolledBack]: 'The upgrade failed; the previous version was restored.',
+  [PackageCode.OtherOrigin]:
+    'This package came from another source, or was signed by another key. It is upgraded only from where it came from, unless you switch its origin to this source.',
   [PackageCode.BadWizardValues]: 'The package did not accept the answers given in its install wizard. Check them and try again.',
   [PackageCode.InstallNotInstalled]: 'This package is not installed.',
   [PackageCode.NotNewer]: 'The same or a newer version of this package is already installed.',

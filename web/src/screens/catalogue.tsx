@@ -9,9 +9,12 @@
 import './catalogue.css';
 import { useCallback, useEffect, useMemo, useRef, useState } from 'preact/hooks';
 import type { Api, Result } from '../api/client';
+import { ToolCode } from '../api/codes';
 import { messageFor } from '../api/messages';
 import { useSession } from '../session';
+import { Dialog } from '../ui/dialog';
 import { ErrorText } from '../ui/error-text';
+import { OriginSwitch } from '../ui/origin-switch';
 import { TaskProgress, taskFailure, type TaskData, type TaskEnd } from '../ui/task-progress';
 import { ServerInstall, startedTaskId, type InstallOutcome } from './server-install';
 
@@ -25,6 +28,10 @@ export interface ServerEntry {
   maintainer?: string;
   beta?: boolean;
   blupgrade?: boolean;
+  // Set on a newer version of an installed package that came from elsewhere:
+  // where it came from, in words. It is no upgrade unless the origin is
+  // switched.
+  other_origin?: string;
   source: 'kivo' | 'others';
   status?: string;
   info?: TaskData | null;
@@ -60,7 +67,7 @@ type Phase =
   | { kind: 'starting' }
   | { kind: 'running'; taskId: string }
   | { kind: 'downloaded'; taskId: string }
-  | { kind: 'note'; text: string; failed: boolean };
+  | { kind: 'note'; text: string; failed: boolean; originRefused?: boolean };
 
 const kDownloadTask = '@KIVOPKG_DOWNLOAD_';
 const kBusyStatus = new Set(['downloading', 'installing', 'upgrading']);
@@ -120,6 +127,13 @@ function feedOf(entry: ServerEntry, feeds: Feed[]): string {
   return match?.name ?? (feeds.length === 1 ? feeds[0].name : 'an added feed');
 }
 
+// The entry's own file, named to the install: a switch of origin goes to
+// the very source the administrator chose, not to whichever lists the
+// package too.
+export function entryLink(entry: ServerEntry): { url?: string; filesize?: number } {
+  return entry.link ? { url: entry.link, filesize: entry.size ?? 0 } : {};
+}
+
 function matches(entry: ServerEntry, query: string): boolean {
   const q = query.trim().toLowerCase();
   if (q === '') return true;
@@ -144,6 +158,7 @@ function EntryCard({
   from,
   phase,
   onInstall,
+  onSwitch,
   onEnd,
   onContinue,
   onDiscard,
@@ -152,6 +167,7 @@ function EntryCard({
   from: string;
   phase: Phase | undefined;
   onInstall: () => void;
+  onSwitch: () => void;
   onEnd: (end: TaskEnd) => void;
   onContinue: () => void;
   onDiscard: () => void;
@@ -162,6 +178,7 @@ function EntryCard({
   const icon = api.url('KIVO.Core.Package.Thumb.Server', 'get', 1, { name: entry.id, ver: entry.version ?? '', size: 72, link: entry.icon ?? '' });
   const installed = isInstalled(entry);
   const canInstall = !phase || phase.kind === 'note';
+  const canSwitch = canInstall && installed && (entry.other_origin !== undefined || (phase?.kind === 'note' && phase.originRefused === true));
   return (
     <li class="catalogue-entry" aria-labelledby={headingId}>
       <img class="catalogue-icon" src={icon} alt="" width={72} height={72} loading="lazy" />
@@ -193,6 +210,14 @@ function EntryCard({
             </button>
           </div>
         )}
+        {canSwitch && (
+          <div class="buttons start">
+            {entry.other_origin && <span class="hint">Installed from {entry.other_origin}, which it is updated from.</span>}
+            <button type="button" onClick={onSwitch} aria-label={`Switch ${name} to ${from}`}>
+              Switch to this source…
+            </button>
+          </div>
+        )}
         {canInstall && (!installed || entry.blupgrade) && (
           <div class="buttons start">
             <button type="button" class="primary" onClick={onInstall} aria-label={`${entry.blupgrade ? 'Upgrade' : 'Install'} ${name}`}>
@@ -211,6 +236,11 @@ export function CatalogueScreen() {
   const [loading, setLoading] = useState(true);
   const [phases, setPhases] = useState<Record<string, Phase>>({});
   const [wizard, setWizard] = useState<{ entry: ServerEntry; taskId: string } | null>(null);
+  // The entry whose source the administrator is asked to switch to.
+  const [switchAsk, setSwitchAsk] = useState<ServerEntry | null>(null);
+  // Packages being installed with their origin switched to the entry's
+  // source, by the administrator's confirmation.
+  const switching = useRef(new Set<string>());
   const [query, setQuery] = useState('');
   // Packages whose download this page started: their wizard opens by itself
   // when the download is done (another tab only offers to continue).
@@ -243,13 +273,16 @@ export function CatalogueScreen() {
       return next;
     });
 
-  const install = async (entry: ServerEntry) => {
+  const install = async (entry: ServerEntry, switchOrigin = false) => {
     setPhase(entry.id, { kind: 'starting' });
     mine.current.add(entry.id);
+    if (switchOrigin) switching.current.add(entry.id);
+    else switching.current.delete(entry.id);
     // A plain download first: the wizard needs what the package file says.
     const answer = await api.call<{ taskid?: string; data?: TaskData }>('KIVO.Core.Package.Installation', 'install', 1, {
       name: entry.id,
       is_kivo: entry.source === 'kivo',
+      ...(switchOrigin ? entryLink(entry) : {}),
     });
     if (answer.ok) setPhase(entry.id, { kind: 'running', taskId: startedTaskId(answer.data, entry.id) });
     else setPhase(entry.id, { kind: 'note', text: messageFor(answer.error), failed: true });
@@ -263,7 +296,8 @@ export function CatalogueScreen() {
       return;
     }
     mine.current.delete(entry.id);
-    if (end.kind === 'failed') setPhase(entry.id, { kind: 'note', text: end.text, failed: true });
+    if (end.kind === 'failed')
+      setPhase(entry.id, { kind: 'note', text: end.text, failed: true, originRefused: end.result === ToolCode.OtherOrigin });
     else if (end.kind === 'cancelled') setPhase(entry.id, { kind: 'note', text: `The download of ${name} was cancelled.`, failed: false });
     else if (end.kind === 'done' && end.data.status === 'installed') setPhase(entry.id, { kind: 'note', text: `${name} is installed.`, failed: false });
     else setPhase(entry.id, null);
@@ -291,13 +325,15 @@ export function CatalogueScreen() {
   const fromFeeds = (catalogue?.others?.ok ? catalogue.others.data.data : []).filter((e) => matches(e, query));
   const upgrades = (catalogue ? entriesOf(catalogue) : []).filter((e) => e.blupgrade).length;
 
+  const fromOf = (entry: ServerEntry) => (entry.source === 'kivo' ? "the vendor's server" : `the feed ${feedOf(entry, feeds)}`);
   const card = (entry: ServerEntry) => (
     <EntryCard
       key={`${entry.source}-${entry.id}`}
       entry={entry}
-      from={entry.source === 'kivo' ? "the vendor's server" : `the feed ${feedOf(entry, feeds)}`}
+      from={fromOf(entry)}
       phase={phases[entry.id]}
       onInstall={() => void install(entry)}
+      onSwitch={() => setSwitchAsk(entry)}
       onEnd={(end) => {
         const phase = phases[entry.id];
         ended(entry, phase && 'taskId' in phase ? phase.taskId : kDownloadTask + entry.id, end);
@@ -374,7 +410,29 @@ export function CatalogueScreen() {
           <ul class="catalogue-list">{fromFeeds.map(card)}</ul>
         </>
       )}
-      {wizard && <ServerInstall entry={wizard.entry} taskId={wizard.taskId} onClose={(outcome) => wizardClosed(wizard.entry, outcome)} />}
+      {wizard && (
+        <ServerInstall
+          entry={wizard.entry}
+          taskId={wizard.taskId}
+          switchOrigin={switching.current.has(wizard.entry.id)}
+          onClose={(outcome) => wizardClosed(wizard.entry, outcome)}
+        />
+      )}
+      {switchAsk && (
+        <Dialog title={`Switch the origin of ${switchAsk.dname || switchAsk.id}`} onClose={() => setSwitchAsk(null)}>
+          <OriginSwitch
+            name={switchAsk.dname || switchAsk.id}
+            installedFrom={switchAsk.other_origin}
+            source={fromOf(switchAsk)}
+            onSwitch={() => {
+              const entry = switchAsk;
+              setSwitchAsk(null);
+              void install(entry, true);
+            }}
+            onCancel={() => setSwitchAsk(null)}
+          />
+        </Dialog>
+      )}
     </section>
   );
 }

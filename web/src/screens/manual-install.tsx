@@ -1,10 +1,12 @@
 import './manual-install.css';
 import { useEffect, useRef, useState } from 'preact/hooks';
 import type { Api, ApiFailure, Result } from '../api/client';
+import { PackageCode } from '../api/codes';
 import { messageFor } from '../api/messages';
 import { useSession } from '../session';
 import { routeHref } from '../route';
 import { Dialog } from '../ui/dialog';
+import { OriginSwitch } from '../ui/origin-switch';
 import { ErrorText } from '../ui/error-text';
 import { ProgressBar } from '../ui/progress';
 import { Steps, type StepPage } from '../ui/steps';
@@ -51,8 +53,16 @@ interface InstallAnswer {
   worker_message?: unknown;
 }
 
+// The trust level at which no confirmation lets an unverified package in
+// ("Trusted publishers only", docs/package-tool.md).
+const kStrictestTrustLevel = 0;
+
 interface Prepared {
   upload: UploadAnswer;
+  // The appliance's trust level when the signature could not be verified;
+  // null when it is not needed or could not be read (the appliance decides
+  // at the install either way).
+  trustLevel: number | null;
   facts: PackageFacts;
   volumes: Volume[];
   busy: boolean;
@@ -67,7 +77,7 @@ type Phase =
   | { kind: 'refused'; file: File; error: ApiFailure }
   | { kind: 'wizard'; prepared: Prepared; choices: InstallChoices }
   | { kind: 'installing'; prepared: Prepared; choices: InstallChoices; progress: number | null }
-  | { kind: 'done'; prepared: Prepared; choices: InstallChoices; outcome: Result<InstallAnswer> };
+  | { kind: 'done'; prepared: Prepared; choices: InstallChoices; trustUnverified: boolean; outcome: Result<InstallAnswer> };
 
 // What the check needs to know about the package, from the upload's answer.
 function checkParams(upload: UploadAnswer) {
@@ -94,7 +104,13 @@ async function prepare(api: Api, upload: UploadAnswer): Promise<Result<Prepared>
   const environment = await checkEnvironment<CheckAnswer>(api, facts, checkParams(upload));
   if (!environment.ok) return environment;
   const { answer, volumes, choices, defaultVolumeError } = environment.data;
-  return { ok: true, data: { upload, facts, volumes, busy: answer.is_occupied === true, defaultVolumeError, initial: choices } };
+  const trustLevel = upload.codesign_error !== undefined ? await readTrustLevel(api) : null;
+  return { ok: true, data: { upload, trustLevel, facts, volumes, busy: answer.is_occupied === true, defaultVolumeError, initial: choices } };
+}
+
+async function readTrustLevel(api: Api): Promise<number | null> {
+  const settings = await api.call<{ trust_level?: unknown }>('KIVO.Core.Package.Setting', 'get', 1);
+  return settings.ok && typeof settings.data.trust_level === 'number' ? settings.data.trust_level : null;
 }
 
 function clean(api: Api, taskId: string): void {
@@ -109,8 +125,10 @@ function workerMessages(answer: InstallAnswer): string[] {
   return Array.isArray(lines) ? lines.filter((l): l is string => typeof l === 'string' && l.trim() !== '') : [];
 }
 
-function codesignPage(upload: UploadAnswer, confirmed: boolean, onConfirm: (yes: boolean) => void): StepPage {
+function codesignPage(prepared: Prepared, confirmed: boolean, onConfirm: (yes: boolean) => void): StepPage {
+  const { upload } = prepared;
   const code = upload.codesign_error ?? 0;
+  if (prepared.trustLevel === kStrictestTrustLevel) return trustLevelRefusalPage(upload);
   return {
     title: 'Signature',
     body: (
@@ -129,6 +147,32 @@ function codesignPage(upload: UploadAnswer, confirmed: boolean, onConfirm: (yes:
   };
 }
 
+// At "Trusted publishers only" the appliance installs no package whose
+// signature could not be verified, whatever anyone confirms: say so, and
+// where the level is changed, instead of offering "Install it anyway".
+function trustLevelRefusalPage(upload: UploadAnswer): StepPage {
+  return {
+    title: 'Signature',
+    body: (
+      <div class="codesign-warning">
+        <p class="warning">
+          <strong>This package's signature could not be verified.</strong> {messageFor({ code: upload.codesign_error ?? 0 })}
+        </p>
+        {upload.codesign_message && <p>The package tool says: {upload.codesign_message}</p>}
+        <p>
+          This appliance installs only packages signed by a trusted publisher (trust level “Trusted publishers only”), so it
+          cannot install this one. To install it, an administrator must first choose a trust level that allows it, then
+          upload the package again.
+        </p>
+        <p>
+          <a href={routeHref({ screen: 'settings' })}>Change the trust level in Settings</a>
+        </p>
+      </div>
+    ),
+    problem: 'The trust level of this appliance does not allow this package.',
+  };
+}
+
 function InstallWizard({
   prepared,
   start,
@@ -144,7 +188,7 @@ function InstallWizard({
   const [trustUnverified, setTrustUnverified] = useState(false);
   const unverified = prepared.upload.codesign_error !== undefined;
   const pages = [
-    ...(unverified ? [codesignPage(prepared.upload, trustUnverified, setTrustUnverified)] : []),
+    ...(unverified ? [codesignPage(prepared, trustUnverified, setTrustUnverified)] : []),
     ...installPages(prepared.facts, prepared.volumes, choices, setChoices),
   ];
   return (
@@ -291,16 +335,19 @@ export function ManualInstallScreen() {
     pendingUpload.current = null;
   };
 
-  const install = async (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean) => {
+  // `switchOrigin`: the administrator confirmed that the package, which
+  // came from elsewhere, is from now on a file's installed by hand.
+  const install = async (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean, switchOrigin = false) => {
     setPhase({ kind: 'installing', prepared, choices, progress: null });
     const outcome = await api.call<InstallAnswer>(kApi, 'install', 1, {
       task_id: prepared.upload.task_id,
       ...installParams(prepared.facts, choices),
       check_codesign: trustUnverified ? false : undefined,
+      switch_origin: switchOrigin ? true : undefined,
     });
     // A successful install took the file; a failed one leaves it for a retry.
     if (outcome.ok) pendingUpload.current = null;
-    setPhase({ kind: 'done', prepared, choices, outcome });
+    setPhase({ kind: 'done', prepared, choices, trustUnverified, outcome });
   };
 
   const close = () => {
@@ -356,7 +403,7 @@ function PhaseBody({
 }: {
   phase: Phase;
   onClose: () => void;
-  onInstall: (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean) => void;
+  onInstall: (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean, switchOrigin?: boolean) => void;
   onRetry: (prepared: Prepared, choices: InstallChoices) => void;
 }) {
   switch (phase.kind) {
@@ -386,6 +433,19 @@ function PhaseBody({
         </>
       );
     case 'done':
+      if (!phase.outcome.ok && phase.outcome.error.code === PackageCode.OtherOrigin) {
+        return (
+          <>
+            <CheckRefusal error={phase.outcome.error} />
+            <OriginSwitch
+              name={phase.prepared.facts.name || phase.prepared.facts.id}
+              source="files installed by hand"
+              onSwitch={() => onInstall(phase.prepared, phase.choices, phase.trustUnverified, true)}
+              onCancel={onClose}
+            />
+          </>
+        );
+      }
       return (
         <>
           <InstallOutcome prepared={phase.prepared} outcome={phase.outcome} />

@@ -7,7 +7,7 @@
 
 import { useEffect, useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
-import type { ServerEntry } from './catalogue';
+import { entryLink, type ServerEntry } from './catalogue';
 import { useSession } from '../session';
 import { Dialog } from '../ui/dialog';
 import { ErrorText } from '../ui/error-text';
@@ -48,7 +48,19 @@ type State =
   | { kind: 'refused'; error: ApiFailure; downloadGone: boolean }
   | { kind: 'ready'; facts: PackageFacts; volumes: Volume[] };
 
-export function ServerInstall({ entry, taskId, onClose }: { entry: ServerEntry; taskId: string; onClose: (outcome: InstallOutcome) => void }) {
+// With `switchOrigin`, the administrator has confirmed that the package,
+// installed from elsewhere, comes from this entry's source from now on.
+export function ServerInstall({
+  entry,
+  taskId,
+  switchOrigin = false,
+  onClose,
+}: {
+  entry: ServerEntry;
+  taskId: string;
+  switchOrigin?: boolean;
+  onClose: (outcome: InstallOutcome) => void;
+}) {
   const { api } = useSession();
   const [state, setState] = useState<State>({ kind: 'checking' });
   const [choices, setChoices] = useState<InstallChoices | null>(null);
@@ -112,6 +124,7 @@ export function ServerInstall({ entry, taskId, onClose }: { entry: ServerEntry; 
       installrunpackage: true,
       volume_path: params.volume_path,
       customuivalues: params.extra_values,
+      ...(switchOrigin ? { ...entryLink(entry), switch_origin: true } : {}),
     });
     setBusy(false);
     if (!started.ok) return setFailure(started.error);

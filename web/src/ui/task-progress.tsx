@@ -28,19 +28,23 @@ export interface TaskData {
   size?: number;
   // A download's failure is {code, message}; a failed install from a file
   // records the API code alone with the package tool's words in "message".
-  error?: { code?: number; message?: string } | number;
+  // A failed install from a package server adds the package tool's code
+  // ("result").
+  error?: { code?: number; message?: string; result?: number } | number;
   message?: string;
   signature?: string;
   feed?: string;
+  origin?: string;
 }
 
 // How a followed task ended: `done` with its last data; `gone` when it was
 // no longer there (another page read its end first); `failed` with the
-// reason in words; `cancelled` by this page.
+// reason in words (and the package tool's code, when the install refused);
+// `cancelled` by this page.
 export type TaskEnd =
   | { kind: 'done'; data: TaskData }
   | { kind: 'gone' }
-  | { kind: 'failed'; text: string }
+  | { kind: 'failed'; text: string; result?: number }
   | { kind: 'cancelled' };
 
 // Words for the download worker's own error codes (not API codes).
@@ -68,7 +72,10 @@ export function taskFailure(data: TaskData): string | null {
 
 export function taskEnd(data: TaskData): TaskEnd {
   const failure = taskFailure(data);
-  if (failure !== null) return { kind: 'failed', text: failure };
+  if (failure !== null) {
+    const result = typeof data.error === 'object' ? data.error.result : undefined;
+    return { kind: 'failed', text: failure, result };
+  }
   return data.status === undefined ? { kind: 'gone' } : { kind: 'done', data };
 }
 
