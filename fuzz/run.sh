@@ -5,7 +5,7 @@
 # reproducer or the fuzzing crashes; crashes land in
 # <build>/fuzz/crashes/<target>/, the grown corpus in <build>/fuzz/corpus/<target>/.
 #
-#   fuzz/run.sh [SECONDS [TARGET...]]     targets: package_file params multipart
+#   fuzz/run.sh [SECONDS [TARGET...]]     targets: package_file params multipart catalogue
 #
 # FUZZ_FLAGS adds libFuzzer flags (e.g. "-jobs=4 -workers=2").
 set -euo pipefail
@@ -13,7 +13,7 @@ cd "$(dirname "$0")/.."
 SECONDS_EACH=${1:-20}
 shift || true
 TARGETS=("$@")
-[ ${#TARGETS[@]} -gt 0 ] || TARGETS=(package_file params multipart)
+[ ${#TARGETS[@]} -gt 0 ] || TARGETS=(package_file params multipart catalogue)
 BUILD=$PWD/${FUZZ_BUILD_DIR:-build-fuzz}
 
 launcher=()
