@@ -275,6 +275,7 @@ test('when the vendor cannot confirm its terms, packages can still be managed, a
     const page = await signedIn('unconfirmed', true);
     const unconfirmed = page.getByRole('alert').filter({ hasText: 'could not be confirmed' });
     await unconfirmed.waitFor();
+    await page.getByRole('heading', { name: 'The terms of service could not be confirmed' }).waitFor();
     assert.ok(await page.getByRole('button', { name: 'I agree' }).isDisabled());
     await screenshot(page, 'terms-unconfirmed');
 

@@ -109,11 +109,14 @@ function TermsScreen({
   // Without the current hash the agreement could not name what was agreed
   // to, and the text shown might not be the current one.
   const confirmed = hash !== '';
+  // Unconfirmed terms read as changed to the appliance (the agreement names
+  // another hash), but the user is told what is known: nothing yet.
+  const title = !confirmed ? 'The terms of service could not be confirmed' : changed ? 'The terms of service have changed' : 'Terms of service';
   return (
     <section class="card terms" aria-labelledby="terms-title">
-      <h1 id="terms-title">{changed ? 'The terms of service have changed' : 'Terms of service'}</h1>
+      <h1 id="terms-title">{title}</h1>
       <p>
-        {changed
+        {changed && confirmed
           ? 'Please read the new terms of service of the package servers. You can use the package center again once you agree to them.'
           : 'Before you use the package center, please read the terms of service of the package servers and agree to them.'}
       </p>
