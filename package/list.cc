@@ -1,8 +1,6 @@
 // The installed packages: "list" (also under the legacy API name) and "get".
 
 #include "error_codes.h"
-#include "klibc/key_value_file.h"
-#include "klibc/sysroot.h"
 #include "package_webapi.h"
 #include "pkgserver/auto_update.h"
 #include "pkgtool/pms.h"
@@ -20,20 +18,21 @@ using PackageUtils::kAutoupdate;
 using PackageUtils::kInstalledInfo;
 using PackageUtils::kLogPath;
 
-bool SettingIsYes(const char* key) {
-  std::string conf = KIVORootPath("/etc/kivoinfo.conf");
-  return KLIBCFileCheckKeyValue(conf.c_str(), key, "yes", 0) == 1;
-}
-
 }  // namespace
 
 PackageWebAPI::AutoUpdateState PackageWebAPI::ReadAutoUpdateState(uint64_t mask) {
   AutoUpdateState state;
-  if (!(mask & kAutoupdate) || !SettingIsYes("enable_pkg_autoupdate_all")) return state;
-  if (SettingIsYes("pkg_autoupdate_all")) {
-    state.all = true;
-  } else {
-    KIVOPackageServer::List(state.list);
+  if (!(mask & kAutoupdate)) return state;
+  switch (KIVOPackageServer::ReadMode()) {
+    case KIVOPackageServer::AutoUpdateMode::kOff:
+      break;
+    case KIVOPackageServer::AutoUpdateMode::kAll:
+      state.all = true;
+      break;
+    case KIVOPackageServer::AutoUpdateMode::kChosen:
+      // An unreadable list leaves it empty: no package shows as chosen.
+      (void)KIVOPackageServer::List(state.list);
+      break;
   }
   return state;
 }

@@ -304,18 +304,21 @@ void PackageWebAPI::AnnotateDownload(NVX::TaskMgr& mgr, const std::set<std::stri
                                      Json::Value& entry) {
   std::unique_ptr<NVX::Task> task(
       ListedTask(mgr, tasks, kDownloadPrefix + entry["package"].asString()));
-  Json::Value data = task ? task->getProperty("data") : Json::Value();
+  // Read through a const value: looking a member up must not add it, as
+  // "info" is the task's data as stored.
+  const Json::Value data = task ? task->getProperty("data") : Json::Value();
   if (data.isNull()) return;
   if (IsTrue(data["blqinst"]) &&
       (task->isFinished() || (data["pid"].isInt() && !TaskProcessAlive(data)))) {
     return;
   }
-  if (data.isMember("installing")) {
-    data["installing"] = !task->isFinished() && IsTrue(data["installing"]) && data["pid"].isInt() &&
-                         TaskProcessAlive(data);
-  }
   entry["info"] = data;
-  if (IsTrue(data["installing"])) {
+  bool installing = IsTrue(data["installing"]);
+  if (data.isMember("installing")) {
+    installing = installing && !task->isFinished() && data["pid"].isInt() && TaskProcessAlive(data);
+    entry["info"]["installing"] = installing;
+  }
+  if (installing) {
     double progress = PMSGetProgress(entry["package"].asString());
     if (progress != -1.0) entry["progress"] = progress;
   } else {

@@ -108,17 +108,18 @@ bool ParseJson(const std::string& text, Json::Value& out) {
   return KIVOParseJson(text, &out, JsonSyntax::Lenient);
 }
 
-// The chosen list of the "set" request: an array as sent, or a JSON text.
-// Null when not given; false when the text is not JSON.
+// The chosen list of the "set" request: an array as sent, or a JSON text of
+// one. Null when not given; false when the text is not JSON or the list is
+// not an array of package ids (each checked whole, as the string it is).
 bool ChosenPackages(const APIRequest& request, Json::Value& list) {
   list = Json::Value();
   Json::Value v = request.GetParam("packages");
   if (v.isArray()) {
     list = v;
-    return true;
+  } else if (v.isString() && !v.asString().empty() && !ParseJson(v.asString(), list)) {
+    return false;
   }
-  if (!v.isString() || v.asString().empty()) return true;
-  return ParseJson(v.asString(), list);
+  return list.isNull() || (list.isArray() && AreIdsOrEmpty(list));
 }
 
 // Drops every `id` from `list` (add: false), or appends it when missing
@@ -239,13 +240,19 @@ void PackageWebAPI::GetSetting() {
   // The list only adds detail: settings are answered without it.
   (void)KIVO::PXS::STORAGE_WEBUTILS::Volume(1).VolumeListGet(result, false);
   (void)FillDefaultVolume(result);
-  bool enabled = InfoValueIs("enable_pkg_autoupdate_all", "yes");
-  result["enable_autoupdate"] = enabled;
-  result["autoupdateall"] = !(enabled && InfoValueIs("pkg_autoupdate_all", "no"));
+  const KIVOPackageServer::AutoUpdateMode mode = KIVOPackageServer::ReadMode();
+  result["enable_autoupdate"] = mode != KIVOPackageServer::AutoUpdateMode::kOff;
+  result["autoupdateall"] = mode != KIVOPackageServer::AutoUpdateMode::kChosen;
   response->SetSuccess(result);
 }
 
 void PackageWebAPI::SetSetting() {
+  // A list that cannot be stored refuses the request before any step is.
+  Json::Value packages;
+  if (!ChosenPackages(*request, packages)) {
+    response->SetError(kErrBadParameter, Json::Value());
+    return;
+  }
   const std::string channel =
       TextParam(*request, "update_channel", "") == "beta" ? "beta" : "stable";
   const bool mail = TextParam(*request, "enable_email", "") == "true" && MailIsSetUp();
@@ -261,11 +268,6 @@ void PackageWebAPI::SetSetting() {
   }
   if (!SetInfoValue("package_update_channel", channel)) return fail("update_channel");
   if (!PMSSavaSchedule(desktop, mail, -1)) return fail("notification");
-  Json::Value packages;
-  if (!ChosenPackages(*request, packages)) {
-    response->SetError(kErrBadParameter, Json::Value());
-    return;
-  }
   if (!KIVOPackageServer::Save(TextParam(*request, "enable_autoupdate", "") == "true",
                                TextParam(*request, "autoupdateall", "") == "true", packages)) {
     return fail("autoupdate");
@@ -293,19 +295,24 @@ void PackageWebAPI::SetAutoUpdate(bool add) {
     return;
   }
   Json::Value list(Json::arrayValue);
-  if (!InfoValueIs("enable_pkg_autoupdate_all", "yes")) {
-    if (add) list.append(id);
-  } else if (InfoValueIs("pkg_autoupdate_all", "yes")) {
-    for (const std::string& installed : pkgMgr.enumPackages()) {
-      if (add || installed != id) list.append(installed);
+  switch (KIVOPackageServer::ReadMode()) {
+    case KIVOPackageServer::AutoUpdateMode::kOff:
+      if (add) list.append(id);
+      break;
+    case KIVOPackageServer::AutoUpdateMode::kAll:
+      for (const std::string& installed : pkgMgr.enumPackages()) {
+        if (add || installed != id) list.append(installed);
+      }
+      break;
+    case KIVOPackageServer::AutoUpdateMode::kChosen: {
+      Json::Value stored;
+      if (!KIVOPackageServer::List(stored)) {
+        response->SetError(kErrFailed, Json::Value());
+        return;
+      }
+      list = EditChosenList(stored, id, add);
+      break;
     }
-  } else {
-    Json::Value stored;
-    if (!KIVOPackageServer::List(stored)) {
-      response->SetError(kErrFailed, Json::Value());
-      return;
-    }
-    list = EditChosenList(stored, id, add);
   }
   if (!KIVOPackageServer::Save(true, false, list)) {
     response->SetError(kErrFailed, Json::Value());

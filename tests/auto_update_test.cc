@@ -3,12 +3,15 @@
 // is upgraded and runs again, a beta is
 // held back on the stable channel and taken on the beta channel, a failing
 // upgrade leaves the old version running and fails the run, the settings
-// "off" and the chosen list are honoured, and --dry-run changes nothing.
+// "off" and the chosen list are honoured, and --dry-run changes nothing; the
+// web API reads the switches as the run does.
 
 #include <gtest/gtest.h>
 
 #include "pkgtool/registry.h"
+#include "settings/web_utils.h"
 #include "testing/catalogue_feed.h"
+#include "testing/cgi_client.h"
 #include "testing/http_test_server.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
@@ -156,6 +159,47 @@ TEST_F(AutoUpdateTest, OffChosenListAndRestrictions) {
   EXPECT_EQ("au-a 1.0 running", State("au-a"));
   EXPECT_EQ("au-b 2.0 running", State("au-b"));
   EXPECT_EQ("au-c 1.0 running", State("au-c"));
+}
+
+// Without "pkg_autoupdate_all" the switches mean the same to every reader:
+// the run, the settings, the list's flag and one package's "delete" all take
+// automatic update to cover every package.
+TEST_F(AutoUpdateTest, AnAbsentAllSwitchMeansEveryPackageToEveryReader) {
+  InstallOld("au-a");
+  InstallOld("au-b");
+  Offer("au-a");
+  Offer("au-b");
+  Serve();
+  root_.Write("/etc/kivoinfo.conf",
+              "pkg_source_trust_level=\"1\"\nenable_pkg_autoupdate_all=\"yes\"\n"
+              "package_update_channel=\"stable\"\n");
+  root_.Write("/usr/kivo/etc/packages/autoupdate.json", "[\"au-a\"]");
+  std::string out;
+  ASSERT_EQ(0, AutoUpdate(&out, true)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: would upgrade")) << out;
+  EXPECT_NE(std::string::npos, out.find("au-b: would upgrade")) << out;
+
+  root_.AddAccount("admin", "secret", {"administrators"});
+  ApiClient client("admin", "secret");
+  ASSERT_TRUE(client.signed_in());
+  CgiAnswer settings = client.Call("KIVO.Core.Package.Setting", "get", 1);
+  ASSERT_TRUE(settings.Success()) << settings.body;
+  EXPECT_TRUE(settings.Data()["enable_autoupdate"].asBool());
+  EXPECT_TRUE(settings.Data()["autoupdateall"].asBool());
+  CgiAnswer list =
+      client.Call("KIVO.Core.Package", "list", 1, {{"additional", "[\"autoupdate\"]"}});
+  ASSERT_TRUE(list.Success()) << list.body;
+  ASSERT_EQ(2u, list.Data()["packages"].size()) << list.body;
+  for (const Json::Value& p : list.Data()["packages"]) {
+    EXPECT_TRUE(p["additional"]["autoupdate"].asBool()) << p["id"].asString();
+  }
+  // Leaving one package out makes a chosen list of all the others.
+  ASSERT_TRUE(
+      client.Call("KIVO.Core.Package.Setting.Update", "delete", 1, {{"id", "au-a"}}).Success());
+  Json::Value chosen;
+  ASSERT_TRUE(WebUtils::LoadJsonFile(root_.Path("/usr/kivo/etc/packages/autoupdate.json"), chosen));
+  ASSERT_EQ(1u, chosen.size()) << chosen.toStyledString();
+  EXPECT_EQ("au-b", chosen[0].asString());
 }
 
 }  // namespace

@@ -4,7 +4,9 @@
 // servers, caching with conditional requests, and the update badge.
 
 #include <dirent.h>
+#include <signal.h>
 #include <sstream>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -134,6 +136,49 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
   std::string badge;
   ASSERT_TRUE(KIVOReadFile(root_.Path("/var/cache/kivo/pkgserver/upgrade_badge.json"), &badge));
   EXPECT_NE(std::string::npos, badge.find("\"count\" : 0")) << badge;
+}
+
+// An install under way of a package the catalogue lists: the entry's "info"
+// is the task's data as stored, with nothing added.
+TEST_F(ServerCatalogueTest, InfoOfAnInstallUnderWayIsTheTasksData) {
+  TestPackage listed;
+  listed.id = "app-held";
+  feed_.Add(listed);
+  ASSERT_TRUE(feed_.Index());
+  feed_.Publish();
+  // The same package from a file, held in its preinst until the test lets go.
+  TestPackage held = listed;
+  held.scripts = {{"preinst",
+                   "for i in $(seq 400); do [ -e \"$KIVO_ROOT/tmp/go\" ] && exit 0; "
+                   "sleep 0.05; done\n"}};
+  const std::string file = held.Build(root_.Path("/tmp/packages"));
+  client();  // signed in before the fork, for both processes
+  pid_t installer = fork();
+  if (installer == 0) {
+    _exit(client().Call("KIVO.Core.Package.Installation", "install", 1, {{"path", file}}).Success()
+              ? 0
+              : 1);
+  }
+  NVX::TaskMgr mgr("@administrators");
+  auto stored = [&mgr] {
+    std::unique_ptr<NVX::Task> task(mgr.getTask("@KIVOPKG_DOWNLOAD_app-held"));
+    return task ? task->getProperty("data") : Json::Value();
+  };
+  Json::Value before;
+  for (int i = 0; i < 500 && !before["installing"].asBool(); ++i) {
+    usleep(20000);
+    before = stored();
+  }
+  CgiAnswer list = List();
+  const Json::Value after = stored();
+  root_.Write("/tmp/go", "");
+  int exit_status = 0;
+  ASSERT_EQ(installer, waitpid(installer, &exit_status, 0));
+  ASSERT_TRUE(before["installing"].asBool()) << before.toStyledString();
+  ASSERT_EQ(before, after) << "the install moved on while the catalogue was read";
+  ASSERT_TRUE(list.Success()) << list.body;
+  EXPECT_EQ(before, Find(list, "app-held")["info"]) << list.body;
+  EXPECT_EQ(0, WEXITSTATUS(exit_status));
 }
 
 TEST_F(ServerCatalogueTest, FeedsMergeArrayAndObjectFormsWithoutRecommendations) {

@@ -6,11 +6,23 @@
 #include "klibc/sysroot.h"
 #include "settings/web_utils.h"
 
+#include <strings.h>
+
 namespace KIVOPackageServer {
 
 namespace {
 
 std::string ListPath() { return KIVORootPath("/usr/kivo/etc/packages/autoupdate.json"); }
+
+// Whether `key` of the settings file holds `value`, ignoring case.
+bool InfoIs(const char* key, const char* value) {
+  char buf[128] = {0};
+  if (KLIBCFileGetKeyValue(KIVORootPath("/etc/kivoinfo.conf").c_str(), key, buf, sizeof(buf), 0) <=
+      0) {
+    return false;
+  }
+  return strcasecmp(buf, value) == 0;
+}
 
 bool IsIdArray(const Json::Value& ids) {
   if (!ids.isArray()) return false;
@@ -21,6 +33,11 @@ bool IsIdArray(const Json::Value& ids) {
 }
 
 }  // namespace
+
+AutoUpdateMode ReadMode() {
+  if (!InfoIs("enable_pkg_autoupdate_all", "yes")) return AutoUpdateMode::kOff;
+  return InfoIs("pkg_autoupdate_all", "no") ? AutoUpdateMode::kChosen : AutoUpdateMode::kAll;
+}
 
 bool List(Json::Value& ids) {
   ids = Json::Value(Json::arrayValue);

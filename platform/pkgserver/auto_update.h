@@ -9,6 +9,21 @@
 
 namespace KIVOPackageServer {
 
+// What the switches say. Every reader of them (the web API's settings, its
+// list and get, kivoctl auto-update) asks ReadMode, so that they agree.
+enum class AutoUpdateMode {
+  kOff,     // packages are not updated automatically
+  kAll,     // every installed package is
+  kChosen,  // the packages of the chosen list are
+};
+
+// Off unless "enable_pkg_autoupdate_all" is "yes"; when on, the chosen list
+// only when "pkg_autoupdate_all" is "no", every package otherwise (also when
+// the key is absent: Save writes both keys, and the first one alone says
+// automatic update of all packages). Both compare ignoring case; a settings
+// file that cannot be read reads as off.
+AutoUpdateMode ReadMode();
+
 // The chosen list (an empty array when none is stored). False when the
 // stored list cannot be read or is not an array of strings.
 bool List(Json::Value& ids);

@@ -19,16 +19,10 @@ namespace {
 constexpr char kInfoConf[] = "/etc/kivoinfo.conf";
 constexpr char kLanguage[] = "enu";
 
-enum class Mode { kOff, kAll, kChosen };
+using Mode = KIVOPackageServer::AutoUpdateMode;
 
 bool InfoIs(const char* key, const char* value) {
   return KLIBCFileCheckKeyValue(KIVORootPath(kInfoConf).c_str(), key, value, 0) == 1;
-}
-
-// The same reading of the switches as the settings' "get".
-Mode ReadMode() {
-  if (!InfoIs("enable_pkg_autoupdate_all", "yes")) return Mode::kOff;
-  return InfoIs("pkg_autoupdate_all", "no") ? Mode::kChosen : Mode::kAll;
 }
 
 // One outcome: a line on stdout and the same in syslog (stderr too when
@@ -187,7 +181,7 @@ int KivoctlAutoUpdate(const std::vector<std::string>& args) {
     dry_run = true;
   }
   openlog("kivoctl-auto-update", LOG_PID, LOG_USER);
-  const Mode mode = ReadMode();
+  const Mode mode = KIVOPackageServer::ReadMode();
   if (mode == Mode::kOff) {
     Report("automatic update is off", false);
     return 0;

@@ -3,8 +3,8 @@
 // line, see README.md).
 //
 // The settings say off, all installed packages, or the chosen list
-// ("enable_pkg_autoupdate_all" / "pkg_autoupdate_all" of /etc/kivoinfo.conf
-// and KIVOPackageServer::List). For each chosen installed package the newest
+// (KIVOPackageServer::ReadMode, which the web API reads them with too, and
+// KIVOPackageServer::List). For each chosen installed package the newest
 // entry of the catalogue it came from (the vendor's or its feed's, never
 // another's: package_origin.h) that is newer than the installed version is
 // taken, unless the update channel is "stable" and the entry is a beta, or
