@@ -1,6 +1,7 @@
 // Feeds (package servers the user adds beside the vendor's) and the
 // appliance's code-signing keyring.
 
+#include <chrono>
 #include <limits.h>
 #include <memory>
 #include <unistd.h>
@@ -81,13 +82,25 @@ bool HasFeed(const Json::Value& feeds, const std::string& feed) {
 }
 
 // Asks the feed for its catalogue, from the cache first and then from the
-// server; *answer gets the parsed answer. The catalogue library logs why a
-// server failed (down, slow, an error status, not JSON, not http/https).
+// server; *answer gets the parsed answer. Both asks together take at most
+// kFeedProbeSeconds: a person waits on the page for the answer. The
+// catalogue library logs why a server failed (down, slow, an error status,
+// not JSON, not http/https).
 bool ProbeFeed(const std::string& language, const std::string& feed, Json::Value* answer) {
+  using Clock = std::chrono::steady_clock;
+  const Clock::time_point deadline =
+      Clock::now() + std::chrono::seconds(KIVOPackageServer::kFeedProbeSeconds);
   for (bool force : {false, true}) {
+    const long left = static_cast<long>(
+        std::chrono::duration_cast<std::chrono::seconds>(deadline - Clock::now()).count());
+    if (left <= 0) {
+      PKG_LOG_ERR("%s did not answer within %ld seconds", feed.c_str(),
+                  KIVOPackageServer::kFeedProbeSeconds);
+      break;
+    }
     std::string text;
     if (KIVOPackageServer::PMSQueryPkgServer(language.c_str(), text, feed, force,
-                                             Json::Value(Json::objectValue)) &&
+                                             Json::Value(Json::objectValue), left) &&
         ParseDocument(text, answer)) {
       return true;
     }

@@ -2,8 +2,12 @@
 // listing, adding with probes and derived names, changing, deleting, and
 // the keys a feed publishes being kept for it and dropped with it.
 
+#include <chrono>
+#include <functional>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <thread>
+#include <unistd.h>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -16,6 +20,9 @@
 #include "testing/http_test_server.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
 
 namespace {
 
@@ -135,6 +142,64 @@ TEST_F(FeedTest, AddDerivesNamesRefusesDuplicatesAndFailedProbes) {
     EXPECT_EQ(4590, Add(Feed(url)).Code()) << url;
   }
   EXPECT_EQ(file, FeedFile());
+}
+
+// A listening socket whose connections the kernel accepts and nobody ever
+// answers: a server that is up and silent.
+class SilentServer {
+ public:
+  SilentServer() {
+    fd_ = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_in addr{};
+    addr.sin_family = AF_INET;
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t len = sizeof(addr);
+    if (fd_ >= 0 && bind(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0 &&
+        listen(fd_, 16) == 0 && getsockname(fd_, reinterpret_cast<sockaddr*>(&addr), &len) == 0) {
+      port_ = ntohs(addr.sin_port);
+    }
+  }
+  ~SilentServer() {
+    if (fd_ >= 0) close(fd_);
+  }
+  int port() const { return port_; }
+
+ private:
+  int fd_ = -1;
+  int port_ = 0;
+};
+
+// The probe is held to its own bound (10 seconds), however long the root
+// lets a catalogue take: a person waits on the page for it.
+TEST_F(FeedTest, ProbeOfASilentServerEndsWithinItsBound) {
+  ASSERT_TRUE(Add(Feed(Url("/a"))).Success());
+  const std::string file = FeedFile();
+  root_.Write("/etc/kivo/pkgserver.conf",
+              "vendor_url=\"http://127.0.0.1:1/none\"\nconnect_timeout=\"60\"\n"
+              "catalogue_timeout=\"31\"\n");
+  SilentServer silent;
+  ASSERT_NE(0, silent.port());
+  // One server that never answers, one whose answer begins and stops.
+  HttpRoute stalled;
+  stalled.body = kCatalogue;
+  stalled.hold_after = 1;
+  server_.Set("/stalled", stalled);
+  const std::string quiet = "http://127.0.0.1:" + std::to_string(silent.port()) + "/catalogue";
+  Json::Value change = Feed(quiet);
+  change["orifeed"] = Url("/a");
+  const std::vector<std::pair<std::string, std::function<CgiAnswer()>>> probes = {
+      {"add " + quiet, [&] { return Add(Feed(quiet)); }},
+      {"set " + quiet, [&] { return Set(change); }},
+      {"add /stalled", [&] { return Add(Feed(Url("/stalled"))); }}};
+  for (const auto& [what, probe] : probes) {
+    const auto start = std::chrono::steady_clock::now();
+    CgiAnswer a = probe();
+    const std::chrono::duration<double> took = std::chrono::steady_clock::now() - start;
+    EXPECT_EQ(4590, a.Code()) << what << ": " << a.body;
+    EXPECT_LT(took.count(), 30.0) << what << " (seconds)";
+  }
+  EXPECT_EQ(file, FeedFile());
+  server_.Release();
 }
 
 TEST_F(FeedTest, SetDerivesTheNameOfTheNewAddress) {

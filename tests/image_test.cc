@@ -418,6 +418,49 @@ TEST_F(ServerImageTest, ListingFetchesIconsOnlyFromTheCataloguesServers) {
   EXPECT_EQ(1, feed_.Requests("/icons/outside-1.0.png"));
 }
 
+// The page asks for the icons right after the listing answers, while the
+// listing's background child is still fetching them (the image server is
+// slow here, so the two always meet): the request waits for that fetch and
+// serves its image, and the image server is asked once, not once by the
+// child and once by the request.
+TEST_F(ServerImageTest, IconAskedRightAfterTheListingWaitsForItsFetch) {
+  Configure(true);
+  SetFeeds({feed_.Url("/catalogue.json")});
+  ApiClient client("admin", "secret");
+  for (int round = 0; round < 4; ++round) {
+    const std::string version = "1." + std::to_string(round);
+    const std::string path = "/icons/demo-" + version + ".png";
+    HttpRoute slow = Serve(Png("icon " + version));
+    slow.delay_ms = 1000;
+    feed_.Set(path, slow);
+    PublishCatalogue(feed_, {{"demo", version, feed_.Url(path)}});
+    CgiAnswer list = client.Call("KIVO.Core.Package.Server", "list", 1,
+                                 {{"blloadothers", "true"}, {"blforcereload", "true"}});
+    ASSERT_TRUE(list.Success()) << list.body;
+    ExpectImage(Icon("demo", version, feed_.Url(path)), Png("icon " + version), 2592000);
+    EXPECT_EQ(1, feed_.Requests(path)) << "round " << round;
+  }
+  // The wait is bounded: a fetch in flight that outlasts it (the root lets
+  // a fetch take longer than the server's delay) leaves the request the
+  // fallback (cached for seconds only), and the server is still asked once.
+  root_.Write("/etc/kivo/pkgserver.conf",
+              "vendor_url=\"" + vendor_.Url("/catalogue.json") +
+                  "\"\nconnect_timeout=\"2\"\ncatalogue_timeout=\"30\"\n"
+                  "allow_private_image_addresses=\"yes\"\n");
+  const std::string path = "/icons/demo-2.0.png";
+  HttpRoute slower = Serve(Png("late icon"));
+  slower.delay_ms = 8000;
+  feed_.Set(path, slower);
+  PublishCatalogue(feed_, {{"demo", "2.0", feed_.Url(path)}});
+  ASSERT_TRUE(client
+                  .Call("KIVO.Core.Package.Server", "list", 1,
+                        {{"blloadothers", "true"}, {"blforcereload", "true"}})
+                  .Success());
+  ASSERT_TRUE(Await([&] { return feed_.Requests(path) > 0; }));
+  ExpectFallback(Icon("demo", "2.0", feed_.Url(path)));
+  EXPECT_EQ(1, feed_.Requests(path));
+}
+
 // A catalogue's id or version with a NUL byte in it is no id or version:
 // it never names the image of the text before the NUL, and its icon is
 // not fetched.

@@ -128,11 +128,11 @@ bool ParseAnswer(const std::string& body, Json::Value& answer) {
   return true;
 }
 
-// Asks the server, conditionally when `cached` (read whole) is given, and
-// leaves the answer in `*cached` and the cache file.
+// Asks the server within `limits`, conditionally when `cached` (read whole)
+// is given, and leaves the answer in `*cached` and the cache file.
 bool FetchFromServer(const std::string& url, const std::string& query, const std::string& language,
-                     const PkgServerConfig& config, const std::string& path,
-                     CachedCatalogue* cached, bool have) {
+                     const HttpLimits& limits, const std::string& path, CachedCatalogue* cached,
+                     bool have) {
   std::string error;
   const PackageServerNetOps* net = PMSServerNetOps(&error);
   if (!net) {
@@ -145,7 +145,7 @@ bool FetchFromServer(const std::string& url, const std::string& query, const std
     fetch.if_none_match = cached->meta["etag"].asString();
     fetch.if_modified_since = cached->meta["last_modified"].asString();
   }
-  if (!net->fetch(config.CatalogueLimits(), fetch)) {
+  if (!net->fetch(limits, fetch)) {
     CATALOGUE_LOG("%s: %s", url.c_str(), fetch.error.c_str());
     return false;
   }
@@ -181,9 +181,10 @@ bool FetchFromServer(const std::string& url, const std::string& query, const std
 
 // The server's answer from the cache or the server into `*out`; with
 // kIfNeeded the body of a fresh cache whose meta names its digest is not
-// read.
+// read. A positive `max_seconds` holds the transfer to that many seconds in
+// all; 0 leaves it to the root's catalogue timeouts.
 bool FetchText(const std::string& url, const std::string& language, bool force,
-               const Json::Value& extra, CatalogueBody want, CatalogueText* out) {
+               const Json::Value& extra, CatalogueBody want, long max_seconds, CatalogueText* out) {
   if (!PMSIsServerUrl(url)) {
     CATALOGUE_LOG("%s: not an http or https address", url.c_str());
     return false;
@@ -202,7 +203,9 @@ bool FetchText(const std::string& url, const std::string& language, bool force,
     return true;
   }
   if (have && !cached.body_read) have = ReadCache(path, false, &cached);
-  if (!(fresh && have) && !FetchFromServer(url, query, language, config, path, &cached, have)) {
+  const HttpLimits limits =
+      max_seconds > 0 ? config.CatalogueLimitsWithin(max_seconds) : config.CatalogueLimits();
+  if (!(fresh && have) && !FetchFromServer(url, query, language, limits, path, &cached, have)) {
     return false;
   }
   if (!MetaDigest(cached.meta, &out->digest)) out->digest = PMSCatalogueDigest(cached.body);
@@ -212,9 +215,11 @@ bool FetchText(const std::string& url, const std::string& language, bool force,
 }
 
 bool FetchText(const std::string& url, const std::string& language, bool force,
-               const Json::Value& extra, std::string& body) {
+               const Json::Value& extra, long max_seconds, std::string& body) {
   CatalogueText text;
-  if (!FetchText(url, language, force, extra, CatalogueBody::kAlways, &text)) return false;
+  if (!FetchText(url, language, force, extra, CatalogueBody::kAlways, max_seconds, &text)) {
+    return false;
+  }
   body = std::move(text.body);
   return true;
 }
@@ -222,7 +227,7 @@ bool FetchText(const std::string& url, const std::string& language, bool force,
 bool QueryServer(const std::string& url, bool force, const std::string& language,
                  Json::Value& answer) {
   std::string body;
-  if (!FetchText(url, language, force, Json::Value(), body)) return false;
+  if (!FetchText(url, language, force, Json::Value(), 0, body)) return false;
   if (ParseAnswer(body, answer)) return true;
   CATALOGUE_LOG("%s: the cached answer is not a JSON catalogue", url.c_str());
   return false;
@@ -255,7 +260,7 @@ std::string PMSVendorCatalogueUrl() {
 
 bool PMSCatalogueText(const std::string& url, bool forceReload, const std::string& language,
                       CatalogueBody want, CatalogueText* text) {
-  return FetchText(url, language, forceReload, Json::Value(), want, text);
+  return FetchText(url, language, forceReload, Json::Value(), want, 0, text);
 }
 
 uint64_t PMSCatalogueDigest(std::string_view text) {
@@ -309,8 +314,8 @@ bool PMSQueryOtherPkgServer(bool forceReload, const char* language, Json::Value&
 }
 
 bool PMSQueryPkgServer(const char* language, std::string& answer, const std::string& feed,
-                       bool forceReload, const Json::Value& extra) {
-  return FetchText(feed, language ? language : "", forceReload, extra, answer);
+                       bool forceReload, const Json::Value& extra, long max_seconds) {
+  return FetchText(feed, language ? language : "", forceReload, extra, max_seconds, answer);
 }
 
 namespace {

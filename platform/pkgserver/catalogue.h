@@ -38,11 +38,17 @@ bool PMSQueryOtherPkgServer(bool forceReload, const char* language, Json::Value&
 bool PMSQueryFeedServer(const std::string& url, bool forceReload, const char* language,
                         Json::Value& entries);
 
+// How long the feed probe may take in all, connecting included, whatever
+// connect_timeout and catalogue_timeout say: a person waits on the page for
+// it (docs/feeds.md).
+inline constexpr long kFeedProbeSeconds = 10;
+
 // One server's answer as text, for the feed probe. `forceReload` bypasses
 // the cache; `extra` (an object of further query parameters) may be null or
-// empty. False when the server gave no usable answer.
+// empty. A transfer takes at most `max_seconds` (positive) in all. False
+// when the server gave no usable answer.
 bool PMSQueryPkgServer(const char* language, std::string& answer, const std::string& feed,
-                       bool forceReload, const Json::Value& extra);
+                       bool forceReload, const Json::Value& extra, long max_seconds);
 
 // The vendor's catalogue address; "" (logged) when none is configured.
 std::string PMSVendorCatalogueUrl();

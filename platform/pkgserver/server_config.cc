@@ -1,5 +1,6 @@
 #include "pkgserver/server_config.h"
 
+#include <algorithm>
 #include <cctype>
 #include <cstdlib>
 
@@ -25,6 +26,16 @@ HttpLimits PkgServerConfig::CatalogueLimits() const {
   limits.total_timeout_s = catalogue_timeout_s;
   limits.stall_timeout_s = catalogue_timeout_s;
   limits.max_bytes = catalogue_max_bytes;
+  return limits;
+}
+
+HttpLimits PkgServerConfig::CatalogueLimitsWithin(long seconds) const {
+  HttpLimits limits = CatalogueLimits();
+  limits.connect_timeout_s = std::min(limits.connect_timeout_s, seconds);
+  // A total of 0 means no bound: the cap is the bound then.
+  limits.total_timeout_s =
+      limits.total_timeout_s > 0 ? std::min(limits.total_timeout_s, seconds) : seconds;
+  limits.stall_timeout_s = std::min(limits.stall_timeout_s, seconds);
   return limits;
 }
 

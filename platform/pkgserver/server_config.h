@@ -36,6 +36,10 @@ struct PkgServerConfig {
   bool allow_private_image_addresses = false;
 
   HttpLimits CatalogueLimits() const;
+  // CatalogueLimits held to `seconds` in all, connecting included (for an
+  // answer a person waits on, whatever the root's timeouts say). `seconds`
+  // is positive.
+  HttpLimits CatalogueLimitsWithin(long seconds) const;
   // Downloads have no total bound (a large file takes long); a stall ends
   // them. `size` is the announced size (0: unknown).
   HttpLimits DownloadLimits(uint64_t size) const;

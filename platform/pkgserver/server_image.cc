@@ -1,7 +1,10 @@
 #include "pkgserver/server_image.h"
 
+#include <ctime>
 #include <fcntl.h>
 #include <string_view>
+#include <sys/file.h>
+#include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 #include <vector>
@@ -91,6 +94,82 @@ bool Fetch(const ImageRules& rules, const std::string& link, const std::string& 
   return true;
 }
 
+// One fetch of an image at a time, whoever asks for it: the fetcher holds an
+// exclusive lock on the marker "<image>.fetch" beside the image while the
+// transfer is in flight. The listing's background child fetches the icons
+// it lists, and the page asks for the same icons right after the listing
+// answers; a request that finds the fetch of its image in flight waits a
+// bounded moment for it instead of asking the server a second time. The
+// lock goes with the process that holds it, so a fetcher that dies leaves
+// no fetch in flight behind.
+class ImageFetchLock {
+ public:
+  explicit ImageFetchLock(const std::string& path) : marker_(path + ".fetch") {}
+  ~ImageFetchLock() {
+    if (fd_ < 0) return;
+    // The marker goes before the lock is released: a later request finds
+    // the image, or no fetch in flight. A waiter that took the lock of a
+    // marker already removed leaves alone the marker a later fetcher made.
+    struct stat mine, named;
+    if (held_ && fstat(fd_, &mine) == 0 && lstat(marker_.c_str(), &named) == 0 &&
+        mine.st_dev == named.st_dev && mine.st_ino == named.st_ino) {
+      unlink(marker_.c_str());
+    }
+    close(fd_);
+  }
+  ImageFetchLock(const ImageFetchLock&) = delete;
+  ImageFetchLock& operator=(const ImageFetchLock&) = delete;
+
+  // Takes the lock at once; false when another process holds it (or the
+  // marker cannot be made).
+  bool TryTake() { return Open() && (held_ = flock(fd_, LOCK_EX | LOCK_NB) == 0); }
+
+  // Takes the lock, waiting at most `wait_ms` for the fetch in flight to
+  // end. The wait polls: flock has no timeout of its own.
+  bool Take(int wait_ms) {
+    constexpr int kPollMs = 20;
+    for (int waited = 0;; waited += kPollMs) {
+      if (TryTake()) return true;
+      if (fd_ < 0 || waited >= wait_ms) return false;
+      struct timespec pause = {0, kPollMs * 1000000L};
+      nanosleep(&pause, nullptr);
+    }
+  }
+
+ private:
+  bool Open() {
+    if (fd_ >= 0) return true;
+    if (KIVOFSMkdirP(marker_.substr(0, marker_.rfind('/')).c_str()) != 0) return false;
+    fd_ = open(marker_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0644);
+    if (fd_ < 0) IMAGE_LOG("cannot open %s", marker_.c_str());
+    return fd_ >= 0;
+  }
+
+  std::string marker_;
+  int fd_ = -1;
+  bool held_ = false;
+};
+
+// How long a request waits for the fetch in flight of the image it asks
+// for: about what an image server that answers at all takes. Past it the
+// icon method answers its fallback (cached for seconds only) rather than
+// keep the page waiting.
+constexpr int kInFlightWaitMs = 5000;
+
+// The image at `path`, fetched under its lock unless the fetch in flight
+// brought it: `wait_ms` bounds the wait for that fetch (0: none; another
+// fetcher's image is then left to it).
+bool FetchOnce(const ImageRules& rules, const std::string& link, const std::string& path,
+               int wait_ms) {
+  ImageFetchLock lock(path);
+  if (wait_ms == 0 && !lock.TryTake()) return false;
+  if (wait_ms > 0 && !lock.Take(wait_ms)) {
+    IMAGE_LOG("%s: its fetch in flight did not end within %d ms", link.c_str(), wait_ms);
+    return false;
+  }
+  return access(path.c_str(), F_OK) == 0 || Fetch(rules, link, path);
+}
+
 // Fetches queued images in one detached child per process, fed through a
 // pipe: the caller never waits for a server, and the child ends when the
 // caller's end of the pipe closes and the queue is done.
@@ -133,7 +212,7 @@ class BackgroundFetcher {
       size_t tab = line.find('\t');
       if (tab == std::string::npos || line.back() != '\n') continue;
       std::string path = line.substr(tab + 1, line.size() - tab - 2);
-      if (access(path.c_str(), F_OK) != 0) Fetch(rules, line.substr(0, tab), path);
+      if (access(path.c_str(), F_OK) != 0) (void)FetchOnce(rules, line.substr(0, tab), path, 0);
     }
     _exit(0);
   }
@@ -147,7 +226,9 @@ bool PMSServerImagePath(const std::string& package, const std::string& version,
                         const std::string& link, std::string* path) {
   std::string cached = ImagePath(package, version, link);
   if (cached.empty()) return false;
-  if (access(cached.c_str(), R_OK) != 0 && !Fetch(LoadRules(), link, cached)) return false;
+  if (access(cached.c_str(), R_OK) != 0 && !FetchOnce(LoadRules(), link, cached, kInFlightWaitMs)) {
+    return false;
+  }
   *path = std::move(cached);
   return true;
 }

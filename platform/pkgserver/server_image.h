@@ -23,17 +23,22 @@
 namespace KIVOPackageTool {
 
 // The path of the image that `link` names for `package` at `version` in
-// `*path`: from the cache, else fetched now (and cached). False, with the
-// reason logged for a refused or failed fetch, when `package` is no package
-// id, `version` no version (each judged whole, a NUL included), `link` is
-// empty or the image cannot be had under the rules above.
+// `*path`: from the cache, else fetched now (and cached). One process at a
+// time fetches an image: when another one's fetch of it is in flight (the
+// listing's background child), this waits for that fetch, at most a few
+// seconds (docs/images.md), instead of asking the server again. False, with
+// the reason logged for a refused or failed fetch, when `package` is no
+// package id, `version` no version (each judged whole, a NUL included),
+// `link` is empty, the image cannot be had under the rules above, or the
+// fetch in flight outlasted the wait.
 bool PMSServerImagePath(const std::string& package, const std::string& version,
                         const std::string& link, std::string* path);
 
 // Queues the image that `link` names for `package` at `version` for a
 // fetch in the background (one detached child per process fetches them in
-// order under the rules above), unless it is cached or the names are not
-// valid; the caller never waits for a server. Best effort: an image that
+// order under the rules above, skipping an image another process is
+// fetching), unless it is cached or the names are not valid; the caller
+// never waits for a server. Best effort: an image that
 // cannot be queued is queued again by a later call.
 void PMSQueueServerImage(const std::string& package, const std::string& version,
                          const std::string& link);
