@@ -182,10 +182,11 @@ bool PackageWebAPI::ReadPackageFile(const std::string& path, PackageInfo& info, 
   bool read = wizard ? pkgMgr.queryPackageFileInfoWithWizard(path, info, PKG_OP_NONE, language)
                      : pkgMgr.queryPackageFileInfo(path, info, PKG_OP_NONE, language);
   const int code = pkgMgr.getResult();
-  // A member that does not match MANIFEST is a bad signature: when the
-  // record could still be read, the check that follows judges it like a
-  // payload changed after signing (a warning at upload, refused by a strict
-  // install).
+  // A member that does not match MANIFEST is a bad signature: the package
+  // tool still reads the record when INFO keeps its rules, and the check
+  // that follows judges it like a payload changed after signing (a warning
+  // at upload and at a download's check, refused by the install). Only a
+  // file with nothing to describe is refused here.
   if ((read || IsCodesignCode(code)) && IsPackageId(info.getId())) return true;
   Json::Value data = WithMessage(
       Json::Value(), read ? "the package id in INFO is not valid" : PMSResultText(code));
@@ -332,16 +333,12 @@ NVX::Task* PackageWebAPI::ClaimInstallTask(NVX::TaskMgr& mgr, const PackageInfo&
   return nullptr;
 }
 
-// A failed install leaves its task finished with false for the status call,
-// its data saying why.
+// A failed install leaves its task finished with false for the status call.
+// Its data stays as the install wrote it ("installing" true): the answer to
+// "install" says why it failed, and a finished task whose data still says
+// installing is one that ended without success.
 void PackageWebAPI::RecordFailure(NVX::Task& task) {
-  Json::Value data = task.getProperty("data");
-  if (!data.isObject()) data = Json::Value(Json::objectValue);
-  data["installing"] = false;
-  data["error"] = response->GetError();
-  const Json::Value& errors = response->GetData();
-  if (errors.isObject() && errors["message"].isString()) data["message"] = errors["message"];
-  if (!task.setProperty("data", data) || !task.finish(false)) {
+  if (!task.finish(false)) {
     PKG_LOG_ERR("Failed to record the end of task '%s'", task.getTaskId().c_str());
   }
 }
@@ -369,6 +366,9 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
   if (!message.empty()) result["message"] = message;
   result["worker_message"] =
       details["workerMessage"].isArray() ? details["workerMessage"] : Json::Value(Json::arrayValue);
+  // Which key signed the file and who vouched for it: the package tool's
+  // finding, never one of the package's own messages.
+  if (details["signature"].isString()) result["signature"] = details["signature"];
   if (ok) {
     if (details["installReboot"].isBool() && details["installReboot"].asBool())
       result["reboot"] = true;
@@ -421,9 +421,9 @@ void PackageWebAPI::CancelProgress() {
     response->SetError(kErrFailed, Json::Value());
     return;
   }
-  // An install under way is not cut off; one whose process is gone is
-  // over already.
-  if (data["installing"].isBool() && data["installing"].asBool() && TaskProcessAlive(data)) {
+  // An install is never cut off, and its "pid" is the request process that
+  // ran it (or ran it once): never a process to signal.
+  if (data["installing"].isBool() && data["installing"].asBool()) {
     response->SetError(kErrInstallRunning, Json::Value());
     return;
   }

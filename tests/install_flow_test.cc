@@ -483,6 +483,69 @@ TEST_F(InstallFlowTest, AnInstallWhoseProcessDiedReadsAsFailed) {
   EXPECT_TRUE(again.Success()) << again.body;
 }
 
+// Worker messages are only what the package's scripts tell the user; which
+// key signed the file comes in "signature" and in the operation's log.
+TEST_F(InstallFlowTest, WorkerMessagesAreOnlyThePackagesOwn) {
+  TestKeys keys(root_.Path("/tmp"));
+  std::string publisher = keys.Create("Publisher <p@test.invalid>");
+  keys.Trust(publisher);
+  TestPackage silent;
+  silent.id = "silent";
+  std::string silent_file = silent.Build(dir_);
+  keys.Sign(silent_file, publisher);
+  CgiAnswer quiet = Call("install", {{"path", silent_file}});
+  ASSERT_TRUE(quiet.Success()) << quiet.body;
+  ASSERT_TRUE(quiet.Data()["worker_message"].isArray()) << quiet.body;
+  EXPECT_EQ(0u, quiet.Data()["worker_message"].size()) << quiet.body;
+  const std::string note = quiet.Data()["signature"].asString();
+  EXPECT_EQ(0u, note.find("signed by key " + publisher)) << quiet.body;
+  EXPECT_NE(std::string::npos, quiet.Data()["message"].asString().find("signature: " + note))
+      << quiet.body;
+
+  TestPackage talker;
+  talker.id = "talker";
+  talker.scripts = {{"postinst", "echo 'Open port 8080' >> \"$KIVO_WORKER_MSG\"\n"}};
+  std::string talker_file = talker.Build(dir_);
+  keys.Sign(talker_file, publisher);
+  CgiAnswer told = Call("install", {{"path", talker_file}});
+  ASSERT_TRUE(told.Success()) << told.body;
+  ASSERT_EQ(1u, told.Data()["worker_message"].size()) << told.body;
+  EXPECT_EQ("Open port 8080", told.Data()["worker_message"][0].asString());
+}
+
+// A failed install keeps the record it was started with: both tasks are
+// finished with false and the install task's data still says installing,
+// so "cancel" refuses it (4506) and drops it all the same.
+TEST_F(InstallFlowTest, AFailedInstallStillSaysItWasInstalling) {
+  TestPackage failing;
+  failing.scripts = {{"preinst", "exit 1\n"}};
+  CgiAnswer up = Upload(failing.Build(dir_));
+  ASSERT_TRUE(up.Success()) << up.body;
+  const std::string upload_task = up.Data()["task_id"].asString();
+  CgiAnswer install = Call("install", {{"task_id", upload_task}});
+  ASSERT_EQ(4549, install.Code()) << install.body;
+  NVX::TaskMgr mgr("@administrators");
+  std::unique_ptr<NVX::Task> upload(GetTaskWithTaskMgr(mgr, upload_task));
+  ASSERT_TRUE(upload);
+  EXPECT_TRUE(upload->isFinished());
+  EXPECT_EQ(up.Data()["id"], upload->getProperty("data")["id"]);
+  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, "@KIVOPKG_DOWNLOAD_test-app"));
+  ASSERT_TRUE(task);
+  EXPECT_TRUE(task->isFinished());
+  const Json::Value data = task->getProperty("data");
+  EXPECT_TRUE(data["installing"].asBool()) << data.toStyledString();
+  EXPECT_EQ("installing", data["status"].asString()) << data.toStyledString();
+  EXPECT_FALSE(data.isMember("error")) << data.toStyledString();
+
+  CgiAnswer status = Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_test-app"}});
+  ASSERT_TRUE(status.Success()) << status.body;
+  EXPECT_TRUE(status.Data()["finished"].asBool()) << status.body;
+  EXPECT_TRUE(status.Data()["installing"].asBool()) << status.body;
+
+  EXPECT_EQ(4506, Call("cancel", {{"taskid", "@KIVOPKG_DOWNLOAD_test-app"}}).Code());
+  EXPECT_FALSE(mgr.hasTask("@KIVOPKG_DOWNLOAD_test-app"));
+}
+
 // Two installs of one package at once: the second is refused as busy and
 // leaves the first one's task exactly as it was.
 TEST_F(InstallFlowTest, ConcurrentInstallsOfOnePackageKeepTheFirstOnesTask) {
@@ -578,8 +641,10 @@ TEST_F(InstallFlowTest, AnUploadWhoseTaskCannotBeWrittenIsRefused) {
   TaskStoreSql("DROP TRIGGER full;");
 }
 
-// Any member changed after signing is a bad signature (4532): the payload,
-// INFO and a script alike, at upload and at a strict install.
+// Any member changed after signing is a bad signature (4532), answered one
+// way for the payload, INFO and a script alike: the upload goes on with the
+// package described and "codesign_error" 4532 for the wizard to warn, and
+// the install refuses the file, strict or confirmed.
 TEST_F(InstallFlowTest, TamperedMembersAnswerAsABadSignature) {
   TestKeys keys(root_.Path("/tmp"));
   std::string publisher = keys.Create("Publisher <p@test.invalid>");
@@ -612,10 +677,16 @@ TEST_F(InstallFlowTest, TamperedMembersAnswerAsABadSignature) {
     std::string path = dir_ + "/tampered-" + t.what + ".kpk";
     ASSERT_TRUE(KIVOWriteFileAtomic(path, changed, SyncToDisk::No));
     CgiAnswer up = Upload(path);
-    int code = up.Success() ? up.Data()["codesign_error"].asInt() : up.Code();
-    EXPECT_EQ(4532, code) << t.what << ": " << up.body;
-    CgiAnswer strict = Call("install", {{"path", path}});
+    ASSERT_TRUE(up.Success()) << t.what << ": " << up.body;
+    EXPECT_EQ(4532, up.Data()["codesign_error"].asInt()) << t.what << ": " << up.body;
+    EXPECT_EQ("test-app", up.Data()["id"].asString()) << t.what << ": " << up.body;
+    const std::string upload_task = up.Data()["task_id"].asString();
+    CgiAnswer strict = Call("install", {{"task_id", upload_task}});
     EXPECT_EQ(4532, strict.Code()) << t.what << ": " << strict.body;
+    CgiAnswer confirmed = Call("install", {{"task_id", upload_task}, {"check_codesign", "false"}});
+    EXPECT_EQ(4532, confirmed.Code()) << t.what << ": " << confirmed.body;
+    CgiAnswer by_path = Call("install", {{"path", path}});
+    EXPECT_EQ(4532, by_path.Code()) << t.what << ": " << by_path.body;
     EXPECT_FALSE(PackageRegistry::IsInstalled("test-app")) << t.what;
   }
 }

@@ -81,6 +81,20 @@ class ServerDownloadTest : public ::testing::Test {
                     .Call("KIVO.Core.Package.Server", "list", 1, {{"blforcereload", "true"}})
                     .Success());
   }
+  // Serves `body` as dl-app's file, announced by its size alone, and
+  // installs it from the catalogue until the download is done.
+  void DownloadInstead(const std::string& body) {
+    HttpRoute route;
+    route.body = body;
+    feed_.SetFileRoute("dl-app", route);
+    feed_.Entry("dl-app")["size"] = static_cast<Json::UInt64>(body.size());
+    feed_.Entry("dl-app").removeMember("md5");
+    feed_.Entry("dl-app").removeMember("sha256");
+    Republish();
+    ASSERT_TRUE(Call("install", {{"name", "dl-app"}}).Success());
+    CgiAnswer done = WaitFinished();
+    ASSERT_EQ(1.0, done.Data()["progress"].asDouble()) << done.body;
+  }
   // The package file stops halfway until server_.Release().
   void HoldHalfway() {
     HttpRoute halfway;
@@ -247,17 +261,7 @@ TEST_F(ServerDownloadTest, DownloadCheckRemovesWhatCannotBeInstalled) {
   EXPECT_EQ(4501, client().Call(kApi, "check", 1, {{"taskid", "@KIVOPKG_DOWNLOAD_none"}}).Code());
 
   // Bytes that are not a package file, announced with their own checksums.
-  const std::string junk = Noise(5000);
-  HttpRoute route;
-  route.body = junk;
-  feed_.SetFileRoute("dl-app", route);
-  feed_.Entry("dl-app")["size"] = static_cast<Json::UInt64>(junk.size());
-  feed_.Entry("dl-app").removeMember("md5");
-  feed_.Entry("dl-app").removeMember("sha256");
-  Republish();
-  ASSERT_TRUE(Call("install", {{"name", "dl-app"}}).Success());
-  CgiAnswer done = WaitFinished();
-  ASSERT_EQ(1.0, done.Data()["progress"].asDouble()) << done.body;
+  DownloadInstead(Noise(5000));
   EXPECT_EQ(4521, client().Call(kApi, "check", 1, {{"taskid", kTask}}).Code());
   EXPECT_EQ(0, DownloadFolders());
   EXPECT_EQ(4501, client().Call(kApi, "check", 1, {{"taskid", kTask}}).Code());
@@ -269,6 +273,22 @@ TEST_F(ServerDownloadTest, DownloadCheckRemovesWhatCannotBeInstalled) {
   ASSERT_TRUE(task->setProperty("data", data));
   EXPECT_EQ(4501, client().Call(kApi, "check", 1, {{"taskid", kTask}}).Code());
   EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(kTask));
+}
+
+// A downloaded file with a member changed after it was built is inspected
+// like an upload: a bad signature for the wizard to warn about (and the
+// install to refuse), not an unreadable file, whichever member it is.
+TEST_F(ServerDownloadTest, DownloadCheckAnswersAChangedMemberAsABadSignature) {
+  const char kApi[] = "KIVO.Core.Package.Installation.Download";
+  std::string changed = feed_.FileBody("dl-app");
+  const size_t version = changed.find("version=\"1.0\"");
+  ASSERT_NE(std::string::npos, version);
+  changed[version + 9] = '2';  // INFO now says 2.0; MANIFEST still names 1.0's digest
+  DownloadInstead(changed);
+  CgiAnswer check = client().Call(kApi, "check", 1, {{"taskid", kTask}});
+  ASSERT_TRUE(check.Success()) << check.body;
+  EXPECT_EQ(4532, check.Data()["codesign_error"].asInt()) << check.body;
+  EXPECT_EQ(1, DownloadFolders());  // kept for the install, which refuses it
 }
 
 }  // namespace

@@ -422,30 +422,32 @@ int Installer::Run() {
 void Installer::Report() {
   if (!id_.empty()) PMSClearProgress(id_);
   if (!op_) return;
+  // Worker messages are only what the package's scripts told the user; the
+  // signature's outcome has a member of its own (and a line in the log).
   (*details_)["workerMessage"] = op_->WorkerMessages();
-  if (!signature_note_.empty()) {
-    (*details_)["signature"] = signature_note_;
-    (*details_)["workerMessage"].append("signature: " + signature_note_);
-  }
+  if (!signature_note_.empty()) (*details_)["signature"] = signature_note_;
   std::string log = PMSReadPackageLog(op_->log_path());
   if (!log.empty()) *message_ += (message_->empty() ? "" : "\n") + log;
   unlink(op_->log_path().c_str());
 }
 
 // The record of a package file; with the wizard, the install wizard (or the
-// upgrade wizard when the package is installed) in `language`.
+// upgrade wizard when the package is installed) in `language`. A file with a
+// member that does not match MANIFEST is still described when its INFO could
+// be read, with 289 as the result: the signature check judges it.
 int QueryFile(const std::string& path, PackageInfo& info, bool with_wizard, const char* language) {
   PackageFileReader reader;
   std::string error;
   int result = reader.Open(path, &error);
-  if (result != PKG_OK) return result;
+  const bool describable = result == PKG_ERR_BAD_SIGNATURE && !reader.header().info.empty();
+  if (result != PKG_OK && !describable) return result;
   PKG_INSTALLATION_TYPE wizard = PKG_OP_NONE;
   if (with_wizard) {
     bool installed = PackageRegistry::IsInstalled(PackageInfo(reader.header().info).getId());
     wizard = installed ? PKG_OP_UPGRADE : PKG_OP_INSTALL;
   }
   InfoFromHeader(path, reader.header(), wizard, language, &info);
-  return PKG_OK;
+  return result;
 }
 
 // A package file whose whole payload passed the check is remembered by

@@ -445,7 +445,16 @@ int PackageFileReader::Open(const std::string& path, std::string* error) {
   int code = ReadHeaderMembers(error);
   if (code != PKG_OK) return code;
   if (header_.manifest.empty()) return Fail(error, PKG_ERR_NOT_PACKAGE_FILE, "no MANIFEST member");
-  if ((code = VerifyManifest(error)) != PKG_OK) return code;
+  if ((code = VerifyManifest(error)) != PKG_OK) {
+    // Still describe the file whose members were changed after signing, so
+    // that it is answered like any other bad signature (a warning with the
+    // package's description, then a refused install). INFO keeps its rules:
+    // one that breaks them is left empty.
+    std::string ignored;
+    if (code == PKG_ERR_BAD_SIGNATURE && ReadInfo(&ignored) != PKG_OK) header_.info.clear();
+    at_payload_ = false;
+    return code;
+  }
   return ReadInfo(error);
 }
 

@@ -49,7 +49,10 @@ class PackageFileReader {
   //        is missing, or one it does not list
   //   293  a newer format
   // The digests are compared before INFO is judged, so a member changed
-  // after signing is 289 whatever it now says.
+  // after signing is 289 whatever it now says. After a 289, header() still
+  // holds the members as read and INFO when it passes its rules (else an
+  // empty INFO), so that the file can be described while it is refused;
+  // none of it is vouched for, and the payload is not to be read.
   [[nodiscard]] int Open(const std::string& path, std::string* error);
   const PackageFileHeader& header() const { return header_; }
 

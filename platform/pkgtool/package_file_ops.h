@@ -17,7 +17,8 @@
 // The table libkivo_pkgfile.so exports as KivoPackageFileOps().
 struct PackageFileOps {
   // queryPackageFileInfo(WithWizard): reads a package file's record. Returns
-  // the result code.
+  // the result code; 289 (a member does not match MANIFEST) still fills
+  // `info` when INFO could be read.
   int (*query)(const std::string& path, PackageInfo& info, bool with_wizard, const char* language);
   bool (*check)(const char* language, const std::string& path, std::string& message,
                 PKG_ERRCODE& code, Json::Value& details, PackageInfo& info);

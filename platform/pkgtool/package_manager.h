@@ -57,7 +57,9 @@ class PackageManager {
     return getPackageInfo(id, info);
   }
   // Reads a package file's INFO (and with the wizard, its install or
-  // upgrade wizard in `language`). False with 261 when it is not one.
+  // upgrade wizard in `language`). False with 261 when it is not one; false
+  // with 289 when a member does not match MANIFEST, `info` then filled all
+  // the same when INFO could be read (getResult() says which).
   [[nodiscard]] bool queryPackageFileInfo(const std::string& path, PackageInfo& info,
                                           PKG_INSTALLATION_TYPE type, const char* language);
   [[nodiscard]] bool queryPackageFileInfoWithWizard(const std::string& path, PackageInfo& info,

@@ -26,10 +26,13 @@ export interface TaskData {
   blqinst?: boolean;
   progress?: number | string;
   size?: number;
-  // A download's failure is {code, message}; a failed install from a file
-  // records the API code alone with the package tool's words in "message".
-  // A failed install from a package server adds the package tool's code
-  // ("result").
+  // A download's failure is {code, message}; a failed install from a package
+  // server adds the package tool's code ("result"). A job whose process died
+  // reads as failed with the API code alone and the reason in "message". A
+  // failed install from a file keeps its data as it started ("installing"
+  // true): its task is finished, or no longer installing in the catalogue,
+  // while its status still says installing (the install's own answer says
+  // why).
   error?: { code?: number; message?: string; result?: number } | number;
   message?: string;
   signature?: string;
@@ -67,7 +70,16 @@ export function taskFailure(data: TaskData): string | null {
     const summary = known ?? `The download failed (error ${error.code ?? 'unknown'}).`;
     return error.message ? `${summary} ${error.message}` : summary;
   }
+  if (installEndedUnfinished(data)) return 'The install did not complete.';
   return data.status === 'failed' ? 'The download failed.' : null;
+}
+
+// An install from a file that ended without success: a successful one
+// removes its task, so a task whose status still says installing is over
+// only when it failed.
+function installEndedUnfinished(data: TaskData): boolean {
+  const installStatus = data.status === 'installing' || data.status === 'upgrading';
+  return installStatus && !data.blqinst && (data.finished === true || data.installing === false);
 }
 
 export function taskEnd(data: TaskData): TaskEnd {
