@@ -6,6 +6,7 @@
 #include <cstdlib>
 #include <memory>
 
+#include "package_status.h"
 #include "package_webapi.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/result_codes.h"
@@ -20,37 +21,6 @@ using PackageUtils::kInstallingProgress;
 using PackageUtils::kStatus;
 using PackageUtils::kUninstallPages;
 using PackageUtils::kUrl;
-
-// "nas.local:5000" -> "nas.local"; "[::1]:5000" -> "[::1]". At most 255 bytes.
-std::string RequestHost() {
-  const char* env = getenv("HTTP_HOST");
-  std::string host = env ? std::string(env).substr(0, 255) : "";
-  size_t colon = host.rfind(':');
-  if (colon != std::string::npos && host.find(']', colon) == std::string::npos) host.resize(colon);
-  return host;
-}
-
-// The status the package tool's last result gives a package that does not run.
-const char* StoppedStatus(int result) {
-  switch (result) {
-    case PKG_ERR_NOT_INSTALLED:
-      return "non_installed";
-    case PKG_ERR_STATUS_UNKNOWN:
-    case PKG_ERR_REGISTRY:
-      return "NA";
-    case PKG_ERR_SIGNATURE_UNCHECKABLE:
-    case PKG_ERR_BROKEN:
-      return "broken";
-    case PKG_ERR_VERSION_LIMIT:
-      return "version_limit";
-    case PKG_ERR_BUILTIN:
-      return "builtin";
-    case PKG_ERR_NOT_SUPPORTED:
-      return "non_support";
-    default:
-      return "stop";
-  }
-}
 
 // The "data" of task `prefix`+id when a living process runs it. Null when
 // there is no such live task. A task whose process is gone is stale: an

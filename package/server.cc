@@ -14,6 +14,7 @@
 
 #include "klibc/json_text.h"
 #include "log_line.h"
+#include "package_status.h"
 #include "package_webapi.h"
 #include "pkgserver/badge.h"
 #include "pkgserver/catalogue_listing.h"
@@ -36,39 +37,13 @@ bool FlagParam(APIRequest* request, const char* name) {
 
 bool IsTrue(const Json::Value& v) { return v.isBool() && v.asBool(); }
 
-// The status of an installed package that does not run, from the package
-// tool's reason.
-const char* NotRunningStatus(int result) {
-  switch (result) {
-    case 255:
-      return "non_installed";
-    case 256:
-    case 263:
-      return "NA";
-    case 150:
-    case 258:
-      return "broken";
-    case 259:
-      return "version_limit";
-    default:
-      return "stop";
-  }
-}
-
-// "nas.local:5000" -> "nas.local": the browser's port is not the package's.
-std::string HostWithoutPort() {
-  const char* env = getenv("HTTP_HOST");
-  std::string host = env ? std::string(env).substr(0, 255) : "";
-  return host.substr(0, host.find(':'));
-}
-
 // The addresses of a running package's own web interface, null when it has
 // neither port nor path.
 Json::Value PackageUrls(const PackageInfo& p) {
   int port = p.getAdminPort();
   std::string path = p.get("adminurl");
   if (port == 0 && path.empty()) return Json::Value();
-  std::string base = HostWithoutPort();
+  std::string base = RequestHost();
   if (port != 0) base += ":" + std::to_string(port);
   if (!path.empty()) base += (path[0] == '/' ? "" : "/") + path;
   Json::Value urls(Json::arrayValue);
@@ -295,7 +270,7 @@ bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const std::set<std::str
     Json::Value urls = PackageUrls(p);
     if (!urls.isNull()) entry["url"] = urls;
   } else {
-    entry["status"] = NotRunningStatus(pkgMgr.getResult());
+    entry["status"] = StoppedStatus(pkgMgr.getResult());
   }
   return false;
 }

@@ -110,6 +110,16 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
   EXPECT_EQ("running", ea["status"].asString());
   ASSERT_EQ(1u, ea["url"].size()) << ea.toStyledString();
   EXPECT_EQ("https://nas.example:8123/ui", ea["url"][0].asString());
+  // Reached over IPv6, the package's address keeps the bracketed host.
+  const std::string body = EncodeForm(
+      {{"api", kServer}, {"method", "list"}, {"version", "1"}, {"_sid", client().sid()}});
+  CgiAnswer over_ipv6 = RunEntryCgi({{"REQUEST_METHOD", "POST"},
+                                     {"CONTENT_TYPE", "application/x-www-form-urlencoded"},
+                                     {"CONTENT_LENGTH", std::to_string(body.size())},
+                                     {"HTTP_HOST", "[::1]:5000"}},
+                                    body);
+  ASSERT_TRUE(over_ipv6.Success()) << over_ipv6.body;
+  EXPECT_EQ("https://[::1]:8123/ui", Find(over_ipv6, "app-a")["url"][0].asString());
   EXPECT_FALSE(eb["blupgrade"].asBool());
   EXPECT_FALSE(eb.isMember("status"));
   EXPECT_TRUE(eb["beta"].asBool());
