@@ -274,6 +274,19 @@ std::string ScgiPostHead(const TempRoot& root, const std::string& module_dir, si
   return std::to_string(pairs.size()) + ":" + pairs + ",";
 }
 
+// Connects to kivo-webd's socket as lighttpd does and sends the head of an
+// urlencoded POST of `length` bytes; the connection, or -1 (a failure
+// recorded) when it cannot be made.
+int SendPostHead(const TempRoot& root, const WebServer& server, const std::string& module_dir,
+                 size_t length) {
+  int fd = ConnectToWebd(root, server);
+  EXPECT_GE(fd, 0);
+  if (fd < 0) return -1;
+  std::string head = ScgiPostHead(root, module_dir, length);
+  EXPECT_EQ(static_cast<ssize_t>(head.size()), send(fd, head.data(), head.size(), MSG_NOSIGNAL));
+  return fd;
+}
+
 // A client that sends its head and part of a small body: the parent reads
 // that body and spends no request process on it until it is whole or its
 // deadline passes; then a process answers that the body was cut short.
@@ -284,10 +297,8 @@ TEST_F(ScgiTest, AClientThatNeverSendsItsBodyHoldsNoProcessAndIsAnsweredAtItsDea
   options.max_children = 1;
   WebServer server(root_.dir(), options);
   ASSERT_TRUE(server.running());
-  int fd = ConnectToWebd(root_, server);
+  int fd = SendPostHead(root_, server, options.module_dir, 100);
   ASSERT_GE(fd, 0);
-  std::string head = ScgiPostHead(root_, options.module_dir, 100);
-  ASSERT_EQ(static_cast<ssize_t>(head.size()), send(fd, head.data(), head.size(), MSG_NOSIGNAL));
   // The rest of the request, 8 bytes of the 100, and the wait for the answer.
   std::atomic<bool> slow_answered{false};
   std::string slow_answer;
@@ -314,10 +325,8 @@ TEST_F(ScgiTest, ALargeBodyThatTricklesInEndsAtItsDeadline) {
   options.read_timeout_seconds = 1;
   WebServer server(root_.dir(), options);
   ASSERT_TRUE(server.running());
-  int fd = ConnectToWebd(root_, server);
+  int fd = SendPostHead(root_, server, options.module_dir, 70000);
   ASSERT_GE(fd, 0);
-  std::string head = ScgiPostHead(root_, options.module_dir, 70000);
-  ASSERT_EQ(static_cast<ssize_t>(head.size()), send(fd, head.data(), head.size(), MSG_NOSIGNAL));
   bool answered = false;
   for (int i = 0; i < 100 && !answered; ++i) {  // 20 s at most
     pollfd p{fd, POLLIN, 0};
