@@ -19,6 +19,7 @@
 #include "host/module_table.h"
 #include "host/multipart/multipart_source.h"
 #include "host/session_store.h"
+#include "webapi/api_names.h"
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
 #include "webapi/api_upload.h"
@@ -34,9 +35,9 @@ Json::Value Reason(const std::string& reason) {
 // Methods that browsers load by URL (images, the inline-frame page) cannot
 // send the token header; they answer only images and a blank page.
 bool IsLoadedByURL(const std::string& api, const std::string& method) {
-  static const char* const kAPIs[] = {
-      "KIVO.Core.Package.Thumb", "KIVO.Core.Package.Thumb.Server", "KIVO.Core.Package.Screenshot",
-      "KIVO.Core.Package.Screenshot.Server", "KIVO.Core.Package.FakeIFrame"};
+  static const char* const kAPIs[] = {WebAPIName::kThumb, WebAPIName::kServerThumb,
+                                      WebAPIName::kScreenshot, WebAPIName::kServerScreenshot,
+                                      WebAPIName::kFakeIFrame};
   if (method != "get") return false;
   for (const char* a : kAPIs) {
     if (api == a) return true;
@@ -141,7 +142,7 @@ void Serve(const RequestClock& clock, APIRequest* request, APIResponse* response
   request->SetUILanguage(UILanguage(cgi.accept_language));
   if (IsHostAPI(request->GetAPIClass())) {
     std::unique_ptr<ModuleTable> modules;
-    if (request->GetAPIClass() == "KIVO.API.Info")
+    if (request->GetAPIClass() == WebAPIName::kInfo)
       modules.reset(new ModuleTable(DefaultModuleDir()));
     return RunHostAPI(cgi, request, modules.get(), response);
   }

@@ -7,12 +7,14 @@
 #include "host/host_config.h"
 #include "host/login_throttle.h"
 #include "host/user_settings_api.h"
+#include "webapi/api_names.h"
 #include "webapi/web_man.h"
 
 namespace {
 
-constexpr char kInfoAPI[] = "KIVO.API.Info";
-constexpr char kAuthAPI[] = "KIVO.API.Auth";
+using WebAPIName::kAuth;
+using WebAPIName::kInfo;
+using WebAPIName::kUserSettings;
 constexpr char kAdminGroup[] = "administrators";
 
 Json::Value Reason(const std::string& reason) {
@@ -30,9 +32,9 @@ void AddRange(Json::Value* out, const std::string& api, int min, int max) {
 
 void InfoQuery(const ModuleTable& modules, APIResponse* response) {
   Json::Value data(Json::objectValue);
-  AddRange(&data, kInfoAPI, 1, 1);
-  AddRange(&data, kAuthAPI, 1, 1);
-  AddRange(&data, kUserSettingsAPI, 1, 1);
+  AddRange(&data, kInfo, 1, 1);
+  AddRange(&data, kAuth, 1, 1);
+  AddRange(&data, kUserSettings, 1, 1);
   for (const APIVersionRange& r : modules.Versions())
     AddRange(&data, r.api, r.min_version, r.max_version);
   response->SetSuccess(data);
@@ -222,7 +224,7 @@ void SessionQuery(const CgiRequest& cgi, APIResponse* response) {
 // bare 404 of its own, which hides that the page exists; a JSON refusal here
 // would tell. So the host only tells the page's session object who calls.
 bool IsSelfGuarded(const APIRequest& request) {
-  return request.GetAPIClass() == "KIVO.Core.Package.FakeIFrame" && request.GetAPIMethod() == "get";
+  return request.GetAPIClass() == WebAPIName::kFakeIFrame && request.GetAPIMethod() == "get";
 }
 
 // Hands the caller of a self-guarded method, if any session is valid, to the
@@ -241,24 +243,23 @@ void HandOverCaller(const CgiRequest& cgi, APIRequest* request) {
 }  // namespace
 
 bool IsHostAPI(const std::string& api) {
-  return api == kInfoAPI || api == kAuthAPI || api == kUserSettingsAPI;
+  return api == kInfo || api == kAuth || api == kUserSettings;
 }
 
 void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* modules,
                 APIResponse* response) {
   const std::string& api = request->GetAPIClass();
   const std::string& method = request->GetAPIMethod();
-  bool known =
-      (api == kInfoAPI && method == "query") ||
-      (api == kAuthAPI && (method == "login" || method == "logout" || method == "session")) ||
-      (api == kUserSettingsAPI && method == "set");
+  bool known = (api == kInfo && method == "query") ||
+               (api == kAuth && (method == "login" || method == "logout" || method == "session")) ||
+               (api == kUserSettings && method == "set");
   if (!known) {
     response->SetError(kErrNoSuchMethod);
   } else if (request->GetAPIVersion() != 1) {
     response->SetError(kErrBadVersion);
-  } else if (api == kInfoAPI) {
+  } else if (api == kInfo) {
     InfoQuery(*modules, response);
-  } else if (api == kUserSettingsAPI) {
+  } else if (api == kUserSettings) {
     UserSettings(cgi, *request, response);
   } else if (method == "login") {
     Login(cgi, *request, response);

@@ -16,20 +16,13 @@
 #include "host/cgi_request.h"
 #include "host/module_table.h"
 #include "host/session_store.h"
+#include "webapi/api_codes.h"
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
 
-// Host error codes.
+// The sign-in's own error codes; the codes every API shares are those of
+// webapi/api_codes.h.
 enum HostError {
-  kErrUnknown = 100,
-  kErrBadRequest = 101,  // no api, method or version, or a malformed request
-  kErrNoSuchAPI = 102,
-  kErrNoSuchMethod = 103,
-  kErrBadVersion = 104,
-  kErrNotPermitted = 105,
-  kErrSessionExpired = 106,
-  kErrNotSignedIn = 119,
-  kErrParameter = 120,
   kErrWrongPassword = 400,
   kErrSignInThrottled = 407,  // too many failed sign-ins; "retry_after" seconds
 };

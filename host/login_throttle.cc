@@ -7,11 +7,11 @@
 #include <syslog.h>
 
 #include <json/value.h>
-#include <json/writer.h>
 
 #include "accounts/accounts.h"
 #include "klibc/atomic_file.h"
 #include "klibc/file_lock.h"
+#include "klibc/json_text.h"
 #include "klibc/sysroot.h"
 #include "settings/web_utils.h"
 
@@ -113,11 +113,9 @@ class ThrottleState {
   }
 
   bool Save(const std::string& path) const {
-    Json::StreamWriterBuilder builder;
-    builder["indentation"] = "";
     // The file lives in the run folder and is rebuilt by failures alone, so
     // it is not worth a sync to disk at every sign-in.
-    return KIVOWriteFileAtomic(path, Json::writeString(builder, state_), SyncToDisk::No, 0600);
+    return KIVOWriteFileAtomic(path, KIVOWriteJson(state_), SyncToDisk::No, 0600);
   }
 
   // Milliseconds until `address` and `account` may be tried; 0 when now.

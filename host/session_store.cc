@@ -4,7 +4,6 @@
 #include <cstdlib>
 #include <dirent.h>
 #include <fcntl.h>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 #include <utility>
@@ -12,6 +11,7 @@
 
 #include "klibc/atomic_file.h"
 #include "klibc/file_lock.h"
+#include "klibc/hex.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
 
@@ -28,25 +28,13 @@ constexpr char kLockName[] = ".lock";
 // requests only read.
 constexpr long kTouchInterval = 30;
 
-bool RandomHex(size_t bytes, std::string* out) {
-  unsigned char buf[32];
-  if (bytes > sizeof(buf) || getrandom(buf, bytes, 0) != static_cast<ssize_t>(bytes)) return false;
-  static const char kHex[] = "0123456789abcdef";
-  out->clear();
-  for (size_t i = 0; i < bytes; ++i) {
-    *out += kHex[buf[i] >> 4];
-    *out += kHex[buf[i] & 15];
-  }
-  return true;
-}
-
 }  // namespace
 
 SessionStore::SessionStore(SessionLimits limits)
     : limits_(limits), dir_(KIVORootPath("/run/kivo/sessions")) {}
 
 bool SessionStore::IsWellFormedId(const std::string& id) {
-  return id.size() == 2 * kIdBytes && id.find_first_not_of("0123456789abcdef") == std::string::npos;
+  return id.size() == 2 * kIdBytes && KIVOIsLowerHex(id);
 }
 
 std::string SessionStore::PathOf(const std::string& id) const { return dir_ + "/" + id; }
@@ -89,7 +77,7 @@ void SessionStore::EndOldestOf(const std::string& user) {
 
 bool SessionStore::Create(const std::string& user, Session* out) {
   RemoveExpired();
-  if (!RandomHex(kIdBytes, &out->id) || !RandomHex(kIdBytes, &out->token)) return false;
+  if (!KIVORandomHex(kIdBytes, &out->id) || !KIVORandomHex(kIdBytes, &out->token)) return false;
   out->user = user;
   if (KIVOFSMkdirP(dir_.c_str(), 0700) != 0) return false;
   FileLock lock(dir_ + "/" + kLockName);

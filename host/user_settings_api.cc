@@ -2,12 +2,9 @@
 
 #include <syslog.h>
 
-#include <json/writer.h>
-
 #include "host/host_api.h"
+#include "klibc/json_text.h"
 #include "settings/kivo_settings.h"
-
-const char kUserSettingsAPI[] = "KIVO.API.UserSettings";
 
 namespace {
 
@@ -33,11 +30,7 @@ void ParameterError(const char* name, const char* reason, APIResponse* response)
   response->SetError(kErrParameter, data);
 }
 
-size_t SerializedSize(const Json::Value& value) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "";
-  return Json::writeString(builder, value).size();
-}
+size_t SerializedSize(const Json::Value& value) { return KIVOWriteJson(value).size(); }
 
 }  // namespace
 

@@ -17,8 +17,6 @@
 #include "webapi/api_request.h"
 #include "webapi/api_response.h"
 
-extern const char kUserSettingsAPI[];
-
 // Answers "set" for `account` (the caller's session), or 120 for a bad
 // parameter, or 100 when the document cannot be read or written.
 void UserSettingsSet(const APIRequest& request, const std::string& account, APIResponse* response);

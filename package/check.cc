@@ -37,8 +37,9 @@ bool RunCheck(int type, int check_type, const std::string& packages, Json::Value
 }  // namespace
 
 void PackageWebAPI::FeasibilityCheck() {
-  std::map<std::string, int> types = {
-      {"install_check", 0x0E}, {"uninstall_check", 0x0F}, {"stop_check", 0x10}};
+  std::map<std::string, int> types = {{"install_check", KIVO_FEASIBILITY_INSTALL},
+                                      {"uninstall_check", KIVO_FEASIBILITY_UNINSTALL},
+                                      {"stop_check", KIVO_FEASIBILITY_STOP}};
   const std::string type = request->GetParam("type", "").asString();
   const Json::Value packages = request->GetParam("packages", Json::Value(Json::arrayValue));
   // The names go to the library as one comma-joined C string: each is a
@@ -52,7 +53,7 @@ void PackageWebAPI::FeasibilityCheck() {
   const struct {
     int check_type;
     const char* name;
-  } kChecks[] = {{1, "hard"}, {2, "soft"}};
+  } kChecks[] = {{KIVO_FEASIBILITY_HARD, "hard"}, {KIVO_FEASIBILITY_SOFT, "soft"}};
   for (const auto& check : kChecks) {
     Json::Value reasons(Json::arrayValue);
     // An unknown name maps to 0, which the library answers for itself.

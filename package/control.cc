@@ -1,4 +1,6 @@
-// Starting and stopping packages, one or a batch in dependency order.
+// The web API's start and stop (KIVO.Core.Package.Control; the package
+// tool's own is platform/pkgtool/control.cc): one package or a batch, in
+// dependency order.
 
 #include <algorithm>
 #include <unistd.h>

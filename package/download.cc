@@ -1,6 +1,7 @@
-// Downloads from a package server: the download task and its worker, the
-// check of a downloaded file, and the status of a running install or
-// download.
+// The web API's side of downloads from a package server (the transfer
+// itself is platform/pkgserver/download.cc): the download task and its
+// worker, the check of a downloaded file, and the status of a running
+// install or download.
 
 #include "pkgserver/download.h"
 
@@ -98,22 +99,12 @@ uint64_t SizeParam(const Json::Value& v) {
   return size > 0 ? static_cast<uint64_t>(size) : 0;
 }
 
-// The API error for the platform's last error after a failed download start.
-int DownloadStartError(int last_error) {
-  switch (last_error) {
-    case KLIBC_ERR_NO_SPACE:
-      return kErrNoSpace;
-    case KLIBC_ERR_LOCK:
-      return kErrBusy;
-    case KLIBC_ERR_VOLUME_CRASHED:
-    case KLIBC_ERR_VOLUME_NOT_FOUND:
-      return kErrNoVolume;
-    case KLIBC_ERR_NO_TMP_DIR:
-      return kErrNoTmpDir;
-    default:
-      return kErrFailed;
-  }
-}
+// The answers for the platform's last error after a failed download start.
+constexpr ToolCodeMapping kDownloadStartErrors[] = {
+    {KLIBC_ERR_NO_SPACE, kErrNoSpace},        {KLIBC_ERR_LOCK, kErrBusy},
+    {KLIBC_ERR_VOLUME_CRASHED, kErrNoVolume}, {KLIBC_ERR_VOLUME_NOT_FOUND, kErrNoVolume},
+    {KLIBC_ERR_NO_TMP_DIR, kErrNoTmpDir},
+};
 
 // A worker that outlives the request lets go of the request's pipes, or the
 // web server would keep the request open until the download ends.
@@ -121,6 +112,17 @@ void DetachFromRequest() {
   int null = open("/dev/null", O_RDWR | O_CLOEXEC);
   for (int fd = 0; fd < 3; ++fd) dup2(null, fd);
   if (null > 2) close(null);
+}
+
+// Removes the download folder of the task `task_id` that a new download is
+// about to replace (the task itself is replaced with it).
+void RemoveReplacedDownload(NVX::TaskMgr& mgr, const std::string& task_id) {
+  std::unique_ptr<NVX::Task> earlier(mgr.getTask(task_id));
+  const Json::Value data = earlier ? earlier->getProperty("data") : Json::Value();
+  if (data.isObject() && data["tmp_folder"].isString() &&
+      !KIVOPackageServer::PMSRemoveDownloadDir(data["tmp_folder"].asString())) {
+    PKG_LOG_ERR("Failed to remove the replaced download folder of '%s'", task_id.c_str());
+  }
 }
 
 }  // namespace
@@ -149,7 +151,7 @@ bool PackageWebAPI::DeterminePackageInfo(DownloadRequest& d) const {
   PackageInfo installed;
   PackageManager manager;
   if (manager.getInstallPackageInfo(d.name, installed) &&
-      (manager.getPkgRoughStatus(d.name) & 4) != 0 &&
+      (manager.getPkgRoughStatus(d.name) & PackageManager::kRoughBroken) != 0 &&
       PMSThirdPartyCheckLimit(d.name, installed.getVersion()) == 0 &&
       KIVOPackageServer::PMSGetPkgFromServer(request->GetUILanguage(), installed)) {
     d.link = installed.get("link");
@@ -209,6 +211,11 @@ bool PackageWebAPI::DownloadAndInstallPackage(const DownloadRequest& d, Json::Va
     }
     if (running) DropTask(*running);
   }
+  // A download this one replaces (a finished one, its file kept for the
+  // wizard) goes with its file here, so that the install after the wizard
+  // is one request: a page that goes away between two requests would leave
+  // the file dropped and nothing installed.
+  RemoveReplacedDownload(mgr, task_id);
   std::string folder;
   if (!PMSCreateDownloadTmpDir(d.volume, d.name, static_cast<int64_t>(d.size), folder))
     return false;
@@ -248,7 +255,7 @@ void PackageWebAPI::Download() {
     response->SetSuccess(result);
     return;
   }
-  response->SetError(DownloadStartError(KLIBCErrGet()), Json::Value());
+  response->SetError(MapToolCode(kDownloadStartErrors, KLIBCErrGet()), Json::Value());
 }
 
 void PackageWebAPI::CheckDownloadPkgInfo() {

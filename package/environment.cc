@@ -10,7 +10,9 @@
 #include "package_webapi.h"
 #include "pkgtool/pms.h"
 #include "request_values.h"
-#include "storage/storage_config.h"
+#include "storage/device_info.h"
+#include "storage/volume_list.h"
+#include "storage/volume_lookup.h"
 #include "webapi/upload_area.h"
 
 namespace KIVO_PACKAGE {

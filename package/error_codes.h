@@ -66,14 +66,16 @@ enum ApiError : int {
   kErrKeyringUnwritable = 4595,  // the appliance keyring cannot be written
 };
 
-// One row of a table that maps a package-tool result code onto an answer.
+// One row of a table that maps a code of something the module calls onto
+// an answer: a package-tool result (PKG_ERR_*), the platform's last error
+// (KLIBC_ERR_*), the code-signing script's exit status.
 struct ToolCodeMapping {
-  int tool;   // PKG_ERR_*
+  int tool;
   int error;  // ApiError
 };
 
-// The answer for `tool` in `table` (ended by a row with tool 0), or
-// kErrFailed when the table has no row for it.
+// The answer for `tool` in `table`, or kErrFailed when the table has no row
+// for it.
 template <size_t N>
 int MapToolCode(const ToolCodeMapping (&table)[N], int tool) {
   for (const ToolCodeMapping& row : table) {

@@ -139,6 +139,16 @@ constexpr char kPhpOptions[] = "-dopen_basedir=/";
 // The code-signing script under the root.
 std::string CodesignScript() { return KIVORootPath("/usr/kivo/bin/codesign.php"); }
 
+// The code-signing script's exit statuses (docs/feeds.md).
+enum CodesignExit : int {
+  kCodesignDone = 0,
+  kCodesignUnreadable = 1,  // the file cannot be read (import), or no such key (delete)
+  kCodesignNotPublicKey = 2,
+  kCodesignSecretKey = 3,
+  kCodesignKeyringUnwritable = 4,
+};
+
+// The script's exit status for `action` on `argument`.
 int RunCodesign(const char* action, const std::string& argument) {
   const std::string script = CodesignScript();
   return KLIBCExec(kPhp, kPhpOptions, script.c_str(), action, argument.c_str());
@@ -163,22 +173,13 @@ bool IsHostTmpFile(const std::string& path) {
          slash + 1 < path.size();
 }
 
-int ImportAnswer(int status) {
-  switch (status) {
-    case 0:
-      return 0;
-    case 1:
-      return kErrKeyUnreadable;
-    case 2:
-      return kErrKeyNotPublic;
-    case 3:
-      return kErrKeySecret;
-    case 4:
-      return kErrKeyringUnwritable;
-    default:
-      return kErrFailed;
-  }
-}
+// The answers for an import that did not end with kCodesignDone.
+constexpr ToolCodeMapping kImportErrors[] = {
+    {kCodesignUnreadable, kErrKeyUnreadable},
+    {kCodesignNotPublicKey, kErrKeyNotPublic},
+    {kCodesignSecretKey, kErrKeySecret},
+    {kCodesignKeyringUnwritable, kErrKeyringUnwritable},
+};
 
 }  // namespace
 
@@ -188,12 +189,13 @@ void PackageWebAPI::AddKeyring() {
     PKG_LOG_ERR("[%s] is not an uploaded key file", path.c_str());
     return response->SetError(kErrKeyUnreadable, Json::Value());
   }
-  const int answer = ImportAnswer(RunCodesign("--import", path));
+  const int status = RunCodesign("--import", path);
   // The key file is the upload's alone: it goes whatever the outcome.
   if (KLIBCFileExist(path.c_str()) && unlink(path.c_str()) != 0) {
     PKG_LOG_ERR("Fail to remove %s, %m", path.c_str());
   }
-  if (answer != 0) return response->SetError(answer, Json::Value());
+  if (status != kCodesignDone)
+    return response->SetError(MapToolCode(kImportErrors, status), Json::Value());
   response->SetSuccess(Json::Value());
 }
 
@@ -225,7 +227,7 @@ void PackageWebAPI::DelKeyring() {
   if (!ReadFeedRequest(&fingerprints)) return;
   for (const Json::Value& fpr : fingerprints) {
     const std::string text = fpr.isString() ? fpr.asString() : "";
-    if (!HasNoNul(text) || text.empty() || RunCodesign("--delete", text) != 0) {
+    if (!HasNoNul(text) || text.empty() || RunCodesign("--delete", text) != kCodesignDone) {
       PKG_LOG_ERR("Delete Keyring failed. fpr=[%s]", text.c_str());
       return response->SetError(kErrFailed, Json::Value());
     }

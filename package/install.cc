@@ -1,5 +1,7 @@
-// Installation: the environment check, upload and inspection of a package
-// file, the install task, progress and cancel, clean-up of an upload.
+// The web API's side of installing (KIVO.Core.Package.Installation; the
+// package tool's own install is platform/pkgtool/install.cc): the
+// environment check, upload and inspection of a package file, the install
+// task, progress and cancel, clean-up of an upload.
 
 #include <cstdio>
 #include <cstdlib>
@@ -8,9 +10,8 @@
 #include <signal.h>
 #include <unistd.h>
 
-#include <json/writer.h>
-
 #include "error_codes.h"
+#include "klibc/json_text.h"
 #include "klibc/last_error.h"
 #include "klibc/process.h"
 #include "log_line.h"
@@ -19,7 +20,6 @@
 #include "pkgtool/result_codes.h"
 #include "remove_tree.h"
 #include "request_values.h"
-#include "storage/storage_config.h"
 #include "task_record.h"
 #include "utils/package_utils.h"
 #include "webapi/api_upload.h"
@@ -92,12 +92,6 @@ std::string Firmware(int major, int minor, int build) {
   char text[32];
   snprintf(text, sizeof(text), "%d.%d-%04d", major, minor, build);
   return text;
-}
-
-std::string JsonText(const Json::Value& value) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "";
-  return Json::writeString(builder, value);
 }
 
 // Error details that carry the package tool's own words.
@@ -246,7 +240,13 @@ bool PackageWebAPI::UploadAndDescribe(const std::string& file, Json::Value& resu
 // only once the task holds the file's data.
 bool PackageWebAPI::RegisterUpload(const std::string& file, const std::string& id,
                                    Json::Value& result) {
-  const std::string task_id = kUploadPrefix + NVX::TaskUtil::getUniqueID(kTaskOwner, 0);
+  std::string unique;
+  if (!NVX::TaskUtil::getUniqueID(kTaskOwner, 0, &unique)) {
+    PKG_LOG_ERR("No random bytes for an upload task id");
+    response->SetError(kErrFailed, WithMessage(Json::Value(), "the upload task cannot be named"));
+    return false;
+  }
+  const std::string task_id = kUploadPrefix + unique;
   std::unique_ptr<NVX::Task> task(GetNewTask(kTaskOwner, task_id.c_str()));
   Json::Value data(Json::objectValue);
   data["id"] = id;
@@ -386,7 +386,7 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
       break;
     case PKG_ERR_DEPENDENCY:
     case PKG_ERR_DEPENDENTS_RUNNING:
-      result["packages"] = JsonText(details["deppkg"]);
+      result["packages"] = KIVOWriteJson(details["deppkg"]);
       break;
     default:
       break;

@@ -6,7 +6,7 @@
 #include "pkgtool/pms.h"
 #include "pkgtool/result_codes.h"
 #include "request_values.h"
-#include "storage/storage_config.h"
+#include "storage/volume_lookup.h"
 #include "utils/package_utils.h"
 #include "webapi/webapi_util.h"
 

@@ -1,7 +1,13 @@
-// The module's frame: the dispatch table the host reads, the exported
-// handlers, and the construction of the per-request object.
+// The module's frame: the exported handlers, the table of the methods it
+// serves with their checkers (from which the host's dispatch and check
+// tables are made), and the construction of the per-request object.
+
+#include <array>
+#include <cstddef>
 
 #include "package_webapi.h"
+#include "param_check.h"
+#include "webapi/api_names.h"
 #include "webapi/api_table.h"
 
 #define KIVO_EXPORT __attribute__((visibility("default")))
@@ -72,55 +78,95 @@ KIVO_HANDLER(GetFakeIFrame)
 
 namespace {
 
-constexpr char kPkg[] = "KIVO.Core.Package";
-constexpr char kInstallation[] = "KIVO.Core.Package.Installation";
-constexpr char kFeed[] = "KIVO.Core.Package.Feed";
-constexpr char kKeyring[] = "KIVO.Core.Package.Feed.Keyring";
-constexpr char kSetting[] = "KIVO.Core.Package.Setting";
+namespace api = WebAPIName;
+using namespace KIVO_PACKAGE;
 
-// The order of the rows is part of the interface; keep it.
-const WEBAPI_TABLE_ROW gTable[] = {
-    {kPkg, 1, "list", List},
-    {kPkg, 1, "get", Get},
-    {kPkg, 1, "feasibility_check", FeasibilityCheck},
-    {kInstallation, 1, "check", CheckEnv},
-    {kInstallation, 2, "check", CheckEnv},
-    {kInstallation, 1, "status", ReadProgress},
-    {kInstallation, 1, "cancel", CancelProgress},
-    {kInstallation, 1, "upload", Upload},
-    {kInstallation, 1, "install", Install},
-    {kInstallation, 1, "clean", CleanTmp},
-    {"KIVO.Core.Package.Installation.Download", 1, "check", CheckDownloadPkgInfo},
-    {"KIVO.Core.Package.Uninstallation", 1, "uninstall", Uninstall},
-    {"KIVO.Core.Package.Control", 1, "start", Start},
-    {"KIVO.Core.Package.Control", 1, "stop", Stop},
-    {"KIVO.Core.Package.Server", 1, "list", ListServerPackage},
-    {"KIVO.Core.Package.Server", 1, "check", CheckUpdate},
-    {kInstallation, 1, "delete", DeleteTmp},
-    {"KIVO.Core.Package.Log", 1, "get", GetLog},
-    {kFeed, 1, "list", LoadFeedList},
-    {kFeed, 1, "set", EditFeedList},
-    {kFeed, 1, "add", AddFeedList},
-    {kFeed, 1, "delete", DelFeedList},
-    {kKeyring, 1, "add", AddKeyring},
-    {kKeyring, 1, "list", ListKeyring},
-    {kKeyring, 1, "delete", DelKeyring},
-    {kSetting, 1, "get", GetSetting},
-    {kSetting, 1, "set", SetSetting},
-    {"KIVO.Core.Package.Thumb.Server", 1, "get", GetServerIcon},
-    {"KIVO.Core.Package.Thumb", 1, "get", GetVXIcon},
-    {"KIVO.Core.Package.Screenshot.Server", 1, "get", GetServerScreenshot},
-    {"KIVO.Core.Package.Screenshot", 1, "get", GetVXScreenshot},
-    {"KIVO.Core.Package.Info", 1, "get", LoadConfig},
-    {"KIVO.Core.Package.Setting.Volume", 1, "set", SetDefVol},
-    {"KIVO.Core.Package.Setting.Volume", 1, "get", GetDefVol},
-    {"KIVO.Core.Package.Setting.Update", 1, "add", AddAutoUpdate},
-    {"KIVO.Core.Package.Setting.Update", 1, "delete", DelAutoUpdate},
-    {"KIVO.Core.Package.FakeIFrame", 1, "get", GetFakeIFrame},
-    {"KIVO.Package", 1, "list", List},
-    {nullptr, 0, nullptr, nullptr},
+// One method the module serves: its API, version and name, its handler, and
+// the parameter checker the host runs first (null: none).
+struct MethodRow {
+  const char* api;
+  int version;
+  const char* method;
+  WebAPIHandler handler;
+  WebAPIChecker checker;
 };
+
+// Every method. The order of the rows is part of the interface; keep it.
+constexpr MethodRow kMethods[] = {
+    {api::kPackage, 1, "list", List, CheckList},
+    {api::kPackage, 1, "get", Get, CheckGet},
+    {api::kPackage, 1, "feasibility_check", FeasibilityCheck, CheckFeasibility},
+    {api::kInstallation, 1, "check", CheckEnv, CheckInstallationCheck},
+    {api::kInstallation, 2, "check", CheckEnv, CheckInstallationCheck},
+    {api::kInstallation, 1, "status", ReadProgress, CheckTaskId},
+    {api::kInstallation, 1, "cancel", CancelProgress, CheckTaskid},
+    {api::kInstallation, 1, "upload", Upload, AlwaysAccept},
+    {api::kInstallation, 1, "install", Install, CheckInstall},
+    {api::kInstallation, 1, "clean", CleanTmp, CheckTaskId},
+    {api::kDownload, 1, "check", CheckDownloadPkgInfo, CheckTaskid},
+    {api::kUninstallation, 1, "uninstall", Uninstall, CheckUninstall},
+    {api::kControl, 1, "start", Start, CheckStart},
+    {api::kControl, 1, "stop", Stop, CheckIds},
+    {api::kServer, 1, "list", ListServerPackage, CheckServerList},
+    {api::kServer, 1, "check", CheckUpdate, AlwaysAccept},
+    {api::kInstallation, 1, "delete", DeleteTmp, CheckTmpPath},
+    {api::kLog, 1, "get", GetLog, CheckLogName},
+    {api::kFeed, 1, "list", LoadFeedList, AlwaysAccept},
+    {api::kFeed, 1, "set", EditFeedList, CheckFeedList},
+    {api::kFeed, 1, "add", AddFeedList, CheckFeedList},
+    {api::kFeed, 1, "delete", DelFeedList, CheckFeedList},
+    {api::kKeyring, 1, "add", AddKeyring, CheckKeyringAdd},
+    {api::kKeyring, 1, "list", ListKeyring, AlwaysAccept},
+    {api::kKeyring, 1, "delete", DelKeyring, CheckKeyringDelete},
+    {api::kSetting, 1, "get", GetSetting, AlwaysAccept},
+    {api::kSetting, 1, "set", SetSetting, CheckSettingSet},
+    {api::kServerThumb, 1, "get", GetServerIcon, CheckThumbServer},
+    {api::kThumb, 1, "get", GetVXIcon, CheckThumb},
+    {api::kServerScreenshot, 1, "get", GetServerScreenshot, CheckScreenshotServer},
+    {api::kScreenshot, 1, "get", GetVXScreenshot, CheckScreenshot},
+    {api::kPackageInfo, 1, "get", LoadConfig, AlwaysAccept},
+    {api::kVolumeSetting, 1, "set", SetDefVol, CheckVolumeSet},
+    {api::kVolumeSetting, 1, "get", GetDefVol, AlwaysAccept},
+    {api::kUpdateSetting, 1, "add", AddAutoUpdate, CheckIds},
+    {api::kUpdateSetting, 1, "delete", DelAutoUpdate, CheckIds},
+    {api::kFakeIFrame, 1, "get", GetFakeIFrame, AlwaysAccept},
+    {api::kLegacyPackage, 1, "list", List, nullptr},
+};
+constexpr size_t kMethodCount = sizeof(kMethods) / sizeof(kMethods[0]);
+
+constexpr size_t CheckedCount() {
+  size_t n = 0;
+  for (const MethodRow& row : kMethods) n += row.checker ? 1 : 0;
+  return n;
+}
+
+// The dispatch table the host reads: every method, then the all-zero row.
+constexpr std::array<WEBAPI_TABLE_ROW, kMethodCount + 1> DispatchTable() {
+  std::array<WEBAPI_TABLE_ROW, kMethodCount + 1> table{};
+  for (size_t i = 0; i < kMethodCount; ++i) {
+    const MethodRow& m = kMethods[i];
+    table[i] = WEBAPI_TABLE_ROW{m.api, m.version, m.method, m.handler};
+  }
+  return table;
+}
+
+// The check table the host reads: the methods with a checker, then the
+// all-zero row.
+constexpr std::array<WEBAPI_CHECK_ROW, CheckedCount() + 1> CheckTable() {
+  std::array<WEBAPI_CHECK_ROW, CheckedCount() + 1> table{};
+  size_t n = 0;
+  for (const MethodRow& m : kMethods) {
+    if (m.checker)
+      table[n++] = WEBAPI_CHECK_ROW{m.api, m.version, m.method, m.checker, nullptr, nullptr};
+  }
+  return table;
+}
+
+constexpr auto kDispatchTable = DispatchTable();
+constexpr auto kCheckTable = CheckTable();
 
 }  // namespace
 
-extern "C" KIVO_EXPORT const WEBAPI_TABLE_ROW* GetAPITable() { return gTable; }
+extern "C" KIVO_EXPORT const WEBAPI_TABLE_ROW* GetAPITable() { return kDispatchTable.data(); }
+
+extern "C" KIVO_EXPORT const WEBAPI_CHECK_ROW* GetAPICheckTable() { return kCheckTable.data(); }

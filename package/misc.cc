@@ -8,7 +8,7 @@
 #include "log_line.h"
 #include "package_webapi.h"
 #include "request_values.h"
-#include "storage/storage_config.h"
+#include "storage/volume_lookup.h"
 
 #include <stdlib.h>
 

@@ -1,17 +1,14 @@
-// Package information rendering that needs the request: a package's live
-// status (from the tasks of running operations and the package tool), its
-// web address, its uninstall wizard pages, and the description of a package
-// file for the install wizard.
-
-#include <cstdlib>
-#include <memory>
+// The web API's rendering of package information (the package tool's own
+// record of a package is platform/pkgtool/package_info.cc), the part that
+// needs the request: a package's live status (from the tasks of running
+// operations and the package tool), its web address, its uninstall wizard
+// pages, and the description of a package file for the install wizard.
 
 #include "package_status.h"
 #include "package_webapi.h"
-#include "pkgtool/pms.h"
-#include "pkgtool/result_codes.h"
 #include "task_record.h"
 #include "utils/package_utils.h"
+#include "webapi/api_names.h"
 
 namespace KIVO_PACKAGE {
 
@@ -22,17 +19,13 @@ using PackageUtils::kStatus;
 using PackageUtils::kUninstallPages;
 using PackageUtils::kUrl;
 
-// The "data" of task `prefix`+id when a living process runs it. Null when
-// there is no such live task. A task whose process is gone is stale: an
-// install or download job that never finished is recorded as failed (its
-// starter polls "status" for the outcome), any other stale task is removed.
-Json::Value LiveTaskData(NVX::TaskMgr& mgr, const std::string& id, const char* prefix) {
-  std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, prefix + id));
-  if (!task) return Json::Value();
-  Json::Value data = task->getProperty("data");
-  if (TaskProcessAlive(data) && !task->isFinished()) return data;
-  if (!TaskProcessAlive(data)) EndStaleTask(*task, data);
-  return Json::Value();
+// The address of a running package's own web page, "" when it has no port.
+std::string PackageUrl(const PackageInfo& info) {
+  if (info.getAdminPort() <= 0) return "";
+  std::string protocol = info.get("adminprotocol").empty() ? "http" : info.get("adminprotocol");
+  std::string path = info.get("adminurl");
+  if (path.empty() || path[0] != '/') path = "/" + path;
+  return protocol + "://" + RequestHost() + ":" + std::to_string(info.getAdminPort()) + path;
 }
 
 }  // namespace
@@ -40,40 +33,17 @@ Json::Value LiveTaskData(NVX::TaskMgr& mgr, const std::string& id, const char* p
 void PackageWebAPI::DumpStatusInfo(const PackageInfo& info, uint64_t mask,
                                    Json::Value& additional) {
   if (!(mask & (kUrl | kStatus))) return;
-  const std::string id = info.getId();
   NVX::TaskMgr mgr(kTaskOwner);
-  Json::Value startstop = LiveTaskData(mgr, id, kStartStopPrefix);
-  if (startstop.isMember("status")) {
-    if (mask & kStatus) additional["status"] = startstop["status"];
-    return;
-  }
-  Json::Value download = LiveTaskData(mgr, id, kDownloadPrefix);
-  if (download["installing"].isBool() && download["installing"].asBool()) {
-    if (mask & kStatus)
-      additional["status"] = download.isMember("status") ? download["status"] : "installing";
-    double progress = PMSGetProgress(id);
-    if ((mask & kInstallingProgress) && progress != -1.0)
-      additional["installing_progress"] = progress;
-    return;
-  }
-  if (!LiveTaskData(mgr, id, kUninstallPrefix).isNull()) {
-    if (mask & kStatus) additional["status"] = "uninstalling";
-    return;
-  }
-  bool running = false;
-  bool ok = pkgMgr.getServiceStatus(info, running, request->GetAPIClass() != "KIVO.Package");
-  if (ok && running) {
-    if (mask & kStatus) additional["status"] = "running";
-    if ((mask & kUrl) && info.getAdminPort() > 0) {
-      std::string protocol = info.get("adminprotocol").empty() ? "http" : info.get("adminprotocol");
-      std::string path = info.get("adminurl");
-      if (path.empty() || path[0] != '/') path = "/" + path;
-      additional["url"] =
-          protocol + "://" + RequestHost() + ":" + std::to_string(info.getAdminPort()) + path;
-    }
-    return;
-  }
-  if (mask & kStatus) additional["status"] = StoppedStatus(pkgMgr.getResult());
+  // Under the legacy API name a package whose installed files are gone reads
+  // as stopped, not broken, as it always has.
+  const PackageState state = ReadPackageState(
+      PackageTasks(mgr), pkgMgr, info.getId(), &info,
+      request->GetAPIClass() == WebAPIName::kLegacyPackage ? BrokenCheck::kNo : BrokenCheck::kYes);
+  if (mask & kStatus) additional["status"] = state.status;
+  if ((mask & kInstallingProgress) && state.progress != -1.0)
+    additional["installing_progress"] = state.progress;
+  const std::string url = state.running && (mask & kUrl) ? PackageUrl(info) : "";
+  if (!url.empty()) additional["url"] = url;
 }
 
 void PackageWebAPI::DumpUninstallPages(const PackageInfo& info, uint64_t mask,
@@ -95,30 +65,12 @@ void PackageWebAPI::DumpPkgInfo(const std::string& path, const PackageInfo& info
   if (!info.getUIFile().isNull() && !info.getUIFile().empty()) {
     PackageUtils::DumpUIFIle(info, out["install_pages"]);
   }
-  std::string status = "NA";
-  bool running = false;
   PackageInfo installed;
-  bool known = pkgMgr.getPackageInfo(info.getId(), installed, request->GetUILanguage());
-  if (!known || !pkgMgr.getServiceStatus(installed, running, true) || !running) {
-    status = StoppedStatus(pkgMgr.getResult());
-    if (pkgMgr.getResult() == PKG_ERR_STATUS_UNKNOWN || pkgMgr.getResult() == PKG_ERR_REGISTRY)
-      status = "NA";
-  } else {
-    status = "running";
-  }
-  if (status == "NA" || status == "running" || status == "stop") {
-    NVX::TaskMgr mgr(kTaskOwner);
-    for (const char* prefix : {kDownloadPrefix, kStartStopPrefix}) {
-      Json::Value data = LiveTaskData(mgr, info.getId(), prefix);
-      bool installing = data["installing"].isBool() && data["installing"].asBool();
-      if (prefix == kDownloadPrefix && installing) {
-        status = data.isMember("status") ? data["status"].asString() : "installing";
-        break;
-      }
-      if (prefix == kStartStopPrefix && data.isMember("status")) status = data["status"].asString();
-    }
-  }
-  out["status"] = status;
+  const bool known = pkgMgr.getPackageInfo(info.getId(), installed, request->GetUILanguage());
+  NVX::TaskMgr mgr(kTaskOwner);
+  out["status"] = ReadPackageState(PackageTasks(mgr), pkgMgr, info.getId(),
+                                   known ? &installed : nullptr, BrokenCheck::kYes)
+                      .status;
 }
 
 }  // namespace KIVO_PACKAGE

@@ -17,6 +17,8 @@
 
 namespace KIVO_PACKAGE {
 
+class PackageTasks;
+
 class PackageWebAPI {
  public:
   // Borrows both pointers for the duration of the call.
@@ -140,10 +142,10 @@ class PackageWebAPI {
   // The progress a download task reports: 1.0 only once its file is there,
   // never below 0.
   static double DownloadTaskProgress(NVX::Task& task, const Json::Value& data);
-  // `tasks`: the ids of the package tasks, listed once per request.
-  bool AnnotateInstalled(NVX::TaskMgr& mgr, const std::set<std::string>& tasks,
-                         const PackageInfo& p, Json::Value& entry);
-  void AnnotateDownload(NVX::TaskMgr& mgr, const std::set<std::string>& tasks, Json::Value& entry);
+  // A catalogue entry's overlay: the state of installed package `p`, and
+  // the package's download.
+  void AnnotateInstalled(const PackageTasks& tasks, const PackageInfo& p, Json::Value& entry);
+  void AnnotateDownload(const PackageTasks& tasks, Json::Value& entry);
 
   // Settings (setting.cc).
   // Stores the default volume; false with the error answered (4504 for a

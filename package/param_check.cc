@@ -1,19 +1,14 @@
-// The parameter checkers the host runs before each handler, and the check
-// table that registers them.
-//
-// Every checker reads all of its parameters in a fixed order, then reports
-// the first fault with code 120 and {"name", "reason"}: a missing required
-// parameter ("required"), a wrong type or a non-string array element
-// ("type"), then the value conditions in order ("condition").
+// The parameter checkers (param_check.h): the parameters of each method
+// with their types and conditions.
 
-#include <initializer_list>
+#include "param_check.h"
+
 #include <string>
 #include <vector>
 
 #include "request_values.h"
-#include "webapi/api_request.h"
-#include "webapi/api_response.h"
-#include "webapi/api_table.h"
+#include "utils/package_utils.h"
+#include "webapi/api_codes.h"
 #include "webapi/api_validator.h"
 #include "webapi/webapi_util.h"
 
@@ -60,7 +55,7 @@ ReadParam ReadOne(const APIRequest& request, const ParamSpec& spec) {
 // conditions of the checkers need.
 class Check {
  public:
-  Check(APIRequest* request, APIResponse* response, std::initializer_list<ParamSpec> specs)
+  Check(APIRequest* request, APIResponse* response, const std::vector<ParamSpec>& specs)
       : response_(response) {
     for (const ParamSpec& spec : specs) params_.push_back(ReadOne(*request, spec));
   }
@@ -93,7 +88,7 @@ class Check {
     Json::Value data(Json::objectValue);
     data["name"] = name;
     data["reason"] = reason;
-    response_->SetError(120, data);
+    response_->SetError(kErrParameter, data);
     return false;
   }
 
@@ -116,6 +111,15 @@ class Check {
     return !p.set || KIVO_PACKAGE::AreIdsOrEmpty(p.value) || Refuse(name, "condition");
   }
 
+  // The array parameter, when sent, holds only names that "additional" may
+  // hold.
+  bool AdditionalNames(const std::string& name) {
+    for (const Json::Value& item : (*this)[name].value) {
+      if (!PackageUtils::IsAdditionalName(item.asString())) return Refuse(name, "condition");
+    }
+    return true;
+  }
+
   // The parameter, when sent, is (each of its elements is) one of `set_text`.
   bool OneOf(const std::string& name, const char* set_text) {
     const ReadParam& p = (*this)[name];
@@ -136,134 +140,61 @@ class Check {
 constexpr PARAM_NECESSITY kReq = PARAM_REQUIRED;
 constexpr PARAM_NECESSITY kOpt = PARAM_OPTIONAL;
 
-constexpr char kAdditionalKeys[] =
-    "[\"autoupdate\",\"beta\",\"description\",\"description_enu\",\"distributor\","
-    "\"distributor_url\",\"nvx_apps\",\"help_url\",\"install_reboot\",\"install_type\","
-    "\"installed_info\",\"is_uninstall_pages\",\"maintainer\",\"maintainer_url\",\"url\","
-    "\"report_beta_url\",\"silent_install\",\"silent_upgrade\",\"silent_uninstall\",\"startable\","
-    "\"status\",\"support_center\",\"support_url\",\"uninstall_pages\",\"dependent_packages\","
-    "\"start_dependent_services\",\"installing_progress\",\"ctl_uninstall\",\"log_path\"]";
-
-bool AlwaysAccept(APIRequest*, APIResponse*) { return true; }
-
-bool CheckStart(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp, {{"id", Type::Array, kReq}});
-  return c.TypesOk() && c.NotOnlyEmpty("id") && c.Ids("id");
-}
-
-bool CheckStop(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp, {{"id", Type::Array, kReq}});
-  return c.TypesOk() && c.Ids("id");
-}
-
-bool CheckUninstall(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp, {{"id", Type::Array, kReq}, {"extra_values", Type::String, kOpt}});
-  return c.TypesOk() && c.NotOnlyEmpty("id") && c.Ids("id");
-}
-
-bool CheckSettingSet(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp,
-          {{"packages", Type::Array, kOpt},
-           {"update_channel", Type::String, kOpt},
-           {"enable_email", Type::Bool, kOpt},
-           {"enable_nvx", Type::Bool, kOpt},
-           {"trust_level", Type::Int, kOpt},
-           {"enable_autoupdate", Type::Bool, kOpt},
-           {"autoupdateall", Type::Bool, kOpt},
-           {"default_vol", Type::String, kOpt}});
-  // "packages" may be the JSON text of the list: the handler parses it and
-  // applies the id rule to the ids it holds.
-  return c.TypesOk();
-}
-
-bool CheckVolumeSet(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp, {{"default_vol", Type::String, kOpt}}).TypesOk();
-}
-
-bool CheckIdArray(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp, {{"id", Type::Array, kReq}});
-  return c.TypesOk() && c.Ids("id");
-}
-
-bool CheckThumb(APIRequest* req, APIResponse* resp) {
-  return Check(
-             req, resp,
-             {{"name", Type::String, kOpt}, {"ver", Type::String, kOpt}, {"size", Type::Int, kOpt}})
-      .TypesOk();
-}
-
-bool CheckThumbServer(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp,
-               {{"name", Type::String, kOpt},
-                {"ver", Type::String, kOpt},
-                {"size", Type::Int, kOpt},
-                {"bls", Type::Bool, kOpt},
-                {"link", Type::String, kOpt}})
-      .TypesOk();
-}
-
-bool CheckScreenshot(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp,
-               {{"name", Type::String, kOpt},
-                {"ver", Type::String, kOpt},
-                {"index", Type::Int, kOpt},
-                {"link", Type::String, kOpt},
-                {"newlink", Type::String, kOpt}})
-      .TypesOk();
-}
-
-bool CheckScreenshotServer(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp,
-               {{"name", Type::String, kOpt},
-                {"ver", Type::String, kOpt},
-                {"index", Type::Int, kOpt},
-                {"link", Type::String, kOpt}})
-      .TypesOk();
+// Checks the types of `specs` and nothing else.
+bool TypesOnly(APIRequest* req, APIResponse* resp, const std::vector<ParamSpec>& specs) {
+  return Check(req, resp, specs).TypesOk();
 }
 
 // One required string that must not be empty.
-template <const char* kName>
-bool CheckRequiredNotEmpty(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp, {{kName, Type::String, kReq}});
-  return c.TypesOk() && c.NotEmpty(kName);
+bool RequiredNotEmpty(APIRequest* req, APIResponse* resp, const char* name) {
+  Check c(req, resp, {{name, Type::String, kReq}});
+  return c.TypesOk() && c.NotEmpty(name);
 }
 
 // One required string, types only.
-template <const char* kName>
-bool CheckRequiredString(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp, {{kName, Type::String, kReq}}).TypesOk();
+bool RequiredString(APIRequest* req, APIResponse* resp, const char* name) {
+  return TypesOnly(req, resp, {{name, Type::String, kReq}});
 }
 
-constexpr char kName[] = "name";
+// The types, then "id" holds at least one non-empty string, and only ids.
+bool TypesAndSomeIds(Check& c) { return c.TypesOk() && c.NotOnlyEmpty("id") && c.Ids("id"); }
 
-constexpr char kList[] = "list";
-constexpr char kTaskId[] = "task_id";
-constexpr char kTaskid[] = "taskid";
-constexpr char kPath[] = "path";
-constexpr char kUploadKeyring[] = "upload_keyring";
+}  // namespace
 
-bool CheckInstallationCheckV1(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp,
-          {{"id", Type::Array, kOpt},
-           {"depsers", Type::String, kOpt},
-           {"deppkgs", Type::Object, kOpt},
-           {"conflictpkgs", Type::Object, kOpt},
-           {"install_type", Type::String, kOpt},
-           {"size", Type::Int, kOpt},
-           {"blCheckDep", Type::Bool, kOpt}});
-  return c.TypesOk() && c.Ids("id");
+namespace KIVO_PACKAGE {
+
+bool AlwaysAccept(APIRequest*, APIResponse*) { return true; }
+
+bool CheckList(APIRequest* req, APIResponse* resp) {
+  Check c(req, resp, {{"additional", Type::Array, kOpt}});
+  return c.TypesOk() && c.AdditionalNames("additional");
 }
 
-bool CheckInstallationCheckV2(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp,
-          {{"id", Type::Array, kOpt},
-           {"depsers", Type::String, kOpt},
-           {"deppkgs", Type::Object, kOpt},
-           {"conflictpkgs", Type::Object, kOpt},
-           {"install_type", Type::String, kOpt},
-           {"size", Type::Int, kOpt},
-           {"blCheckDep", Type::Bool, kOpt},
-           {"ver", Type::String, kOpt}});
+bool CheckGet(APIRequest* req, APIResponse* resp) {
+  Check c(req, resp, {{"id", Type::Array, kReq}, {"additional", Type::Array, kOpt}});
+  return TypesAndSomeIds(c) && c.AdditionalNames("additional");
+}
+
+bool CheckFeasibility(APIRequest* req, APIResponse* resp) {
+  Check c(req, resp, {{"type", Type::String, kReq}, {"packages", Type::Array, kReq}});
+  return c.TypesOk() && c.OneOf("type", "[\"install_check\",\"uninstall_check\",\"stop_check\"]") &&
+         c.Ids("packages");
+}
+
+bool CheckLogName(APIRequest* req, APIResponse* resp) {
+  return RequiredNotEmpty(req, resp, "name");
+}
+
+bool CheckInstallationCheck(APIRequest* req, APIResponse* resp) {
+  std::vector<ParamSpec> specs = {{"id", Type::Array, kOpt},
+                                  {"depsers", Type::String, kOpt},
+                                  {"deppkgs", Type::Object, kOpt},
+                                  {"conflictpkgs", Type::Object, kOpt},
+                                  {"install_type", Type::String, kOpt},
+                                  {"size", Type::Int, kOpt},
+                                  {"blCheckDep", Type::Bool, kOpt}};
+  if (req->GetAPIVersion() >= 2) specs.push_back({"ver", Type::String, kOpt});
+  Check c(req, resp, specs);
   return c.TypesOk() && c.Ids("id");
 }
 
@@ -308,81 +239,98 @@ bool CheckInstall(APIRequest* req, APIResponse* resp) {
   return true;
 }
 
-bool CheckFeasibility(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp, {{"type", Type::String, kReq}, {"packages", Type::Array, kReq}});
-  return c.TypesOk() && c.OneOf("type", "[\"install_check\",\"uninstall_check\",\"stop_check\"]") &&
-         c.Ids("packages");
+bool CheckTaskId(APIRequest* req, APIResponse* resp) {
+  return RequiredNotEmpty(req, resp, "task_id");
 }
 
-bool CheckList(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp, {{"additional", Type::Array, kOpt}});
-  return c.TypesOk() && c.OneOf("additional", kAdditionalKeys);
+bool CheckTaskid(APIRequest* req, APIResponse* resp) {
+  return RequiredNotEmpty(req, resp, "taskid");
 }
 
-bool CheckGet(APIRequest* req, APIResponse* resp) {
-  Check c(req, resp, {{"id", Type::Array, kReq}, {"additional", Type::Array, kOpt}});
-  return c.TypesOk() && c.NotOnlyEmpty("id") && c.Ids("id") &&
-         c.OneOf("additional", kAdditionalKeys);
+bool CheckTmpPath(APIRequest* req, APIResponse* resp) {
+  return RequiredNotEmpty(req, resp, "path");
+}
+
+bool CheckStart(APIRequest* req, APIResponse* resp) {
+  Check c(req, resp, {{"id", Type::Array, kReq}});
+  return TypesAndSomeIds(c);
+}
+
+bool CheckUninstall(APIRequest* req, APIResponse* resp) {
+  Check c(req, resp, {{"id", Type::Array, kReq}, {"extra_values", Type::String, kOpt}});
+  return TypesAndSomeIds(c);
+}
+
+bool CheckIds(APIRequest* req, APIResponse* resp) {
+  Check c(req, resp, {{"id", Type::Array, kReq}});
+  return c.TypesOk() && c.Ids("id");
+}
+
+bool CheckSettingSet(APIRequest* req, APIResponse* resp) {
+  // "packages" may be the JSON text of the list: the handler parses it and
+  // applies the id rule to the ids it holds.
+  return TypesOnly(req, resp,
+                   {{"packages", Type::Array, kOpt},
+                    {"update_channel", Type::String, kOpt},
+                    {"enable_email", Type::Bool, kOpt},
+                    {"enable_nvx", Type::Bool, kOpt},
+                    {"trust_level", Type::Int, kOpt},
+                    {"enable_autoupdate", Type::Bool, kOpt},
+                    {"autoupdateall", Type::Bool, kOpt},
+                    {"default_vol", Type::String, kOpt}});
+}
+
+bool CheckVolumeSet(APIRequest* req, APIResponse* resp) {
+  return TypesOnly(req, resp, {{"default_vol", Type::String, kOpt}});
+}
+
+bool CheckFeedList(APIRequest* req, APIResponse* resp) {
+  return RequiredNotEmpty(req, resp, "list");
+}
+
+bool CheckKeyringAdd(APIRequest* req, APIResponse* resp) {
+  return RequiredString(req, resp, "upload_keyring");
+}
+
+bool CheckKeyringDelete(APIRequest* req, APIResponse* resp) {
+  return RequiredString(req, resp, "list");
 }
 
 bool CheckServerList(APIRequest* req, APIResponse* resp) {
-  return Check(req, resp, {{"blloadothers", Type::Bool, kOpt}, {"blforcereload", Type::Bool, kOpt}})
-      .TypesOk();
+  return TypesOnly(req, resp,
+                   {{"blloadothers", Type::Bool, kOpt}, {"blforcereload", Type::Bool, kOpt}});
 }
 
-constexpr char kControl[] = "KIVO.Core.Package.Control";
-constexpr char kSetting[] = "KIVO.Core.Package.Setting";
-constexpr char kVolume[] = "KIVO.Core.Package.Setting.Volume";
-constexpr char kUpdate[] = "KIVO.Core.Package.Setting.Update";
-constexpr char kFeed[] = "KIVO.Core.Package.Feed";
-constexpr char kKeyring[] = "KIVO.Core.Package.Feed.Keyring";
-constexpr char kInstallation[] = "KIVO.Core.Package.Installation";
-constexpr char kPkg[] = "KIVO.Core.Package";
-
-const WEBAPI_CHECK_ROW gCheckTable[] = {
-    {kControl, 1, "start", CheckStart, nullptr, nullptr},
-    {kControl, 1, "stop", CheckStop, nullptr, nullptr},
-    {"KIVO.Core.Package.Uninstallation", 1, "uninstall", CheckUninstall, nullptr, nullptr},
-    {kSetting, 1, "set", CheckSettingSet, nullptr, nullptr},
-    {kSetting, 1, "get", AlwaysAccept, nullptr, nullptr},
-    {kVolume, 1, "set", CheckVolumeSet, nullptr, nullptr},
-    {kVolume, 1, "get", AlwaysAccept, nullptr, nullptr},
-    {kUpdate, 1, "add", CheckIdArray, nullptr, nullptr},
-    {kUpdate, 1, "delete", CheckIdArray, nullptr, nullptr},
-    {"KIVO.Core.Package.Info", 1, "get", AlwaysAccept, nullptr, nullptr},
-    {"KIVO.Core.Package.Thumb", 1, "get", CheckThumb, nullptr, nullptr},
-    {"KIVO.Core.Package.Thumb.Server", 1, "get", CheckThumbServer, nullptr, nullptr},
-    {"KIVO.Core.Package.Screenshot", 1, "get", CheckScreenshot, nullptr, nullptr},
-    {"KIVO.Core.Package.Screenshot.Server", 1, "get", CheckScreenshotServer, nullptr, nullptr},
-    {"KIVO.Core.Package.Log", 1, "get", CheckRequiredNotEmpty<kName>, nullptr, nullptr},
-    {kFeed, 1, "add", CheckRequiredNotEmpty<kList>, nullptr, nullptr},
-    {kFeed, 1, "set", CheckRequiredNotEmpty<kList>, nullptr, nullptr},
-    {kFeed, 1, "list", AlwaysAccept, nullptr, nullptr},
-    {kFeed, 1, "delete", CheckRequiredNotEmpty<kList>, nullptr, nullptr},
-    {kKeyring, 1, "add", CheckRequiredString<kUploadKeyring>, nullptr, nullptr},
-    {kKeyring, 1, "list", AlwaysAccept, nullptr, nullptr},
-    {kKeyring, 1, "delete", CheckRequiredString<kList>, nullptr, nullptr},
-    {kInstallation, 2, "check", CheckInstallationCheckV2, nullptr, nullptr},
-    {kInstallation, 1, "check", CheckInstallationCheckV1, nullptr, nullptr},
-    {kInstallation, 1, "status", CheckRequiredNotEmpty<kTaskId>, nullptr, nullptr},
-    {kInstallation, 1, "install", CheckInstall, nullptr, nullptr},
-    {kInstallation, 1, "upload", AlwaysAccept, nullptr, nullptr},
-    {kInstallation, 1, "clean", CheckRequiredNotEmpty<kTaskId>, nullptr, nullptr},
-    {kInstallation, 1, "cancel", CheckRequiredNotEmpty<kTaskid>, nullptr, nullptr},
-    {kInstallation, 1, "delete", CheckRequiredNotEmpty<kPath>, nullptr, nullptr},
-    {"KIVO.Core.Package.Installation.Download", 1, "check", CheckRequiredNotEmpty<kTaskid>, nullptr,
-     nullptr},
-    {"KIVO.Core.Package.FakeIFrame", 1, "get", AlwaysAccept, nullptr, nullptr},
-    {kPkg, 1, "feasibility_check", CheckFeasibility, nullptr, nullptr},
-    {kPkg, 1, "list", CheckList, nullptr, nullptr},
-    {kPkg, 1, "get", CheckGet, nullptr, nullptr},
-    {"KIVO.Core.Package.Server", 1, "list", CheckServerList, nullptr, nullptr},
-    {"KIVO.Core.Package.Server", 1, "check", AlwaysAccept, nullptr, nullptr},
-    {nullptr, 0, nullptr, nullptr, nullptr, nullptr},
-};
-
-}  // namespace
-
-extern "C" __attribute__((visibility("default"))) const WEBAPI_CHECK_ROW* GetAPICheckTable() {
-  return gCheckTable;
+bool CheckThumb(APIRequest* req, APIResponse* resp) {
+  return TypesOnly(
+      req, resp,
+      {{"name", Type::String, kOpt}, {"ver", Type::String, kOpt}, {"size", Type::Int, kOpt}});
 }
+
+bool CheckThumbServer(APIRequest* req, APIResponse* resp) {
+  return TypesOnly(req, resp,
+                   {{"name", Type::String, kOpt},
+                    {"ver", Type::String, kOpt},
+                    {"size", Type::Int, kOpt},
+                    {"bls", Type::Bool, kOpt},
+                    {"link", Type::String, kOpt}});
+}
+
+bool CheckScreenshot(APIRequest* req, APIResponse* resp) {
+  return TypesOnly(req, resp,
+                   {{"name", Type::String, kOpt},
+                    {"ver", Type::String, kOpt},
+                    {"index", Type::Int, kOpt},
+                    {"link", Type::String, kOpt},
+                    {"newlink", Type::String, kOpt}});
+}
+
+bool CheckScreenshotServer(APIRequest* req, APIResponse* resp) {
+  return TypesOnly(req, resp,
+                   {{"name", Type::String, kOpt},
+                    {"ver", Type::String, kOpt},
+                    {"index", Type::Int, kOpt},
+                    {"link", Type::String, kOpt}});
+}
+
+}  // namespace KIVO_PACKAGE

@@ -57,15 +57,6 @@ Json::Value PackageUrls(const PackageInfo& p) {
   return urls;
 }
 
-// Task `id` when the request's one listing of the package tasks holds it. A
-// catalogue has thousands of entries and few of them have a task: asking the
-// task store once per request instead of once per entry keeps the listing's
-// cost in reading the catalogue.
-NVX::Task* ListedTask(NVX::TaskMgr& mgr, const std::set<std::string>& listed,
-                      const std::string& id) {
-  return listed.count(id) ? GetTaskWithTaskMgr(mgr, id) : nullptr;
-}
-
 // Marks `overlay` as an upgrade of installed package `p` to the server's
 // `version` unless the installed version is restricted; true when it did.
 // Only the catalogue the package came from offers its upgrades: a newer
@@ -95,9 +86,9 @@ bool MarkUpgrade(const PackageInfo& p, const PMSPackageOrigin& source,
 // costs more than an entry.
 class EntryOverlay {
  public:
-  EntryOverlay() : writer_(AnswerJsonWriter().newStreamWriter()) {}
+  EntryOverlay() : writer_(KIVONewJsonWriter()) {}
 
-  // `text` (an object written by AnswerJsonWriter()) with the members of
+  // `text` (an object written by KIVONewJsonWriter()) with the members of
   // `overlay` but "package" in place of its own or added, as if they had
   // been set on the parsed entry: the writer puts members in name order, so
   // the entry's members are merged with the overlay's by name and only the
@@ -175,7 +166,7 @@ class EntryOverlay {
 
 // The answer {"blupgrade": B, "data": [...], "recommend": [...], "total": N}
 // as text, from the entries' texts: the members in name order and written
-// compactly, as AnswerJsonWriter() writes an object. "recommend" holds, for
+// compactly, as KIVONewJsonWriter() writes an object. "recommend" holds, for
 // each recommended name in order, the last listed entry of that name, and
 // is left out when none is listed.
 class AnswerText {
@@ -228,57 +219,20 @@ class AnswerText {
 
 }  // namespace
 
-bool PackageWebAPI::AnnotateInstalled(NVX::TaskMgr& mgr, const std::set<std::string>& tasks,
-                                      const PackageInfo& p, Json::Value& entry) {
+void PackageWebAPI::AnnotateInstalled(const PackageTasks& tasks, const PackageInfo& p,
+                                      Json::Value& entry) {
   const std::string name = entry["package"].asString();
-  std::unique_ptr<NVX::Task> task(ListedTask(mgr, tasks, kStartStopPrefix + name));
-  if (task) {
-    Json::Value data = task->getProperty("data");
-    if (data.isMember("status") && TaskProcessAlive(data)) {
-      entry["status"] = data["status"];
-      return true;
-    }
-    EndStaleTask(*task, data);
-  }
-  task.reset(ListedTask(mgr, tasks, kDownloadPrefix + name));
-  if (task) {
-    Json::Value data = task->getProperty("data");
-    if (IsTrue(data["installing"]) && !task->isFinished() && data["pid"].isInt()) {
-      if (TaskProcessAlive(data)) {
-        entry["status"] = data.isMember("status") ? data["status"] : Json::Value("installing");
-        double progress = PMSGetProgress(name);
-        if (progress != -1.0) entry["installing_progress"] = progress;
-        return true;
-      }
-      if (data["pid"].asInt() != 0) EndStaleTask(*task, data);
-    }
-  }
-  task.reset(ListedTask(mgr, tasks, kUninstallPrefix + name));
-  if (task) {
-    Json::Value data = task->getProperty("data");
-    if (data.isMember("status") && TaskProcessAlive(data)) {
-      entry["status"] = "uninstalling";
-      return true;
-    }
-    EndStaleTask(*task, data);
-  }
-  bool running = false;
-  entry["status"] = "NA";
-  if (pkgMgr.getServiceStatus(p, running, true) && running) {
-    entry["status"] = "running";
-    entry["nvx_apps"] = p.get("nvx_apps");
-    Json::Value urls = PackageUrls(p);
-    if (!urls.isNull()) entry["url"] = urls;
-  } else {
-    entry["status"] = StoppedStatus(pkgMgr.getResult());
-  }
-  return false;
+  const PackageState state = ReadPackageState(tasks, pkgMgr, name, &p, BrokenCheck::kYes);
+  entry["status"] = state.status;
+  if (state.progress != -1.0) entry["installing_progress"] = state.progress;
+  if (!state.running) return;
+  entry["nvx_apps"] = p.get("nvx_apps");
+  Json::Value urls = PackageUrls(p);
+  if (!urls.isNull()) entry["url"] = urls;
 }
 
-void PackageWebAPI::AnnotateDownload(NVX::TaskMgr& mgr, const std::set<std::string>& tasks,
-                                     Json::Value& entry) {
-  std::unique_ptr<NVX::Task> task(
-      ListedTask(mgr, tasks, kDownloadPrefix + entry["package"].asString()));
+void PackageWebAPI::AnnotateDownload(const PackageTasks& tasks, Json::Value& entry) {
+  std::unique_ptr<NVX::Task> task(tasks.Get(kDownloadPrefix + entry["package"].asString()));
   // Read through a const value: looking a member up must not add it, as
   // "info" is the task's data as stored.
   const Json::Value data = task ? task->getProperty("data") : Json::Value();
@@ -321,8 +275,8 @@ void PackageWebAPI::ListServerPackage() {
     PKG_LOG_ERR("Failed to read the installed packages [%d]", pkgMgr.getResult());
   }
   NVX::TaskMgr mgr(kTaskOwner);
-  const std::vector<std::string> listed = mgr.listTasks("@KIVOPKG_");
-  const std::set<std::string> tasks(listed.begin(), listed.end());
+  const std::vector<std::string> listed = mgr.listTasks(kPackageTaskPrefix);
+  const PackageTasks tasks(mgr, std::set<std::string>(listed.begin(), listed.end()));
   const PMSThirdPartyLimits limits;
   EntryOverlay entries;
   AnswerText answer(listing.recommend);
@@ -330,7 +284,7 @@ void PackageWebAPI::ListServerPackage() {
   for (KIVOPackageServer::ListingEntry& e : listing.entries) {
     if (e.has_version && limits.Restricts(e.name, e.version)) continue;
     auto p = installed.find(e.name);
-    if (p != installed.end() || tasks.count(kDownloadPrefix + e.name)) {
+    if (p != installed.end() || tasks.MayHave(kDownloadPrefix + e.name)) {
       Json::Value overlay(Json::objectValue);
       overlay["package"] = e.name;
       if (p != installed.end()) {
@@ -340,9 +294,9 @@ void PackageWebAPI::ListServerPackage() {
         any_upgrade =
             MarkUpgrade(p->second, listing.sources[e.source], limits, e.version, overlay) ||
             any_upgrade;
-        AnnotateInstalled(mgr, tasks, p->second, overlay);
+        AnnotateInstalled(tasks, p->second, overlay);
       }
-      AnnotateDownload(mgr, tasks, overlay);
+      AnnotateDownload(tasks, overlay);
       answer.AddOwned(e.name, entries.Apply(e.text, overlay));
     } else {
       answer.Add(e.name, e.text);

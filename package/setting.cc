@@ -27,7 +27,7 @@
 #include "settings/mail_config.h"
 #include "settings/update_schedule.h"
 #include "settings/web_utils.h"
-#include "storage/storage_config.h"
+#include "storage/volume_list.h"
 
 #include <strings.h>
 

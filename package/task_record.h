@@ -1,5 +1,5 @@
-// The package task record that long operations share: ids, and the liveness
-// rule readers apply.
+// The package task record that long operations share: ids (named by the task
+// manager, taskmgr/task_names.h), and the liveness rule readers apply.
 #pragma once
 
 #include <string>
@@ -7,14 +7,16 @@
 #include <json/value.h>
 
 #include "taskmgr/task.h"
+#include "taskmgr/task_names.h"
 
 namespace KIVO_PACKAGE {
 
-constexpr char kTaskOwner[] = "@administrators";
-constexpr char kUploadPrefix[] = "@KIVOPKG_UPLOAD_";
-constexpr char kDownloadPrefix[] = "@KIVOPKG_DOWNLOAD_";
-constexpr char kStartStopPrefix[] = "@KIVOPKG_STARTSTOP_";
-constexpr char kUninstallPrefix[] = "@KIVOPKG_UNINSTALL_";
+using KIVOPackageTasks::kDownloadPrefix;
+using KIVOPackageTasks::kPackageTaskPrefix;
+using KIVOPackageTasks::kStartStopPrefix;
+using KIVOPackageTasks::kTaskOwner;
+using KIVOPackageTasks::kUninstallPrefix;
+using KIVOPackageTasks::kUploadPrefix;
 
 // True when `data` names an integer "pid" of a living process.
 bool TaskProcessAlive(const Json::Value& data);

@@ -1,5 +1,5 @@
 #!/usr/bin/env bash
-# Builds the package center page (web/) into build/page with the exact
+# Builds the package center page (web/) into build/page (or $BUILD_DIR/page) with the exact
 # packages of web/package-lock.json. Needs Node.js 20.19 or newer and npm.
 set -euo pipefail
 cd "$(dirname "$0")/../web"
@@ -9,4 +9,6 @@ if ! cmp -s package-lock.json node_modules/.package-lock.json.installed 2>/dev/n
   npm ci --no-audit --no-fund --loglevel=error
   cp package-lock.json node_modules/.package-lock.json.installed
 fi
-KIVO_PAGE_OUT=../build/page npx vite build --logLevel warn
+BUILD=${BUILD_DIR:-build}
+case $BUILD in /*) ;; *) BUILD="$(cd .. && pwd)/$BUILD" ;; esac
+KIVO_PAGE_OUT=$BUILD/page npx vite build --logLevel warn

@@ -3,9 +3,14 @@
 # the account admin, the sample packages (two of them installed and
 # running), the vendor's package server under /feed/, a community feed under
 # /community/, the package center page at / and ROOT/lighttpd.conf. Both the
-# demo and the page's browser tests use it; it expects a finished build.
+# demo and the page's browser tests use it; it expects a finished build in
+# build/ (or $BUILD_DIR).
 #
 #   scripts/demo-root.sh ROOT PORT [cgi|scgi]     password: $KIVO_DEMO_PASSWORD (admin)
+#
+# demo-web serves its page on $DEMO_WEB_PORT (8095): appliances that run on
+# one machine at once (the demo, each browser test's) give it ports of their
+# own.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 ROOT=$1
@@ -13,20 +18,23 @@ PORT=$2
 MODE=${3:-scgi}
 PASSWORD=${KIVO_DEMO_PASSWORD:-admin}
 
-K="build/bin/kivoctl --root $ROOT"
-build/bin/kivoctl init-root "$ROOT"
+BUILD=${BUILD_DIR:-build}
+K="$BUILD/bin/kivoctl --root $ROOT"
+$BUILD/bin/kivoctl init-root "$ROOT"
 $K user-add admin --password "$PASSWORD" --group administrators
 # The web API runs in kivo-webd behind lighttpd's SCGI module (a forked
 # process per request; lighttpd starts it and starts it again if it ends).
 # Mode cgi runs entry.cgi per request instead.
 $K web-config --mode "$MODE" --port "$PORT" > "$ROOT/lighttpd.conf"
 
-# The sample packages, signed by a demo publisher key that this root trusts.
-examples/build.sh "$PWD/build/bin/kivoctl" "$PWD/build/examples"
+# The sample packages, built for this root (demo-web's port) and signed by a
+# demo publisher key that this root trusts.
+SAMPLES=$ROOT/.samples
+examples/build.sh "$PWD/$BUILD/bin/kivoctl" "$SAMPLES" >/dev/null
 gpg --homedir "$ROOT/usr/kivo/etc/packages/gnupg" --batch --quiet --import \
-  build/examples/demo-publisher.asc 2>/dev/null
+  "$SAMPLES/demo-publisher.asc" 2>/dev/null
 mkdir -p "$ROOT/volume1/public/packages"
-cp build/examples/*.kpk "$ROOT/volume1/public/packages/"
+cp "$SAMPLES"/*.kpk "$ROOT/volume1/public/packages/"
 
 # The two installed packages come from the vendor's package server, as on an
 # appliance, so that their records name the vendor as their origin and the
@@ -37,7 +45,7 @@ cp build/examples/*.kpk "$ROOT/volume1/public/packages/"
 FEED=$ROOT/usr/kivo/www/feed
 if ! $K status demo-web >/dev/null 2>&1 || ! $K status demo-notes >/dev/null 2>&1; then
   rm -rf "$FEED" && mkdir -p "$FEED"
-  cp build/examples/demo-web.kpk build/examples/demo-notes.kpk "$FEED/"
+  cp "$SAMPLES/demo-web.kpk" "$SAMPLES/demo-notes.kpk" "$FEED/"
   $K index "$FEED" --base-url "http://127.0.0.1:$PORT/feed" >/dev/null
   $K server-config --vendor "http://127.0.0.1:$PORT/feed/catalogue.json" >/dev/null
   php -S "127.0.0.1:$PORT" -t "$ROOT/usr/kivo/www" >/dev/null 2>&1 &
@@ -60,7 +68,7 @@ fi
 # indexing so that its download fails cleanly.
 rm -rf "$FEED" && mkdir -p "$FEED"
 for pkg in demo-beta demo-db demo-notes demo-web-update demo-wizard demo-gone; do
-  cp "build/examples/$pkg.kpk" "$FEED/"
+  cp "$SAMPLES/$pkg.kpk" "$FEED/"
 done
 $K index "$FEED" --base-url "http://127.0.0.1:$PORT/feed" --recommend demo-web --recommend demo-beta >/dev/null
 rm "$FEED/demo-gone.kpk"
@@ -86,8 +94,8 @@ rm -rf "$COMMUNITY" "$COMMUNITY_GPG" && mkdir -p "$COMMUNITY" && mkdir -m 700 "$
 gpg --homedir "$COMMUNITY_GPG" --batch --quiet --passphrase '' --quick-gen-key \
   "KIVO Community Publisher <community@kivo.invalid>" ed25519 sign never 2>/dev/null
 CKEY=$(gpg --homedir "$COMMUNITY_GPG" --batch --with-colons --list-secret-keys | awk -F: '/^fpr/ {print $10; exit}')
-cp build/examples/demo-unsigned.kpk "$COMMUNITY/"
-build/bin/kivoctl sign "$COMMUNITY/demo-unsigned.kpk" --homedir "$COMMUNITY_GPG" --key "$CKEY" >/dev/null
+cp "$SAMPLES/demo-unsigned.kpk" "$COMMUNITY/"
+$BUILD/bin/kivoctl sign "$COMMUNITY/demo-unsigned.kpk" --homedir "$COMMUNITY_GPG" --key "$CKEY" >/dev/null
 $K index "$COMMUNITY" --base-url "http://127.0.0.1:$PORT/community" >/dev/null
 gpg --homedir "$COMMUNITY_GPG" --batch --armor --export "$CKEY" >"$COMMUNITY_GPG/community.asc"
 php -r '$f = $argv[1]; $c = json_decode(file_get_contents($f), true);
@@ -98,4 +106,4 @@ gpgconf --homedir "$COMMUNITY_GPG" --kill gpg-agent 2>/dev/null || true
 
 
 # The package center page, built by scripts/build-page.sh.
-cp -r build/page/. "$ROOT/usr/kivo/www/"
+cp -r "$BUILD/page/." "$ROOT/usr/kivo/www/"

@@ -20,6 +20,11 @@ ROOT=$PWD/demo-root
 scripts/build-page.sh
 scripts/demo-root.sh "$ROOT" "$PORT"
 K="build/bin/kivoctl --root $ROOT"
+if [ -f "$ROOT/.stopped-by-demo" ]; then
+  while read -r id; do $K start "$id" >/dev/null || echo "could not start $id again" >&2; done \
+    <"$ROOT/.stopped-by-demo"
+  rm -f "$ROOT/.stopped-by-demo"
+fi
 
 cat <<TXT
 
@@ -30,7 +35,19 @@ Installed: $($K list | tr '\n' ';')
 Sample package files: $ROOT/volume1/public/packages
 Package server: http://127.0.0.1:$PORT/feed/catalogue.json
 Community feed (add it through the API): http://127.0.0.1:$PORT/community/catalogue.json
-Try the curl lines of README.md. Ctrl-C stops the server.
+Try the curl lines of README.md. Ctrl-C stops the server and the packages.
 
 TXT
-exec /usr/sbin/lighttpd -D -f "$ROOT/lighttpd.conf"
+# The demo's packages end with it: a service left running (demo-web on its
+# port above all) would stand in the way of the next demo or of the tests.
+# The ones it stops run again when the demo starts again.
+STOPPED=$ROOT/.stopped-by-demo
+stop_packages() {
+  $K list | awk '$NF == "running" {print $1}' >"$STOPPED.tmp" && mv "$STOPPED.tmp" "$STOPPED"
+  while read -r id; do $K stop "$id" >/dev/null || echo "could not stop $id" >&2; done <"$STOPPED"
+  echo "stopped: $(tr '\n' ' ' <"$STOPPED")"
+}
+trap stop_packages EXIT
+# Ctrl-C reaches lighttpd, which ends; the shell goes on to the trap above.
+trap : INT TERM
+/usr/sbin/lighttpd -D -f "$ROOT/lighttpd.conf"

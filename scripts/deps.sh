@@ -15,7 +15,7 @@ PACKAGES=(
   g++ cmake ninja-build pkg-config ccache clang-format clang libclang-rt-dev
   libjsoncpp-dev libcrypt-dev libgtest-dev googletest
   libarchive-dev libsqlite3-dev libcurl4-openssl-dev libgpgme-dev libpoco-dev libssl-dev libpng-dev
-  lighttpd php-cli gnupg curl procps
+  lighttpd lighttpd-mod-deflate php-cli gnupg curl procps
 )
 # The page's browser tests drive Debian's chromium; the demo does not need it.
 [ "${1:-}" = --tests ] && PACKAGES+=(chromium)

@@ -1,8 +1,8 @@
 #!/usr/bin/env bash
 # Checks and tests the package center page: type checks and lint, the
 # build (and its JavaScript budget), then the browser tests in Debian's
-# chromium against real appliances made from build/ (scripts/demo-root.sh).
-# Screenshots of each screen land in build/screenshots/.
+# chromium against real appliances made from build/ or $BUILD_DIR
+# (scripts/demo-root.sh). Screenshots of each screen land in its screenshots/.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/build-page.sh
@@ -11,7 +11,7 @@ npm run --silent check
 # The appliance serves the page over slow links too: all its JavaScript,
 # gzipped, stays under 150 KB.
 total=0
-for f in ../build/page/assets/*.js; do total=$((total + $(gzip -9c "$f" | wc -c))); done
+for f in "../${BUILD_DIR:-build}"/page/assets/*.js; do total=$((total + $(gzip -9c "$f" | wc -c))); done
 echo "page JavaScript: $total bytes gzipped"
 if [ "$total" -ge 153600 ]; then
   echo "the page's JavaScript is over its 150 KB budget" >&2

@@ -11,23 +11,17 @@
 
 #include <gtest/gtest.h>
 
+#include "host/host_api.h"
 #include "klibc/key_value_file.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/temp_root.h"
 
 namespace {
 
-constexpr int kThrottled = 407;
-constexpr int kWrongPassword = 400;
-constexpr int kBadRequest = 101;
-constexpr int kNotSignedIn = 119;
-
-class AuthTest : public ::testing::Test {
+class AuthTest : public AdminApiTest {
  protected:
-  void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    root_.AddAccount("ops", "ops-pw", {"administrators"});
-  }
+  void SetUp() override { root_.AddAccount("ops", "ops-pw", {"administrators"}); }
 
   void Configure(const std::string& settings) { root_.Write("/etc/kivo/webapi.conf", settings); }
 
@@ -51,7 +45,7 @@ class AuthTest : public ::testing::Test {
     CgiAnswer a = RunEntryCgi(
         {{"REQUEST_METHOD", "GET"},
          {"QUERY_STRING", "api=KIVO.Core.Package.Log&version=1&method=get&name=x&_sid=" + sid}});
-    EXPECT_TRUE(a.Success() || a.Code() == kNotSignedIn) << a.body;
+    EXPECT_TRUE(a.Success() || a.Code() == kErrNotSignedIn) << a.body;
     return a.Success();
   }
 
@@ -68,14 +62,12 @@ class AuthTest : public ::testing::Test {
     if (d) closedir(d);
     return users;
   }
-
-  TempRoot root_;
 };
 
 // Refused for a while; `retry_after` is somewhat less than the whole wait
 // when the machine is slow to run the attempts.
 void ExpectThrottled(const CgiAnswer& a, long min_retry_after, long max_retry_after) {
-  EXPECT_EQ(kThrottled, a.Code()) << a.body;
+  EXPECT_EQ(kErrSignInThrottled, a.Code()) << a.body;
   EXPECT_LE(min_retry_after, a.Errors()["retry_after"].asInt64()) << a.body;
   EXPECT_GE(max_retry_after, a.Errors()["retry_after"].asInt64()) << a.body;
   EXPECT_FALSE(a.Errors()["reason"].asString().empty()) << a.body;
@@ -89,7 +81,8 @@ TEST_F(AuthTest, FailedSignInsHoldBackTheirAddressUntilTheBackOffPasses) {
   Configure("login_free_failures=\"3\"\nlogin_backoff_base=\"2\"\nlogin_backoff_max=\"60\"\n");
   const std::string first = "192.0.2.66", second = "192.0.2.67";
   for (const std::string& address : {first, second}) {
-    for (int i = 0; i < 3; ++i) EXPECT_EQ(kWrongPassword, SignIn("admin", "guess", address).Code());
+    for (int i = 0; i < 3; ++i)
+      EXPECT_EQ(kErrWrongPassword, SignIn("admin", "guess", address).Code());
     // The right password is refused too while the back-off lasts, and
     // waiting attempts do not lengthen it.
     ExpectThrottled(SignIn("admin", "secret", address), 1, 2);
@@ -99,11 +92,11 @@ TEST_F(AuthTest, FailedSignInsHoldBackTheirAddressUntilTheBackOffPasses) {
   // Once the wait is over the right password is taken; another failure
   // instead doubles the wait.
   EXPECT_TRUE(SignIn("admin", "secret", first).Success());
-  EXPECT_EQ(kWrongPassword, SignIn("admin", "guess", second).Code());
+  EXPECT_EQ(kErrWrongPassword, SignIn("admin", "guess", second).Code());
   ExpectThrottled(SignIn("admin", "secret", second), 3, 4);
 
   // A success forgets the failures: the free ones are free again.
-  for (int i = 0; i < 3; ++i) EXPECT_EQ(kWrongPassword, SignIn("admin", "guess", first).Code());
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(kErrWrongPassword, SignIn("admin", "guess", first).Code());
   ExpectThrottled(SignIn("admin", "secret", first), 1, 2);
 }
 
@@ -112,9 +105,9 @@ TEST_F(AuthTest, ASuccessOnASharedAddressDoesNotLengthenTheNextPersonsWait) {
   const std::string office = "192.0.2.80";
   // Someone at the office mistypes ops's password twice: the second try
   // already waits, and after it the office waits 2 seconds.
-  EXPECT_EQ(kWrongPassword, SignIn("ops", "typo", office).Code());
+  EXPECT_EQ(kErrWrongPassword, SignIn("ops", "typo", office).Code());
   WaitSeconds(1.2);
-  EXPECT_EQ(kWrongPassword, SignIn("ops", "typo", office).Code());
+  EXPECT_EQ(kErrWrongPassword, SignIn("ops", "typo", office).Code());
   ExpectThrottled(SignIn("admin", "secret", office), 1, 2);
   WaitSeconds(2.2);
   // Once that wait is over, one colleague after another signs in rightly:
@@ -128,7 +121,8 @@ TEST_F(AuthTest, ASuccessOnASharedAddressDoesNotLengthenTheNextPersonsWait) {
 TEST_F(AuthTest, AddressesAreCountedApartAndGuessesSpreadOverManyHoldBackTheAccount) {
   Configure("login_free_failures=\"3\"\nlogin_backoff_base=\"60\"\n");
   const std::string attacker = "192.0.2.66";
-  for (int i = 0; i < 3; ++i) EXPECT_EQ(kWrongPassword, SignIn("admin", "guess", attacker).Code());
+  for (int i = 0; i < 3; ++i)
+    EXPECT_EQ(kErrWrongPassword, SignIn("admin", "guess", attacker).Code());
   ExpectThrottled(SignIn("admin", "secret", attacker), 50, 60);
   // One address cannot lock the account: its owner elsewhere signs in, and
   // that does not free the guessing address.
@@ -137,18 +131,19 @@ TEST_F(AuthTest, AddressesAreCountedApartAndGuessesSpreadOverManyHoldBackTheAcco
 
   // Every address of one IPv6 /64 is one address; an IPv4-mapped one is the
   // IPv4 address.
-  EXPECT_EQ(kWrongPassword, SignIn("nobody", "x", "2001:db8:1:2::1").Code());
-  EXPECT_EQ(kWrongPassword, SignIn("nobody", "x", "2001:db8:1:2::2").Code());
-  EXPECT_EQ(kWrongPassword, SignIn("nobody", "x", "2001:db8:1:2:ffff::3").Code());
+  EXPECT_EQ(kErrWrongPassword, SignIn("nobody", "x", "2001:db8:1:2::1").Code());
+  EXPECT_EQ(kErrWrongPassword, SignIn("nobody", "x", "2001:db8:1:2::2").Code());
+  EXPECT_EQ(kErrWrongPassword, SignIn("nobody", "x", "2001:db8:1:2:ffff::3").Code());
   ExpectThrottled(SignIn("ops", "ops-pw", "2001:db8:1:2::4"), 50, 60);
   EXPECT_TRUE(SignIn("ops", "ops-pw", "2001:db8:1:3::1").Success());
-  for (int i = 0; i < 3; ++i) EXPECT_EQ(kWrongPassword, SignIn("ops", "x", "203.0.113.5").Code());
+  for (int i = 0; i < 3; ++i)
+    EXPECT_EQ(kErrWrongPassword, SignIn("ops", "x", "203.0.113.5").Code());
   ExpectThrottled(SignIn("ops", "ops-pw", "::ffff:203.0.113.5"), 50, 60);
 
   // Three more addresses guessing admin's password, one try each: admin is
   // now held back from a fourth address too, ops is not.
   for (const char* address : {"203.0.113.21", "203.0.113.22", "203.0.113.23"})
-    EXPECT_EQ(kWrongPassword, SignIn("admin", "guess", address).Code());
+    EXPECT_EQ(kErrWrongPassword, SignIn("admin", "guess", address).Code());
   ExpectThrottled(SignIn("admin", "secret", "203.0.113.24"), 50, 60);
   EXPECT_TRUE(SignIn("ops", "ops-pw", "203.0.113.24").Success());
 }
@@ -160,8 +155,8 @@ TEST_F(AuthTest, RacingGuessesAreCountedBeforeTheirPasswordIsChecked) {
   for (size_t i = 0; i < codes.size(); ++i)
     threads.emplace_back([&codes, i] { codes[i] = SignIn("admin", "guess").Code(); });
   for (std::thread& t : threads) t.join();
-  EXPECT_EQ(3, std::count(codes.begin(), codes.end(), kWrongPassword));
-  EXPECT_EQ(9, std::count(codes.begin(), codes.end(), kThrottled));
+  EXPECT_EQ(3, std::count(codes.begin(), codes.end(), kErrWrongPassword));
+  EXPECT_EQ(9, std::count(codes.begin(), codes.end(), kErrSignInThrottled));
 }
 
 TEST_F(AuthTest, ADamagedAttemptsFileIsStartedAfresh) {
@@ -174,7 +169,7 @@ TEST_F(AuthTest, ADamagedAttemptsFileIsStartedAfresh) {
                     "\"many\"}}}, \"accounts\": {\"admin\": []}}")}) {
     root_.Write(file, damage);
     EXPECT_TRUE(SignIn("admin", "secret").Success()) << damage;
-    EXPECT_EQ(kWrongPassword, SignIn("admin", "guess", "192.0.2.11").Code()) << damage;
+    EXPECT_EQ(kErrWrongPassword, SignIn("admin", "guess", "192.0.2.11").Code()) << damage;
     ExpectThrottled(SignIn("admin", "secret", "192.0.2.11"), 50, 60);
   }
 }
@@ -183,7 +178,7 @@ TEST_F(AuthTest, ADamagedAttemptsFileIsStartedAfresh) {
 template <typename Fn>
 double MedianSeconds(Fn sign_in, std::vector<double>* samples) {
   auto start = std::chrono::steady_clock::now();
-  EXPECT_EQ(kWrongPassword, sign_in().Code());
+  EXPECT_EQ(kErrWrongPassword, sign_in().Code());
   samples->push_back(
       std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count());
   std::vector<double> sorted = *samples;
@@ -228,7 +223,7 @@ TEST_F(AuthTest, PasswordsAreTakenOnlyFromAPostBody) {
   const std::string login = "api=KIVO.API.Auth&version=1&method=login";
   CgiAnswer get = RunEntryCgi(
       {{"REQUEST_METHOD", "GET"}, {"QUERY_STRING", login + "&account=admin&passwd=secret"}});
-  EXPECT_EQ(kBadRequest, get.Code()) << get.body;
+  EXPECT_EQ(kErrBadRequest, get.Code()) << get.body;
   EXPECT_NE(std::string::npos, get.Errors()["reason"].asString().find("POST")) << get.body;
 
   // A POST whose query string carries the password or the account.
@@ -243,7 +238,7 @@ TEST_F(AuthTest, PasswordsAreTakenOnlyFromAPostBody) {
                                   {"CONTENT_TYPE", "application/x-www-form-urlencoded"},
                                   {"CONTENT_LENGTH", std::to_string(p.body.size())}},
                                  p.body);
-    EXPECT_EQ(kBadRequest, post.Code()) << p.query << ": " << post.body;
+    EXPECT_EQ(kErrBadRequest, post.Code()) << p.query << ": " << post.body;
   }
   EXPECT_TRUE(SessionUsers().empty());
   EXPECT_TRUE(SignIn("admin", "secret").Success());
@@ -258,8 +253,8 @@ TEST_F(AuthTest, TheCookieSessionTellsAReloadedPageItsTokenAndRole) {
     return RunEntryCgi(
         {{"REQUEST_METHOD", "GET"}, {"QUERY_STRING", query + extra}, {"HTTP_COOKIE", cookie}});
   };
-  EXPECT_EQ(kNotSignedIn, ask("").Code());
-  EXPECT_EQ(kNotSignedIn, ask("id=0123456789abcdef0123456789abcdef").Code());
+  EXPECT_EQ(kErrNotSignedIn, ask("").Code());
+  EXPECT_EQ(kErrNotSignedIn, ask("id=0123456789abcdef0123456789abcdef").Code());
 
   CgiAnswer admin = SignIn("admin", "secret");
   ASSERT_TRUE(admin.Success()) << admin.body;
@@ -269,7 +264,7 @@ TEST_F(AuthTest, TheCookieSessionTellsAReloadedPageItsTokenAndRole) {
   EXPECT_EQ("admin", a.Data()["account"].asString());
   EXPECT_EQ(admin.Data()["token"], a.Data()["token"]);
   EXPECT_TRUE(a.Data()["administrator"].asBool());
-  EXPECT_EQ(kNotSignedIn, ask("", "&_sid=" + sid).Code());
+  EXPECT_EQ(kErrNotSignedIn, ask("", "&_sid=" + sid).Code());
 
   CgiAnswer viewer = SignIn("viewer", "view-pw");
   ASSERT_TRUE(viewer.Success()) << viewer.body;
@@ -282,7 +277,7 @@ TEST_F(AuthTest, TheCookieSessionTellsAReloadedPageItsTokenAndRole) {
                                {"HTTP_COOKIE", "id=" + sid},
                                {"HTTP_X_KIVO_TOKEN", a.Data()["token"].asString()}});
   ASSERT_TRUE(out.Success()) << out.body;
-  EXPECT_EQ(kNotSignedIn, ask("id=" + sid).Code());
+  EXPECT_EQ(kErrNotSignedIn, ask("id=" + sid).Code());
 }
 
 }  // namespace

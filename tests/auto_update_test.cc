@@ -21,8 +21,7 @@ namespace {
 class AutoUpdateTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    root_.Write("/etc/kivo/pkgserver.conf",
-                "vendor_url=\"" + vendor_.Url() + "\"\nconnect_timeout=\"2\"\n");
+    root_.Write("/etc/kivo/pkgserver.conf", VendorConf(vendor_.Url()));
     Settings("yes", "yes", "stable");
   }
   void TearDown() override {
@@ -42,9 +41,7 @@ class AutoUpdateTest : public ::testing::Test {
   void InstallOld(const std::string& id) {
     TestPackage v1;
     v1.id = id;
-    vendor_.Add(v1);
-    ASSERT_TRUE(vendor_.Index());
-    vendor_.Publish();
+    ASSERT_TRUE(vendor_.Offer(v1));
     std::string out;
     ASSERT_EQ(0, Kivoctl({"install-server", id, "--run"}, &out)) << out;
   }

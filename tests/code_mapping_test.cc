@@ -15,6 +15,7 @@
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/signature.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/gpg_keys.h"
 #include "testing/package_factory.h"
@@ -52,24 +53,14 @@ int ListenOnSomePort(int* port) {
   return fd;
 }
 
-class CodeMappingTest : public ::testing::Test {
+class CodeMappingTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
     Trust(1);
     dir_ = root_.Path("/tmp/packages");
     ASSERT_EQ(0, KIVOFSMkdirP(dir_.c_str()));
   }
-  void TearDown() override {
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
-  void Trust(int level) {
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"" + std::to_string(level) + "\"\n");
-  }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
-  }
+  void TearDown() override { StopInstalledPackages(); }
   CgiAnswer Upload(const std::string& file) {
     return client().Upload(kInst, "upload", 1, {}, file);
   }
@@ -79,9 +70,7 @@ class CodeMappingTest : public ::testing::Test {
     return client().Call(kInst, "install", 1, params);
   }
 
-  TempRoot root_;
   std::string dir_;
-  std::unique_ptr<ApiClient> client_;
 };
 
 // Signature outcomes: lenient at upload ("codesign_error"), the error of a

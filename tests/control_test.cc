@@ -13,22 +13,20 @@
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "taskmgr/task.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
 
 namespace {
 
-class ControlTest : public ::testing::Test {
+class ControlTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
+    Trust(1);
     dir_ = root_.Path("/tmp/packages");
   }
-  void TearDown() override {
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
+  void TearDown() override { StopInstalledPackages(); }
 
   // A package whose start and stop append its id to one shared file, so the
   // order of a batch shows.
@@ -58,7 +56,7 @@ class ControlTest : public ::testing::Test {
     ASSERT_EQ(0, Kivoctl(args, &out)) << out;
   }
   CgiAnswer Call(const std::string& api, const std::string& method, const Params& params) {
-    return ApiClient("admin", "secret").Call(api, method, 1, params);
+    return client().Call(api, method, 1, params);
   }
   std::string Order() {
     std::string text;
@@ -75,7 +73,6 @@ class ControlTest : public ::testing::Test {
     return n - 2;
   }
 
-  TempRoot root_;
   std::string dir_;
 };
 

@@ -3,7 +3,6 @@
 // forked children (SCGI).
 
 #include <sys/socket.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -14,6 +13,7 @@
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
 #include "testing/web_server.h"
+#include "webapi/api_codes.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
@@ -27,24 +27,10 @@ struct HttpAnswer {
 
 // Runs curl with `args` and returns the response headers and parsed body.
 HttpAnswer Curl(const std::vector<std::string>& args) {
-  std::vector<const char*> argv = {"curl", "-s", "-i"};
-  for (const std::string& a : args) argv.push_back(a.c_str());
-  argv.push_back(nullptr);
-  int fds[2];
-  EXPECT_EQ(0, pipe(fds));
-  pid_t pid = fork();
-  if (pid == 0) {
-    dup2(fds[1], STDOUT_FILENO);
-    execv("/usr/bin/curl", const_cast<char* const*>(argv.data()));
-    _exit(127);
-  }
-  close(fds[1]);
+  std::vector<std::string> argv = {"/usr/bin/curl", "-s", "-i"};
+  argv.insert(argv.end(), args.begin(), args.end());
   std::string raw;
-  char buf[4096];
-  for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) > 0;)
-    raw.append(buf, static_cast<size_t>(n));
-  close(fds[0]);
-  waitpid(pid, nullptr, 0);
+  RunProgram(argv, &raw);
   HttpAnswer answer;
   size_t split = raw.find("\r\n\r\n");
   answer.head = raw.substr(0, split);
@@ -55,12 +41,29 @@ HttpAnswer Curl(const std::vector<std::string>& args) {
   return answer;
 }
 
+// A session signed in through lighttpd: its cookie jar and token.
+struct HttpSession {
+  HttpAnswer login;
+  std::string jar;
+  std::string token;
+};
+
 class EndToEndHttpTest : public testing::TestWithParam<WebMode> {
  protected:
   WebServerOptions Options() const {
     WebServerOptions options;
     options.mode = GetParam();
     return options;
+  }
+  // Signs the administrator in at `url`, keeping the cookie in a jar under `root`.
+  static HttpSession SignIn(const TempRoot& root, const std::string& url) {
+    HttpSession session;
+    session.jar = root.Path("/cookies");
+    session.login =
+        Curl({"-c", session.jar, "--data",
+              "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret", url});
+    session.token = session.login.json["data"]["token"].asString();
+    return session;
   }
 };
 
@@ -72,25 +75,20 @@ TEST_P(EndToEndHttpTest, SignInQueryAndReadALogThroughLighttpd) {
   WebServer server(root.dir(), Options());
   ASSERT_TRUE(server.running());
   const std::string url = server.EntryURL();
-  const std::string jar = root.Path("/cookies");
-
-  HttpAnswer login =
-      Curl({"-c", jar, "--data",
-            "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret", url});
-  ASSERT_TRUE(login.json["success"].asBool()) << login.head;
-  EXPECT_NE(std::string::npos, login.head.find("application/json"));
-  std::string token = login.json["data"]["token"].asString();
+  HttpSession admin = SignIn(root, url);
+  ASSERT_TRUE(admin.login.json["success"].asBool()) << admin.login.head;
+  EXPECT_NE(std::string::npos, admin.login.head.find("application/json"));
 
   HttpAnswer info = Curl({url + "?api=KIVO.API.Info&version=1&method=query"});
   EXPECT_EQ(2, info.json["data"]["KIVO.Core.Package.Installation"]["maxVersion"].asInt());
 
   const std::string log_url = url + "?api=KIVO.Core.Package.Log&version=1&method=get&name=demo";
-  HttpAnswer log = Curl({"-b", jar, "-H", "X-KIVO-Token: " + token, log_url});
+  HttpAnswer log = Curl({"-b", admin.jar, "-H", "X-KIVO-Token: " + admin.token, log_url});
   EXPECT_EQ("hello from demo\n", log.json["data"]["pkglog"].asString()) << log.head;
 
-  EXPECT_EQ(105, Curl({"-b", jar, log_url}).json["error"]["code"].asInt());
-  EXPECT_EQ(119, Curl({log_url}).json["error"]["code"].asInt());
-  EXPECT_EQ(101, Curl({url + "?api=%zz"}).json["error"]["code"].asInt());
+  EXPECT_EQ(kErrNotPermitted, Curl({"-b", admin.jar, log_url}).json["error"]["code"].asInt());
+  EXPECT_EQ(kErrNotSignedIn, Curl({log_url}).json["error"]["code"].asInt());
+  EXPECT_EQ(kErrBadRequest, Curl({url + "?api=%zz"}).json["error"]["code"].asInt());
 }
 
 TEST_P(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
@@ -104,23 +102,19 @@ TEST_P(EndToEndHttpTest, UploadInstallAndListThroughLighttpd) {
   WebServer server(root.dir(), Options());
   ASSERT_TRUE(server.running());
   const std::string url = server.EntryURL();
-  const std::string jar = root.Path("/cookies");
-  HttpAnswer login =
-      Curl({"-c", jar, "--data",
-            "api=KIVO.API.Auth&version=1&method=login&account=admin&passwd=secret", url});
-  std::string token = login.json["data"]["token"].asString();
-  const std::string header = "X-KIVO-Token: " + token;
+  HttpSession admin = SignIn(root, url);
+  const std::string header = "X-KIVO-Token: " + admin.token;
 
-  HttpAnswer up = Curl({"-b", jar, "-H", header, "-F", "file=@" + file,
+  HttpAnswer up = Curl({"-b", admin.jar, "-H", header, "-F", "file=@" + file,
                         url + "?api=KIVO.Core.Package.Installation&version=1&method=upload"});
   ASSERT_TRUE(up.json["success"].asBool()) << up.head;
   std::string task = up.json["data"]["task_id"].asString();
   HttpAnswer install =
-      Curl({"-b", jar, "-H", header, "--data",
+      Curl({"-b", admin.jar, "-H", header, "--data",
             "api=KIVO.Core.Package.Installation&version=1&method=install&task_id=" + task, url});
   ASSERT_TRUE(install.json["success"].asBool()) << install.head;
   HttpAnswer list =
-      Curl({"-b", jar, "-H", header, url + "?api=KIVO.Core.Package&version=1&method=list"});
+      Curl({"-b", admin.jar, "-H", header, url + "?api=KIVO.Core.Package&version=1&method=list"});
   EXPECT_EQ("http-app", list.json["data"]["packages"][0]["id"].asString());
   std::string big;
   ASSERT_TRUE(KIVOReadFile(root.Path("/var/packages/http-app/target/big.bin"), &big));

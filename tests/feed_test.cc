@@ -15,6 +15,8 @@
 
 #include "klibc/atomic_file.h"
 #include "pkgserver/feed_keys.h"
+#include "testing/admin_api_test.h"
+#include "testing/catalogue_feed.h"
 #include "testing/cgi_client.h"
 #include "testing/gpg_keys.h"
 #include "testing/http_test_server.h"
@@ -30,14 +32,6 @@ constexpr char kFeedApi[] = "KIVO.Core.Package.Feed";
 constexpr char kFeedFile[] = "/usr/kivo/etc/packages/feeds";
 constexpr char kCatalogue[] = R"({"packages": [], "recommend": []})";
 
-// `value` as JSON text, quoted again as a JSON string: the "list" parameter
-// is a string that holds JSON.
-std::string ListParam(const Json::Value& value) {
-  Json::StreamWriterBuilder b;
-  b["indentation"] = "";
-  return Json::writeString(b, Json::Value(Json::writeString(b, value)));
-}
-
 Json::Value Feed(const std::string& feed, const std::string& name = "") {
   Json::Value v(Json::objectValue);
   v["feed"] = feed;
@@ -45,14 +39,11 @@ Json::Value Feed(const std::string& feed, const std::string& name = "") {
   return v;
 }
 
-class FeedTest : public ::testing::Test {
+class FeedTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
     root_.Write("/etc/kivo/pkgserver.conf",
-                "vendor_url=\"http://127.0.0.1:1/none\"\nconnect_timeout=\"2\"\n"
-                "catalogue_timeout=\"2\"\n");
-    client_.reset(new ApiClient("admin", "secret"));
+                VendorConf("http://127.0.0.1:1/none", "catalogue_timeout=\"2\"\n"));
     Serve("/a", kCatalogue);
     Serve("/b", kCatalogue);
   }
@@ -63,7 +54,7 @@ class FeedTest : public ::testing::Test {
     server_.Set(path, route);
   }
   CgiAnswer Call(const std::string& method, const Params& params = {}) {
-    return client_->Call(kFeedApi, method, 1, params);
+    return client().Call(kFeedApi, method, 1, params);
   }
   CgiAnswer Add(const Json::Value& item) { return Call("add", {{"list", ListParam(item)}}); }
   CgiAnswer Set(const Json::Value& change) { return Call("set", {{"list", ListParam(change)}}); }
@@ -74,9 +65,7 @@ class FeedTest : public ::testing::Test {
   Json::Value Items() { return Call("list").Data()["items"]; }
   std::string Url(const std::string& path) { return server_.Url(path); }
 
-  TempRoot root_;
   HttpTestServer server_;
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(FeedTest, ListsNoFileAnEmptyFileAndAnEmptyArray) {

@@ -7,10 +7,10 @@
 #include <unistd.h>
 
 #include <gtest/gtest.h>
-#include <json/writer.h>
 
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
+#include "testing/admin_api_test.h"
 #include "testing/catalogue_feed.h"
 #include "testing/cgi_client.h"
 #include "testing/gpg_keys.h"
@@ -23,21 +23,13 @@ namespace {
 constexpr char kInst[] = "KIVO.Core.Package.Installation";
 constexpr char kTask[] = "@KIVOPKG_DOWNLOAD_feed-app";
 
-// `value` as JSON text, quoted again as a JSON string ("list" holds JSON).
-std::string ListParam(const Json::Value& value) {
-  Json::StreamWriterBuilder b;
-  b["indentation"] = "";
-  return Json::writeString(b, Json::Value(Json::writeString(b, value)));
-}
-
-class FeedTrustTest : public ::testing::Test {
+class FeedTrustTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"0\"\n");
-    root_.Write("/etc/kivo/pkgserver.conf",
-                "vendor_url=\"http://127.0.0.1:1/none\"\nconnect_timeout=\"2\"\n"
-                "catalogue_timeout=\"2\"\ndownload_stall_timeout=\"2\"\n");
+    Trust(0);
+    root_.Write("/etc/kivo/pkgserver.conf", VendorConf("http://127.0.0.1:1/none",
+                                                       "catalogue_timeout=\"2\"\n"
+                                                       "download_stall_timeout=\"2\"\n"));
     keys_.reset(new TestKeys(root_.Path("/publisher")));
     signer_ = keys_->Create("Community Publisher <community@test.invalid>");
     TestPackage app;
@@ -46,46 +38,24 @@ class FeedTrustTest : public ::testing::Test {
     file_ = feed_.Add(app);
     keys_->Sign(file_, signer_);
     ASSERT_TRUE(feed_.Index());
-    std::string key;
-    ASSERT_EQ(0, RunProgram({"sh", "-c",
-                             "gpg --homedir '" + keys_->home() + "' --batch --armor --export " +
-                                 signer_ + " 2>/dev/null"},
-                            &key));
-    feed_.catalogue()["keyrings"].append(key);
+    feed_.catalogue()["keyrings"].append(keys_->Export(signer_));
     feed_.Publish();
   }
-  void TearDown() override {
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
-  }
+  void TearDown() override { StopInstalledPackages(); }
   CgiAnswer Call(const std::string& api, const std::string& method, const Params& params = {}) {
     return client().Call(api, method, 1, params);
   }
   CgiAnswer FeedCall(const std::string& method, const Json::Value& list) {
     return Call("KIVO.Core.Package.Feed", method, {{"list", ListParam(list)}});
   }
-  // Polls "status" until the download task is finished (or 10 s pass).
-  CgiAnswer WaitFinished() {
-    CgiAnswer s;
-    for (int i = 0; i < 200; ++i) {
-      s = Call(kInst, "status", {{"task_id", kTask}});
-      if (s.Data()["finished"].asBool()) break;
-      usleep(50000);
-    }
-    return s;
-  }
+  CgiAnswer WaitFinished() { return WaitTaskFinished(client(), kTask); }
   // Scratch keyrings left in the root's tmp/.
   int ScratchHomes() { return CountEntries(root_.Path("/tmp"), "source-keys-"); }
 
-  TempRoot root_;
   HttpTestServer server_;
   CatalogueFeed feed_{server_, root_.Path("/feed"), "/feed"};
   std::unique_ptr<TestKeys> keys_;
   std::string signer_, file_;
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(FeedTrustTest, FeedKeyVouchesOnlyForItsOwnDownloadsWhileTheFeedIsListed) {

@@ -3,8 +3,6 @@
 #include <array>
 #include <chrono>
 #include <cstdio>
-#include <fstream>
-#include <sstream>
 #include <thread>
 #include <unistd.h>
 
@@ -12,6 +10,8 @@
 
 #include "pkgserver/server_net.h"
 #include "pkgtool/package_file.h"
+#include "testing/admin_api_test.h"
+#include "testing/catalogue_feed.h"
 #include "testing/cgi_client.h"
 #include "testing/http_test_server.h"
 #include "testing/package_factory.h"
@@ -21,17 +21,8 @@ namespace {
 
 const char kImages[] = "/usr/kivo/kivoman/webman/modules/PkgManApp/images/";
 
-std::string ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream s;
-  s << in.rdbuf();
-  return s.str();
-}
-
-class ImageTest : public ::testing::Test {
+class ImageTest : public AdminApiTest {
  protected:
-  void SetUp() override { root_.AddAccount("admin", "secret", {"administrators"}); }
-
   // A registry record as the package tool leaves it, with the given members.
   void Install(const std::string& id, const std::string& version,
                const std::map<std::string, std::string>& members) {
@@ -41,12 +32,10 @@ class ImageTest : public ::testing::Test {
   }
 
   CgiAnswer Get(const std::string& api, const Params& params) {
-    return ApiClient("admin", "secret").Call(api, "get", 1, params);
+    return client().Call(api, "get", 1, params);
   }
 
-  std::string Fallback(const std::string& name) { return ReadFile(root_.Path(kImages + name)); }
-
-  TempRoot root_;
+  std::string Fallback(const std::string& name) { return FileText(root_.Path(kImages + name)); }
 };
 
 // An image answer: the file's bytes, its length and the cache time.
@@ -190,7 +179,6 @@ HttpRoute RedirectTo(const std::string& location) {
 class ServerImageTest : public ImageTest {
  protected:
   void SetUp() override {
-    ImageTest::SetUp();
     for (HttpTestServer* s : {&vendor_, &feed_, &feed2_, &internal_}) {
       s->Set("/catalogue.json", Serve("{\"packages\": [], \"recommend\": []}"));
     }
@@ -203,9 +191,9 @@ class ServerImageTest : public ImageTest {
   // addresses allowed or not.
   void Configure(bool allow_private, const std::string& vendor_url) {
     root_.Write("/etc/kivo/pkgserver.conf",
-                "vendor_url=\"" + vendor_url +
-                    "\"\nconnect_timeout=\"2\"\ncatalogue_timeout=\"5\"\n" +
-                    (allow_private ? "allow_private_image_addresses=\"yes\"\n" : ""));
+                VendorConf(vendor_url,
+                           std::string("catalogue_timeout=\"5\"\n") +
+                               (allow_private ? "allow_private_image_addresses=\"yes\"\n" : "")));
   }
   void Configure(bool allow_private) { Configure(allow_private, vendor_.Url("/catalogue.json")); }
 
@@ -443,10 +431,9 @@ TEST_F(ServerImageTest, IconAskedRightAfterTheListingWaitsForItsFetch) {
   // The wait is bounded: a fetch in flight that outlasts it (the root lets
   // a fetch take longer than the server's delay) leaves the request the
   // fallback (cached for seconds only), and the server is still asked once.
-  root_.Write("/etc/kivo/pkgserver.conf",
-              "vendor_url=\"" + vendor_.Url("/catalogue.json") +
-                  "\"\nconnect_timeout=\"2\"\ncatalogue_timeout=\"30\"\n"
-                  "allow_private_image_addresses=\"yes\"\n");
+  root_.Write("/etc/kivo/pkgserver.conf", VendorConf(vendor_.Url("/catalogue.json"),
+                                                     "catalogue_timeout=\"30\"\n"
+                                                     "allow_private_image_addresses=\"yes\"\n"));
   const std::string path = "/icons/demo-2.0.png";
   HttpRoute slower = Serve(Png("late icon"));
   slower.delay_ms = 8000;

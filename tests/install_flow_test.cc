@@ -15,6 +15,7 @@
 #include "pkgtool/registry.h"
 #include "taskmgr/sqlite_api.h"
 #include "taskmgr/task.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/gpg_keys.h"
 #include "testing/package_factory.h"
@@ -24,29 +25,28 @@ namespace {
 
 constexpr char kInst[] = "KIVO.Core.Package.Installation";
 
-class InstallFlowTest : public ::testing::Test {
+class InstallFlowTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
     Trust(1);
     dir_ = root_.Path("/tmp/packages");
   }
   void TearDown() override {
-    for (pid_t pid : children_) {
-      kill(pid, SIGKILL);
-      waitpid(pid, nullptr, 0);
-    }
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
-  void Trust(int level) {
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"" + std::to_string(level) + "\"\n");
-  }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
+    KillAndReap(children_);
+    StopInstalledPackages();
   }
   CgiAnswer Upload(const std::string& file, const Params& fields = {}) {
     return client().Upload(kInst, "upload", 1, fields, file);
+  }
+  // Uploads test-app whose preinst script is `preinst`.
+  CgiAnswer UploadWithPreinst(const std::string& preinst) {
+    TestPackage app;
+    app.scripts = {{"preinst", preinst}};
+    return Upload(app.Build(dir_));
+  }
+  // Uploads a package `id` whose INFO adds `info`.
+  CgiAnswer UploadWithInfo(const std::string& id, const std::map<std::string, std::string>& info) {
+    return Upload(PackageWithInfo(id, info).Build(dir_));
   }
   CgiAnswer Call(const std::string& method, const Params& params, int version = 1) {
     return client().Call(kInst, method, version, params);
@@ -105,9 +105,7 @@ class InstallFlowTest : public ::testing::Test {
     NVX::Sqlite()->close(db);
   }
 
-  TempRoot root_;
   std::string dir_;
-  std::unique_ptr<ApiClient> client_;
   std::vector<pid_t> children_;
 };
 
@@ -176,40 +174,24 @@ TEST_F(InstallFlowTest, StatusShowsAnUpgradeInProgress) {
 
 TEST_F(InstallFlowTest, RefusalsAtUploadComeFromRealState) {
   root_.Write("/etc/kivo/device.conf", "os_version=\"7.2-0064\"\n");
-  TestPackage future;
-  future.id = "future";
-  future.info = {{"os_min_ver", "9.0-0001"}};
-  CgiAnswer low = Upload(future.Build(dir_));
+  CgiAnswer low = UploadWithInfo("future", {{"os_min_ver", "9.0-0001"}});
   EXPECT_EQ(4538, low.Code());
   EXPECT_EQ("9.0-0001", low.Errors()["firmware"].asString());
-  TestPackage old;
-  old.id = "old";
-  old.info = {{"os_max_ver", "6.2-0064"}};
-  EXPECT_EQ("6.2-0064", Upload(old.Build(dir_)).Errors()["firmware"].asString());
+  CgiAnswer high = UploadWithInfo("old", {{"os_max_ver", "6.2-0064"}});
+  EXPECT_EQ("6.2-0064", high.Errors()["firmware"].asString());
 
-  TestPackage base;
-  base.id = "base";
-  ASSERT_EQ(0, Kivoctl({"install", base.Build(dir_)}));
-  TestPackage rival;
-  rival.id = "rival";
-  rival.info = {{"install_conflict_packages", "base"}};
-  CgiAnswer conflict = Upload(rival.Build(dir_));
+  ASSERT_EQ(0, Kivoctl({"install", PackageWithInfo("base").Build(dir_)}));
+  CgiAnswer conflict = UploadWithInfo("rival", {{"install_conflict_packages", "base"}});
   EXPECT_EQ(4524, conflict.Code());
   EXPECT_EQ("base", conflict.Errors()["packages"].asString());
 
-  TestPackage needs;
-  needs.id = "needs";
-  needs.info = {{"install_dep_packages", "base:missing-one"}};
-  CgiAnswer dep = Upload(needs.Build(dir_));
+  CgiAnswer dep = UploadWithInfo("needs", {{"install_dep_packages", "base:missing-one"}});
   EXPECT_EQ(4526, dep.Code());
   EXPECT_EQ("base", dep.Errors()["unstart_packages"].asString());
   EXPECT_EQ("missing-one", dep.Errors()["uninstall_packages"][0].asString());
 
   root_.Write("/etc/kivo/services.conf", "pgsql=\"stopped\"\n");
-  TestPackage db;
-  db.id = "db";
-  db.info = {{"install_dep_services", "pgsql"}};
-  CgiAnswer service = Upload(db.Build(dir_));
+  CgiAnswer service = UploadWithInfo("db", {{"install_dep_services", "pgsql"}});
   EXPECT_EQ(4525, service.Code());
   EXPECT_EQ("pgsql", service.Errors()["services"][0].asString());
 
@@ -517,9 +499,7 @@ TEST_F(InstallFlowTest, WorkerMessagesAreOnlyThePackagesOwn) {
 // finished with false and the install task's data still says installing,
 // so "cancel" refuses it (4506) and drops it all the same.
 TEST_F(InstallFlowTest, AFailedInstallStillSaysItWasInstalling) {
-  TestPackage failing;
-  failing.scripts = {{"preinst", "exit 1\n"}};
-  CgiAnswer up = Upload(failing.Build(dir_));
+  CgiAnswer up = UploadWithPreinst("exit 1\n");
   ASSERT_TRUE(up.Success()) << up.body;
   const std::string upload_task = up.Data()["task_id"].asString();
   CgiAnswer install = Call("install", {{"task_id", upload_task}});
@@ -549,9 +529,7 @@ TEST_F(InstallFlowTest, AFailedInstallStillSaysItWasInstalling) {
 // Two installs of one package at once: the second is refused as busy and
 // leaves the first one's task exactly as it was.
 TEST_F(InstallFlowTest, ConcurrentInstallsOfOnePackageKeepTheFirstOnesTask) {
-  TestPackage slow;
-  slow.scripts = {{"preinst", "sleep 2\n"}};
-  CgiAnswer up = Upload(slow.Build(dir_));
+  CgiAnswer up = UploadWithPreinst("sleep 2\n");
   ASSERT_TRUE(up.Success()) << up.body;
   const std::string upload_task = up.Data()["task_id"].asString();
   pid_t first = fork();

@@ -6,8 +6,8 @@
 #include <unistd.h>
 
 #include <gtest/gtest.h>
-#include <json/writer.h>
 
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/gpg_keys.h"
 #include "testing/package_factory.h"
@@ -17,32 +17,25 @@ namespace {
 
 constexpr char kKeyringApi[] = "KIVO.Core.Package.Feed.Keyring";
 
-class KeyringTest : public ::testing::Test {
+class KeyringTest : public AdminApiTest {
  protected:
-  void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    client_.reset(new ApiClient("admin", "secret"));
-  }
   std::string Export(const std::string& fpr, bool secret) { return keys_.Export(fpr, secret); }
   // Posts `content` as the key file, as the page does: the host keeps it in
   // the root's tmp/ for the request, and nothing of it may stay there.
   CgiAnswer Import(const std::string& content) {
     CgiAnswer a =
-        client_->PostFilePart(kKeyringApi, "add", 1, "upload_keyring", "key.asc", content);
+        client().PostFilePart(kKeyringApi, "add", 1, "upload_keyring", "key.asc", content);
     EXPECT_EQ(0, CountEntries(root_.Path("/tmp"), "upload-")) << "an uploaded key file stayed";
     return a;
   }
   Json::Value List() {
-    CgiAnswer a = client_->Call(kKeyringApi, "list", 1);
+    CgiAnswer a = client().Call(kKeyringApi, "list", 1);
     EXPECT_TRUE(a.Success()) << a.body;
     EXPECT_EQ(a.Data()["items"].size(), a.Data()["total"].asUInt());
     return a.Data()["items"];
   }
   CgiAnswer Delete(const Json::Value& fprs) {
-    Json::StreamWriterBuilder b;
-    b["indentation"] = "";
-    return client_->Call(kKeyringApi, "delete", 1,
-                         {{"list", Json::writeString(b, Json::Value(Json::writeString(b, fprs)))}});
+    return client().Call(kKeyringApi, "delete", 1, {{"list", ListParam(fprs)}});
   }
   bool Listed(const std::string& fpr) {
     for (const Json::Value& key : List()) {
@@ -51,9 +44,7 @@ class KeyringTest : public ::testing::Test {
     return false;
   }
 
-  TempRoot root_;
   TestKeys keys_{root_.Path("/test-gnupg")};
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(KeyringTest, ImportsPublicKeysAndRefusesEverythingElse) {
@@ -67,7 +58,7 @@ TEST_F(KeyringTest, ImportsPublicKeysAndRefusesEverythingElse) {
   EXPECT_TRUE(List().empty());
 
   // Without a key file there is nothing to import.
-  EXPECT_EQ(4592, client_->Call(kKeyringApi, "add", 1, {{"upload_keyring", "x"}}).Code());
+  EXPECT_EQ(4592, client().Call(kKeyringApi, "add", 1, {{"upload_keyring", "x"}}).Code());
 
   CgiAnswer ok = Import(Export(fpr, false));
   ASSERT_TRUE(ok.Success()) << ok.body;
@@ -116,7 +107,7 @@ TEST_F(KeyringTest, DeletesInOrderAndStopsAtTheFirstFailure) {
   EXPECT_EQ(4501, Delete(three).Code());
   EXPECT_FALSE(Listed(a));
   EXPECT_TRUE(Listed(c));
-  EXPECT_EQ(4501, client_->Call(kKeyringApi, "delete", 1, {{"list", "\"[not json\""}}).Code());
+  EXPECT_EQ(4501, client().Call(kKeyringApi, "delete", 1, {{"list", "\"[not json\""}}).Code());
 }
 
 }  // namespace

@@ -11,6 +11,7 @@
 #include <json/reader.h>
 
 #include "klibc/atomic_file.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/gpg_keys.h"
 #include "testing/package_factory.h"
@@ -33,9 +34,8 @@ std::string Part(const std::string& name, const std::string& content,
 
 std::string Closing() { return std::string("--") + kBoundary + "--\r\n"; }
 
-class KeyringUploadTest : public ::testing::Test {
+class KeyringUploadTest : public AdminApiTest {
  protected:
-  void SetUp() override { root_.AddAccount("admin", "secret", {"administrators"}); }
   std::string PublicKey() {
     std::string fpr = keys_.Create("Uploaded Publisher <up@test.invalid>"), out;
     EXPECT_EQ(0, RunProgram({"sh", "-c",
@@ -58,10 +58,6 @@ class KeyringUploadTest : public ::testing::Test {
     }
     return RunEntryCgi(env, body);
   }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
-  }
   bool Listed(const std::string& fpr) {
     CgiAnswer a = client().Call("KIVO.Core.Package.Feed.Keyring", "list", 1);
     for (const Json::Value& key : a.Data()["items"]) {
@@ -82,9 +78,7 @@ class KeyringUploadTest : public ::testing::Test {
     return names;
   }
 
-  TempRoot root_;
   TestKeys keys_{root_.Path("/test-gnupg")};
-  std::unique_ptr<ApiClient> client_;
   std::string fpr_;
 };
 

@@ -2,8 +2,6 @@
 // installed by the package tool.
 
 #include <memory>
-#include <signal.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -11,6 +9,7 @@
 #include "klibc/atomic_file.h"
 #include "pkgtool/package_manager.h"
 #include "taskmgr/task.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
@@ -25,18 +24,14 @@ const char kAllKeys[] =
     "\"status\",\"support_center\",\"support_url\",\"uninstall_pages\",\"dependent_packages\","
     "\"start_dependent_services\",\"installing_progress\",\"ctl_uninstall\",\"log_path\"]";
 
-class ListGetTest : public ::testing::Test {
+class ListGetTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
+    Trust(1);
     dir_ = root_.Path("/tmp/packages");
   }
   void TearDown() override {
-    for (pid_t pid : sleepers_) {
-      kill(pid, SIGKILL);
-      waitpid(pid, nullptr, 0);
-    }
+    KillAndReap(sleepers_);
     for (const char* id : {"web-app", "beta-app", "plain"}) Kivoctl({"stop", id});
   }
 
@@ -58,10 +53,6 @@ class ListGetTest : public ::testing::Test {
     }
     return Json::Value();
   }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
-  }
   // A living process whose pid tasks can name.
   pid_t Sleeper() {
     pid_t pid = fork();
@@ -77,9 +68,7 @@ class ListGetTest : public ::testing::Test {
     ASSERT_TRUE(task && task->setProperty("data", data));
   }
 
-  TempRoot root_;
   std::string dir_;
-  std::unique_ptr<ApiClient> client_;
   std::vector<pid_t> sleepers_;
 };
 

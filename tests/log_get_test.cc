@@ -4,15 +4,14 @@
 
 #include "klibc/atomic_file.h"
 #include "klibc/process.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/temp_root.h"
 
 namespace {
 
-class LogGetTest : public ::testing::Test {
+class LogGetTest : public AdminApiTest {
  protected:
-  void SetUp() override { root_.AddAccount("admin", "secret", {"administrators"}); }
-
   // A registry record as the package tool leaves it.
   void Install(const std::string& id, const std::string& info) {
     root_.Write("/var/packages/" + id + "/INFO", "package=\"" + id + "\"\n" + info);
@@ -20,10 +19,8 @@ class LogGetTest : public ::testing::Test {
   }
 
   CgiAnswer GetLog(const std::string& name) {
-    return ApiClient("admin", "secret").Call("KIVO.Core.Package.Log", "get", 1, {{"name", name}});
+    return client().Call("KIVO.Core.Package.Log", "get", 1, {{"name", name}});
   }
-
-  TempRoot root_;
 };
 
 TEST_F(LogGetTest, PackageWithALog) {

@@ -6,9 +6,9 @@
 
 #include <gtest/gtest.h>
 #include <json/value.h>
-#include <json/writer.h>
 
 #include "pkgtool/registry.h"
+#include "testing/admin_api_test.h"
 #include "testing/catalogue_feed.h"
 #include "testing/cgi_client.h"
 #include "testing/http_test_server.h"
@@ -19,13 +19,10 @@ namespace {
 
 constexpr char kServer[] = "KIVO.Core.Package.Server";
 
-class NestedCatalogueTest : public ::testing::Test {
+class NestedCatalogueTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    root_.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + vendor_.Url() +
-                                                "\"\nconnect_timeout=\"2\"\n"
-                                                "catalogue_timeout=\"2\"\n");
+    root_.Write("/etc/kivo/pkgserver.conf", VendorConf(vendor_.Url(), "catalogue_timeout=\"2\"\n"));
     root_.Write("/etc/kivoinfo.conf",
                 "pkg_source_trust_level=\"1\"\nenable_pkg_autoupdate_all=\"yes\"\n"
                 "pkg_autoupdate_all=\"yes\"\npackage_update_channel=\"stable\"\n");
@@ -34,9 +31,7 @@ class NestedCatalogueTest : public ::testing::Test {
     v1.id = v2.id = "nest-app";
     v1.daemon = v2.daemon = false;
     v2.version = "2.0";
-    vendor_.Add(v1);
-    ASSERT_TRUE(vendor_.Index());
-    vendor_.Publish();
+    ASSERT_TRUE(vendor_.Offer(v1));
     std::string out;
     ASSERT_EQ(0, Kivoctl({"install-server", "nest-app"}, &out)) << out;
     vendor_.Replace(v2);
@@ -50,15 +45,9 @@ class NestedCatalogueTest : public ::testing::Test {
                 "[{\"feed\": \"" + Deep() + "\", \"name\": \"deep\"}]");
   }
   std::string Deep() const { return server_.Url("/deep/catalogue.json"); }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
-  }
 
-  TempRoot root_;
   HttpTestServer server_;
   CatalogueFeed vendor_{server_, root_.Path("/vendor-files"), "/vendor"};
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(NestedCatalogueTest, AutoUpdateReportsTheFeedAndAppliesTheVendorsUpgrade) {
@@ -91,11 +80,10 @@ TEST_F(NestedCatalogueTest, TheWebApiAnswersAsForAnyMalformedCatalogue) {
   HttpRoute deep;
   deep.body = std::string(100000, '[') + std::string(100000, ']');
   server_.Set("/deeper/catalogue.json", deep);
-  const std::string again =
-      "{\"feed\": \"" + server_.Url("/deeper/catalogue.json") + "\", \"name\": \"again\"}";
-  // "list" is JSON text, sent as a JSON string.
-  CgiAnswer add = client().Call("KIVO.Core.Package.Feed", "add", 1,
-                                {{"list", Json::valueToQuotedString(again.c_str())}});
+  Json::Value again;
+  again["feed"] = server_.Url("/deeper/catalogue.json");
+  again["name"] = "again";
+  CgiAnswer add = client().Call("KIVO.Core.Package.Feed", "add", 1, {{"list", ListParam(again)}});
   EXPECT_EQ(4590, add.Code()) << add.body;
 }
 

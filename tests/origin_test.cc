@@ -12,11 +12,11 @@
 #include <unistd.h>
 
 #include <gtest/gtest.h>
-#include <json/writer.h>
 
 #include "klibc/atomic_file.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
+#include "testing/admin_api_test.h"
 #include "testing/catalogue_feed.h"
 #include "testing/cgi_client.h"
 #include "testing/gpg_keys.h"
@@ -33,26 +33,17 @@ constexpr char kServer[] = "KIVO.Core.Package.Server";
 // that the version's scripts ran.
 constexpr char kPostupgrade[] = "echo \"$KIVO_PKG_VERSION\" > \"$KIVO_PKG_VAR/postupgrade-ran\"\n";
 
-// `value` as JSON text, quoted again as a JSON string ("list" holds JSON).
-std::string ListParam(const Json::Value& value) {
-  Json::StreamWriterBuilder b;
-  b["indentation"] = "";
-  return Json::writeString(b, Json::Value(Json::writeString(b, value)));
-}
-
 bool Has(const std::string& text, const std::string& part) {
   return text.find(part) != std::string::npos;
 }
 
-class PackageOriginTest : public ::testing::Test {
+class PackageOriginTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
     TrustLevel(0);
-    root_.Write("/etc/kivo/pkgserver.conf",
-                "vendor_url=\"" + vendor_.Url() +
-                    "\"\nconnect_timeout=\"2\"\ncatalogue_timeout=\"5\"\n"
-                    "download_stall_timeout=\"5\"\n");
+    root_.Write("/etc/kivo/pkgserver.conf", VendorConf(vendor_.Url(),
+                                                       "catalogue_timeout=\"5\"\n"
+                                                       "download_stall_timeout=\"5\"\n"));
     keys_.reset(new TestKeys(root_.Path("/keys")));
     publisher_ = keys_->Create("Trusted Publisher <publisher@test.invalid>");
     keys_->Trust(publisher_);
@@ -61,9 +52,7 @@ class PackageOriginTest : public ::testing::Test {
     ASSERT_TRUE(vendor_.Index());
     vendor_.Publish();
   }
-  void TearDown() override {
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
+  void TearDown() override { StopInstalledPackages(); }
 
   // Trust level `level`, automatic updates on for every package.
   void TrustLevel(int level) {
@@ -95,12 +84,7 @@ class PackageOriginTest : public ::testing::Test {
     ASSERT_TRUE(server.Index());
     if (&server == &feed_) {
       for (const std::string& fpr : {feed_key_, other_feed_key_}) {
-        std::string armored;
-        ASSERT_EQ(0, RunProgram({"sh", "-c",
-                                 "gpg --homedir '" + keys_->home() + "' --batch --armor --export " +
-                                     fpr + " 2>/dev/null"},
-                                &armored));
-        server.catalogue()["keyrings"].append(armored);
+        server.catalogue()["keyrings"].append(keys_->Export(fpr));
       }
     }
     server.Publish();
@@ -112,9 +96,13 @@ class PackageOriginTest : public ::testing::Test {
     ASSERT_TRUE(added.Success()) << added.body;
     ASSERT_TRUE(added.Data()["has_keyrings"].asBool()) << added.body;
   }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
+  // demo-legacy 0.9 installed by hand from a file of the appliance's own
+  // publisher, and then the feed, offering 99.0, added.
+  void LegacyFromAFileThenTheFeedOffersMore() {
+    std::string out;
+    ASSERT_EQ(0, Kivoctl({"install", File("demo-legacy", "0.9", publisher_)}, &out)) << out;
+    Offer(feed_, "demo-legacy", "99.0", feed_key_);
+    AddFeed();
   }
   CgiAnswer Call(const std::string& api, const std::string& method, const Params& params = {}) {
     return client().Call(api, method, 1, params);
@@ -129,12 +117,7 @@ class PackageOriginTest : public ::testing::Test {
     params.insert(params.end(), extra.begin(), extra.end());
     CgiAnswer start = Call(kInst, "install", params);
     EXPECT_TRUE(start.Success()) << start.body;
-    CgiAnswer s;
-    for (int i = 0; i < 400; ++i) {
-      s = Call(kInst, "status", {{"task_id", "@KIVOPKG_DOWNLOAD_" + id}});
-      if (s.Data()["finished"].asBool()) break;
-      usleep(50000);
-    }
+    CgiAnswer s = WaitTaskFinished(client(), "@KIVOPKG_DOWNLOAD_" + id, 400);
     EXPECT_TRUE(s.Data()["finished"].asBool()) << s.body;
     return s.Data();
   }
@@ -149,28 +132,17 @@ class PackageOriginTest : public ::testing::Test {
     return text.substr(0, text.find('\n'));
   }
   int AutoUpdate(std::string* out) { return Kivoctl({"auto-update"}, out); }
-  // The entry of `id` in a "Server" "list" answer.
-  static Json::Value Entry(const CgiAnswer& list, const std::string& id) {
-    for (const Json::Value& e : list.Data()["data"]) {
-      if (e["id"].asString() == id) return e;
-    }
-    return Json::Value();
-  }
 
-  TempRoot root_;
   HttpTestServer server_;
   CatalogueFeed vendor_{server_, root_.Path("/vendor-files"), "/vendor"};
   CatalogueFeed feed_{server_, root_.Path("/feed-files"), "/feed"};
   std::unique_ptr<TestKeys> keys_;
   std::string publisher_, feed_key_, other_feed_key_;
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(PackageOriginTest, AutoUpdateDoesNotLetAFeedTakeOverAPackageFromAFile) {
+  LegacyFromAFileThenTheFeedOffersMore();
   std::string out;
-  ASSERT_EQ(0, Kivoctl({"install", File("demo-legacy", "0.9", publisher_)}, &out)) << out;
-  Offer(feed_, "demo-legacy", "99.0", feed_key_);
-  AddFeed();
 
   ASSERT_EQ(0, Kivoctl({"auto-update", "--dry-run"}, &out)) << out;
   EXPECT_FALSE(Has(out, "would upgrade")) << out;
@@ -184,10 +156,8 @@ TEST_F(PackageOriginTest, AutoUpdateDoesNotLetAFeedTakeOverAPackageFromAFile) {
 }
 
 TEST_F(PackageOriginTest, AnUpgradeByHandFromAnotherOriginIsRefused) {
+  LegacyFromAFileThenTheFeedOffersMore();
   std::string out;
-  ASSERT_EQ(0, Kivoctl({"install", File("demo-legacy", "0.9", publisher_)}, &out)) << out;
-  Offer(feed_, "demo-legacy", "99.0", feed_key_);
-  AddFeed();
 
   // From the feed, through the web API and through kivoctl.
   Json::Value task = InstallFromFeed("demo-legacy");
@@ -219,10 +189,8 @@ TEST_F(PackageOriginTest, AnUpgradeByHandFromAnotherOriginIsRefused) {
 }
 
 TEST_F(PackageOriginTest, AnAdministratorMaySwitchThePackagesOriginExplicitly) {
+  LegacyFromAFileThenTheFeedOffersMore();
   std::string out;
-  ASSERT_EQ(0, Kivoctl({"install", File("demo-legacy", "0.9", publisher_)}, &out)) << out;
-  Offer(feed_, "demo-legacy", "99.0", feed_key_);
-  AddFeed();
   EXPECT_EQ(PKG_ERR_OTHER_ORIGIN, InstallFromFeed("demo-legacy")["error"]["result"].asInt());
 
   Json::Value task = InstallFromFeed("demo-legacy", {{"switch_origin", "true"}});
@@ -283,17 +251,19 @@ TEST_F(PackageOriginTest, TheCatalogueAndTheBadgeOfferUpgradesOnlyFromTheOrigin)
 
   CgiAnswer vendor = Call(kServer, "list", {{"blforcereload", "true"}});
   ASSERT_TRUE(vendor.Success()) << vendor.body;
-  EXPECT_TRUE(Entry(vendor, "vendor-app")["blupgrade"].asBool()) << vendor.body;
-  EXPECT_FALSE(Entry(vendor, "demo-legacy")["blupgrade"].asBool()) << vendor.body;
-  EXPECT_EQ("a file", Entry(vendor, "demo-legacy")["other_origin"].asString()) << vendor.body;
+  EXPECT_TRUE(CatalogueEntry(vendor, "vendor-app")["blupgrade"].asBool()) << vendor.body;
+  EXPECT_FALSE(CatalogueEntry(vendor, "demo-legacy")["blupgrade"].asBool()) << vendor.body;
+  EXPECT_EQ("a file", CatalogueEntry(vendor, "demo-legacy")["other_origin"].asString())
+      << vendor.body;
 
   CgiAnswer feeds = Call(kServer, "list", {{"blforcereload", "true"}, {"blloadothers", "true"}});
   ASSERT_TRUE(feeds.Success()) << feeds.body;
   EXPECT_FALSE(feeds.Data()["blupgrade"].asBool()) << feeds.body;
-  EXPECT_FALSE(Entry(feeds, "demo-legacy")["blupgrade"].asBool()) << feeds.body;
-  EXPECT_EQ("a file", Entry(feeds, "demo-legacy")["other_origin"].asString()) << feeds.body;
-  EXPECT_FALSE(Entry(feeds, "vendor-app")["blupgrade"].asBool()) << feeds.body;
-  EXPECT_EQ("the vendor's server", Entry(feeds, "vendor-app")["other_origin"].asString());
+  EXPECT_FALSE(CatalogueEntry(feeds, "demo-legacy")["blupgrade"].asBool()) << feeds.body;
+  EXPECT_EQ("a file", CatalogueEntry(feeds, "demo-legacy")["other_origin"].asString())
+      << feeds.body;
+  EXPECT_FALSE(CatalogueEntry(feeds, "vendor-app")["blupgrade"].asBool()) << feeds.body;
+  EXPECT_EQ("the vendor's server", CatalogueEntry(feeds, "vendor-app")["other_origin"].asString());
 
   ASSERT_TRUE(Call(kServer, "check").Success());
   std::string text;

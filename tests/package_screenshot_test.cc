@@ -2,43 +2,30 @@
 // package's record and served by "Screenshot" "get", extracted by the
 // catalogue index beside the catalogue.
 
-#include <fstream>
-#include <sstream>
-
 #include <gtest/gtest.h>
 #include <json/reader.h>
 
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
 
 namespace {
 
-std::string ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream s;
-  s << in.rdbuf();
-  return s.str();
-}
-
-class PackageScreenshotTest : public ::testing::Test {
+class PackageScreenshotTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    // Unsigned test packages install at trust level 1.
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
+    Trust(1);  // unsigned test packages install at trust level 1
     shots_.id = "shots";
     shots_.version = "1.2";
     shots_.members = {{"SCREENSHOT_1.PNG", "first picture"}, {"SCREENSHOT_2.PNG", "second"}};
   }
 
   CgiAnswer Screenshot(const char* index) {
-    return ApiClient("admin", "secret")
-        .Call("KIVO.Core.Package.Screenshot", "get", 1,
-              {{"name", "shots"}, {"ver", "1.2"}, {"index", index}});
+    return client().Call("KIVO.Core.Package.Screenshot", "get", 1,
+                         {{"name", "shots"}, {"ver", "1.2"}, {"index", index}});
   }
 
-  TempRoot root_;
   TestPackage shots_;
 };
 
@@ -64,10 +51,10 @@ TEST_F(PackageScreenshotTest, CatalogueIndexExtractsScreenshots) {
   shots_.Build(folder);
   std::string out;
   ASSERT_EQ(0, Kivoctl({"index", folder, "--base-url", "http://pkg.example/kivo"}, &out)) << out;
-  EXPECT_EQ("first picture", ReadFile(folder + "/screenshots/shots-1.2/screenshot_1.png"));
-  EXPECT_EQ("second", ReadFile(folder + "/screenshots/shots-1.2/screenshot_2.png"));
+  EXPECT_EQ("first picture", FileText(folder + "/screenshots/shots-1.2/screenshot_1.png"));
+  EXPECT_EQ("second", FileText(folder + "/screenshots/shots-1.2/screenshot_2.png"));
   Json::Value catalogue;
-  ASSERT_TRUE(Json::Reader().parse(ReadFile(folder + "/catalogue.json"), catalogue));
+  ASSERT_TRUE(Json::Reader().parse(FileText(folder + "/catalogue.json"), catalogue));
   const Json::Value& entry = catalogue["packages"][0];
   ASSERT_EQ(2u, entry["screenshots"].size()) << catalogue.toStyledString();
   EXPECT_EQ("http://pkg.example/kivo/screenshots/shots-1.2/screenshot_2.png",

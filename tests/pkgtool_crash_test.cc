@@ -1,6 +1,7 @@
 // kill -9 of the package tool at each step of each operation: afterwards the
-// package is fully there in its old state or fully in its new one (or fully
-// gone), and the next operation clears what the killed one left behind.
+// package's code is fully there in its old state or fully in its new one (or
+// fully gone), and the next operation clears what the killed one left
+// behind; after it, code and data are one version's, never a mix.
 
 #include <gtest/gtest.h>
 
@@ -18,12 +19,15 @@ class CrashTest : public ::testing::TestWithParam<const char*> {
     dir_ = root_.Path("/tmp/packages");
     ASSERT_EQ(0, KIVOFSMkdirP(dir_.c_str()));
     v1_.files = {{"version.txt", "1\n"}};
+    v1_.scripts = {{"postinst", "echo 1 > \"$KIVO_PKG_VAR/data.txt\"\n"}};
     v2_ = v1_;
     v2_.version = "2.0";
     v2_.files = {{"version.txt", "2\n"}};
+    // The migration changes the data before the new version is published.
+    v2_.scripts = {{"preupgrade", "echo 2 > \"$KIVO_PKG_VAR/data.txt\"\n"}};
     other_.id = "other-app";
   }
-  void TearDown() override { Kivoctl({"stop", "test-app"}); }
+  void TearDown() override { StopInstalledPackages(); }
 
   // Runs kivoctl with the fault point set; it must die by SIGKILL.
   void CrashAt(const char* step, std::vector<std::string> args) {
@@ -46,10 +50,19 @@ class CrashTest : public ::testing::TestWithParam<const char*> {
     EXPECT_EQ(version.substr(0, 1) + "\n", text);
   }
 
+  // The data a version keeps: "1" or "2"; "" when the data folder is gone.
+  std::string Data() { return FileText(root_.Path("/volume1/@appdata/test-app/data.txt")); }
+  // The package is installed at `version`, code and data.
+  void ExpectWholeWithData(const std::string& version) {
+    ExpectWhole(version);
+    EXPECT_EQ(version.substr(0, 1) + "\n", Data());
+  }
+
   // Another operation recovers: nothing is left that no package owns.
   void ExpectRecoveredByNextOperation() {
     std::string out;
     ASSERT_EQ(0, Kivoctl({"install", other_.Build(dir_)}, &out)) << out;
+    EXPECT_FALSE(KLIBCFileExist(root_.Path("/volume1/@appdata/.snapshots").c_str()));
     for (const char* dir : {"/var/packages/.records", "/volume1/@appstore"}) {
       RunProgram({"ls", "-A", root_.Path(dir)}, &out);
       EXPECT_EQ(PackageRegistry::List().size(),
@@ -81,11 +94,59 @@ TEST_P(InstallCrashTest, Upgrade) {
   ASSERT_EQ(0, Kivoctl({"install", v1_.Build(dir_)}, &out)) << out;
   CrashAt(GetParam(), {"install", v2_.Build(dir_)});
   ExpectWhole(Committed(GetParam()) ? "2.0" : "1.0");
+  // An upgrade is confirmed only at its end: before that, the next
+  // operation puts the old version back with the data it had.
   ExpectRecoveredByNextOperation();
+  ExpectWholeWithData(std::string(GetParam()) == "done" ? "2.0" : "1.0");
   // And the package can be upgraded again afterwards.
   ASSERT_EQ(0, Kivoctl({"install", v2_.Build(dir_)}, &out)) << out;
-  ExpectWhole("2.0");
+  ExpectWholeWithData("2.0");
 }
+
+TEST_F(CrashTest, StartAfterACrashStartsTheOldVersionOnItsOwnData) {
+  std::string out;
+  ASSERT_EQ(0, Kivoctl({"install", v1_.Build(dir_), "--run"}, &out)) << out;
+  CrashAt("published", {"install", v2_.Build(dir_)});
+  ExpectWhole("2.0");
+  ASSERT_EQ(0, Kivoctl({"start", "test-app"}, &out)) << out;
+  Kivoctl({"status", "test-app"}, &out);
+  EXPECT_EQ("test-app 1.0 running\n", out);
+  ExpectWholeWithData("1.0");
+}
+
+// The steps of an upgrade's safety copy and of a restore.
+const char* const kRestoreSteps[] = {"snapshot_taken", "restore_begun", "restore_half_done",
+                                     "old_published"};
+
+class RestoreCrashTest : public CrashTest {};
+
+TEST_P(RestoreCrashTest, FailedUpgrade) {
+  const std::string step = GetParam();
+  std::string out;
+  ASSERT_EQ(0, Kivoctl({"install", v1_.Build(dir_), "--run"}, &out)) << out;
+  TestPackage broken = v2_;
+  broken.version = "2.1";  // a package file of its own
+  broken.scripts = {{"postupgrade", "echo 2 > \"$KIVO_PKG_VAR/data.txt\"; exit 1\n"}};
+  CrashAt(step.c_str(), {"install", broken.Build(dir_)});
+  if (step == "snapshot_taken" || step == "old_published") {
+    ExpectWholeWithData("1.0");
+  } else if (step == "restore_begun") {
+    ExpectWholeWithData("2.1");
+  } else {
+    // Between the restore's two renames the data folder is away; the next
+    // operation puts the copy in its place.
+    ExpectWhole("2.1");
+    EXPECT_EQ("", Data());
+  }
+  ExpectRecoveredByNextOperation();
+  ExpectWholeWithData("1.0");
+  Kivoctl({"status", "test-app"}, &out);
+  EXPECT_EQ("test-app 1.0 stopped\n", out);
+  ASSERT_EQ(0, Kivoctl({"install", v2_.Build(dir_)}, &out)) << out;
+  ExpectWholeWithData("2.0");
+}
+
+INSTANTIATE_TEST_SUITE_P(Steps, RestoreCrashTest, ::testing::ValuesIn(kRestoreSteps));
 
 INSTANTIATE_TEST_SUITE_P(Steps, InstallCrashTest, ::testing::ValuesIn(kInstallSteps));
 

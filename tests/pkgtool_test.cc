@@ -15,6 +15,7 @@
 #include "pkgtool/package_manager.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/result_codes.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
 
@@ -31,15 +32,18 @@ class PackageToolTest : public ::testing::Test {
     dir_ = root_.Path("/tmp/packages");
     ASSERT_EQ(0, KIVOFSMkdirP(dir_.c_str()));
   }
-  void TearDown() override {
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
+  void TearDown() override { StopInstalledPackages(); }
 
   std::string Build(const TestPackage& p) { return p.Build(dir_); }
   int Install(const std::string& file, std::vector<std::string> extra = {}) {
     std::vector<std::string> args = {"install", file};
     args.insert(args.end(), extra.begin(), extra.end());
     return Kivoctl(args, &out_);
+  }
+  // Installs `file` and expects the tool to refuse it with result `code`.
+  void ExpectRefused(int code, const std::string& file, std::vector<std::string> extra = {}) {
+    EXPECT_EQ(1, Install(file, extra)) << out_;
+    EXPECT_NE(std::string::npos, out_.find("[" + std::to_string(code) + "]")) << out_;
   }
   std::string Status(const std::string& id) {
     std::string out;
@@ -108,8 +112,7 @@ TEST_F(PackageToolTest, UpgradeKeepsDataAndFailedUpgradeKeepsTheOldVersionRunnin
   broken.version = "2.0";
   broken.files = {{"version.txt", "two\n"}};
   broken.scripts = {{"postupgrade", "echo 'cannot migrate' >&2; exit 3\n"}};
-  EXPECT_EQ(1, Install(Build(broken))) << out_;
-  EXPECT_NE(std::string::npos, out_.find("[305]")) << out_;
+  ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, Build(broken));
   EXPECT_EQ("1.0", InstalledVersion("test-app"));
   EXPECT_EQ("test-app 1.0 running\n", Status("test-app"));
   std::string text;
@@ -131,15 +134,13 @@ TEST_F(PackageToolTest, UpgradeKeepsDataAndFailedUpgradeKeepsTheOldVersionRunnin
   EXPECT_EQ("two\n", text);
   ExpectNoLeftovers();
 
-  EXPECT_EQ(1, Install(Build(v1), {"--no-force"}));  // a downgrade needs force
-  EXPECT_NE(std::string::npos, out_.find("[267]")) << out_;
+  ExpectRefused(PKG_ERR_NOT_NEWER, Build(v1), {"--no-force"});  // a downgrade needs force
 }
 
 TEST_F(PackageToolTest, FailedInstallScriptsLeaveNothing) {
   TestPackage pre;
   pre.scripts = {{"preinst", "exit 1\n"}};
-  EXPECT_EQ(1, Install(Build(pre)));
-  EXPECT_NE(std::string::npos, out_.find("[274]")) << out_;
+  ExpectRefused(PKG_ERR_SCRIPT_FAILED, Build(pre));
   TestPackage post;
   post.id = "post-fails";
   post.scripts = {{"postinst", "exit 1\n"}};
@@ -170,8 +171,7 @@ TEST_F(PackageToolTest, DependenciesConflictsAndServices) {
   needs_base.info = {{"install_dep_packages", "base-app>=1.0"}};
   std::string needs_file = Build(needs_base);
 
-  EXPECT_EQ(1, Install(needs_file));  // not installed
-  EXPECT_NE(std::string::npos, out_.find("[268]")) << out_;
+  ExpectRefused(PKG_ERR_DEPENDENCY, needs_file);  // not installed
   ASSERT_EQ(0, Install(Build(base)));
   EXPECT_EQ(1, Install(needs_file));  // installed but stopped
   ASSERT_EQ(0, Kivoctl({"start", "base-app"}));
@@ -203,61 +203,39 @@ TEST_F(PackageToolTest, DependenciesConflictsAndServices) {
   uses_library.info = {{"install_dep_packages", "a-library"}};
   EXPECT_EQ(0, Install(Build(uses_library))) << out_;
 
-  TestPackage rival;
-  rival.id = "rival";
-  rival.info = {{"install_conflict_packages", "needs-base"}};
-  EXPECT_EQ(1, Install(Build(rival)));
-  EXPECT_NE(std::string::npos, out_.find("[284]")) << out_;
+  ExpectRefused(PKG_ERR_CONFLICT,
+                Build(PackageWithInfo("rival", {{"install_conflict_packages", "needs-base"}})));
   // A conflict declared by the installed side counts too.
-  TestPackage target_of_conflict;
-  target_of_conflict.id = "victim";
-  TestPackage declares;
-  declares.id = "declares";
-  declares.info = {{"install_conflict_packages", "victim<2"}};
-  ASSERT_EQ(0, Install(Build(declares)));
-  EXPECT_EQ(1, Install(Build(target_of_conflict)));
-  EXPECT_NE(std::string::npos, out_.find("[284]")) << out_;
+  ASSERT_EQ(
+      0, Install(Build(PackageWithInfo("declares", {{"install_conflict_packages", "victim<2"}}))));
+  ExpectRefused(PKG_ERR_CONFLICT, Build(PackageWithInfo("victim")));
 
   root_.Write("/etc/kivo/services.conf", "pgsql=\"stopped\"\n");
-  TestPackage db;
-  db.id = "db-app";
-  db.info = {{"install_dep_services", "pgsql"}};
-  EXPECT_EQ(1, Install(Build(db)));
-  EXPECT_NE(std::string::npos, out_.find("[260]")) << out_;
+  TestPackage db = PackageWithInfo("db-app", {{"install_dep_services", "pgsql"}});
+  ExpectRefused(PKG_ERR_SERVICE_NOT_RUNNING, Build(db));
   root_.Write("/etc/kivo/services.conf", "pgsql=\"running\"\n");
   EXPECT_EQ(0, Install(Build(db)));
 }
 
 TEST_F(PackageToolTest, DeviceVolumesAndPorts) {
   root_.Write("/etc/kivo/device.conf", "os_version=\"7.2-0064\"\narch=\"x86_64\"\n");
-  TestPackage future;
-  future.info = {{"os_min_ver", "8.0-0001"}};
-  EXPECT_EQ(1, Install(Build(future)));
-  EXPECT_NE(std::string::npos, out_.find("[303]")) << out_;
-  TestPackage old;
-  old.id = "old-app";
-  old.info = {{"os_max_ver", "6.2-9999"}};
-  EXPECT_EQ(1, Install(Build(old)));
-  EXPECT_NE(std::string::npos, out_.find("[302]")) << out_;
-  TestPackage arm;
-  arm.id = "arm-app";
-  arm.info = {{"arch", "armv8 aarch64"}};
-  EXPECT_EQ(1, Install(Build(arm)));
-  EXPECT_NE(std::string::npos, out_.find("[264]")) << out_;
+  ExpectRefused(PKG_ERR_OS_TOO_OLD,
+                Build(PackageWithInfo("test-app", {{"os_min_ver", "8.0-0001"}})));
+  ExpectRefused(PKG_ERR_OS_TOO_NEW,
+                Build(PackageWithInfo("old-app", {{"os_max_ver", "6.2-9999"}})));
+  ExpectRefused(PKG_ERR_NOT_SUPPORTED,
+                Build(PackageWithInfo("arm-app", {{"arch", "armv8 aarch64"}})));
 
   TestPackage app;
   app.files = {{"data.bin", std::string(4096, 'x')}};  // unpacks to 4 KiB, more than the cap
   std::string file = Build(app);
   root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"crashed\"}]");
-  EXPECT_EQ(1, Install(file));
-  EXPECT_NE(std::string::npos, out_.find("[296]")) << out_;
+  ExpectRefused(PKG_ERR_VOLUME_CRASHED, file);
   root_.Write("/etc/kivo/volumes.json",
               "[{\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 1000}]");
-  EXPECT_EQ(1, Install(file));
-  EXPECT_NE(std::string::npos, out_.find("[279]")) << out_;
+  ExpectRefused(PKG_ERR_NO_SPACE, file);
   root_.Write("/etc/kivo/volumes.json", "[]");
-  EXPECT_EQ(1, Install(file));
-  EXPECT_NE(std::string::npos, out_.find("[297]")) << out_;
+  ExpectRefused(PKG_ERR_NO_VOLUME, file);
   root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"normal\"}]");
 
   // A port someone listens on.
@@ -271,8 +249,7 @@ TEST_F(PackageToolTest, DeviceVolumesAndPorts) {
   TestPackage web;
   web.id = "web-app";
   web.info = {{"adminport", std::to_string(ntohs(addr.sin_port))}};
-  EXPECT_EQ(1, Install(Build(web)));
-  EXPECT_NE(std::string::npos, out_.find("[283]")) << out_;
+  ExpectRefused(PKG_ERR_PORT_IN_USE, Build(web));
   close(fd);
   EXPECT_EQ(0, Install(Build(web))) << out_;
 }
@@ -282,8 +259,7 @@ TEST_F(PackageToolTest, BusyToolAnswers275InsteadOfWaiting) {
   ASSERT_GE(lock, 0);
   TestPackage app;
   time_t start = time(nullptr);
-  EXPECT_EQ(1, Install(Build(app)));
-  EXPECT_NE(std::string::npos, out_.find("[275]")) << out_;
+  ExpectRefused(PKG_ERR_BUSY, Build(app));
   EXPECT_LT(time(nullptr) - start, 10);
   PMSUnlockFile(lock);
   EXPECT_EQ(0, Install(Build(app))) << out_;
@@ -332,8 +308,7 @@ TEST_F(PackageToolTest, WizardAnswersReachTheScripts) {
   ASSERT_TRUE(pm.readUIFile(PKG_OP_UNINSTALL, info, ui, "enu"));
   EXPECT_EQ("Keep", ui.getUIFile()[0]["step_title"].asString());
 
-  EXPECT_EQ(1, Install(Build(app), {"--wizard", "{broken"}));
-  EXPECT_NE(std::string::npos, out_.find("[270]")) << out_;
+  ExpectRefused(PKG_ERR_BAD_WIZARD_VALUES, Build(app), {"--wizard", "{broken"});
   ASSERT_EQ(0, Kivoctl({"uninstall", "test-app", "--wizard", "{\"keep\": true}"}, &out_)) << out_;
   ASSERT_TRUE(KIVOReadFile(root_.Path("/tmp/uninstall-answers.json"), &text));
   EXPECT_NE(std::string::npos, text.find("\"keep\""));

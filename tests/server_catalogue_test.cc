@@ -17,6 +17,7 @@
 #include "klibc/sysroot.h"
 #include "pkgtool/registry.h"
 #include "taskmgr/task.h"
+#include "testing/admin_api_test.h"
 #include "testing/catalogue_feed.h"
 #include "testing/cgi_client.h"
 #include "testing/http_test_server.h"
@@ -28,42 +29,25 @@ namespace {
 
 constexpr char kServer[] = "KIVO.Core.Package.Server";
 
-class ServerCatalogueTest : public ::testing::Test {
+class ServerCatalogueTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
     root_.Write("/etc/kivoinfo.conf",
                 "pkg_source_trust_level=\"1\"\n"
                 "package_update_channel=\"beta\"\n");
     Configure(feed_.Url());
   }
-  void TearDown() override {
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
+  void TearDown() override { StopInstalledPackages(); }
   void Configure(const std::string& vendor, const std::string& more = "") {
-    root_.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + vendor +
-                                                "\"\nconnect_timeout=\"2\"\n"
-                                                "catalogue_timeout=\"2\"\n"
-                                                "catalogue_max_bytes=\"1048576\"\n" +
-                                                more);
-  }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
+    root_.Write("/etc/kivo/pkgserver.conf", VendorConf(vendor,
+                                                       "catalogue_timeout=\"2\"\n"
+                                                       "catalogue_max_bytes=\"1048576\"\n" +
+                                                           more));
   }
   CgiAnswer List(const Params& params = {}) { return client().Call(kServer, "list", 1, params); }
-  // The listed entry of `id`.
-  static Json::Value Find(const CgiAnswer& a, const std::string& id) {
-    for (const Json::Value& e : a.Data()["data"]) {
-      if (e["id"].asString() == id) return e;
-    }
-    return Json::Value();
-  }
 
-  TempRoot root_;
   HttpTestServer server_;
   CatalogueFeed feed_{server_, root_.Path("/feed"), "/feed"};
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations) {
@@ -71,9 +55,7 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
   a.id = "app-a";
   a.info = {{"adminport", "8123"}, {"adminurl", "ui"}, {"adminprotocol", "https"}};
   // Version 1.0 installed from this server, which then offers 2.0.
-  feed_.Add(a);
-  ASSERT_TRUE(feed_.Index());
-  feed_.Publish();
+  ASSERT_TRUE(feed_.Offer(a));
   std::string out;
   ASSERT_EQ(0, Kivoctl({"install-server", "app-a", "--run"}, &out)) << out;
   a.version = "2.0";
@@ -104,7 +86,7 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
   ASSERT_TRUE(list.Success()) << list.body;
   EXPECT_EQ(2u, list.Data()["total"].asUInt());
   EXPECT_TRUE(list.Data()["blupgrade"].asBool());
-  Json::Value ea = Find(list, "app-a"), eb = Find(list, "app-b");
+  Json::Value ea = CatalogueEntry(list, "app-a"), eb = CatalogueEntry(list, "app-b");
   EXPECT_TRUE(ea["blupgrade"].asBool());
   EXPECT_EQ("kivo", ea["source"].asString());
   EXPECT_EQ("running", ea["status"].asString());
@@ -119,7 +101,7 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
                                      {"HTTP_HOST", "[::1]:5000"}},
                                     body);
   ASSERT_TRUE(over_ipv6.Success()) << over_ipv6.body;
-  EXPECT_EQ("https://[::1]:8123/ui", Find(over_ipv6, "app-a")["url"][0].asString());
+  EXPECT_EQ("https://[::1]:8123/ui", CatalogueEntry(over_ipv6, "app-a")["url"][0].asString());
   EXPECT_FALSE(eb["blupgrade"].asBool());
   EXPECT_FALSE(eb.isMember("status"));
   EXPECT_TRUE(eb["beta"].asBool());
@@ -139,7 +121,7 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
   feed_.Entry("app-a")["version"] = "1.0";
   feed_.Publish();
   list = List({{"blforcereload", "true"}});
-  EXPECT_FALSE(Find(list, "app-a")["blupgrade"].asBool());
+  EXPECT_FALSE(CatalogueEntry(list, "app-a")["blupgrade"].asBool());
   EXPECT_FALSE(list.Data()["blupgrade"].asBool());
 
   EXPECT_TRUE(client().Call(kServer, "check", 1).Success());
@@ -153,9 +135,7 @@ TEST_F(ServerCatalogueTest, MergesInstalledStateUpgradesTasksAndRecommendations)
 TEST_F(ServerCatalogueTest, InfoOfAnInstallUnderWayIsTheTasksData) {
   TestPackage listed;
   listed.id = "app-held";
-  feed_.Add(listed);
-  ASSERT_TRUE(feed_.Index());
-  feed_.Publish();
+  ASSERT_TRUE(feed_.Offer(listed));
   // The same package from a file, held in its preinst until the test lets go.
   TestPackage held = listed;
   held.scripts = {{"preinst",
@@ -187,16 +167,14 @@ TEST_F(ServerCatalogueTest, InfoOfAnInstallUnderWayIsTheTasksData) {
   ASSERT_TRUE(before["installing"].asBool()) << before.toStyledString();
   ASSERT_EQ(before, after) << "the install moved on while the catalogue was read";
   ASSERT_TRUE(list.Success()) << list.body;
-  EXPECT_EQ(before, Find(list, "app-held")["info"]) << list.body;
+  EXPECT_EQ(before, CatalogueEntry(list, "app-held")["info"]) << list.body;
   EXPECT_EQ(0, WEXITSTATUS(exit_status));
 }
 
 TEST_F(ServerCatalogueTest, FeedsMergeArrayAndObjectFormsWithoutRecommendations) {
   TestPackage a;
   a.id = "feed-a";
-  feed_.Add(a);
-  ASSERT_TRUE(feed_.Index());
-  feed_.Publish();
+  ASSERT_TRUE(feed_.Offer(a));
   HttpRoute array;
   array.body = "[{\"package\": \"feed-b\", \"version\": \"1.0\", \"link\": \"" +
                server_.Url("/b.kpk") + "\"}]";
@@ -208,7 +186,7 @@ TEST_F(ServerCatalogueTest, FeedsMergeArrayAndObjectFormsWithoutRecommendations)
   CgiAnswer list = List({{"blloadothers", "true"}});
   ASSERT_TRUE(list.Success()) << list.body;
   EXPECT_EQ(2u, list.Data()["total"].asUInt());
-  EXPECT_EQ("others", Find(list, "feed-b")["source"].asString());
+  EXPECT_EQ("others", CatalogueEntry(list, "feed-b")["source"].asString());
   EXPECT_FALSE(list.Data().isMember("recommend"));
 }
 

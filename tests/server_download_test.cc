@@ -12,6 +12,7 @@
 #include "klibc/process.h"
 #include "pkgtool/registry.h"
 #include "taskmgr/task.h"
+#include "testing/admin_api_test.h"
 #include "testing/catalogue_feed.h"
 #include "testing/cgi_client.h"
 #include "testing/http_test_server.h"
@@ -34,43 +35,24 @@ std::string Noise(size_t size) {
   return out;
 }
 
-class ServerDownloadTest : public ::testing::Test {
+class ServerDownloadTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
-    root_.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + feed_.Url() +
-                                                "\"\nconnect_timeout=\"2\"\n"
-                                                "download_stall_timeout=\"2\"\n");
+    Trust(1);
+    root_.Write("/etc/kivo/pkgserver.conf",
+                VendorConf(feed_.Url(), "download_stall_timeout=\"2\"\n"));
     TestPackage app;
     app.id = "dl-app";
     app.daemon = false;
     app.files = {{"data.bin", Noise(256 * 1024)}};
-    feed_.Add(app);
-    ASSERT_TRUE(feed_.Index());
-    feed_.Publish();
+    ASSERT_TRUE(feed_.Offer(app));
   }
-  void TearDown() override {
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
-  }
+  void TearDown() override { StopInstalledPackages(); }
   CgiAnswer Call(const std::string& method, const Params& params) {
     return client().Call(kInst, method, 1, params);
   }
   CgiAnswer Status() { return Call("status", {{"task_id", kTask}}); }
-  // Polls "status" until the task is finished (or 10 s pass).
-  CgiAnswer WaitFinished() {
-    CgiAnswer s;
-    for (int i = 0; i < 200; ++i) {
-      s = Status();
-      if (s.Data()["finished"].asBool()) break;
-      usleep(50000);
-    }
-    return s;
-  }
+  CgiAnswer WaitFinished() { return WaitTaskFinished(client(), kTask); }
   // Download folders left on the volume.
   int DownloadFolders() { return CountEntries(root_.Path("/volume1/@tmp"), "download-"); }
   // Serves the changed catalogue; the appliance keeps the one it has for a
@@ -102,10 +84,8 @@ class ServerDownloadTest : public ::testing::Test {
     feed_.SetFileRoute("dl-app", halfway);
   }
 
-  TempRoot root_;
   HttpTestServer server_;
   CatalogueFeed feed_{server_, root_.Path("/feed"), "/feed"};
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(ServerDownloadTest, DownloadShowsProgressThenChecksAndInstalls) {

@@ -13,6 +13,7 @@
 
 #include "klibc/atomic_file.h"
 #include "pkgtool/registry.h"
+#include "testing/admin_api_test.h"
 #include "testing/catalogue_feed.h"
 #include "testing/cgi_client.h"
 #include "testing/http_test_server.h"
@@ -23,11 +24,10 @@ namespace {
 
 constexpr char kServer[] = "KIVO.Core.Package.Server";
 
-class ServerListingTest : public ::testing::Test {
+class ServerListingTest : public AdminApiTest {
  protected:
   void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
+    Trust(1);
     Vendor(feed_.Url());
     for (const char* id : {"list-a", "list-b", "list-c"}) {
       TestPackage p;
@@ -41,19 +41,16 @@ class ServerListingTest : public ::testing::Test {
     feed_.catalogue()["recommend"].append("list-b");
   }
   void Vendor(const std::string& url) {
-    root_.Write("/etc/kivo/pkgserver.conf", "vendor_url=\"" + url +
-                                                "\"\nconnect_timeout=\"2\"\n"
-                                                "catalogue_timeout=\"5\"\n"
-                                                "catalogue_max_age=\"600\"\n");
+    root_.Write("/etc/kivo/pkgserver.conf", VendorConf(url,
+                                                       "catalogue_timeout=\"5\"\n"
+                                                       "catalogue_max_age=\"600\"\n"));
   }
   // Installs `p` from the vendor's server as it was before it offered 2.0:
   // a catalogue of its own, where the vendor's address points for the
   // install alone, so the catalogue under test is asked nothing.
   void InstallFromTheVendor(const TestPackage& p, bool run) {
     CatalogueFeed earlier(server_, root_.Path("/earlier"), "/earlier");
-    earlier.Add(p);
-    ASSERT_TRUE(earlier.Index());
-    earlier.Publish();
+    ASSERT_TRUE(earlier.Offer(p));
     Vendor(earlier.Url());
     std::vector<std::string> args = {"install-server", p.id};
     if (run) args.push_back("--run");
@@ -61,22 +58,8 @@ class ServerListingTest : public ::testing::Test {
     EXPECT_EQ(0, Kivoctl(args, &out)) << out;
     Vendor(feed_.Url());
   }
-  void TearDown() override {
-    for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
-  }
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
-  }
-  CgiAnswer List(const Params& params = {}) const {
-    return client_->Call(kServer, "list", 1, params);
-  }
-  static Json::Value Find(const CgiAnswer& a, const std::string& id) {
-    for (const Json::Value& e : a.Data()["data"]) {
-      if (e["id"].asString() == id) return e;
-    }
-    return Json::Value();
-  }
+  void TearDown() override { StopInstalledPackages(); }
+  CgiAnswer List(const Params& params = {}) { return client().Call(kServer, "list", 1, params); }
   // The listing file of the vendor's catalogue ("" when there is none).
   std::string ListingFile() {
     std::string dir = root_.Path("/var/cache/kivo/pkgserver/listing"), found;
@@ -124,10 +107,8 @@ class ServerListingTest : public ::testing::Test {
     });
   }
 
-  TempRoot root_;
   HttpTestServer server_;
   CatalogueFeed feed_{server_, root_.Path("/feed"), "/feed"};
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(ServerListingTest, ChangedCatalogueIsRenderedAgainAndAnUnchangedOneIsNot) {
@@ -135,7 +116,7 @@ TEST_F(ServerListingTest, ChangedCatalogueIsRenderedAgainAndAnUnchangedOneIsNot)
   client();
   CgiAnswer first = List();
   ASSERT_TRUE(first.Success()) << first.body;
-  EXPECT_EQ("2.0", Find(first, "list-a")["version"].asString());
+  EXPECT_EQ("2.0", CatalogueEntry(first, "list-a")["version"].asString());
   ASSERT_NE("", ListingFile());
   const std::string rendered = ReadListing();
   const long long written = ListingWritten();
@@ -154,8 +135,9 @@ TEST_F(ServerListingTest, ChangedCatalogueIsRenderedAgainAndAnUnchangedOneIsNot)
   CgiAnswer changed = List();
   ASSERT_TRUE(changed.Success()) << changed.body;
   EXPECT_EQ(3, server_.Requests("/feed/catalogue.json"));
-  EXPECT_EQ("3.0", Find(changed, "list-a")["version"].asString());
-  EXPECT_EQ("<", Find(changed, "list-b")["conflictpkgs"]["list-a"]["operator"].asString());
+  EXPECT_EQ("3.0", CatalogueEntry(changed, "list-a")["version"].asString());
+  EXPECT_EQ("<",
+            CatalogueEntry(changed, "list-b")["conflictpkgs"]["list-a"]["operator"].asString());
   EXPECT_EQ("list-b", changed.Data()["recommend"][0]["id"].asString());
   EXPECT_NE(rendered, ReadListing());
   // And the same answer again from the new listing.
@@ -191,7 +173,7 @@ TEST_F(ServerListingTest, InstalledAndUninstalledPackagesShowAtOnce) {
   client();
   CgiAnswer before = List();
   ASSERT_TRUE(before.Success()) << before.body;
-  EXPECT_FALSE(Find(before, "list-a").isMember("status"));
+  EXPECT_FALSE(CatalogueEntry(before, "list-a").isMember("status"));
   EXPECT_FALSE(before.Data()["blupgrade"].asBool());
 
   TestPackage old;
@@ -200,15 +182,15 @@ TEST_F(ServerListingTest, InstalledAndUninstalledPackagesShowAtOnce) {
   InstallFromTheVendor(old, true);
   CgiAnswer installed = List();
   ASSERT_TRUE(installed.Success()) << installed.body;
-  Json::Value a = Find(installed, "list-a");
+  Json::Value a = CatalogueEntry(installed, "list-a");
   EXPECT_EQ("running", a["status"].asString()) << a.toStyledString();
   EXPECT_TRUE(a["blupgrade"].asBool());
   EXPECT_TRUE(installed.Data()["blupgrade"].asBool());
   ASSERT_EQ(1u, a["url"].size());
   EXPECT_EQ("http://nas.example:8125", a["url"][0].asString());
   // The other entries are the listing's text as it was.
-  EXPECT_EQ(Find(before, "list-b"), Find(installed, "list-b"));
-  EXPECT_EQ(installed.Data()["recommend"][0], Find(installed, "list-b"));
+  EXPECT_EQ(CatalogueEntry(before, "list-b"), CatalogueEntry(installed, "list-b"));
+  EXPECT_EQ(installed.Data()["recommend"][0], CatalogueEntry(installed, "list-b"));
 
   ASSERT_EQ(0, Kivoctl({"uninstall", "list-a"}));
   CgiAnswer after = List();
@@ -264,12 +246,12 @@ TEST_F(ServerListingTest, EntriesWithEscapedMemberNamesGetTheirStateToo) {
   client();
   CgiAnswer list = List();
   ASSERT_TRUE(list.Success()) << list.body;
-  Json::Value a = Find(list, "list-a");
+  Json::Value a = CatalogueEntry(list, "list-a");
   EXPECT_EQ("label", a["\xc3\xa9tiquette"].asString());
   EXPECT_EQ(1, a["quote\"d"].asInt());
   EXPECT_TRUE(a["blupgrade"].asBool());
   EXPECT_TRUE(a.isMember("status")) << a.toStyledString();
-  EXPECT_EQ("label", Find(list, "list-b")["\xc3\xa9tiquette"].asString());
+  EXPECT_EQ("label", CatalogueEntry(list, "list-b")["\xc3\xa9tiquette"].asString());
   EXPECT_EQ(std::string::npos, list.body.find("\xc3\xa9")) << "answers are ASCII";
 }
 
@@ -293,7 +275,7 @@ TEST_F(ServerListingTest, RequestsRacingWhileTheListingIsRenderedAnswerAlike) {
   for (std::thread& t : requests) t.join();
   for (const CgiAnswer& answer : answers) {
     ASSERT_TRUE(answer.Success()) << answer.body;
-    EXPECT_EQ("4.0", Find(answer, "list-c")["version"].asString());
+    EXPECT_EQ("4.0", CatalogueEntry(answer, "list-c")["version"].asString());
     EXPECT_EQ(answers[0].body, answer.body);
   }
   const long long written = ListingWritten();

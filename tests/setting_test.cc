@@ -13,6 +13,7 @@
 #include "klibc/key_value_file.h"
 #include "klibc/process.h"
 #include "settings/web_utils.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/http_test_server.h"
 #include "testing/temp_root.h"
@@ -24,17 +25,13 @@ constexpr char kVolume[] = "KIVO.Core.Package.Setting.Volume";
 constexpr char kUpdate[] = "KIVO.Core.Package.Setting.Update";
 constexpr char kInfo[] = "KIVO.Core.Package.Info";
 
-class SettingTest : public ::testing::Test {
+class SettingTest : public AdminApiTest {
  protected:
-  void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    // One sign-in per test: each one costs a deliberate password hash.
-    client_ = std::make_unique<ApiClient>("admin", "secret");
-    ASSERT_TRUE(client_->signed_in());
-  }
+  // One sign-in per test: each one costs a deliberate password hash.
+  void SetUp() override { ASSERT_TRUE(client().signed_in()); }
 
   CgiAnswer Call(const char* api, const char* method, const Params& params = {}) {
-    return client_->Call(api, method, 1, params);
+    return client().Call(api, method, 1, params);
   }
 
   void Volumes(const std::string& json) { root_.Write("/etc/kivo/volumes.json", json); }
@@ -55,9 +52,6 @@ class SettingTest : public ::testing::Test {
     return list;
   }
   void MailSetUp() { root_.Write("/etc/kivo/mail.conf", "smtp_server=\"mail.example.com\"\n"); }
-
-  TempRoot root_;
-  std::unique_ptr<ApiClient> client_;
 };
 
 TEST_F(SettingTest, DefaultVolumeGetAndSetWithEachVolumeState) {

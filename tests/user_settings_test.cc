@@ -5,50 +5,37 @@
 
 #include <chrono>
 #include <ctime>
-#include <fstream>
-#include <sstream>
 #include <thread>
 
 #include <gtest/gtest.h>
-#include <json/reader.h>
-#include <json/writer.h>
 
+#include "klibc/json_text.h"
+#include "testing/admin_api_test.h"
 #include "testing/cgi_client.h"
 #include "testing/http_test_server.h"
 #include "testing/temp_root.h"
+#include "webapi/api_codes.h"
 
 namespace {
 
 constexpr char kApp[] = "KIVO.PXS.PkgManApp.Instance";
-constexpr int kParameter = 120;
-constexpr int kNotPermitted = 105;
-constexpr int kNotSignedIn = 119;
 
-class UserSettingsTest : public ::testing::Test {
+class UserSettingsTest : public AdminApiTest {
  protected:
-  void SetUp() override {
-    root_.AddAccount("admin", "secret", {"administrators"});
-    root_.AddAccount("guest", "guest-pw", {"users"});
-  }
+  void SetUp() override { root_.AddAccount("guest", "guest-pw", {"users"}); }
 
   Json::Value Document(const std::string& user) const {
-    std::ifstream in(root_.Path("/usr/kivo/etc/users/" + user + "/settings.json"));
-    std::stringstream text;
-    text << in.rdbuf();
     Json::Value doc;
-    std::string errors;
-    Json::CharReaderBuilder builder;
-    std::istringstream stream(text.str());
-    if (!Json::parseFromStream(builder, stream, &doc, &errors)) return Json::Value();
-    return doc;
+    return KIVOParseJson(FileText(root_.Path("/usr/kivo/etc/users/" + user + "/settings.json")),
+                         &doc)
+               ? doc
+               : Json::Value();
   }
 
   static CgiAnswer Set(const ApiClient& client, const std::string& app,
                        const std::string& settings) {
     return client.Call("KIVO.API.UserSettings", "set", 1, {{"app", app}, {"settings", settings}});
   }
-
-  TempRoot root_;
 };
 
 TEST_F(UserSettingsTest, MembersMergeIntoTheCallersOwnApplicationObject) {
@@ -77,12 +64,12 @@ TEST_F(UserSettingsTest, MembersMergeIntoTheCallersOwnApplicationObject) {
 TEST_F(UserSettingsTest, BadParametersAndMissingProofAreRefusedAndWriteNothing) {
   ApiClient admin("admin", "secret");
   ASSERT_TRUE(admin.signed_in());
-  EXPECT_EQ(kParameter, Set(admin, "../../etc", R"({"a":1})").Code());
-  EXPECT_EQ(kParameter, Set(admin, "", R"({"a":1})").Code());
-  EXPECT_EQ(kParameter, Set(admin, kApp, R"([1,2])").Code());
-  EXPECT_EQ(kParameter, Set(admin, kApp, "not json").Code());
+  EXPECT_EQ(kErrParameter, Set(admin, "../../etc", R"({"a":1})").Code());
+  EXPECT_EQ(kErrParameter, Set(admin, "", R"({"a":1})").Code());
+  EXPECT_EQ(kErrParameter, Set(admin, kApp, R"([1,2])").Code());
+  EXPECT_EQ(kErrParameter, Set(admin, kApp, "not json").Code());
   CgiAnswer big = Set(admin, kApp, R"({"a":")" + std::string(70 * 1024, 'x') + R"("})");
-  EXPECT_EQ(kParameter, big.Code()) << big.body;
+  EXPECT_EQ(kErrParameter, big.Code()) << big.body;
   EXPECT_TRUE(Document("admin").isNull());
 
   // A cookie without the token is what a forged cross-site request carries.
@@ -90,11 +77,11 @@ TEST_F(UserSettingsTest, BadParametersAndMissingProofAreRefusedAndWriteNothing) 
       {{"REQUEST_METHOD", "GET"},
        {"QUERY_STRING", "api=KIVO.API.UserSettings&version=1&method=set&app=A&settings={}"},
        {"HTTP_COOKIE", "id=" + admin.sid()}});
-  EXPECT_EQ(kNotPermitted, forged.Code()) << forged.body;
+  EXPECT_EQ(kErrNotPermitted, forged.Code()) << forged.body;
   CgiAnswer anonymous = RunEntryCgi(
       {{"REQUEST_METHOD", "GET"},
        {"QUERY_STRING", "api=KIVO.API.UserSettings&version=1&method=set&app=A&settings={}"}});
-  EXPECT_EQ(kNotSignedIn, anonymous.Code());
+  EXPECT_EQ(kErrNotSignedIn, anonymous.Code());
   EXPECT_TRUE(Document("admin").isNull());
 }
 

@@ -4,8 +4,7 @@
 #include <string>
 #include <vector>
 
-#include <json/writer.h>
-
+#include "klibc/json_text.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/pms.h"
 #include "webapi/cgi_encode.h"
@@ -78,6 +77,13 @@ uint64_t ParseAdditional(const Json::Value& names) {
   return mask;
 }
 
+bool IsAdditionalName(const std::string& name) {
+  for (const NamedBit& n : kNames) {
+    if (name == n.name) return true;
+  }
+  return false;
+}
+
 void DumpInfo(const PackageInfo& info, uint64_t mask, Json::Value& out) {
   out["id"] = info.getId();
   out["version"] = info.getVersion();
@@ -140,10 +146,8 @@ void DumpLicense(const PackageInfo& info, Json::Value& out) {
 void DumpUIFIle(const PackageInfo& info, Json::Value& out) {
   const Json::Value& ui = info.getUIFile();
   if (ui.isNull() || ui.empty()) return;
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "";
   std::string encoded;
-  if (Encode(Json::writeString(builder, ui), &encoded)) out = encoded;
+  if (Encode(KIVOWriteJson(ui), &encoded)) out = encoded;
 }
 
 }  // namespace PackageUtils

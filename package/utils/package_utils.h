@@ -4,6 +4,7 @@
 #pragma once
 
 #include <cstdint>
+#include <string>
 
 #include <json/value.h>
 
@@ -47,6 +48,11 @@ enum AdditionalBit : uint64_t {
 // The mask of the names in `names` (compared ignoring case); unknown names
 // and non-strings add nothing.
 uint64_t ParseAdditional(const Json::Value& names);
+
+// Whether `name` is one of those names as it is spelt. The checkers of list
+// and get take only these; a handler reached without them (the legacy list)
+// takes any case.
+bool IsAdditionalName(const std::string& name);
 
 // Writes "id", "version", "name"; with a mask, also "additional" (kept and
 // added to when `out` already has one) through DumpAdditionalInfo.

@@ -12,8 +12,10 @@
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
-#include "storage/storage_config.h"
+#include "storage/volume_space.h"
+#include "storage/volumes.h"
 #include "taskmgr/task.h"
+#include "taskmgr/task_names.h"
 
 namespace {
 
@@ -40,7 +42,8 @@ bool ToolBusy() {
 
 // True when a task of a running job (a live "pid") concerns `id`.
 bool OperationRunning(NVX::TaskMgr& mgr, const std::string& id) {
-  for (const char* prefix : {"@KIVOPKG_DOWNLOAD_", "@KIVOPKG_STARTSTOP_", "@KIVOPKG_UNINSTALL_"}) {
+  for (const char* prefix : {KIVOPackageTasks::kDownloadPrefix, KIVOPackageTasks::kStartStopPrefix,
+                             KIVOPackageTasks::kUninstallPrefix}) {
     std::unique_ptr<NVX::Task> task(GetTaskWithTaskMgr(mgr, prefix + id));
     if (!task) continue;
     Json::Value data = task->getProperty("data");
@@ -49,6 +52,13 @@ bool OperationRunning(NVX::TaskMgr& mgr, const std::string& id) {
     }
   }
   return false;
+}
+
+// The name the reasons give a package: its display name when it is
+// installed (the reasons are shown to people as they stand), else its id.
+std::string NameOf(const std::string& id) {
+  PackageInfo info;
+  return PMSLoadInstalled(id, &info) ? info.getDisplayName() : id;
 }
 
 std::vector<std::string> RunningDependents(const std::string& id) {
@@ -103,7 +113,7 @@ void Checker::InstallVolume(const std::string& id, bool hard) {
 }
 
 void Checker::Hard(const std::string& id, NVX::TaskMgr& mgr) {
-  if (OperationRunning(mgr, id)) Add(id + " is being installed or changed right now.");
+  if (OperationRunning(mgr, id)) Add(NameOf(id) + " is being installed or changed right now.");
   bool installed = PackageRegistry::IsInstalled(id);
   if (type_ == KIVO_FEASIBILITY_INSTALL) {
     InstallVolume(id, true);
@@ -114,10 +124,11 @@ void Checker::Hard(const std::string& id, NVX::TaskMgr& mgr) {
     return;
   }
   if (type_ == KIVO_FEASIBILITY_UNINSTALL) {
-    for (const std::string& other : PMSInstalledDependents(id)) Add(other + " needs " + id + ".");
+    for (const std::string& other : PMSInstalledDependents(id))
+      Add(NameOf(other) + " needs " + NameOf(id) + ".");
   } else {
     for (const std::string& other : RunningDependents(id))
-      Add(other + " runs and needs " + id + ".");
+      Add(NameOf(other) + " runs and needs " + NameOf(id) + ".");
   }
 }
 
@@ -125,10 +136,10 @@ void Checker::Soft(const std::string& id) {
   if (type_ == KIVO_FEASIBILITY_INSTALL) {
     InstallVolume(id, false);
   } else if (type_ == KIVO_FEASIBILITY_UNINSTALL && PackageRegistry::IsInstalled(id)) {
-    Add("Removing " + id + " deletes the data it keeps.");
+    Add("Removing " + NameOf(id) + " deletes the data it keeps.");
   } else if (type_ == KIVO_FEASIBILITY_STOP) {
     for (const std::string& other : PMSInstalledDependents(id)) {
-      Add(other + " cannot start while " + id + " is stopped.");
+      Add(NameOf(other) + " cannot start while " + NameOf(id) + " is stopped.");
     }
   }
 }
@@ -155,7 +166,7 @@ int KIVOFeasibilityCheck(int type, int check_type, PKLIBSZLIST* reasons, const c
   if (check_type == KIVO_FEASIBILITY_HARD && ToolBusy()) {
     checker.Add("The package center is busy with another package operation.");
   }
-  NVX::TaskMgr mgr("@administrators");
+  NVX::TaskMgr mgr(KIVOPackageTasks::kTaskOwner);
   for (const std::string& id : ids) {
     if (check_type == KIVO_FEASIBILITY_HARD) {
       checker.Hard(id, mgr);

@@ -2,6 +2,7 @@
 
 #include <exception>
 #include <memory>
+#include <sstream>
 
 #include <json/reader.h>
 
@@ -23,4 +24,16 @@ bool KIVOParseJson(std::string_view text, Json::Value* out, JsonSyntax syntax) {
   }
   *out = ok ? std::move(parsed) : Json::Value();
   return ok;
+}
+
+std::unique_ptr<Json::StreamWriter> KIVONewJsonWriter(const std::string& indentation) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = indentation;
+  return std::unique_ptr<Json::StreamWriter>(builder.newStreamWriter());
+}
+
+std::string KIVOWriteJson(const Json::Value& value, const std::string& indentation) {
+  std::ostringstream out;
+  KIVONewJsonWriter(indentation)->write(value, &out);
+  return out.str();
 }

@@ -1,13 +1,16 @@
-// The one way this system reads JSON text. Much of what it reads comes from
-// elsewhere (request parameters, package files, package servers and feeds,
+// The one way this system reads and writes JSON text. Much of what it reads
+// comes from elsewhere (request parameters, package files, package servers and feeds,
 // files other processes write), and jsoncpp throws when a document nests
 // deeper than its stack limit, so a reader that let the exception out would
 // end its process on one hostile catalogue. This one never throws.
 #pragma once
 
+#include <memory>
+#include <string>
 #include <string_view>
 
 #include <json/value.h>
+#include <json/writer.h>
 
 enum class JsonSyntax {
   // RFC 8259 and nothing else: no comments, no trailing commas, nothing
@@ -26,3 +29,17 @@ constexpr int kMaxJsonDepth = 200;
 // `syntax` or nests deeper than kMaxJsonDepth; *out is then null.
 [[nodiscard]] bool KIVOParseJson(std::string_view text, Json::Value* out,
                                  JsonSyntax syntax = JsonSyntax::Strict);
+
+// A writer of the one form this system writes JSON in: jsoncpp's defaults
+// (members in name order, reals to 17 significant digits, every character
+// beyond ASCII escaped as \uXXXX, so the text is valid UTF-8 whatever its
+// strings hold) with `indentation` as one level's indentation. With ""
+// the document is compact: one line, no space between tokens, which is what
+// answers, task data and state files are written as; an indented form is
+// for what people or scripts read a line at a time (a settings file,
+// kivoctl's output, a package script's wizard answers).
+std::unique_ptr<Json::StreamWriter> KIVONewJsonWriter(const std::string& indentation = "");
+
+// `value` as written by KIVONewJsonWriter(indentation), with no newline
+// after it.
+std::string KIVOWriteJson(const Json::Value& value, const std::string& indentation = "");

@@ -1,5 +1,7 @@
 #include <cstring>
+#include <memory>
 #include <signal.h>
+#include <sstream>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
@@ -8,6 +10,7 @@
 #include <gtest/gtest.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/hex.h"
 #include "klibc/json_text.h"
 #include "klibc/key_value_file.h"
 #include "klibc/last_error.h"
@@ -187,6 +190,52 @@ TEST(JsonTextTest, DeepOrMalformedTextIsRefusedWithoutThrowing) {
   EXPECT_EQ(1, v["a"].asInt());
   EXPECT_TRUE(KIVOParseJson("\"text\"", &v));
   EXPECT_EQ("text", v.asString());
+}
+
+TEST(JsonTextTest, WrittenTextIsCompactEscapedAndReadsBack) {
+  Json::Value v(Json::objectValue);
+  v["b"] = true;
+  v["a"] = Json::Value(Json::arrayValue);
+  v["a"].append(1);
+  v["a"].append("x y");
+  v["a"].append(Json::Value());
+  v["c"] = "\xc3\xa9";  // é, in UTF-8
+  const std::string text = KIVOWriteJson(v);
+  EXPECT_EQ("{\"a\":[1,\"x y\",null],\"b\":true,\"c\":\"\\u00e9\"}", text);
+  Json::Value back;
+  ASSERT_TRUE(KIVOParseJson(text, &back));
+  EXPECT_EQ(v, back);
+  // The indented form people read; the same writer object serves many
+  // values alike.
+  Json::Value one(Json::objectValue);
+  one["b"] = 2;
+  EXPECT_EQ("{\n  \"b\" : 2\n}", KIVOWriteJson(one, "  "));
+  std::ostringstream out;
+  const std::unique_ptr<Json::StreamWriter> writer = KIVONewJsonWriter();
+  writer->write(one, &out);
+  writer->write(one, &out);
+  EXPECT_EQ("{\"b\":2}{\"b\":2}", out.str());
+}
+
+TEST(HexTest, BytesBecomeLowerCaseDigitPairs) {
+  const unsigned char bytes[] = {0x00, 0x01, 0x7f, 0x80, 0xab, 0xff};
+  EXPECT_EQ("00017f80abff", KIVOHex(bytes, sizeof(bytes)));
+  EXPECT_EQ("", KIVOHex(bytes, 0));
+  EXPECT_TRUE(KIVOIsLowerHex("00017f80abff"));
+  for (const char* bad : {"", "00FF", "0g", "ab cd", "-1"})
+    EXPECT_FALSE(KIVOIsLowerHex(bad)) << bad;
+}
+
+TEST(HexTest, RandomHexHasTheLengthAndDigitsAndDiffersEachDraw) {
+  std::string first, second;
+  ASSERT_TRUE(KIVORandomHex(16, &first));
+  ASSERT_TRUE(KIVORandomHex(16, &second));
+  EXPECT_EQ(32u, first.size());
+  EXPECT_TRUE(KIVOIsLowerHex(first)) << first;
+  EXPECT_TRUE(KIVOIsLowerHex(second)) << second;
+  EXPECT_NE(first, second);
+  ASSERT_TRUE(KIVORandomHex(0, &first));
+  EXPECT_EQ("", first);
 }
 
 }  // namespace

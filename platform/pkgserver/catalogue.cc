@@ -11,9 +11,8 @@
 #include <syslog.h>
 #include <vector>
 
-#include <json/writer.h>
-
 #include "klibc/atomic_file.h"
+#include "klibc/hex.h"
 #include "klibc/json_text.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
@@ -99,8 +98,7 @@ std::string DigestText(uint64_t digest) {
 // The digest the meta names, when it names a well-formed one.
 bool MetaDigest(const Json::Value& meta, uint64_t* digest) {
   const Json::Value& text = meta["digest"];
-  if (!text.isString() || text.asString().size() != 16 ||
-      text.asString().find_first_not_of("0123456789abcdef") != std::string::npos) {
+  if (!text.isString() || text.asString().size() != 16 || !KIVOIsLowerHex(text.asString())) {
     return false;
   }
   *digest = strtoull(text.asCString(), nullptr, 16);
@@ -110,11 +108,8 @@ bool MetaDigest(const Json::Value& meta, uint64_t* digest) {
 // The cache only saves the next request a transfer: failing to write it is
 // logged and otherwise harmless.
 void WriteCache(const std::string& path, const CachedCatalogue& cached) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "";
   if (KIVOFSMkdirP(CacheDir().c_str()) != 0 ||
-      !KIVOWriteFileAtomic(path, Json::writeString(builder, cached.meta) + "\n" + cached.body,
-                           SyncToDisk::No)) {
+      !KIVOWriteFileAtomic(path, KIVOWriteJson(cached.meta) + "\n" + cached.body, SyncToDisk::No)) {
     syslog(LOG_WARNING, "%s:%d cannot write the catalogue cache %s", "catalogue", __LINE__,
            path.c_str());
   }
@@ -133,19 +128,13 @@ bool ParseAnswer(const std::string& body, Json::Value& answer) {
 bool FetchFromServer(const std::string& url, const std::string& query, const std::string& language,
                      const HttpLimits& limits, const std::string& path, CachedCatalogue* cached,
                      bool have) {
-  std::string error;
-  const PackageServerNetOps* net = PMSServerNetOps(&error);
-  if (!net) {
-    CATALOGUE_LOG("%s: %s", url.c_str(), error.c_str());
-    return false;
-  }
   HttpFetch fetch;
   fetch.url = query;
   if (have) {
     fetch.if_none_match = cached->meta["etag"].asString();
     fetch.if_modified_since = cached->meta["last_modified"].asString();
   }
-  if (!net->fetch(limits, fetch)) {
+  if (!PMSServerFetch(limits, fetch)) {
     CATALOGUE_LOG("%s: %s", url.c_str(), fetch.error.c_str());
     return false;
   }

@@ -14,7 +14,6 @@
 #include "klibc/sysroot.h"
 #include "pkgserver/catalogue.h"
 #include "pkgtool/dependency.h"
-#include "webapi/api_response.h"
 
 #define LISTING_LOG(fmt, ...) \
   syslog(LOG_ERR, "%s:%d " fmt, "catalogue_listing", __LINE__, ##__VA_ARGS__)
@@ -145,7 +144,7 @@ bool Render(const std::string& body, uint64_t catalogue, ListingSide side, const
   }
   std::string fields;
   for (const std::string& name : recommend) PutField(&fields, name);
-  std::unique_ptr<Json::StreamWriter> writer(AnswerJsonWriter().newStreamWriter());
+  const std::unique_ptr<Json::StreamWriter> writer = KIVONewJsonWriter();
   size_t entries = 0;
   for (Json::Value& element : *list) entries += RenderEntry(element, side, *writer, &fields);
   *file = Header(side, catalogue, PMSCatalogueDigest(fields), entries, recommend.size()) + fields;

@@ -36,9 +36,10 @@ struct ListingEntry {
   std::string version;       // its text; "" when it is not a string
   std::string icon;          // "icon" when a non-empty string, else ""
   size_t source = 0;         // its catalogue: an index into CatalogueListing::sources
-  // The rendered entry: one JSON object written with AnswerJsonWriter()
-  // (api_response.h), so that it can stand in an answer as it is. It views
-  // the listing's `files` and lives as long as the listing.
+  // The rendered entry: one JSON object written with KIVONewJsonWriter()
+  // (klibc/json_text.h), as answers are written, so that it can stand in an
+  // answer as it is. It views the listing's `files` and lives as long as the
+  // listing.
   std::string_view text;
 };
 

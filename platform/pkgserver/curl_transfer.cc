@@ -15,6 +15,7 @@
 
 #include <curl/curl.h>
 
+#include "klibc/hex.h"
 #include "pkgserver/server_net.h"
 
 #include <arpa/inet.h>
@@ -315,16 +316,6 @@ bool Fetch(const HttpLimits& limits, HttpFetch& fetch) {
 
 // --- Download into a file --------------------------------------------------
 
-std::string Hex(const unsigned char* digest, unsigned size) {
-  static const char kDigits[] = "0123456789abcdef";
-  std::string out;
-  for (unsigned i = 0; i < size; ++i) {
-    out += kDigits[digest[i] >> 4];
-    out += kDigits[digest[i] & 15];
-  }
-  return out;
-}
-
 // A digest of a download on a thread of its own, so that hashing
 // one block overlaps receiving and writing the next: inline, the digests
 // took most of the worker's time and the server waited on a full socket.
@@ -437,9 +428,9 @@ class FileSink {
     Drain();
     unsigned char digest[EVP_MAX_MD_SIZE];
     unsigned size = 0;
-    if (md5_ && EVP_DigestFinal_ex(md5_.get(), digest, &size)) d_.md5_hex = Hex(digest, size);
+    if (md5_ && EVP_DigestFinal_ex(md5_.get(), digest, &size)) d_.md5_hex = KIVOHex(digest, size);
     if (sha256_ && EVP_DigestFinal_ex(sha256_.get(), digest, &size))
-      d_.sha256_hex = Hex(digest, size);
+      d_.sha256_hex = KIVOHex(digest, size);
   }
 
  private:

@@ -1,3 +1,6 @@
+// The package server library's transfer of a package file into its
+// download task (the web API's request and worker are package/download.cc).
+
 #include "pkgserver/download.h"
 
 #include <algorithm>
@@ -15,6 +18,7 @@
 #include "pkgserver/server_net.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/pms.h"
+#include "taskmgr/task_names.h"
 
 #include <strings.h>
 
@@ -72,7 +76,10 @@ bool WriteTaskData(NVX::Task* task, const Json::Value& data, double progress) {
   return ok;
 }
 
-void Fail(NVX::Task* task, int code, const std::string& message, int result = 0) {
+// `dependent`: for an upgrade refused because it would break a running
+// package (269), that package's id.
+void Fail(NVX::Task* task, int code, const std::string& message, int result = 0,
+          const std::string& dependent = "") {
   if (isCanceled() || !TaskExists(task)) return;
   Json::Value data = task->getProperty("data");
   if (!data.isObject()) data = Json::Value(Json::objectValue);
@@ -81,6 +88,7 @@ void Fail(NVX::Task* task, int code, const std::string& message, int result = 0)
   data["error"]["code"] = code;
   data["error"]["message"] = message;
   if (result) data["error"]["result"] = result;
+  if (!dependent.empty()) data["error"]["deppkg"] = dependent;
   // The log line says what failed even when the task cannot.
   DOWNLOAD_LOG("%s: %s", task->getTaskId().c_str(), message.c_str());
   if (!WriteTaskData(task, data, -1.0) || !task->finish(false)) {
@@ -178,8 +186,8 @@ bool Transfer(NVX::Task* task, const std::string& name, const std::string& link,
 }  // namespace
 
 bool IsInstalling(const std::string& name) {
-  NVX::TaskMgr mgr("@administrators");
-  std::unique_ptr<NVX::Task> task(mgr.getTask("@KIVOPKG_DOWNLOAD_" + name));
+  NVX::TaskMgr mgr(KIVOPackageTasks::kTaskOwner);
+  std::unique_ptr<NVX::Task> task(mgr.getTask(KIVOPackageTasks::kDownloadPrefix + name));
   if (!task || task->isFinished()) return false;
   Json::Value data = task->getProperty("data");
   return data.isObject() && data["pid"].isInt() && KLIBCProcAlive(data["pid"].asInt()) == 1;
@@ -273,7 +281,8 @@ bool Install(NVX::Task* task, const std::string& user, const std::string& volume
     DOWNLOAD_LOG("install of %s failed: %s [%d]", name.c_str(), message.c_str(),
                  static_cast<int>(code));
     Fail(task, PMS_DL_ERR_INSTALL, message.empty() ? "the install failed" : message,
-         static_cast<int>(code));
+         static_cast<int>(code),
+         code == PKG_ERR_DEPENDENTS_RUNNING ? details["deppkg"].asString() : "");
     return false;
   }
   return SetStatus(task, "installed", false) && task->finish(true);

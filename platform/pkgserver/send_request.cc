@@ -20,11 +20,9 @@ bool PMSDownloadSendRequest(const std::string& url, bool post, std::string& body
     for (const auto& [key, value] : params->entries)
       form += (form.empty() ? "" : "&") + PMSUrlEncode(key) + "=" + PMSUrlEncode(value);
   }
-  std::string error;
-  const PackageServerNetOps* net = PMSServerNetOps(&error);
-  if (!PMSIsServerUrl(url) || !net) {
-    syslog(LOG_ERR, "%s:%d %s: %s", "send_request", __LINE__, url.c_str(),
-           net ? "not an http or https address" : error.c_str());
+  if (!PMSIsServerUrl(url)) {
+    syslog(LOG_ERR, "%s:%d %s: not an http or https address", "send_request", __LINE__,
+           url.c_str());
     return false;
   }
   HttpFetch fetch;
@@ -34,7 +32,7 @@ bool PMSDownloadSendRequest(const std::string& url, bool post, std::string& body
   } else {
     fetch.url = form.empty() ? url : url + (url.find('?') == std::string::npos ? "?" : "&") + form;
   }
-  if (!net->fetch(PMSLoadServerConfig().SmallLimits(kMaxAnswerBytes), fetch) ||
+  if (!PMSServerFetch(PMSLoadServerConfig().SmallLimits(kMaxAnswerBytes), fetch) ||
       fetch.status != 200) {
     syslog(LOG_ERR, "%s:%d %s: %s", "send_request", __LINE__, url.c_str(),
            fetch.error.empty() ? ("HTTP " + std::to_string(fetch.status)).c_str()

@@ -64,18 +64,12 @@ ImageRules LoadRules() {
 }
 
 bool Fetch(const ImageRules& rules, const std::string& link, const std::string& path) {
-  std::string error;
-  const PackageServerNetOps* net = PMSServerNetOps(&error);
-  if (!net) {
-    IMAGE_LOG("%s: %s", link.c_str(), error.c_str());
-    return false;
-  }
   HttpFetch fetch;
   fetch.url = link;
   fetch.servers_only = true;
   fetch.servers = rules.servers;
   fetch.public_only = !rules.config.allow_private_image_addresses;
-  if (!net->fetch(rules.config.SmallLimits(kMaxImageBytes), fetch) || fetch.status != 200) {
+  if (!PMSServerFetch(rules.config.SmallLimits(kMaxImageBytes), fetch) || fetch.status != 200) {
     IMAGE_LOG("%s: %s", link.c_str(),
               fetch.error.empty()
                   ? ("the server answered HTTP " + std::to_string(fetch.status)).c_str()

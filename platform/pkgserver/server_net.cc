@@ -33,3 +33,8 @@ const PackageServerNetOps* PMSServerNetOps(std::string* error) {
   if (!ops) *error = load_error.empty() ? std::string("cannot load ") + kLibrary : load_error;
   return ops;
 }
+
+bool PMSServerFetch(const HttpLimits& limits, HttpFetch& fetch) {
+  const PackageServerNetOps* net = PMSServerNetOps(&fetch.error);
+  return net && net->fetch(limits, fetch);
+}

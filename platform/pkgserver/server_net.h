@@ -87,3 +87,8 @@ using KivoPackageServerNetFn = const PackageServerNetOps* (*)();
 // The loaded table, or null (with `*error` set) when the library cannot be
 // loaded. Loaded once per process.
 const PackageServerNetOps* PMSServerNetOps(std::string* error);
+
+// The table's fetch: true when an answer came (any status). False with
+// `fetch.error` saying why when there was none, the library's failing to
+// load among the reasons.
+[[nodiscard]] bool PMSServerFetch(const HttpLimits& limits, HttpFetch& fetch);

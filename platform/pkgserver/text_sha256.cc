@@ -4,6 +4,8 @@
 
 #include <cstdint>
 
+#include "klibc/hex.h"
+
 namespace {
 
 constexpr uint32_t kRound[64] = {
@@ -70,10 +72,9 @@ std::string PMSTextSha256Hex(std::string_view text) {
   for (size_t at = 0; at < message.size(); at += 64) {
     Compress(state, reinterpret_cast<const unsigned char*>(message.data() + at));
   }
-  static const char kDigits[] = "0123456789abcdef";
-  std::string hex;
-  for (uint32_t word : state) {
-    for (int shift = 28; shift >= 0; shift -= 4) hex += kDigits[(word >> shift) & 15];
-  }
-  return hex;
+  // The digest is the state's words, big-endian.
+  unsigned char digest[32];
+  for (int i = 0; i < 32; ++i)
+    digest[i] = static_cast<unsigned char>(state[i / 4] >> (24 - 8 * (i % 4)));
+  return KIVOHex(digest, sizeof(digest));
 }

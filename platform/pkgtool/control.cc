@@ -1,4 +1,5 @@
-// Starting, stopping and removing installed packages.
+// The package tool's start, stop and removal of installed packages (the
+// web API's requests for them are package/control.cc).
 
 #include <cerrno>
 #include <cstring>
@@ -12,7 +13,9 @@
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/upgrade_recovery.h"
 #include "taskmgr/task.h"
+#include "taskmgr/task_names.h"
 
 namespace {
 
@@ -23,7 +26,7 @@ namespace {
 class OperationTask {
  public:
   OperationTask(const std::string& id, const char* prefix, const char* status) {
-    task_.reset(GetNewTask("@administrators", (prefix + id).c_str()));
+    task_.reset(GetNewTask(KIVOPackageTasks::kTaskOwner, (prefix + id).c_str()));
     if (!task_) return;
     Json::Value data(Json::objectValue);
     data["status"] = status;
@@ -84,6 +87,10 @@ int PackageManager::LockAndLoad(const std::string& id, PackageInfo* info) {
   // The record is read only once the lock is held: read before, it may be
   // the state another operation is about to change.
   if (!ExLock(PMSLockWaitSeconds())) return PKG_ERR_BUSY;
+  // An upgrade killed half way may have left a version over data that is
+  // not its own; it is put right before anything starts or stops it. What
+  // cannot be put right yet is in the system log and is tried again.
+  static_cast<void>(PMSRecoverUpgrades(nullptr));
   return PMSLoadInstalled(id, info) ? PKG_OK : PKG_ERR_NOT_INSTALLED;
 }
 
@@ -120,7 +127,7 @@ bool PackageManager::serviceControl(int opType, const std::string& id, bool star
   }
   std::string record = PMSIsValidPackageId(id) ? PackageRegistry::RecordDir(id) : "";
   if (result == PKG_OK && info.isStartable()) {
-    OperationTask task(id, "@KIVOPKG_STARTSTOP_", start ? "starting" : "stopping");
+    OperationTask task(id, KIVOPackageTasks::kStartStopPrefix, start ? "starting" : "stopping");
     auto env = PMSScriptEnv(info, record, start ? "start" : "stop", op, Json::Value());
     if (!PMSRunPackageScript(record, "start-stop-status", start ? "start" : "stop", env, op)) {
       result = PKG_ERR_SCRIPT_FAILED;
@@ -163,7 +170,7 @@ bool PackageManager::uninstall(const std::string& id, const Json::Value* wizardV
     }
   }
   if (result == PKG_OK) {
-    OperationTask task(id, "@KIVOPKG_UNINSTALL_", "uninstalling");
+    OperationTask task(id, KIVOPackageTasks::kUninstallPrefix, "uninstalling");
     result = RemovePackage(id, info, wizardValues ? *wizardValues : Json::Value(), op);
   }
   UnLock();

@@ -2,8 +2,8 @@
 
 #include <cctype>
 
+#include "klibc/json_text.h"
 #include "pkgtool/registry.h"
-#include "webapi/webapi_util.h"
 
 namespace {
 
@@ -91,7 +91,7 @@ int PMSParseDepJSON(const Json::Value& value, DepPkgVector& out) {
 int PMSParseDepJSONString(const std::string& text, DepPkgVector& out) {
   out.clear();
   Json::Value value;
-  if (!WebAPIUtil::ParseJson(text, value)) return 0;
+  if (!KIVOParseJson(text, &value)) return 0;
   return PMSParseDepJSON(value, out);
 }
 

@@ -1,9 +1,16 @@
-// Checking and installing package files. The install is one transaction:
+// The package tool's install (the web API's requests for it are
+// package/install.cc). Checking and installing package files. The install is one transaction:
 // the new version is staged under fresh names (record and payload folder),
 // its scripts run, and it becomes the installed version by one atomic
-// rename (registry.h). Until then the old version is untouched and runs; a
-// failure after it puts the old record back.
+// rename (registry.h). Until then the old version's code is untouched. An
+// upgrade copies the package's data before its scripts change it
+// (data_snapshot.h) and counts as done only once the new version passes its
+// health gate (health_gate.h); any failure before that puts the old version
+// back with its data.
 
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
 #include <ctime>
 #include <memory>
 #include <sys/stat.h>
@@ -11,8 +18,11 @@
 #include <unistd.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/last_error.h"
 #include "klibc/sysroot.h"
+#include "pkgtool/data_snapshot.h"
+#include "pkgtool/health_gate.h"
 #include "pkgtool/install_checks.h"
 #include "pkgtool/lifecycle.h"
 #include "pkgtool/package_file.h"
@@ -23,7 +33,7 @@
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/signature.h"
-#include "webapi/webapi_util.h"
+#include "storage/volume_space.h"
 
 namespace {
 
@@ -42,8 +52,10 @@ void InfoFromHeader(const std::string& path, const PackageFileHeader& header,
     mask |= w.op;
     if (w.op != wizard) continue;
     auto localized = header.members.find(std::string(w.member) + "_" + (language ? language : ""));
+    // A member that is not JSON leaves the wizard without pages (null); the
+    // builder refuses such a member, so only a hand-made file has one.
     Json::Value ui;
-    WebAPIUtil::ParseJson(localized != header.members.end() ? localized->second : it->second, ui);
+    (void)KIVOParseJson(localized != header.members.end() ? localized->second : it->second, &ui);
     info->setUIFile(ui);
   }
   info->setWizardMask(mask);
@@ -141,6 +153,31 @@ bool ControlRecord(const std::string& record, const PackageInfo& info, const std
   return PMSRunPackageScript(record, "start-stop-status", action, env, op);
 }
 
+std::string MiB(uint64_t bytes) { return std::to_string((bytes + (1 << 20) - 1) >> 20) + " MiB"; }
+
+// The last `count` lines of `text`, without its final newline.
+std::string LastLines(std::string text, int count) {
+  while (!text.empty() && text.back() == '\n') text.pop_back();
+  size_t start = text.size();
+  for (int i = 0; i < count; ++i) {
+    size_t newline = start == 0 ? std::string::npos : text.rfind('\n', start - 1);
+    if (newline == std::string::npos) return text;
+    start = newline;
+  }
+  return text.substr(start + 1);
+}
+
+// The last lines of the installed package's own log (INFO "logfile"), at
+// most 4 KiB, for an answer that says why an upgrade failed; "" when it has
+// none.
+std::string PackageLogTail(const std::string& id) {
+  PackageManager pm;
+  const std::string path = pm.getPackageLog(id);
+  std::string tail = LastLines(path.empty() ? "" : PMSReadPackageLog(path), 10);
+  if (tail.size() > 4096) tail.erase(0, tail.size() - 4096);
+  return tail.empty() ? "" : "\nThe last lines of " + id + "'s log:\n" + tail;
+}
+
 struct InstallJob {
   std::string path, volume, user, language;
   Json::Value wizard;
@@ -176,16 +213,36 @@ class Installer {
   // (package_origin.h).
   int CheckOrigin(const SignatureSeen& found);
   int Stage(PackageFileReader* reader, const PackageInfo& info, Staging* s);
+  // Before anything is written: whether the upgrade can copy the data
+  // folder of `volume`, and whether the volume has room for the copy besides
+  // the install's `needed` bytes (307, 308). Sets snapshot_ when a copy is
+  // to be taken.
+  int PlanDataCopy(const PackageInfo& info, const VolumeConfig& volume, uint64_t needed);
   int RunScriptsAndPublish(const PackageInfo& info, Staging* s);
-  // preinst; or, for an upgrade, stopping the old version and preupgrade.
+  // preinst; or, for an upgrade, stopping the old version, copying the data
+  // and preupgrade.
   int PrepareInstall(const std::map<std::string, std::string>& env, Staging* s);
   int PrepareUpgrade(const PackageInfo& info, const std::map<std::string, std::string>& env,
                      Staging* s);
-  // After a failed postupgrade/postinst: the old record published again (or
-  // the new one withdrawn), and an answer that says what really happened.
-  int RollBackUpgrade(const PackageInfo& info, Staging* s);
+  int TakeDataCopy();
+  // After a refusal that changed nothing but stopping the old version: it
+  // runs again, and the answer says so.
+  int RestartOld(int code);
+  // After any failure of an upgrade once its scripts began (`failure` says
+  // what the new version did: "failed in postupgrade", ...): the new version
+  // stopped, the old one back with its data and started when it ran, and an
+  // answer that says what really happened.
+  int RestoreAfterFailure(const PackageInfo& info, Staging* s, const std::string& failure);
+  // Puts the old version back (with its data when it was copied); true when
+  // it is whole again. *state says what happened in words.
+  bool PutOldBack(const PackageInfo& info, std::string* state);
+  std::string PartialRestoreText(RestoreState restored, const std::string& error,
+                                 const PackageInfo& info);
   int WithdrawInstall(const PackageInfo& info, Staging* s);
   int Finish(const PackageInfo& info, Staging* s);
+  // An upgraded package that ran (or was asked to) starts and must pass
+  // the health gate; one that was stopped is judged by its scripts alone.
+  int StartUpgraded(const PackageInfo& info, Staging* s);
   [[nodiscard]] bool RemoveOldVersion();
 
   const InstallJob& job_;
@@ -194,6 +251,10 @@ class Installer {
   std::unique_ptr<Operation> op_;
   bool upgrade_ = false;
   bool was_running_ = false;
+  bool published_ = false;                  // the new version is published
+  bool new_started_ = false;                // the new version was started: a restore stops it first
+  std::unique_ptr<DataSnapshot> snapshot_;  // the planned copy of the data; null for none
+  bool copy_taken_ = false;
   PackageInfo old_;
   std::string old_record_;
   std::string id_;
@@ -264,6 +325,7 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
   uint64_t needed = PMSNeededBytes(info, reader->header().payload_size);
   int code = PMSChooseVolume(info, job_.volume, needed, &volume, &text);
   if (code != PKG_OK) return Refuse(code, text);
+  if (upgrade_ && (code = PlanDataCopy(info, volume, needed)) != PKG_OK) return code;
   const std::string record_name = PackageRegistry::NewRecordName(info.getId());
   if (record_name.empty()) return Refuse(PKG_ERR_INTERNAL, "cannot make a fresh record name");
   s->id = info.getId();
@@ -295,6 +357,38 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
   return PKG_OK;
 }
 
+int Installer::PlanDataCopy(const PackageInfo& info, const VolumeConfig& volume, uint64_t needed) {
+  const std::string appdata = KIVORootPath(volume.path + "/@appdata");
+  auto snapshot = std::make_unique<DataSnapshot>(appdata, id_, old_record_.substr(9));
+  if (!info.getBool(kPMSDataCopyKey, true)) {
+    op_->Log("no safety copy of the data: the package declares it needs none");
+    return PKG_OK;
+  }
+  if (!KLIBCFileExist(snapshot->data_dir().c_str())) return PKG_OK;  // no data to copy
+  if (!snapshot->IsValid()) return Refuse(PKG_ERR_INTERNAL, "cannot name the copy of the data");
+  TreeSurvey survey;
+  if (!PMSSurveyTree(snapshot->data_dir(), &survey)) {
+    return Refuse(PKG_ERR_DATA_NOT_COPYABLE, "The data of " + id_ +
+                                                 " cannot be copied safely before the upgrade: " +
+                                                 survey.problem + ". Nothing was changed.");
+  }
+  // Where the file system shares blocks, the copy takes no room.
+  const bool shared = PMSSnapshotsShareBlocks(appdata);
+  VolumeConfig same;
+  std::string text;
+  if (!shared &&
+      PMSChooseVolume(info, volume.path, needed + survey.bytes, &same, &text) == PKG_ERR_NO_SPACE) {
+    return Refuse(PKG_ERR_NO_ROOM_FOR_DATA_COPY,
+                  "The upgrade of " + id_ + " needs " + MiB(survey.bytes) +
+                      " for a safety copy of its data besides " + MiB(needed) +
+                      " for its files, and " + volume.path + " has " +
+                      MiB(std::max<int64_t>(KIVOVolumeFreeBytes(volume), 0)) +
+                      " free. Nothing was changed.");
+  }
+  snapshot_ = std::move(snapshot);
+  return PKG_OK;
+}
+
 int Installer::RunScriptsAndPublish(const PackageInfo& info, Staging* s) {
   auto env = PMSScriptEnv(info, s->record, upgrade_ ? "upgrade" : "install", *op_, job_.wizard,
                           upgrade_ ? old_.getVersion() : "");
@@ -304,11 +398,13 @@ int Installer::RunScriptsAndPublish(const PackageInfo& info, Staging* s) {
   if (!PackageRegistry::Publish(info.getId(), ".records/" + s->record_name)) {
     return Refuse(PKG_ERR_INTERNAL, "cannot publish the package record");
   }
+  published_ = true;
   PMSFaultPoint("published");
   if (PMSRunPackageScript(s->record, upgrade_ ? "postupgrade" : "postinst", "", env, *op_))
     return PKG_OK;
   // The new version failed its last step: put back what was there before.
-  return upgrade_ ? RollBackUpgrade(info, s) : WithdrawInstall(info, s);
+  return upgrade_ ? RestoreAfterFailure(info, s, "failed in postupgrade")
+                  : WithdrawInstall(info, s);
 }
 
 int Installer::PrepareInstall(const std::map<std::string, std::string>& env, Staging* s) {
@@ -324,30 +420,119 @@ int Installer::PrepareUpgrade(const PackageInfo& info,
     return Refuse(PKG_ERR_SCRIPT_FAILED,
                   old_.getVersion() + " did not stop; it stays installed and running");
   }
+  int code = TakeDataCopy();
+  if (code != PKG_OK) return RestartOld(code);
   if (PMSRunPackageScript(s->record, "preupgrade", "", env, *op_)) return PKG_OK;
-  if (was_running_ && !ControlRecord(old_record, old_, "start", *op_)) {
-    return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "preupgrade failed; " + old_.getVersion() +
-                                                   " stays installed but did not start again");
-  }
-  return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "preupgrade failed; " + old_.getVersion() + " stays");
+  return RestoreAfterFailure(info, s, "failed in preupgrade");
 }
 
-int Installer::RollBackUpgrade(const PackageInfo& info, Staging* s) {
-  if (!PackageRegistry::Publish(info.getId(), old_record_)) {
-    // The new version is the one published: keep its folders, or the
-    // published name would lead nowhere.
-    s->committed = true;
-    return Refuse(PKG_ERR_SCRIPT_FAILED, "postupgrade failed, and " + old_.getVersion() +
-                                             " could not be put back; " + info.getVersion() +
-                                             " stays installed");
+int Installer::TakeDataCopy() {
+  if (!snapshot_) return PKG_OK;
+  std::string error;
+  const std::string what = "The data of " + id_;
+  switch (PMSTakeSnapshot(*snapshot_, &error)) {
+    case TreeCopyResult::kCopied:
+      copy_taken_ = true;
+      PMSFaultPoint("snapshot_taken");
+      return PKG_OK;
+    case TreeCopyResult::kNoSpace:
+      return Refuse(PKG_ERR_NO_ROOM_FOR_DATA_COPY, "The volume filled up while the data of " + id_ +
+                                                       " was copied before the upgrade (" + error +
+                                                       ").");
+    case TreeCopyResult::kRefused:
+      return Refuse(PKG_ERR_DATA_NOT_COPYABLE,
+                    what + " cannot be copied safely before the upgrade: " + error + ".");
+    case TreeCopyResult::kFailed:
+      break;
   }
-  if (was_running_ &&
-      !ControlRecord(PackageRegistry::RecordDir(info.getId()), old_, "start", *op_)) {
-    return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK, "postupgrade failed; " + old_.getVersion() +
-                                                   " was restored but did not start again");
+  return Refuse(PKG_ERR_INTERNAL, what + " could not be copied before the upgrade: " + error + ".");
+}
+
+int Installer::RestartOld(int code) {
+  const std::string old = old_.getVersion();
+  if (!was_running_) {
+    *message_ += " Nothing was changed.";
+  } else if (ControlRecord(PackageRegistry::RecordDir(id_), old_, "start", *op_)) {
+    *message_ += " Nothing was changed; " + old + " runs again.";
+  } else {
+    *message_ += " Nothing was changed, but " + old + " did not start again.";
   }
-  return Refuse(PKG_ERR_UPGRADE_ROLLED_BACK,
-                "postupgrade failed; " + old_.getVersion() + " was restored");
+  return code;
+}
+
+int Installer::RestoreAfterFailure(const PackageInfo& info, Staging* s,
+                                   const std::string& failure) {
+  const std::string head = "The upgrade to " + info.getVersion() + " " + failure;
+  // Read before the data folder, which holds the log, is put back.
+  const std::string log = PackageLogTail(id_);
+  std::string state;
+  bool whole = false;
+  if (new_started_ && !ControlRecord(s->record, info, "stop", *op_) && PMSIsRunning(id_, info)) {
+    state = info.getVersion() + " did not stop: it stays installed and running with the data it " +
+            "changed" +
+            (copy_taken_ ? "; " + old_.getVersion() +
+                               " and the copy of its data are kept, and the next package "
+                               "operation puts them back once " +
+                               info.getVersion() + " stops"
+                         : "");
+  } else {
+    whole = PutOldBack(info, &state);
+  }
+  // The new version's folders stay exactly when it is still the one
+  // published: the published name must never lead nowhere.
+  s->committed = PackageRegistry::PublishedRecord(id_) == ".records/" + s->record_name;
+  *message_ = head + (whole ? "; " : ", and ") + state + "." + log;
+  return whole ? PKG_ERR_UPGRADE_ROLLED_BACK : PKG_ERR_SCRIPT_FAILED;
+}
+
+bool Installer::PutOldBack(const PackageInfo& info, std::string* state) {
+  const std::string old = old_.getVersion();
+  bool whole = false;
+  if (copy_taken_) {
+    std::string error;
+    RestoreState restored = PMSRestoreSnapshot(*snapshot_, &error);
+    whole = restored == RestoreState::kRestored;
+    *state =
+        whole ? old + " and its data were restored" : PartialRestoreText(restored, error, info);
+  } else if (published_ && !PackageRegistry::Publish(id_, old_record_)) {
+    *state = old + " could not be put back (" + strerror(errno) + "): " + info.getVersion() +
+             " stays installed";
+  } else {
+    whole = true;
+    *state = old + (published_ ? " was restored" : " stays installed") +
+             (!info.getBool(kPMSDataCopyKey, true)
+                  ? "; its data was not copied before the upgrade and stays as the upgrade left it"
+                  : "");
+  }
+  if (whole && was_running_ &&
+      !ControlRecord(PackageRegistry::RecordDir(id_), old_, "start", *op_)) {
+    *state += ", but " + old + " did not start again";
+  }
+  return whole;
+}
+
+std::string Installer::PartialRestoreText(RestoreState restored, const std::string& error,
+                                          const PackageInfo& info) {
+  const std::string old = old_.getVersion(), now = info.getVersion();
+  const std::string code = published_ ? now : old;  // the version published now
+  switch (restored) {
+    case RestoreState::kUntouched:
+      return "putting " + old + "'s data back failed (" + error + "): " + code +
+             " stays installed, stopped, with the data the upgrade changed; the copy of " + old +
+             "'s data is kept, and the next package operation puts " + old + " back with it";
+    case RestoreState::kDataAside:
+      return "putting " + old + "'s data back failed half way (" + error + "): the data folder " +
+             snapshot_->data_dir() + " is missing; the data the upgrade changed is in " +
+             snapshot_->Named(".replaced") + ", the copy of " + old + "'s in " + snapshot_->copy() +
+             ", and the next package operation puts " + old + " back with it";
+    case RestoreState::kNotPublished:
+      return old + "'s data is back, but its record could not be published again (" + error +
+             "): " + now + " stays installed over " + old +
+             "'s data, stopped, until the next package operation finishes the restore";
+    default:
+      return "the copy of " + old + "'s data could not be put back (" + error + "): " + code +
+             " stays installed, stopped, with the data the upgrade changed";
+  }
 }
 
 int Installer::WithdrawInstall(const PackageInfo& info, Staging* s) {
@@ -360,19 +545,40 @@ int Installer::WithdrawInstall(const PackageInfo& info, Staging* s) {
 }
 
 int Installer::Finish(const PackageInfo& info, Staging* s) {
-  s->committed = true;
-  if (job_.run_after || was_running_) {
-    if (!ControlRecord(s->record, info, "start", *op_)) {
-      op_->Log("installed, but the package did not start");
-    } else if (!KIVOWriteFileAtomic(s->record + "/enabled", "", SyncToDisk::No)) {
-      op_->Log("started, but cannot record that the package is meant to run");
+  bool started = job_.run_after || was_running_;
+  if (upgrade_) {
+    int code = StartUpgraded(info, s);
+    if (code != PKG_OK) return code;
+    // The commit of the upgrade: from here on the new version stays.
+    if (copy_taken_ && !PMSDiscardSnapshot(*snapshot_)) {
+      return RestoreAfterFailure(info, s,
+                                 std::string("could not be confirmed (") + strerror(errno) + ")");
     }
+  } else if (job_.run_after && !ControlRecord(s->record, info, "start", *op_)) {
+    op_->Log("installed, but the package did not start");
+    started = false;
+  }
+  s->committed = true;
+  if (started && !KIVOWriteFileAtomic(s->record + "/enabled", "", SyncToDisk::No)) {
+    op_->Log("started, but cannot record that the package is meant to run");
   }
   // The old version's record and files are no longer reachable; what cannot
   // be removed now, the next operation's clean-up removes.
   if (upgrade_ && !RemoveOldVersion()) op_->Log("some files of the previous version stay");
   PMSFaultPoint("done");
   return PKG_OK;
+}
+
+int Installer::StartUpgraded(const PackageInfo& info, Staging* s) {
+  if (!job_.run_after && !was_running_) return PKG_OK;
+  new_started_ = true;
+  if (!ControlRecord(s->record, info, "start", *op_)) {
+    return RestoreAfterFailure(info, s, "did not start (its start script failed)");
+  }
+  auto env = PMSScriptEnv(info, s->record, "upgrade", *op_, job_.wizard, old_.getVersion());
+  HealthVerdict verdict = PMSHealthGate(id_, info, s->record, env, *op_);
+  if (verdict == HealthVerdict::kHealthy) return PKG_OK;
+  return RestoreAfterFailure(info, s, PMSHealthVerdictText(verdict, PMSHealthLimits(info)));
 }
 
 bool Installer::RemoveOldVersion() {
@@ -515,7 +721,7 @@ bool InstallFile(const std::string& user, const std::string& path, const std::st
   InstallJob job{path, volume, user, language, Json::Value(), typeFlag, force, checkCodesign, from};
   details = Json::Value(Json::objectValue);
   details["workerMessage"] = Json::Value(Json::arrayValue);
-  if (!extraValues.empty() && !WebAPIUtil::ParseJson(extraValues, job.wizard)) {
+  if (!extraValues.empty() && !KIVOParseJson(extraValues, &job.wizard)) {
     code = PKG_ERR_BAD_WIZARD_VALUES;
     message = "the wizard values are not valid JSON";
     return false;

@@ -11,6 +11,9 @@
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
+#include "storage/device_info.h"
+#include "storage/os_version.h"
+#include "storage/volume_space.h"
 
 #include <netinet/in.h>
 

@@ -7,7 +7,7 @@
 #include <json/value.h>
 
 #include "pkgtool/package_info.h"
-#include "storage/storage_config.h"
+#include "storage/volumes.h"
 
 // Architecture, OS version limits, conflicts, required services and
 // packages, port. Returns PKG_OK or the code, with `message` and `details`

@@ -11,14 +11,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <json/writer.h>
-
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/script_runner.h"
-#include "storage/storage_config.h"
+#include "pkgtool/upgrade_recovery.h"
+#include "storage/volumes.h"
 
 #include <stdlib.h>
 
@@ -34,17 +34,6 @@ bool IsEnvKey(const std::string& key) {
 
 std::string ProgressPath(const std::string& id) {
   return KIVORootPath("/run/kivo/pkgtool/progress/") + id;
-}
-
-std::set<std::string> ListDir(const std::string& dir) {
-  std::set<std::string> names;
-  DIR* d = opendir(dir.c_str());
-  if (!d) return names;
-  while (struct dirent* e = readdir(d)) {
-    if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) names.insert(e->d_name);
-  }
-  closedir(d);
-  return names;
 }
 
 std::string RealPath(const std::string& path) {
@@ -73,10 +62,10 @@ std::map<std::string, std::string> PMSScriptEnv(const PackageInfo& info, const s
   if (!old_version.empty()) env["KIVO_PKG_OLD_VERSION"] = old_version;
   if (wizard_values.isObject()) {
     std::string path = op.worker_message_path() + ".wizard.json";
-    // Scripts read the answers from the file; without it they only get the
-    // variables below, and the log says so.
-    if (KIVOWriteFileAtomic(path, Json::writeString(Json::StreamWriterBuilder(), wizard_values),
-                            SyncToDisk::No, 0600)) {
+    // Scripts read the answers from the file (one member a line, as it has
+    // always been written); without it they only get the variables below,
+    // and the log says so.
+    if (KIVOWriteFileAtomic(path, KIVOWriteJson(wizard_values, "\t"), SyncToDisk::No, 0600)) {
       env["KIVO_WIZARD_VALUES"] = path;
     } else {
       op.Log("cannot write the wizard answers for the scripts");
@@ -139,20 +128,38 @@ std::string PMSVolumeFolderHolding(const std::string& path, const char* kind) {
   return "";
 }
 
+std::set<std::string> PMSListDir(const std::string& dir) {
+  std::set<std::string> names;
+  DIR* d = opendir(dir.c_str());
+  if (!d) return names;
+  while (struct dirent* e = readdir(d)) {
+    if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) names.insert(e->d_name);
+  }
+  closedir(d);
+  return names;
+}
+
 bool PMSRecoverLeftovers() {
+  // Upgrades first: a version an interrupted upgrade replaced is published
+  // by no one, yet must come back; one that cannot come back yet keeps its
+  // record and payload for the next try.
   std::set<std::string> live_records, live_targets;
+  bool all_removed = PMSRecoverUpgrades(&live_records);
+  for (const std::string& name : live_records) {
+    std::string target = RealPath(PackageRegistry::RecordsDir() + "/" + name + "/target");
+    if (!target.empty()) live_targets.insert(target);
+  }
   for (const std::string& id : PackageRegistry::List()) {
     std::string record = PackageRegistry::PublishedRecord(id);
     if (record.compare(0, 9, ".records/") == 0) live_records.insert(record.substr(9));
     std::string target = RealPath(PackageRegistry::RecordDir(id) + "/target");
     if (!target.empty()) live_targets.insert(target);
   }
-  bool all_removed = true;
   std::string records = PackageRegistry::RecordsDir();
-  for (const std::string& name : ListDir(records)) {
+  for (const std::string& name : PMSListDir(records)) {
     if (!live_records.count(name)) all_removed &= PMSRemoveTree(records, records + "/" + name);
   }
-  for (const std::string& name : ListDir(PackageRegistry::Dir())) {
+  for (const std::string& name : PMSListDir(PackageRegistry::Dir())) {
     std::string path = PackageRegistry::Dir() + "/" + name;
     bool half_published = name.compare(0, 9, ".publish-") == 0;
     bool dangling = name[0] != '.' && !PackageRegistry::PublishedRecord(name).empty() &&
@@ -161,7 +168,7 @@ bool PMSRecoverLeftovers() {
   }
   for (const VolumeConfig& volume : KIVOVolumesLoad()) {
     std::string store = KIVORootPath(volume.path + "/@appstore");
-    for (const std::string& name : ListDir(store)) {
+    for (const std::string& name : PMSListDir(store)) {
       std::string path = RealPath(store + "/" + name);
       if (!path.empty() && !live_targets.count(path)) {
         all_removed &= PMSRemoveTree(store, store + "/" + name);

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <map>
+#include <set>
 #include <string>
 
 #include <json/value.h>
@@ -40,11 +41,16 @@ void PMSClearProgress(const std::string& id);
 // itself with SIGKILL right there, as a power cut or `kill -9` would.
 void PMSFaultPoint(const char* step);
 
-// Removes records and payload folders that no published record reaches,
+// Finishes or undoes interrupted upgrades (upgrade_recovery.h), then
+// removes records and payload folders that no published record reaches,
 // and half-made temporary names: what an interrupted operation leaves.
 // Must run under the tool's exclusive lock. False when something could not
 // be removed (it is tried again by the next operation).
 [[nodiscard]] bool PMSRecoverLeftovers();
+
+// The names in folder `dir`, without "." and ".."; none when it cannot be
+// read.
+std::set<std::string> PMSListDir(const std::string& dir);
 
 // rm -rf `path`, the one way the package tool removes a folder: only when
 // `path` lies strictly inside `owner` (PMSIsStrictlyInside); anything else is

@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/hex.h"
 #include "klibc/sysroot.h"
 #include "pkgtool/registry.h"
 
@@ -14,8 +15,9 @@ namespace {
 // Tells this operation's files from every other's, even when the system
 // has no random bytes to give.
 std::string Nonce() {
-  std::string nonce = PMSRandomHex(6);
-  return nonce.empty() ? std::to_string(getpid()) + "-" + std::to_string(time(nullptr)) : nonce;
+  std::string nonce;
+  return KIVORandomHex(6, &nonce) ? nonce
+                                  : std::to_string(getpid()) + "-" + std::to_string(time(nullptr));
 }
 
 }  // namespace

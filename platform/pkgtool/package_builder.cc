@@ -15,13 +15,13 @@
 #include <archive_entry.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/key_value_file.h"
 #include "pkgtool/package_file.h"
 #include "pkgtool/package_info.h"
 #include "pkgtool/result_codes.h"
 #include "pkgtool/sha256.h"
 #include "pkgtool/signature.h"
-#include "webapi/webapi_util.h"
 
 namespace {
 
@@ -199,7 +199,7 @@ bool CollectMembers(const std::string& source, std::map<std::string, std::string
   if (!problem.empty()) return Fail(error, "INFO: " + problem);
   for (const auto& m : *members) {
     Json::Value ui;
-    if (m.first.compare(0, 15, "WIZARD_UIFILES/") == 0 && !WebAPIUtil::ParseJson(m.second, ui)) {
+    if (m.first.compare(0, 15, "WIZARD_UIFILES/") == 0 && !KIVOParseJson(m.second, &ui)) {
       return Fail(error, m.first + " is not valid JSON");
     }
   }

@@ -74,22 +74,6 @@ bool NormalizeEntryPath(const std::string& raw, std::string* out) {
   return PMSIsContainedRelativePath(path);
 }
 
-// A symlink at `path` pointing at `target` stays inside the tree when the
-// target is relative and never climbs above the root on its way.
-bool SymlinkStaysInside(const std::string& path, const std::string& target) {
-  if (target.empty() || target[0] == '/') return false;
-  int depth = static_cast<int>(std::count(path.begin(), path.end(), '/'));
-  std::istringstream in(target);
-  for (std::string part; std::getline(in, part, '/');) {
-    if (part == "..") {
-      if (--depth < 0) return false;
-    } else if (!part.empty() && part != ".") {
-      ++depth;
-    }
-  }
-  return true;
-}
-
 // INFO's extractsize in bytes. It is required: without a declaration there
 // is nothing to hold the payload to. Checked as text by PMSCheckInfo.
 bool DeclaredExtractBytes(const KeyValueMap& info, uint64_t* bytes) {
@@ -147,7 +131,7 @@ int CheckEntry(struct archive_entry* entry, const std::string& path, std::string
   }
   if (type == AE_IFLNK) {
     const char* target = archive_entry_symlink(entry);
-    if (!target || !SymlinkStaysInside(path, target)) {
+    if (!target || !PMSSymlinkStaysInside(path, target)) {
       return Fail(error, PKG_ERR_HOSTILE_MEMBER, "symlink that leaves the package: " + path);
     }
   }
@@ -310,9 +294,9 @@ bool PMSIsPackageMemberName(const std::string& name) {
       name[11] <= '8' && name.compare(12, 4, ".PNG") == 0) {
     return true;
   }
-  static const char* const kScripts[] = {"preinst",          "postinst",   "preuninst",
-                                         "postuninst",       "preupgrade", "postupgrade",
-                                         "start-stop-status"};
+  static const char* const kScripts[] = {"preinst",           "postinst",   "preuninst",
+                                         "postuninst",        "preupgrade", "postupgrade",
+                                         "start-stop-status", "health"};
   for (const char* s : kScripts) {
     if (name == std::string("scripts/") + s) return true;
   }

@@ -1,3 +1,6 @@
+// The package tool's record of a package: its INFO keys read and checked
+// (the web API renders it for answers in package/package_info.cc).
+
 #include "pkgtool/package_info.h"
 
 #include <algorithm>
@@ -6,6 +9,8 @@
 #include <cstring>
 #include <functional>
 
+#include "pkgtool/data_snapshot.h"
+#include "pkgtool/health_gate.h"
 #include "pkgtool/registry.h"
 
 #include <strings.h>
@@ -108,7 +113,7 @@ std::string CheckIdentity(const InfoGetter& get) {
 std::string CheckForms(const InfoGetter& get) {
   for (const char* key :
        {"beta", "startable", "silent_install", "silent_upgrade", "silent_uninstall",
-        "install_reboot", "support_center", "ctl_uninstall", "checkport"}) {
+        "install_reboot", "support_center", "ctl_uninstall", "checkport", kPMSDataCopyKey}) {
     if (!IsYesNo(get(key))) return std::string(key) + ": must be yes or no";
   }
   for (const char* key : {"os_min_ver", "os_max_ver"}) {
@@ -171,6 +176,7 @@ std::string PMSCheckInfo(const KeyValueMap& info, std::string* field) {
   if (problem.empty()) problem = CheckIdentity(get);
   if (problem.empty()) problem = CheckForms(get);
   if (problem.empty()) problem = CheckPathsAndNames(get);
+  if (problem.empty()) problem = PMSHealthInfoProblem(info);
   if (field) *field = problem.substr(0, problem.find(':'));
   return problem;
 }

@@ -9,13 +9,13 @@
 #include <unistd.h>
 
 #include "klibc/atomic_file.h"
+#include "klibc/json_text.h"
 #include "klibc/sysroot.h"
 #include "pkgtool/lifecycle.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
-#include "storage/storage_config.h"
-#include "webapi/webapi_util.h"
+#include "storage/service_state.h"
 
 namespace {
 
@@ -106,7 +106,7 @@ bool PackageManager::readUIFile(int op, const PackageInfo& package, PackageInfo&
     return false;
   }
   Json::Value ui;
-  if (!WebAPIUtil::ParseJson(text, ui)) return false;
+  if (!KIVOParseJson(text, &ui)) return false;
   out = package;
   out.setUIFile(ui);
   return true;
@@ -132,9 +132,9 @@ bool PackageManager::getServiceStatus(const PackageInfo& info, bool& running, bo
 unsigned PackageManager::getPkgRoughStatus(const std::string& id) {
   PackageInfo info;
   if (!PMSLoadInstalled(id, &info)) return 0;
-  unsigned flags = 1;
-  if (PMSIsRunning(id, info)) flags |= 2;
-  if (info.getTarget().empty()) flags |= 4;
+  unsigned flags = kRoughInstalled;
+  if (PMSIsRunning(id, info)) flags |= kRoughRunning;
+  if (info.getTarget().empty()) flags |= kRoughBroken;
   return flags;
 }
 

@@ -72,7 +72,8 @@ class PackageManager {
   // Whether the package runs. False when it cannot be told; then the result
   // says why (255 not installed, 258 broken, 264 not supported...).
   [[nodiscard]] bool getServiceStatus(const PackageInfo& info, bool& running, bool checkBroken);
-  // Flags of an installed package: bit 0 installed, bit 1 running, bit 2 broken.
+  // Flags of an installed package (RoughStatus); 0 when it is not installed.
+  enum RoughStatus : unsigned { kRoughInstalled = 1, kRoughRunning = 2, kRoughBroken = 4 };
   unsigned getPkgRoughStatus(const std::string& id);
   // The package's own log file (INFO "logfile", in its data folder). With
   // `evenIfMissing` false only when the file exists. "" when none.

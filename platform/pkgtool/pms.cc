@@ -13,7 +13,9 @@
 #include "klibc/last_error.h"
 #include "klibc/sysroot.h"
 #include "pkgtool/registry.h"
-#include "storage/storage_config.h"
+#include "storage/os_version.h"
+#include "storage/volume_space.h"
+#include "storage/volumes.h"
 
 #include <stdlib.h>
 #include <time.h>

@@ -5,10 +5,10 @@
 #include <cerrno>
 #include <dirent.h>
 #include <sstream>
-#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "klibc/hex.h"
 #include "klibc/sysroot.h"
 
 namespace PackageRegistry {
@@ -104,8 +104,8 @@ bool Unpublish(const std::string& id) {
 }
 
 std::string NewRecordName(const std::string& id) {
-  std::string nonce = PMSRandomHex(6);
-  return nonce.empty() ? "" : id + "." + nonce;
+  std::string nonce;
+  return KIVORandomHex(6, &nonce) ? id + "." + nonce : "";
 }
 
 }  // namespace PackageRegistry
@@ -135,14 +135,16 @@ bool PMSIsStrictlyInside(const std::string& path, const std::string& owner) {
          path[owner.size()] == '/' && PMSIsContainedRelativePath(path.substr(owner.size() + 1));
 }
 
-std::string PMSRandomHex(size_t bytes) {
-  std::string raw(bytes, '\0');
-  if (getrandom(&raw[0], bytes, 0) != static_cast<ssize_t>(bytes)) return "";
-  static const char kHex[] = "0123456789abcdef";
-  std::string hex;
-  for (unsigned char b : raw) {
-    hex += kHex[b >> 4];
-    hex += kHex[b & 15];
+bool PMSSymlinkStaysInside(const std::string& path, const std::string& target) {
+  if (target.empty() || target[0] == '/') return false;
+  int depth = static_cast<int>(std::count(path.begin(), path.end(), '/'));
+  std::istringstream in(target);
+  for (std::string part; std::getline(in, part, '/');) {
+    if (part == "..") {
+      if (--depth < 0) return false;
+    } else if (!part.empty() && part != ".") {
+      ++depth;
+    }
   }
-  return hex;
+  return true;
 }

@@ -76,5 +76,8 @@ bool PMSIsContainedRelativePath(const std::string& rel);
 // the step to the owner itself or to anything beside it.
 bool PMSIsStrictlyInside(const std::string& path, const std::string& owner);
 
-// `bytes` random bytes as lower-case hex; "" when the system has none to give.
-std::string PMSRandomHex(size_t bytes);
+// True when a symlink at `path` (relative to the top of a tree) pointing at
+// `target` stays inside that tree: the target is relative and never climbs
+// above the top on its way. Payload entries and the data folder's copy are
+// judged by this one rule.
+bool PMSSymlinkStaysInside(const std::string& path, const std::string& target);

@@ -80,6 +80,10 @@ const char* PMSResultText(int code) {
       return "the upgrade failed; the previous version was restored";
     case PKG_ERR_OTHER_ORIGIN:
       return "the package was installed from another source or signed by another key";
+    case PKG_ERR_NO_ROOM_FOR_DATA_COPY:
+      return "not enough space for a safety copy of the package's data";
+    case PKG_ERR_DATA_NOT_COPYABLE:
+      return "the package's data cannot be copied safely";
   }
   return "unknown result";
 }

@@ -45,6 +45,11 @@ enum PKG_ERRCODE {
   // an upgrade from another source, or signed by another key, than the
   // installed version's, without the administrator switching its origin
   PKG_ERR_OTHER_ORIGIN = 306,
+  // an upgrade whose safety copy of the package's data does not fit on the volume
+  PKG_ERR_NO_ROOM_FOR_DATA_COPY = 307,
+  // an upgrade whose package data holds what cannot be copied safely (a
+  // fifo, a socket, a device, an unreadable file, a symlink leading out)
+  PKG_ERR_DATA_NOT_COPYABLE = 308,
 };
 
 // A short English text for a code, for logs and the command line.

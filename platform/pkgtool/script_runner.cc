@@ -1,5 +1,6 @@
 #include "pkgtool/script_runner.h"
 
+#include <cerrno>
 #include <cstdlib>
 #include <fcntl.h>
 #include <signal.h>
@@ -10,16 +11,16 @@
 
 #include "pkgtool/pms.h"
 
+#include <poll.h>
 #include <time.h>
 
 namespace {
 
+// Runs in the forked child: `out` becomes its stdout and stderr.
 [[noreturn]] void ExecScript(const std::string& script, const std::string& arg,
-                             const std::vector<std::string>& env, const std::string& log_path) {
+                             const std::vector<std::string>& env, int out) {
   setsid();
   int in = open("/dev/null", O_RDONLY);
-  int out =
-      open(log_path.empty() ? "/dev/null" : log_path.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
   if (in >= 0) dup2(in, STDIN_FILENO);
   if (out >= 0) {
     dup2(out, STDOUT_FILENO);
@@ -56,31 +57,106 @@ bool WaitUntil(pid_t pid, double deadline, int* status) {
   }
 }
 
+bool IsScript(const std::string& script) {
+  struct stat st;
+  return stat(script.c_str(), &st) == 0 && S_ISREG(st.st_mode);
+}
+
+// Forks and starts `script` with `out` as its output; the child's pid, or
+// -1.
+pid_t StartScript(const std::string& script, const std::string& arg,
+                  const std::map<std::string, std::string>& env, int out) {
+  std::vector<std::string> vars;
+  for (const auto& e : env) vars.push_back(e.first + "=" + e.second);
+  fflush(nullptr);
+  pid_t pid = fork();
+  if (pid == 0) ExecScript(script, arg, vars, out);
+  return pid;
+}
+
+// A wait status as PMSRunScript answers it.
+int ScriptResult(int status) {
+  if (WIFEXITED(status)) return WEXITSTATUS(status) == 126 ? SCRIPT_NOT_RUN : WEXITSTATUS(status);
+  return 128 + WTERMSIG(status);
+}
+
+// Waits for the script `pid` until `deadline`, then kills it with its whole
+// process group (the script and whatever it started).
+int FinishScript(pid_t pid, double deadline) {
+  int status = 0;
+  if (WaitUntil(pid, deadline, &status)) return ScriptResult(status);
+  kill(-pid, SIGTERM);
+  if (!WaitUntil(pid, Now() + 2, &status)) {
+    kill(-pid, SIGKILL);
+    waitpid(pid, &status, 0);
+  }
+  return SCRIPT_TIMED_OUT;
+}
+
+// Reads the script's output `fd` into `out` until every writer has closed
+// it, the script `pid` has ended with nothing more waiting (what it left
+// running may hold the pipe open for ever), or `deadline`. Keeps only the
+// last `keep` bytes. True when the script ended meanwhile (*status).
+bool ReadOutput(int fd, pid_t pid, double deadline, size_t keep, ScriptOutput* out, int* status) {
+  bool ended = false;
+  char buf[65536];
+  while (Now() < deadline) {
+    if (!ended && waitpid(pid, status, WNOHANG) == pid) ended = true;
+    struct pollfd ready = {fd, POLLIN, 0};
+    int n = poll(&ready, 1, ended ? 0 : 100);
+    if (n < 0 && errno != EINTR) break;
+    if (n <= 0) {
+      if (ended) break;
+      continue;
+    }
+    ssize_t got = read(fd, buf, sizeof(buf));
+    if (got == 0 || (got < 0 && errno != EINTR && errno != EAGAIN)) break;
+    if (got < 0) continue;
+    out->total += static_cast<uint64_t>(got);
+    out->tail.append(buf, static_cast<size_t>(got));
+    if (out->tail.size() > keep) out->tail.erase(0, out->tail.size() - keep);
+  }
+  return ended;
+}
+
 }  // namespace
 
 int PMSRunScript(const std::string& script, const std::string& arg,
                  const std::map<std::string, std::string>& env, int timeout_seconds,
                  const std::string& log_path) {
-  struct stat st;
-  if (stat(script.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) return SCRIPT_MISSING;
-  std::vector<std::string> vars;
-  for (const auto& e : env) vars.push_back(e.first + "=" + e.second);
-  fflush(nullptr);
-  pid_t pid = fork();
+  if (!IsScript(script)) return SCRIPT_MISSING;
+  int out = open(log_path.empty() ? "/dev/null" : log_path.c_str(),
+                 O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+  pid_t pid = StartScript(script, arg, env, out);
+  if (out >= 0) close(out);
   if (pid < 0) return SCRIPT_NOT_RUN;
-  if (pid == 0) ExecScript(script, arg, vars, log_path);
-  int status = 0;
-  if (!WaitUntil(pid, Now() + timeout_seconds, &status)) {
-    // The script and whatever it started form one process group.
-    kill(-pid, SIGTERM);
-    if (!WaitUntil(pid, Now() + 2, &status)) {
-      kill(-pid, SIGKILL);
-      waitpid(pid, &status, 0);
-    }
-    return SCRIPT_TIMED_OUT;
+  return FinishScript(pid, Now() + timeout_seconds);
+}
+
+ScriptOutput PMSRunScriptCaptured(const std::string& script, const std::string& arg,
+                                  const std::map<std::string, std::string>& env,
+                                  int timeout_seconds, size_t keep) {
+  ScriptOutput out;
+  if (!IsScript(script)) {
+    out.status = SCRIPT_MISSING;
+    return out;
   }
-  if (WIFEXITED(status)) return WEXITSTATUS(status) == 126 ? SCRIPT_NOT_RUN : WEXITSTATUS(status);
-  return 128 + WTERMSIG(status);
+  int pipe_fds[2];
+  if (pipe2(pipe_fds, O_CLOEXEC) != 0) return out;
+  // Only our end waits for nothing: the script writes as to any pipe.
+  fcntl(pipe_fds[0], F_SETFL, O_NONBLOCK);
+  pid_t pid = StartScript(script, arg, env, pipe_fds[1]);
+  close(pipe_fds[1]);
+  if (pid < 0) {
+    close(pipe_fds[0]);
+    return out;
+  }
+  const double deadline = Now() + timeout_seconds;
+  int status = 0;
+  const bool ended = ReadOutput(pipe_fds[0], pid, deadline, keep, &out, &status);
+  close(pipe_fds[0]);
+  out.status = ended ? ScriptResult(status) : FinishScript(pid, deadline);
+  return out;
 }
 
 int PMSScriptTimeout() { return PMSToolSetting("script_timeout", 120, 1); }

@@ -3,6 +3,7 @@
 // /dev/null and stdout/stderr appended to the operation log.
 #pragma once
 
+#include <cstdint>
 #include <map>
 #include <string>
 
@@ -18,6 +19,22 @@ enum ScriptStatus {
 [[nodiscard]] int PMSRunScript(const std::string& script, const std::string& arg,
                                const std::map<std::string, std::string>& env, int timeout_seconds,
                                const std::string& log_path);
+
+// How a script whose output was captured ended.
+struct ScriptOutput {
+  int status = SCRIPT_NOT_RUN;  // as PMSRunScript answers
+  std::string tail;             // the last bytes it wrote (stdout and stderr together)
+  uint64_t total = 0;           // how many bytes it wrote in all
+};
+
+// Runs `script` as PMSRunScript does, but reads its output through a pipe
+// and keeps only the last `keep` bytes, however much it writes. It ends when
+// the script has ended (processes it left behind are not waited for) or,
+// after `timeout_seconds`, with SCRIPT_TIMED_OUT, the script killed with its
+// whole process group.
+[[nodiscard]] ScriptOutput PMSRunScriptCaptured(const std::string& script, const std::string& arg,
+                                                const std::map<std::string, std::string>& env,
+                                                int timeout_seconds, size_t keep);
 
 // The script time limit: "script_timeout" of /etc/kivo/pkgtool.conf (seconds),
 // 120 by default.

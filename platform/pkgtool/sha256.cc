@@ -1,5 +1,7 @@
 #include "pkgtool/sha256.h"
 
+#include "klibc/hex.h"
+
 #include <openssl/evp.h>
 
 Sha256::Sha256() : ctx_(EVP_MD_CTX_new()) {
@@ -17,11 +19,5 @@ std::string Sha256::FinishHex() {
   unsigned int len = 0;
   if (!ok_ || EVP_DigestFinal_ex(static_cast<EVP_MD_CTX*>(ctx_), digest, &len) != 1) return "";
   ok_ = false;
-  static const char kHex[] = "0123456789abcdef";
-  std::string hex;
-  for (unsigned int i = 0; i < len; ++i) {
-    hex += kHex[digest[i] >> 4];
-    hex += kHex[digest[i] & 15];
-  }
-  return hex;
+  return KIVOHex(digest, len);
 }

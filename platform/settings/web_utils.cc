@@ -2,8 +2,6 @@
 
 #include <memory>
 
-#include <json/writer.h>
-
 #include "klibc/atomic_file.h"
 #include "klibc/json_text.h"
 #include "klibc/last_error.h"
@@ -28,9 +26,7 @@ bool SaveJsonFile(const std::string& path, const Json::Value& value) {
   if (slash != std::string::npos && slash > 0 && KIVOFSMkdirP(path.substr(0, slash).c_str()) != 0) {
     return false;
   }
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "  ";
-  return KIVOWriteFileAtomic(path, Json::writeString(builder, value) + "\n");
+  return KIVOWriteFileAtomic(path, KIVOWriteJson(value, "  ") + "\n");
 }
 
 }  // namespace WebUtils

@@ -2,14 +2,12 @@
 
 #include <ctime>
 #include <mutex>
-#include <sys/random.h>
 #include <unistd.h>
 
-#include <json/writer.h>
-
+#include "klibc/hex.h"
+#include "klibc/json_text.h"
 #include "taskmgr/sqlite_api.h"
 #include "taskmgr/task_store.h"
-#include "webapi/webapi_util.h"
 
 namespace NVX {
 
@@ -49,10 +47,11 @@ class Statement {
   sqlite3_stmt* stmt_ = nullptr;
 };
 
-std::string Serialize(const Json::Value& value) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "";
-  return Json::writeString(builder, value);
+// Runs `sql`, an UPDATE of one task's row whose parameters are a flag, the
+// owner and the id, in that order.
+bool UpdateTaskRow(TaskStore& store, const char* sql, bool flag, const std::string& owner,
+                   const std::string& id) {
+  return Statement(store, sql).Bind(1, flag ? 1LL : 0LL).Bind(2, owner).Bind(3, id).Run();
 }
 
 bool WriteProperty(TaskStore& db, const std::string& owner, const std::string& id,
@@ -69,7 +68,7 @@ bool WriteProperty(TaskStore& db, const std::string& owner, const std::string& i
       .Bind(1, owner)
       .Bind(2, id)
       .Bind(3, name)
-      .Bind(4, Serialize(value))
+      .Bind(4, KIVOWriteJson(value))
       .Run();
 }
 
@@ -84,7 +83,8 @@ Json::Value Task::getProperty(const std::string& name) {
   Statement s(*store_, "SELECT value FROM properties WHERE owner=? AND id=? AND name=?");
   s.Bind(1, owner_).Bind(2, id_).Bind(3, name);
   Json::Value value;
-  if (s.Row()) WebAPIUtil::ParseJson(s.Text(0), value);
+  // A stored value that is not JSON reads as absent (null).
+  if (s.Row()) (void)KIVOParseJson(s.Text(0), &value);
   return value;
 }
 
@@ -130,19 +130,13 @@ bool Task::endUpdate() {
 }
 
 bool Task::setFinishValue(bool finished) {
-  return Statement(*store_, "UPDATE tasks SET finished=? WHERE owner=? AND id=?")
-      .Bind(1, finished ? 1LL : 0LL)
-      .Bind(2, owner_)
-      .Bind(3, id_)
-      .Run();
+  return UpdateTaskRow(*store_, "UPDATE tasks SET finished=? WHERE owner=? AND id=?", finished,
+                       owner_, id_);
 }
 
 bool Task::finish(bool ok) {
-  return Statement(*store_, "UPDATE tasks SET finished=1, ok=? WHERE owner=? AND id=?")
-      .Bind(1, ok ? 1LL : 0LL)
-      .Bind(2, owner_)
-      .Bind(3, id_)
-      .Run();
+  return UpdateTaskRow(*store_, "UPDATE tasks SET finished=1, ok=? WHERE owner=? AND id=?", ok,
+                       owner_, id_);
 }
 
 bool Task::isFinished() {
@@ -228,8 +222,9 @@ bool TaskMgr::StillHeld(const std::string& id, InUse in_use) {
   if (!s.Row() || s.Int(0) != 0) return false;
   Statement p(*store_, "SELECT value FROM properties WHERE owner=? AND id=? AND name=?");
   p.Bind(1, owner_).Bind(2, id).Bind(3, std::string("data"));
+  // Data that is not JSON reads as none (null), and `in_use` judges that.
   Json::Value data;
-  if (p.Row()) WebAPIUtil::ParseJson(p.Text(0), data);
+  if (p.Row()) (void)KIVOParseJson(p.Text(0), &data);
   return in_use && in_use(data);
 }
 
@@ -273,16 +268,11 @@ std::vector<std::string> TaskMgr::listTasks(const std::string& prefix) {
 
 namespace TaskUtil {
 
-std::string getUniqueID(const std::string& owner, int reserved) {
-  unsigned char bytes[8] = {0};
-  getrandom(bytes, sizeof(bytes), 0);
-  static const char kHex[] = "0123456789abcdef";
-  std::string id = std::to_string(time(nullptr)) + "_";
-  for (unsigned char b : bytes) {
-    id += kHex[b >> 4];
-    id += kHex[b & 15];
-  }
-  return id;
+bool getUniqueID(const std::string& owner, int reserved, std::string* id) {
+  std::string nonce;
+  if (!KIVORandomHex(8, &nonce)) return false;
+  *id = std::to_string(time(nullptr)) + "_" + nonce;
+  return true;
 }
 
 }  // namespace TaskUtil

@@ -105,8 +105,10 @@ class TaskMgr {
 };
 
 namespace TaskUtil {
-// A new id, unique among all tasks of `owner` for as long as they exist.
-std::string getUniqueID(const std::string& owner, int reserved);
+// A new id in *id, unique among all tasks of `owner` for as long as they
+// exist: the time and 64 random bits. False when the system has no random
+// bytes to give (*id is then unchanged).
+[[nodiscard]] bool getUniqueID(const std::string& owner, int reserved, std::string* id);
 }  // namespace TaskUtil
 
 }  // namespace NVX

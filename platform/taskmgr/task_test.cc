@@ -144,8 +144,10 @@ TEST_F(TaskTest, ClaimsAreExclusive) {
 }
 
 TEST(TaskUtilTest, UniqueIds) {
-  EXPECT_NE(NVX::TaskUtil::getUniqueID("@administrators", 0),
-            NVX::TaskUtil::getUniqueID("@administrators", 0));
+  std::string first, second;
+  ASSERT_TRUE(NVX::TaskUtil::getUniqueID("@administrators", 0, &first));
+  ASSERT_TRUE(NVX::TaskUtil::getUniqueID("@administrators", 0, &second));
+  EXPECT_NE(first, second);
 }
 
 }  // namespace

@@ -1,14 +1,6 @@
 #include "webapi/api_response.h"
 
-#include <memory>
-
 #include "klibc/json_text.h"
-
-Json::StreamWriterBuilder AnswerJsonWriter() {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "";
-  return builder;
-}
 
 void APIResponse::SetSuccess(Json::Value data) {
   answered_ = true;
@@ -61,5 +53,5 @@ std::string APIResponse::TakeEnvelopeText() {
   // The writer puts an object's members in name order: "data" before
   // "success", as the envelope of SetSuccess comes out.
   if (!data_text_.empty()) return "{\"data\":" + std::move(data_text_) + ",\"success\":true}";
-  return Json::writeString(AnswerJsonWriter(), Envelope(answered_, error_code_, std::move(data_)));
+  return KIVOWriteJson(Envelope(answered_, error_code_, std::move(data_)));
 }

@@ -9,11 +9,6 @@
 #include <vector>
 
 #include <json/value.h>
-#include <json/writer.h>
-
-// How answers are written: compact, every character beyond ASCII escaped,
-// so that an answer is valid UTF-8 whatever its strings hold.
-Json::StreamWriterBuilder AnswerJsonWriter();
 
 class APIResponse {
  public:
@@ -23,7 +18,7 @@ class APIResponse {
 
   void SetSuccess(Json::Value data = Json::Value());
   // A success whose data is already written: `json` must be exactly one JSON
-  // value written by a writer of AnswerJsonWriter() (never text from
+  // value written compactly by KIVONewJsonWriter() (never text from
   // outside), for it is sent as it stands. A large answer assembled from
   // pieces of text written earlier is then not parsed and written again.
   void SetSuccessText(std::string json);
@@ -46,7 +41,7 @@ class APIResponse {
   // response gives the default error 100. The data of SetSuccessText is
   // parsed for it.
   Json::Value ToEnvelope() const;
-  // The same as text written by AnswerJsonWriter(), moving the data into it
+  // The same as text written by KIVOWriteJson(), moving the data into it
   // (the response is spent afterwards): a large answer is not copied once
   // more on its way out, and text data is not parsed.
   std::string TakeEnvelopeText();

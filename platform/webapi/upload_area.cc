@@ -6,7 +6,8 @@
 
 #include "klibc/atomic_file.h"
 #include "klibc/sysroot.h"
-#include "storage/storage_config.h"
+#include "storage/volume_space.h"
+#include "storage/volumes.h"
 #include "webapi/api_upload.h"
 
 namespace {

@@ -7,6 +7,10 @@
 #include "klibc/atomic_file.h"
 #include "webapi/webapi_util.h"
 
+std::string VendorConf(const std::string& vendor_url, const std::string& more) {
+  return "vendor_url=\"" + vendor_url + "\"\nconnect_timeout=\"2\"\n" + more;
+}
+
 CatalogueFeed::CatalogueFeed(HttpTestServer& server, const std::string& dir,
                              const std::string& prefix)
     : server_(server), dir_(dir), prefix_(prefix) {
@@ -42,6 +46,13 @@ bool CatalogueFeed::Index() {
     bodies_[id] = route.body;
     server_.Set(prefix_ + "/" + file, route);
   }
+  return true;
+}
+
+bool CatalogueFeed::Offer(const TestPackage& package) {
+  Add(package);
+  if (!Index()) return false;
+  Publish();
   return true;
 }
 

@@ -12,6 +12,11 @@
 #include "testing/http_test_server.h"
 #include "testing/package_factory.h"
 
+// The text of pkgserver.conf naming `vendor_url` as the vendor's catalogue,
+// with a connect timeout of 2 s (a loopback server answers at once or not
+// at all), then the key="value" lines of `more`.
+std::string VendorConf(const std::string& vendor_url, const std::string& more = "");
+
 class CatalogueFeed {
  public:
   // Files are built into `dir` and served under `prefix` ("/feed").
@@ -25,6 +30,9 @@ class CatalogueFeed {
   // Runs kivoctl index over the folder and serves every file; the catalogue
   // is then catalogue() (object form), served at Url() after Publish().
   bool Index();
+  // Add(), Index() and Publish() in one: the feed offers `package` beside
+  // what it offered. False when indexing failed.
+  [[nodiscard]] bool Offer(const TestPackage& package);
   Json::Value& catalogue() { return catalogue_; }
   // The entry of `id` in catalogue()["packages"] (null when none).
   Json::Value& Entry(const std::string& id);

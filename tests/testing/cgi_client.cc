@@ -9,6 +9,7 @@
 
 #include <json/reader.h>
 
+#include "pkgserver/server_config.h"
 #include "testing/temp_root.h"
 
 namespace {
@@ -88,22 +89,10 @@ CgiAnswer RunEntryCgi(const CgiEnv& env, const std::string& body) {
 }
 
 std::string EncodeForm(const Params& params) {
-  static const char kHex[] = "0123456789ABCDEF";
   std::string out;
   for (const auto& p : params) {
     if (!out.empty()) out += '&';
-    for (int part = 0; part < 2; ++part) {
-      if (part == 1) out += '=';
-      for (unsigned char c : part == 0 ? p.first : p.second) {
-        if (isalnum(c) || c == '-' || c == '_' || c == '.' || c == '~') {
-          out += static_cast<char>(c);
-        } else {
-          out += '%';
-          out += kHex[c >> 4];
-          out += kHex[c & 15];
-        }
-      }
-    }
+    out += PMSUrlEncode(p.first) + "=" + PMSUrlEncode(p.second);
   }
   return out;
 }

@@ -2,6 +2,7 @@
 
 #include <cstdlib>
 #include <fcntl.h>
+#include <signal.h>
 #include <sys/sysmacros.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -13,6 +14,7 @@
 #include "klibc/atomic_file.h"
 #include "pkgtool/package_builder.h"
 #include "pkgtool/package_file.h"
+#include "pkgtool/registry.h"
 #include "testing/temp_root.h"
 
 namespace {
@@ -140,6 +142,13 @@ std::string Manifest(const MemberList& members) {
   return text;
 }
 
+TestPackage PackageWithInfo(const std::string& id, const std::map<std::string, std::string>& info) {
+  TestPackage package;
+  package.id = id;
+  package.info = info;
+  return package;
+}
+
 int RunProgram(const std::vector<std::string>& argv, std::string* out,
                const std::map<std::string, std::string>& extra_env) {
   int fds[2];
@@ -168,9 +177,20 @@ int RunProgram(const std::vector<std::string>& argv, std::string* out,
   return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
+void KillAndReap(const std::vector<pid_t>& pids) {
+  for (pid_t pid : pids) {
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+  }
+}
+
 int Kivoctl(const std::vector<std::string>& args, std::string* out,
             const std::map<std::string, std::string>& extra_env) {
   std::vector<std::string> argv = {BuildDir() + "/bin/kivoctl"};
   argv.insert(argv.end(), args.begin(), args.end());
   return RunProgram(argv, out, extra_env);
+}
+
+void StopInstalledPackages() {
+  for (const std::string& id : PackageRegistry::List()) Kivoctl({"stop", id});
 }

@@ -4,6 +4,7 @@
 
 #include <map>
 #include <string>
+#include <sys/types.h>
 #include <utility>
 #include <vector>
 
@@ -19,6 +20,10 @@ struct TestPackage {
   // Builds it into `dir` and returns the package file's path.
   std::string Build(const std::string& dir) const;
 };
+
+// A package `id` whose INFO adds `info`, for a test where only those keys matter.
+TestPackage PackageWithInfo(const std::string& id,
+                            const std::map<std::string, std::string>& info = {});
 
 // A package whose payload is written entry by entry with libarchive, so a
 // test can put in what the builder never would (escaping paths, devices,
@@ -45,6 +50,11 @@ std::string Manifest(const MemberList& members);
 // Runs a program and returns its exit status; stdout and stderr into *out.
 int RunProgram(const std::vector<std::string>& argv, std::string* out,
                const std::map<std::string, std::string>& extra_env = {});
+// Kills each of `pids` (SIGKILL) and reaps it: for processes a test forked.
+void KillAndReap(const std::vector<pid_t>& pids);
 // Runs build/bin/kivoctl with `args` in the current KIVO_ROOT.
 int Kivoctl(const std::vector<std::string>& args, std::string* out = nullptr,
             const std::map<std::string, std::string>& extra_env = {});
+// Stops every installed package, so that no package's daemon outlives the
+// test that started it.
+void StopInstalledPackages();

@@ -21,6 +21,11 @@ int CountEntries(const std::string& dir, const std::string& prefix) {
   return n;
 }
 
+std::string FileText(const std::string& path) {
+  std::string text;
+  return KIVOReadFile(path, &text) ? text : "";
+}
+
 std::string BuildDir() {
   const char* dir = getenv("KIVO_BUILD_DIR");
   return dir ? dir : ".";

@@ -28,6 +28,9 @@ class TempRoot {
 // the folder cannot be read): what an operation left behind.
 int CountEntries(const std::string& dir, const std::string& prefix);
 
+// The whole content of file `path`; "" when it cannot be read.
+std::string FileText(const std::string& path);
+
 // The build tree (KIVO_BUILD_DIR, set by ctest).
 std::string BuildDir();
 // For programs run outside ctest (benchmarks): the build tree is the folder

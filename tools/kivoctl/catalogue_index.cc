@@ -7,9 +7,9 @@
 #include <memory>
 #include <unistd.h>
 
-#include <json/writer.h>
-
 #include "klibc/atomic_file.h"
+#include "klibc/hex.h"
+#include "klibc/json_text.h"
 #include "klibc/key_value_file.h"
 #include "pkgserver/server_config.h"
 #include "pkgtool/dependency.h"
@@ -24,13 +24,6 @@ struct FileDigests {
   std::string md5, sha256;
   uint64_t size = 0;
 };
-
-std::string Hex(const unsigned char* d, unsigned n) {
-  static const char k[] = "0123456789abcdef";
-  std::string out;
-  for (unsigned i = 0; i < n; ++i) out += {k[d[i] >> 4], k[d[i] & 15]};
-  return out;
-}
 
 bool Digest(const std::string& path, FileDigests* out) {
   int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
@@ -49,9 +42,9 @@ bool Digest(const std::string& path, FileDigests* out) {
   unsigned char d[EVP_MAX_MD_SIZE];
   unsigned len = 0;
   if (!ok || n < 0 || !EVP_DigestFinal_ex(md5.get(), d, &len)) return false;
-  out->md5 = Hex(d, len);
+  out->md5 = KIVOHex(d, len);
   if (!EVP_DigestFinal_ex(sha.get(), d, &len)) return false;
-  out->sha256 = Hex(d, len);
+  out->sha256 = KIVOHex(d, len);
   return true;
 }
 
@@ -167,10 +160,8 @@ bool KivoctlWriteCatalogue(const CatalogueIndexOptions& o, int* count, std::stri
     catalogue["packages"].append(entry);
   }
   for (const std::string& id : o.recommend) catalogue["recommend"].append(id);
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = " ";
   const std::string out = o.folder + "/" + o.output;
-  if (!KIVOWriteFileAtomic(out, Json::writeString(builder, catalogue) + "\n", SyncToDisk::No, 0644))
+  if (!KIVOWriteFileAtomic(out, KIVOWriteJson(catalogue, " ") + "\n", SyncToDisk::No, 0644))
     return (*error = "cannot write " + out), false;
   *count = static_cast<int>(catalogue["packages"].size());
   return true;

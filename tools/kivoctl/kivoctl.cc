@@ -6,7 +6,7 @@
 //                                   [--webd PATH] [--max-children N] [--read-timeout S]
 //   kivoctl [--root DIR] server-config [--vendor URL] [--company-info URL]
 //                                      [--allow-private-image-addresses yes|no]
-//   kivoctl build|sign|inspect|index ...      (package authors)
+//   kivoctl build|sign|inspect|index|icon ...  (package authors)
 //   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
 //   kivoctl [--root DIR] auto-update [--dry-run]
 
@@ -19,8 +19,12 @@
 
 #include "accounts/accounts.h"
 #include "host/host_config.h"
+#include "klibc/atomic_file.h"
+#include "klibc/key_value_file.h"
+#include "pkgtool/registry.h"
 #include "tools/kivoctl/auto_update.h"
 #include "tools/kivoctl/catalogue_index.h"
+#include "tools/kivoctl/fallback_icon.h"
 #include "tools/kivoctl/package_commands.h"
 #include "tools/kivoctl/root_setup.h"
 #include "tools/kivoctl/server_install.h"
@@ -54,6 +58,10 @@ const char kUsage[] =
     "  build SOURCE OUT.kpk [--level N]   build a package file from a source folder\n"
     "  sign FILE.kpk --homedir GNUPGHOME --key KEY [--output OUT.kpk]\n"
     "  inspect FILE.kpk                   INFO, members and signature as JSON\n"
+    "  icon SOURCE [--letter L]           draw SOURCE's PACKAGE_ICON.PNG and\n"
+    "                                     PACKAGE_ICON_256.PNG: a tile in a colour its\n"
+    "                                     package id chooses, bearing L (default: the\n"
+    "                                     id's first character)\n"
     "  index FOLDER --base-url URL [--recommend ID]...\n"
     "                                     write FOLDER/catalogue.json (and icons/) from\n"
     "                                     its package files: a static package server\n"
@@ -110,6 +118,39 @@ int UserAdd(const std::vector<std::string>& args) {
   std::string error;
   if (!KIVOAccountSet(args[0], password, groups, &error)) return Fail(error);
   std::cout << "account " << args[0] << " ready\n";
+  return 0;
+}
+
+// Draws a package source's icons from its id, for packages without a picture
+// of their own; the id's colour keeps them apart (the sample packages).
+int Icon(const std::vector<std::string>& args) {
+  std::string source, letter;
+  for (size_t i = 0; i < args.size(); ++i) {
+    if (args[i] == "--letter" && i + 1 < args.size()) {
+      letter = args[++i];
+    } else if (source.empty() && args[i].rfind("--", 0) != 0) {
+      source = args[i];
+    } else {
+      return Fail("unknown argument for icon: " + args[i]);
+    }
+  }
+  if (source.empty()) return Fail("icon needs a package source folder");
+  std::string info;
+  if (!KIVOReadFile(source + "/INFO", &info, 64 * 1024))
+    return Fail("cannot read " + source + "/INFO");
+  std::string id = KIVOKeyValueParse(info)["package"];
+  if (!PMSIsValidPackageId(id)) return Fail(source + "/INFO names no valid package id");
+  if (letter.empty()) letter = id.substr(0, 1);
+  if (letter.size() != 1 || !KIVOIsIconLetter(letter[0])) {
+    return Fail("--letter takes one letter or digit");
+  }
+  const std::pair<const char*, int> kIcons[] = {{"PACKAGE_ICON.PNG", 72},
+                                                {"PACKAGE_ICON_256.PNG", 256}};
+  for (const auto& [name, size] : kIcons) {
+    std::string path = source + "/" + name;
+    if (!KIVOWriteLetterIcon(path, size, id, letter[0])) return Fail("cannot write " + path);
+  }
+  std::cout << "icons of " << id << " drawn in " << source << "\n";
   return 0;
 }
 
@@ -179,6 +220,7 @@ int main(int argc, char** argv) {
   if (command == "build") return KivoctlBuild(args);
   if (command == "sign") return KivoctlSign(args);
   if (command == "inspect") return KivoctlInspect(args);
+  if (command == "icon") return Icon(args);
   if (command == "install" || command == "upgrade") return KivoctlInstall(args);
   if (command == "uninstall") return KivoctlUninstall(args);
   if (command == "start") return KivoctlStartStop(args, true);

@@ -5,14 +5,12 @@
 #include <iostream>
 #include <unistd.h>
 
-#include <json/writer.h>
-
+#include "klibc/json_text.h"
 #include "pkgtool/package_builder.h"
 #include "pkgtool/package_file.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/signature.h"
-#include "webapi/webapi_util.h"
 
 namespace {
 
@@ -51,11 +49,7 @@ std::vector<std::string> Positional(const std::vector<std::string>& args,
   return out;
 }
 
-void PrintJson(const Json::Value& value) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "  ";
-  std::cout << Json::writeString(builder, value) << "\n";
-}
+void PrintJson(const Json::Value& value) { std::cout << KIVOWriteJson(value, "  ") << "\n"; }
 
 // Prints and deletes an operation's log, prints its worker messages.
 int Report(PackageManager& pm, bool ok, const std::string& what) {
@@ -164,7 +158,7 @@ int KivoctlUninstall(const std::vector<std::string>& args) {
   if (pos.size() != 1) return Usage("kivoctl uninstall ID [--wizard JSON]");
   Json::Value wizard;
   std::string text = Option(args, "--wizard");
-  if (!text.empty() && !WebAPIUtil::ParseJson(text, wizard)) return Fail("--wizard is not JSON");
+  if (!text.empty() && !KIVOParseJson(text, &wizard)) return Fail("--wizard is not JSON");
   PackageManager pm;
   if (!pm.init()) return Fail("the package registry cannot be read");
   return Report(pm, pm.uninstall(pos[0], &wizard, "enu", PKG_OP_UNINSTALL, false, "root"),

@@ -11,14 +11,11 @@
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "taskmgr/task.h"
+#include "taskmgr/task_names.h"
 
 namespace {
 
 constexpr char kLanguage[] = "enu";
-// The download runs in the same task the desktop's downloads use, so the
-// desktop sees it and never starts a second download of the same package.
-constexpr char kTaskOwner[] = "@administrators";
-constexpr char kTaskPrefix[] = "@KIVOPKG_DOWNLOAD_";
 constexpr char kUser[] = "root";
 
 std::string Text(const Json::Value& v) { return v.isString() ? v.asString() : ""; }
@@ -69,8 +66,10 @@ bool KivoctlDownloadAndInstall(const std::string& id, const Json::Value& entry, 
     message = "no room for the download";
     return false;
   }
-  NVX::TaskMgr mgr(kTaskOwner);
-  std::unique_ptr<NVX::Task> task(mgr.createTask(kTaskPrefix + id));
+  // The download runs in the same task the desktop's downloads use, so the
+  // desktop sees it and never starts a second download of the same package.
+  NVX::TaskMgr mgr(KIVOPackageTasks::kTaskOwner);
+  std::unique_ptr<NVX::Task> task(mgr.createTask(KIVOPackageTasks::kDownloadPrefix + id));
   if (!task || !KIVOPackageServer::InitDownload(task.get(), id, size, link, folder, true, getpid(),
                                                 change)) {
     (void)KIVOPackageServer::PMSRemoveDownloadDir(folder);

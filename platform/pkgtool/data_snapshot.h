@@ -1,0 +1,94 @@
+// The safety copy of a package's data folder during an upgrade: taking it,
+// putting it back, and dropping it once the upgrade is confirmed.
+//
+// The copy lies beside the data folder D = <volume>/@appdata/<id>, on the
+// same file system so that it moves back by rename, and never inside it:
+//
+//   <volume>/@appdata/.snapshots/<id>/<R>.copying   a copy being made
+//   <volume>/@appdata/.snapshots/<id>/<R>           D as version R left it
+//   <volume>/@appdata/.snapshots/<id>/<R>.replaced  D as the failed version
+//                                                   left it, moved aside by
+//                                                   a restore under way
+//   <volume>/@appdata/.snapshots/<id>/<R>.discard   a copy being removed
+//
+// <R> is the record name ("<id>.<nonce>", registry.h) of the version being
+// replaced. ".snapshots" is never a package's data folder: ids start with a
+// letter or a digit.
+//
+// The names are the upgrade's journal, each changed by one rename. While
+// <R> exists, the upgrade away from R is not confirmed, and a crash leaves
+// the next operation to put R back with its data (upgrade_recovery.h). The
+// upgrade's last step renames <R> to <R>.discard: from then on the new
+// version stays. A restore renames D to <R>.replaced, then <R> to D, then
+// publishes R again; while <R>.replaced exists, those steps are under way
+// for R.
+#pragma once
+
+#include <string>
+
+#include "pkgtool/tree_copy.h"
+
+// The INFO key by which a package says that its data needs no copy before
+// an upgrade ("no"): it is too large to copy, or nothing an upgrade does to
+// it needs undoing. Yes by default.
+inline constexpr char kPMSDataCopyKey[] = "upgrade_data_copy";
+
+class DataSnapshot {
+ public:
+  // `appdata` is "<root>/<volume>/@appdata", `record` the record name R of
+  // the version whose data is copied. Both must be valid (IsValid).
+  DataSnapshot(std::string appdata, std::string id, std::string record);
+
+  // True when the id and the record name are valid and the record name is
+  // one of the id's, so that every path below stays inside `appdata`.
+  bool IsValid() const;
+  const std::string& id() const { return id_; }
+  const std::string& record() const { return record_; }
+  const std::string& appdata() const { return appdata_; }
+  std::string data_dir() const { return appdata_ + "/" + id_; }
+  // ".snapshots/<id>", the folder of the id's copies.
+  std::string folder() const;
+  // ".snapshots/<id>/<R>", the copy itself.
+  std::string copy() const { return Named(""); }
+  // ".snapshots/<id>/<R><suffix>".
+  std::string Named(const char* suffix) const { return folder() + "/" + record_ + suffix; }
+
+ private:
+  std::string appdata_, id_, record_;
+};
+
+// "<appdata>/.snapshots", the folder of every package's copies on a volume.
+// It exists only while a copy is in it.
+std::string PMSSnapshotsDir(const std::string& appdata);
+
+// True when copies in `appdata`'s copies folder share blocks with the data
+// (reflinks), so that a copy takes no room: probed with files made there and
+// removed again (as is the folder, when it was made for the probe).
+[[nodiscard]] bool PMSSnapshotsShareBlocks(const std::string& appdata);
+
+// Copies D to <R> (made as <R>.copying and renamed when whole). The package
+// must be stopped. On failure nothing of the copy stays (unless it cannot
+// be removed: the next operation's clean-up removes a .copying) and *error
+// says why; D is never changed.
+[[nodiscard]] TreeCopyResult PMSTakeSnapshot(const DataSnapshot& s, std::string* error);
+
+// Confirms the upgrade: the copy is renamed to <R>.discard, then removed.
+// False (errno set) when it could not be renamed: the upgrade is then not
+// confirmed. A .discard that could not be removed now is removed by the
+// next operation's clean-up.
+[[nodiscard]] bool PMSDiscardSnapshot(const DataSnapshot& s);
+
+enum class RestoreState {
+  kRestored,      // D holds the copy again and R is published
+  kUntouched,     // nothing changed: D holds what the failed version left; the copy stays
+  kDataAside,     // D is missing: the failed version's data is at <R>.replaced, the copy at <R>
+  kNotPublished,  // D holds the copy again but R could not be published again
+  kNoCopy,        // there is no copy of R to put back
+};
+
+// Puts the copy back in place of D and publishes R as the package when it
+// is not published already, then removes what the failed version left.
+// Resumes a restore that was interrupted. Every process of the version
+// that used D must have stopped. Must run under the tool's lock. *error
+// says what failed.
+[[nodiscard]] RestoreState PMSRestoreSnapshot(const DataSnapshot& s, std::string* error);

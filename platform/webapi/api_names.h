@@ -1,0 +1,37 @@
+// The names of every web API the appliance serves: the host's own and those
+// of the package center's module. The module's tables register its names
+// with the host; the host answers its own, and treats a few of the module's
+// apart (the methods browsers load by URL, the page that guards itself).
+#pragma once
+
+namespace WebAPIName {
+
+// Served by the host.
+inline constexpr char kInfo[] = "KIVO.API.Info";
+inline constexpr char kAuth[] = "KIVO.API.Auth";
+inline constexpr char kUserSettings[] = "KIVO.API.UserSettings";
+
+// Served by the package center's module.
+inline constexpr char kPackage[] = "KIVO.Core.Package";
+inline constexpr char kInstallation[] = "KIVO.Core.Package.Installation";
+inline constexpr char kDownload[] = "KIVO.Core.Package.Installation.Download";
+inline constexpr char kUninstallation[] = "KIVO.Core.Package.Uninstallation";
+inline constexpr char kControl[] = "KIVO.Core.Package.Control";
+inline constexpr char kServer[] = "KIVO.Core.Package.Server";
+inline constexpr char kLog[] = "KIVO.Core.Package.Log";
+inline constexpr char kFeed[] = "KIVO.Core.Package.Feed";
+inline constexpr char kKeyring[] = "KIVO.Core.Package.Feed.Keyring";
+inline constexpr char kSetting[] = "KIVO.Core.Package.Setting";
+inline constexpr char kVolumeSetting[] = "KIVO.Core.Package.Setting.Volume";
+inline constexpr char kUpdateSetting[] = "KIVO.Core.Package.Setting.Update";
+inline constexpr char kPackageInfo[] = "KIVO.Core.Package.Info";
+inline constexpr char kThumb[] = "KIVO.Core.Package.Thumb";
+inline constexpr char kServerThumb[] = "KIVO.Core.Package.Thumb.Server";
+inline constexpr char kScreenshot[] = "KIVO.Core.Package.Screenshot";
+inline constexpr char kServerScreenshot[] = "KIVO.Core.Package.Screenshot.Server";
+inline constexpr char kFakeIFrame[] = "KIVO.Core.Package.FakeIFrame";
+// The list's name from before the package center had APIs of its own; it
+// answers "list" without a parameter checker.
+inline constexpr char kLegacyPackage[] = "KIVO.Package";
+
+}  // namespace WebAPIName

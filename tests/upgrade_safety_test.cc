@@ -1,0 +1,333 @@
+// Upgrades that never lose data, through kivoctl on a temporary root: the
+// safety copy of the package's data, the health gate, the automatic restore
+// of the old version with its data, and the refusals that come before
+// anything changes.
+
+#include <algorithm>
+#include <fcntl.h>
+#include <sys/inotify.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include "klibc/atomic_file.h"
+#include "pkgtool/registry.h"
+#include "pkgtool/result_codes.h"
+#include "pkgtool/tree_copy.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+
+namespace {
+
+// What v1 keeps in its data folder: files of several kinds and modes, a
+// subfolder, a symlink and a hard link inside it.
+const char kWriteData[] =
+    "D=\"$KIVO_PKG_VAR\"\n"
+    "mkdir -p \"$D/db/journal\"\n"
+    "printf 'row1\\000row2\\377\\n' > \"$D/db/main.db\"\n"
+    "echo 'entry' > \"$D/db/journal/0001\"\n"
+    "echo 'secret=1' > \"$D/config\"; chmod 600 \"$D/config\"\n"
+    "ln -s db/main.db \"$D/current\"\n"
+    "ln \"$D/config\" \"$D/config.bak\"\n"
+    "touch -d '2001-02-03 04:05:06' \"$D/db/journal/0001\" \"$D/db\"\n";
+
+// What a migration does to it before it fails.
+const char kRewriteData[] =
+    "D=\"$KIVO_PKG_VAR\"\n"
+    "echo 'migrated' > \"$D/db/main.db\"\n"
+    "rm -rf \"$D/db/journal\" \"$D/current\"\n"
+    "echo 'new' > \"$D/v2-only\"\n"
+    "chmod 644 \"$D/config\"\n";
+
+class UpgradeSafetyTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
+    dir_ = root_.Path("/tmp/packages");
+    data_ = root_.Path("/volume1/@appdata/test-app");
+    ASSERT_EQ(0, KIVOFSMkdirP(dir_.c_str()));
+    v1_.files = {{"version.txt", "1\n"}};
+    v1_.scripts = {{"postinst", kWriteData}};
+    v2_ = v1_;
+    v2_.version = "2.0";
+    v2_.files = {{"version.txt", "2\n"}};
+    v2_.scripts = {};
+  }
+  void TearDown() override { StopInstalledPackages(); }
+
+  int Install(const TestPackage& p, std::vector<std::string> extra = {}) {
+    std::vector<std::string> args = {"install", p.Build(dir_)};
+    args.insert(args.end(), extra.begin(), extra.end());
+    return Kivoctl(args, &out_);
+  }
+  void ExpectRefused(int code, const TestPackage& p) {
+    EXPECT_EQ(1, Install(p)) << out_;
+    EXPECT_NE(std::string::npos, out_.find("[" + std::to_string(code) + "]")) << out_;
+  }
+  void ExpectSaid(const std::string& words) {
+    EXPECT_NE(std::string::npos, out_.find(words)) << "missing: " << words << "\n" << out_;
+  }
+  std::string Status() {
+    std::string out;
+    Kivoctl({"status", "test-app"}, &out);
+    return out;
+  }
+  // Every entry of the data folder: path, type, mode, owner, size, times,
+  // link target and content digest, so that two equal answers mean the
+  // same data byte for byte.
+  std::string Fingerprint() {
+    std::string listing, digests;
+    RunProgram({"find", data_, "-printf", "%P|%y|%m|%U:%G|%s|%T@|%n|%l\n"}, &listing);
+    RunProgram({"sh", "-c", "cd \"$1\" && find . -type f -exec sha256sum {} + | sort", "sh", data_},
+               &digests);
+    return SortLines(listing) + digests;
+  }
+  static std::string SortLines(const std::string& text) {
+    std::vector<std::string> lines;
+    size_t start = 0;
+    for (size_t end; (end = text.find('\n', start)) != std::string::npos; start = end + 1) {
+      lines.push_back(text.substr(start, end - start));
+    }
+    std::sort(lines.begin(), lines.end());
+    std::string out;
+    for (const std::string& l : lines) out += l + "\n";
+    return out;
+  }
+  // No copy of any package's data stays, and no record or payload that no
+  // package owns.
+  void ExpectNothingLeft() {
+    EXPECT_FALSE(KLIBCFileExist(root_.Path("/volume1/@appdata/.snapshots").c_str()))
+        << Entries("/volume1/@appdata/.snapshots");
+    const size_t installed = PackageRegistry::List().size();
+    for (const char* dir : {"/var/packages/.records", "/volume1/@appstore"}) {
+      const std::string names = Entries(dir);
+      EXPECT_EQ(installed, static_cast<size_t>(std::count(names.begin(), names.end(), '\n')))
+          << dir << ":\n"
+          << names;
+    }
+  }
+  // The names in a folder under the root, one a line.
+  std::string Entries(const std::string& dir) {
+    std::string out;
+    RunProgram({"ls", "-A", root_.Path(dir)}, &out);
+    return out.find("No such file") != std::string::npos ? "" : out;
+  }
+  std::string InstalledVersion() {
+    KeyValueMap info;
+    return PackageRegistry::ReadInfo("test-app", &info) ? info["version"] : "";
+  }
+
+  TempRoot root_;
+  std::string dir_, data_, out_;
+  TestPackage v1_, v2_;
+};
+
+TEST_F(UpgradeSafetyTest, FailedMigrationGetsTheOldDataBackByteForByte) {
+  ASSERT_EQ(0, Install(v1_)) << out_;
+  ASSERT_EQ(0, setxattr((data_ + "/config").c_str(), "user.owner", "ada", 3, 0));
+  const std::string before = Fingerprint();
+  ASSERT_NE(std::string::npos, before.find("db/journal/0001|f|644")) << before;
+
+  v2_.scripts = {{"postupgrade", std::string(kRewriteData) + "exit 3\n"}};
+  ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, v2_);
+  ExpectSaid("The upgrade to 2.0 failed in postupgrade; 1.0 and its data were restored.");
+  EXPECT_EQ("1.0", InstalledVersion());
+  EXPECT_EQ("1\n", FileText(root_.Path("/var/packages/test-app/target/version.txt")));
+  EXPECT_EQ(before, Fingerprint());
+  char owner[8] = {};
+  EXPECT_EQ(3, getxattr((data_ + "/config").c_str(), "user.owner", owner, sizeof(owner)));
+  ExpectNothingLeft();
+
+  // A migration that fails before the new version is registered, likewise.
+  TestPackage early = v2_;
+  early.version = "2.1";  // a package file of its own
+  early.scripts = {{"preupgrade", std::string(kRewriteData) + "exit 1\n"}};
+  ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, early);
+  ExpectSaid("The upgrade to 2.1 failed in preupgrade; 1.0 and its data were restored.");
+  EXPECT_EQ(before, Fingerprint());
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, ServiceThatNeverStartsIsReplacedByTheOldVersionWithItsData) {
+  v1_.info = {{"logfile", "app.log"}};
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  const std::string data_before = FileText(data_ + "/db/main.db");
+
+  v2_.daemon = false;
+  v2_.info = {{"logfile", "app.log"}, {"health_grace_seconds", "1"}};
+  v2_.scripts = {
+      {"postupgrade", kRewriteData},
+      {"start-stop-status",
+       "case \"$1\" in start) echo 'cannot open port 8080' >> \"$KIVO_PKG_VAR/app.log\";;"
+       " status) exit 1;; esac\n"}};
+  ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, v2_);
+  ExpectSaid("The upgrade to 2.0 did not start within 1 s; 1.0 and its data were restored.");
+  ExpectSaid("The last lines of test-app's log:\ncannot open port 8080");
+  EXPECT_EQ("test-app 1.0 running\n", Status());
+  EXPECT_EQ(data_before, FileText(data_ + "/db/main.db"));
+  EXPECT_FALSE(KLIBCFileExist((data_ + "/v2-only").c_str()));
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, FailingHealthCheckIsReplacedByTheOldVersion) {
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  v2_.scripts = {{"postupgrade", kRewriteData},
+                 {"health", "echo 'database unreachable'; exit 2\n"}};
+  ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, v2_);
+  ExpectSaid("The upgrade to 2.0 failed its health check; 1.0 and its data were restored.");
+  ExpectSaid("database unreachable");
+  EXPECT_EQ("test-app 1.0 running\n", Status());
+  EXPECT_FALSE(KLIBCFileExist((data_ + "/v2-only").c_str()));
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, HangingAndNoisyHealthCheckIsCutShort) {
+  root_.Write("/etc/kivo/pkgtool.conf", "health_check_timeout_seconds=\"1\"\n");
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  v2_.scripts = {{"health",
+                  "head -c 30000000 /dev/zero | tr '\\000' x\n"
+                  "sleep 300 # kivo-health-hang-marker\n"}};
+  time_t start = time(nullptr);
+  ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, v2_);
+  EXPECT_LT(time(nullptr) - start, 20);
+  ExpectSaid(
+      "The upgrade to 2.0 did not pass its health check within 1 s; 1.0 and its data were "
+      "restored.");
+  EXPECT_LT(out_.size(), 200000u);  // the check's 30 MB reached the answer only as a tail
+  EXPECT_NE(0, RunProgram({"pgrep", "-f", "kivo-health-hang-marker"}, nullptr));
+  EXPECT_EQ("test-app 1.0 running\n", Status());
+}
+
+TEST_F(UpgradeSafetyTest, HealthyUpgradeKeepsTheNewDataAndDropsTheCopy) {
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  v2_.scripts = {{"postupgrade", kRewriteData},
+                 {"health",
+                  "head -c 5000000 /dev/zero | tr '\\000' y || exit 9\n"
+                  "[ -f \"$KIVO_PKG_VAR/v2-only\" ] && echo healthy\n"}};
+  ASSERT_EQ(0, Install(v2_)) << out_;
+  ExpectSaid("the health check passed");
+  EXPECT_EQ("test-app 2.0 running\n", Status());
+  EXPECT_EQ("migrated\n", FileText(data_ + "/db/main.db"));
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, NewVersionThatDoesNotStopKeepsTheCopyUntilTheNextOperation) {
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  const std::string before = FileText(data_ + "/db/main.db");
+  const std::string up = data_ + "/v2-up";
+  v2_.daemon = false;
+  v2_.scripts = {{"postupgrade", kRewriteData},
+                 {"health", "exit 1\n"},
+                 {"start-stop-status",
+                  "case \"$1\" in start) touch \"$KIVO_PKG_VAR/v2-up\";; stop) exit 1;;"
+                  " status) [ -f \"$KIVO_PKG_VAR/v2-up\" ];; esac\n"}};
+  ExpectRefused(PKG_ERR_SCRIPT_FAILED, v2_);
+  ExpectSaid(
+      "The upgrade to 2.0 failed its health check, and 2.0 did not stop: it stays "
+      "installed and running with the data it changed; 1.0 and the copy of its data are "
+      "kept, and the next package operation puts them back once 2.0 stops.");
+  EXPECT_EQ("test-app 2.0 running\n", Status());
+  EXPECT_EQ("migrated\n", FileText(data_ + "/db/main.db"));
+
+  // While it runs, the next operation leaves it be; once it is gone, the
+  // next operation puts 1.0 back with its data.
+  EXPECT_EQ(0, Kivoctl({"install", PackageWithInfo("other-app").Build(dir_)}, &out_)) << out_;
+  EXPECT_EQ("test-app 2.0 running\n", Status());
+  ASSERT_EQ(0, unlink(up.c_str()));
+  EXPECT_EQ(0, Kivoctl({"stop", "test-app"}, &out_)) << out_;
+  EXPECT_EQ("test-app 1.0 stopped\n", Status());
+  EXPECT_EQ(before, FileText(data_ + "/db/main.db"));
+  // 2.0's record and payload, no one's now, go with the next clean-up.
+  EXPECT_EQ(0, Kivoctl({"uninstall", "other-app"}, &out_)) << out_;
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, StoppedPackageIsJudgedByItsScriptsAndStaysStopped) {
+  ASSERT_EQ(0, Install(v1_)) << out_;
+  const std::string before = Fingerprint();
+  TestPackage failing = v2_;
+  failing.version = "1.5";
+  failing.scripts = {{"postupgrade", std::string(kRewriteData) + "exit 1\n"}};
+  ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, failing);
+  ExpectSaid("The upgrade to 1.5 failed in postupgrade; 1.0 and its data were restored.");
+  EXPECT_EQ("test-app 1.0 stopped\n", Status());
+  EXPECT_EQ(before, Fingerprint());
+
+  // Neither started nor checked: its failing start and health check do not
+  // count.
+  v2_.daemon = false;
+  v2_.scripts = {{"health", "exit 1\n"},
+                 {"start-stop-status",
+                  "case \"$1\" in start) touch \"$KIVO_ROOT/tmp/started\"; exit 1;; "
+                  "status) exit 1;; esac\n"}};
+  ASSERT_EQ(0, Install(v2_)) << out_;
+  EXPECT_EQ("test-app 2.0 stopped\n", Status());
+  EXPECT_FALSE(KLIBCFileExist(root_.Path("/tmp/started").c_str()));
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, DataWithAFifoIsRefusedBeforeAnythingChanges) {
+  v1_.scripts = {{"postinst", "mkfifo \"$KIVO_PKG_VAR/queue\"\n"}};
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  ExpectRefused(PKG_ERR_DATA_NOT_COPYABLE, v2_);
+  ExpectSaid(
+      "The data of test-app cannot be copied safely before the upgrade: queue is a fifo. "
+      "Nothing was changed.");
+  EXPECT_EQ("test-app 1.0 running\n", Status());
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, DataWithASymlinkLeadingOutIsRefusedAndNothingOutsideIsRead) {
+  const std::string outside = root_.Path("/outside");
+  root_.Write("/outside/secret.txt", "not the package's\n");
+  v1_.scripts = {{"postinst",
+                  "ln -s \"$KIVO_ROOT/outside/secret.txt\" \"$KIVO_PKG_VAR/escape\"\n"
+                  "ln -s ../../../outside \"$KIVO_PKG_VAR/climb\"\n"}};
+  ASSERT_EQ(0, Install(v1_)) << out_;
+  // Any open, read or write of what the links lead to shows here.
+  int watch = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
+  ASSERT_GE(watch, 0);
+  ASSERT_GE(inotify_add_watch(watch, outside.c_str(), IN_ALL_EVENTS), 0);
+
+  ExpectRefused(PKG_ERR_DATA_NOT_COPYABLE, v2_);
+  ExpectSaid("outside the data folder. Nothing was changed.");
+  EXPECT_EQ("test-app 1.0 stopped\n", Status());
+  char events[4096];
+  EXPECT_LT(read(watch, events, sizeof(events)), 0) << "something outside was touched";
+  close(watch);
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, NoRoomForTheCopyIsRefusedInWordsUnlessThePackageNeedsNone) {
+  const std::string appdata = root_.Path("/volume1/@appdata");
+  ASSERT_EQ(0, KIVOFSMkdirP(appdata.c_str()));
+  if (PMSCanReflink(appdata)) GTEST_SKIP() << "this file system shares blocks: copies take no room";
+  v1_.scripts = {{"postinst", "head -c 3000000 /dev/zero > \"$KIVO_PKG_VAR/big\"\n"}};
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  root_.Write("/etc/kivo/volumes.json",
+              "[{\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 2097152}]");
+  ExpectRefused(PKG_ERR_NO_ROOM_FOR_DATA_COPY, v2_);
+  ExpectSaid("The upgrade of test-app needs 3 MiB for a safety copy of its data besides");
+  ExpectSaid("/volume1 has 2 MiB free. Nothing was changed.");
+  EXPECT_EQ("test-app 1.0 running\n", Status());
+
+  TestPackage uncopied = v2_;
+  uncopied.version = "2.1";
+  uncopied.info = {{"upgrade_data_copy", "no"}};
+  ASSERT_EQ(0, Install(uncopied)) << out_;
+  EXPECT_EQ("test-app 2.1 running\n", Status());
+  ExpectNothingLeft();
+}
+
+TEST_F(UpgradeSafetyTest, HealthLimitsInInfoMustBeInBounds) {
+  std::string src = dir_ + "/wild";
+  root_.Write("/tmp/packages/wild/INFO",
+              "package=\"test-app\"\nversion=\"2.0\"\nhealth_grace_seconds=\"100000\"\n");
+  ASSERT_EQ(0, KIVOFSMkdirP((src + "/package").c_str()));
+  EXPECT_NE(0, Kivoctl({"build", src, dir_ + "/wild.kpk"}, &out_));
+  ExpectSaid("health_grace_seconds: must be a whole number of seconds from 1 to 600");
+}
+
+}  // namespace
