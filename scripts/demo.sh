@@ -20,9 +20,23 @@ ROOT=$PWD/demo-root
 scripts/build-page.sh
 scripts/demo-root.sh "$ROOT" "$PORT"
 K="build/bin/kivoctl --root $ROOT"
+# Runs `kivoctl ACTION` on each of the ids in FILE, in passes, until a pass
+# changes nothing: a package that needs another (demo-notes needs demo-web)
+# starts only after it and must stop before it, whatever the order.
+in_passes() {
+  local action=$1 file=$2 left
+  left=$(cat "$file")
+  while [ -n "$left" ]; do
+    local failed=""
+    for id in $left; do $K "$action" "$id" >/dev/null 2>&1 || failed="$failed $id"; done
+    [ "$(echo $failed)" = "$(echo $left)" ] && break
+    left=$failed
+  done
+  for id in $left; do echo "could not $action $id" >&2; done
+}
+# What the last run stopped runs again.
 if [ -f "$ROOT/.stopped-by-demo" ]; then
-  while read -r id; do $K start "$id" >/dev/null || echo "could not start $id again" >&2; done \
-    <"$ROOT/.stopped-by-demo"
+  in_passes start "$ROOT/.stopped-by-demo"
   rm -f "$ROOT/.stopped-by-demo"
 fi
 
@@ -40,11 +54,11 @@ Try the curl lines of README.md. Ctrl-C stops the server and the packages.
 TXT
 # The demo's packages end with it: a service left running (demo-web on its
 # port above all) would stand in the way of the next demo or of the tests.
-# The ones it stops run again when the demo starts again.
+# They run again when the demo starts again.
 STOPPED=$ROOT/.stopped-by-demo
 stop_packages() {
   $K list | awk '$NF == "running" {print $1}' >"$STOPPED.tmp" && mv "$STOPPED.tmp" "$STOPPED"
-  while read -r id; do $K stop "$id" >/dev/null || echo "could not stop $id" >&2; done <"$STOPPED"
+  in_passes stop "$STOPPED"
   echo "stopped: $(tr '\n' ' ' <"$STOPPED")"
 }
 trap stop_packages EXIT
