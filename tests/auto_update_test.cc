@@ -4,7 +4,12 @@
 // held back on the stable channel and taken on the beta channel, a failing
 // upgrade leaves the old version running and fails the run, the settings
 // "off" and the chosen list are honoured, and --dry-run changes nothing; the
-// web API reads the switches as the run does.
+// web API reads the switches as the run does. A version whose upgrade failed
+// is remembered and not tried again until a newer one is offered; an
+// uninstall forgets it, and a damaged record of failures is read as empty.
+
+#include <ctime>
+#include <regex>
 
 #include <gtest/gtest.h>
 
@@ -48,10 +53,10 @@ class AutoUpdateTest : public ::testing::Test {
   // The vendor offers version 2.0 of `id` (with `scripts`), as a beta when
   // `beta`. Call Serve() after the last.
   void Offer(const std::string& id, const std::map<std::string, std::string>& scripts = {},
-             bool beta = false) {
+             bool beta = false, const std::string& version = "2.0") {
     TestPackage v2;
     v2.id = id;
-    v2.version = "2.0";
+    v2.version = version;
     v2.scripts = scripts;
     vendor_.Replace(v2);
     if (beta) betas_.push_back(id);
@@ -72,6 +77,24 @@ class AutoUpdateTest : public ::testing::Test {
     EXPECT_EQ(0, Kivoctl({"list"}, &out)) << out;
     size_t at = out.find(id + " ");
     return at == std::string::npos ? "" : out.substr(at, out.find('\n', at) - at);
+  }
+
+  // The record of versions that failed, as the run keeps it (null when
+  // there is none or it is not JSON).
+  Json::Value Failures() {
+    Json::Value failures;
+    if (!WebUtils::LoadJsonFile(FailuresPath(), failures)) return Json::Value();
+    return failures;
+  }
+  std::string FailuresPath() {
+    return root_.Path("/usr/kivo/etc/packages/autoupdate-failures.json");
+  }
+  std::string FailuresText() { return FileText(FailuresPath()); }
+  // How often the package file of `id` that the vendor now offers was
+  // downloaded.
+  int Downloads(const std::string& id) {
+    const std::string file = vendor_.FilePath(id);
+    return server_.Requests("/vendor/" + file.substr(file.rfind('/') + 1));
   }
 
   TempRoot root_;
@@ -127,6 +150,113 @@ TEST_F(AutoUpdateTest, FailedUpgradeLeavesTheOldVersionRunning) {
   // One failure does not stop the others.
   EXPECT_NE(std::string::npos, out.find("au-b: upgraded 1.0 -> 2.0")) << out;
   EXPECT_EQ("au-b 2.0 running", State("au-b"));
+}
+
+TEST_F(AutoUpdateTest, AFailedVersionWaitsForANewerOne) {
+  InstallOld("au-a");
+  Offer("au-a", {{"postupgrade", "echo postupgrade refuses >&2\nexit 1\n"}});
+  Serve();
+  std::string out;
+  const long long before = time(nullptr);
+  EXPECT_EQ(1, AutoUpdate(&out)) << out;
+  const long long after = time(nullptr);
+  EXPECT_NE(std::string::npos, out.find("au-a: failed 1.0 -> 2.0: ")) << out;
+  EXPECT_EQ("au-a 1.0 running", State("au-a"));
+  const Json::Value failed = Failures()["au-a"];
+  ASSERT_TRUE(failed.isObject()) << FailuresText();
+  EXPECT_EQ("2.0", failed["version"].asString());
+  EXPECT_EQ(305, failed["code"].asInt());
+  ASSERT_TRUE(failed["time"].isInt64());
+  EXPECT_LE(before, failed["time"].asInt64());
+  EXPECT_GE(after, failed["time"].asInt64());
+  const std::string reason = failed["reason"].asString();
+  EXPECT_NE(std::string::npos, reason.find("postupgrade")) << reason;
+  EXPECT_EQ(std::string::npos, reason.find('\n')) << reason;
+
+  // The next run does not download it again and says why, in words; a dry
+  // run says the same and writes nothing.
+  const std::regex skipped(
+      "au-a: skipped: 2\\.0 failed on \\d{4}-\\d\\d-\\d\\d \\d\\d:\\d\\d UTC and was "
+      "restored \\(([^\n]*)\\); waiting for a newer version\n");
+  const std::string recorded = FailuresText();
+  const int downloads = Downloads("au-a");
+  for (bool dry_run : {true, false}) {
+    ASSERT_EQ(0, AutoUpdate(&out, dry_run)) << out;
+    std::smatch match;
+    ASSERT_TRUE(std::regex_search(out, match, skipped)) << out;
+    EXPECT_EQ(reason, match[1].str()) << out;
+    EXPECT_EQ("au-a 1.0 running", State("au-a"));
+    EXPECT_EQ(recorded, FailuresText());
+  }
+  EXPECT_EQ(downloads, Downloads("au-a"));
+
+  // A fixed version is taken, and the failure is forgotten.
+  Offer("au-a", {}, false, "3.0");
+  Serve();
+  ASSERT_EQ(0, AutoUpdate(&out, true)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: would upgrade 1.0 -> 3.0")) << out;
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: upgraded 1.0 -> 3.0")) << out;
+  EXPECT_EQ("au-a 3.0 running", State("au-a"));
+  EXPECT_TRUE(Failures().isObject()) << FailuresText();
+  EXPECT_FALSE(Failures().isMember("au-a")) << FailuresText();
+}
+
+TEST_F(AutoUpdateTest, AnUninstallForgetsTheFailedVersion) {
+  InstallOld("au-a");
+  Offer("au-a", {{"postupgrade", "exit 1\n"}});
+  Serve();
+  std::string out;
+  EXPECT_EQ(1, AutoUpdate(&out)) << out;
+  ASSERT_TRUE(Failures().isMember("au-a")) << out << FailuresText();
+
+  ASSERT_EQ(0, Kivoctl({"uninstall", "au-a"}, &out)) << out;
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_TRUE(Failures().isObject()) << FailuresText();
+  EXPECT_FALSE(Failures().isMember("au-a")) << FailuresText();
+
+  // Installed again, the same version is tried again.
+  Offer("au-a", {}, false, "1.0");
+  Serve();
+  ASSERT_EQ(0, Kivoctl({"install-server", "au-a", "--run"}, &out)) << out;
+  Offer("au-a", {{"postupgrade", "exit 1\n"}});
+  Serve();
+  EXPECT_EQ(1, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: failed 1.0 -> 2.0: ")) << out;
+}
+
+// The record is checked whole: one entry that is not valid makes the whole
+// file count as empty (a dry run reads it so and leaves it), and a run
+// replaces it.
+TEST_F(AutoUpdateTest, ADamagedRecordOfFailuresIsReadAsEmptyAndReplaced) {
+  InstallOld("au-a");
+  Offer("au-a");
+  Serve();
+  // An entry that holds for the installed 1.0: 2.0 failed over this record.
+  const std::string entry = R"({"code": 305, "reason": "failed in postupgrade", "record": ")" +
+                            PackageRegistry::PublishedRecord("au-a") +
+                            R"(", "time": 1700000000, "version": "2.0"})";
+  std::string out;
+  root_.Write("/usr/kivo/etc/packages/autoupdate-failures.json", "{\"au-a\": " + entry + "}");
+  ASSERT_EQ(0, AutoUpdate(&out, true)) << out;
+  EXPECT_NE(std::string::npos,
+            out.find("au-a: skipped: 2.0 failed on 2023-11-14 22:13 UTC and was restored (failed "
+                     "in postupgrade); waiting for a newer version"))
+      << out;
+
+  for (const std::string& damaged :
+       {std::string("not json"), std::string("[]"),
+        "{\"au-a\": " + entry + ", \"../x\": " + entry + "}",
+        "{\"au-a\": " + entry + ", \"au-b\": {\"version\": \"2.0;rm\"}}",
+        "{\"au-a\": " + entry.substr(0, entry.size() - 1) + ", \"more\": 1}}"}) {
+    root_.Write("/usr/kivo/etc/packages/autoupdate-failures.json", damaged);
+    ASSERT_EQ(0, AutoUpdate(&out, true)) << out;
+    EXPECT_NE(std::string::npos, out.find("au-a: would upgrade 1.0 -> 2.0")) << damaged << out;
+    EXPECT_EQ(damaged, FailuresText());
+  }
+  ASSERT_EQ(0, AutoUpdate(&out)) << out;
+  EXPECT_NE(std::string::npos, out.find("au-a: upgraded 1.0 -> 2.0")) << out;
+  EXPECT_EQ(Json::Value(Json::objectValue), Failures()) << FailuresText();
 }
 
 TEST_F(AutoUpdateTest, OffChosenListAndRestrictions) {

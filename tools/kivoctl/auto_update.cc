@@ -1,5 +1,6 @@
 #include "tools/kivoctl/auto_update.h"
 
+#include <ctime>
 #include <iostream>
 #include <map>
 #include <syslog.h>
@@ -11,6 +12,8 @@
 #include "pkgserver/server_config.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/pms.h"
+#include "pkgtool/registry.h"
+#include "pkgtool/result_codes.h"
 #include "pkgtool/version.h"
 #include "tools/kivoctl/server_install.h"
 
@@ -20,6 +23,7 @@ constexpr char kInfoConf[] = "/etc/kivoinfo.conf";
 constexpr char kLanguage[] = "enu";
 
 using Mode = KIVOPackageServer::AutoUpdateMode;
+using KIVOPackageServer::AutoUpdateFailure;
 
 bool InfoIs(const char* key, const char* value) {
   return KLIBCFileCheckKeyValue(KIVORootPath(kInfoConf).c_str(), key, value, 0) == 1;
@@ -69,6 +73,82 @@ bool ReadCatalogues(std::vector<CatalogueOffer>& offers) {
 
 bool IsBeta(const Json::Value& entry) { return entry["beta"].isBool() && entry["beta"].asBool(); }
 
+// Whether a failed upgrade says something about the version itself, so
+// that trying it again would fail again. A failure that says the appliance
+// was not ready (the download, another operation holding the lock, no room
+// on the volume or for the data's safety copy, no temporary space, a
+// crashed or missing volume, a needed package or service not running, a
+// cancel, an internal error) is tried again by the next run.
+bool SaysTheVersionFailed(int code) {
+  switch (code) {
+    case PKG_OK:  // the failure came before the package tool: the download
+    case PKG_ERR_BUSY:
+    case PKG_ERR_NO_SPACE:
+    case PKG_ERR_NO_ROOM_FOR_DATA_COPY:
+    case PKG_ERR_NO_TMP:
+    case PKG_ERR_VOLUME_CRASHED:
+    case PKG_ERR_NO_VOLUME:
+    case PKG_ERR_DEPENDENCY:
+    case PKG_ERR_SERVICE_NOT_RUNNING:
+    case PKG_ERR_CANCELLED:
+    case PKG_ERR_INTERNAL:
+      return false;
+    default:
+      return true;
+  }
+}
+
+// "2024-05-01 14:03 UTC".
+std::string DateText(int64_t when) {
+  const time_t t = static_cast<time_t>(when);
+  struct tm utc {};
+  char text[32] = "";
+  if (gmtime_r(&t, &utc) == nullptr ||
+      strftime(text, sizeof(text), "%Y-%m-%d %H:%M UTC", &utc) == 0)
+    return "an unknown date";
+  return text;
+}
+
+// Remembers that `plan.version` failed with `code` and `message`, so that
+// the next run waits for a newer version; a failure of the appliance's
+// rather than the version's is not remembered.
+void RememberFailure(const AutoUpdatePlan& plan, int code, const std::string& message) {
+  if (!SaysTheVersionFailed(code)) return;
+  AutoUpdateFailure failure;
+  failure.version = plan.version;
+  failure.time = time(nullptr);
+  failure.code = code;
+  failure.reason = KIVOPackageServer::FailureReasonLine(message);
+  if (failure.reason.empty()) failure.reason = PMSResultText(code);
+  // What is published now is what the failure holds for; nothing published
+  // means the package is gone, and there is nothing left to hold back.
+  failure.record = PackageRegistry::PublishedRecord(plan.id);
+  if (failure.record.empty()) return;
+  if (!KIVOPackageServer::RecordFailure(plan.id, failure)) {
+    Report(plan.id + ": the failure of " + plan.version +
+               " cannot be recorded; the next run tries it again",
+           true);
+  }
+}
+
+// `plan`, turned into a skip when it would upgrade to a version that is
+// not newer than one that failed before.
+AutoUpdatePlan HoldBackFailed(AutoUpdatePlan plan) {
+  if (plan.action != AutoUpdatePlan::Action::kUpgrade) return plan;
+  const KIVOPackageServer::AutoUpdateFailures failures = KIVOPackageServer::ReadFailures();
+  const auto failed = failures.find(plan.id);
+  if (failed == failures.end() || PMSCompareVersion(plan.version, failed->second.version) > 0)
+    return plan;
+  const AutoUpdateFailure& f = failed->second;
+  // Only 305 says the previous version was put back whole; any other
+  // failure is told in the package tool's own words.
+  plan.action = AutoUpdatePlan::Action::kSkip;
+  plan.reason = f.version + " failed on " + DateText(f.time) +
+                (f.code == PKG_ERR_UPGRADE_ROLLED_BACK ? " and was restored" : "") + " (" +
+                f.reason + "); waiting for a newer version";
+  return plan;
+}
+
 // Carries out one plan (or says what it would do); false when it failed.
 bool Apply(PackageManager& manager, const AutoUpdatePlan& plan, bool dry_run) {
   if (plan.action == AutoUpdatePlan::Action::kSkip) {
@@ -88,9 +168,14 @@ bool Apply(PackageManager& manager, const AutoUpdatePlan& plan, bool dry_run) {
     Report(plan.id + ": failed " + step + ": " + message +
                (code ? " [" + std::to_string(code) + "]" : ""),
            true);
+    RememberFailure(plan, code, message);
     return false;
   }
   Report(plan.id + ": upgraded " + step, false);
+  // The entry no longer holds once another record is published; this only
+  // keeps the file tidy.
+  if (!KIVOPackageServer::ForgetFailure(plan.id))
+    syslog(LOG_WARNING, "%s: the record of its failed version cannot be cleared", plan.id.c_str());
   return true;
 }
 
@@ -189,12 +274,17 @@ int KivoctlAutoUpdate(const std::vector<std::string>& args) {
   PackageManager manager;
   std::map<std::string, std::string> chosen;
   if (!manager.init() || !ChosenPackages(manager, mode, chosen)) return 1;
+  // Failures of packages since uninstalled (or installed afresh) are gone
+  // from the record before anything else; a dry run writes nothing.
+  if (!dry_run && !KIVOPackageServer::DropFailuresThatNoLongerHold())
+    syslog(LOG_WARNING, "the record of failed versions cannot be tidied");
   if (chosen.empty()) return 0;
   std::vector<CatalogueOffer> offers;
   bool ok = ReadCatalogues(offers);
   const bool beta = InfoIs("package_update_channel", "beta");
   for (const auto& [id, version] : chosen) {
-    const AutoUpdatePlan plan = PlanAutoUpdate(id, version, PMSInstalledOrigin(id), offers, beta);
+    const AutoUpdatePlan plan =
+        HoldBackFailed(PlanAutoUpdate(id, version, PMSInstalledOrigin(id), offers, beta));
     ok = Apply(manager, plan, dry_run) && ok;
   }
   return ok ? 0 : 1;

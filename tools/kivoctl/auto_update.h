@@ -12,7 +12,9 @@
 // with the catalogue's checksums and upgraded by the package tool under its
 // lock, one package at a time, with the trust level and signature checks of
 // any install; a package that ran before runs again afterwards. A failed
-// upgrade leaves the old version in place (the package tool's guarantee).
+// upgrade leaves the old version in place (the package tool's guarantee),
+// and the version that failed is recorded (KIVOPackageServer::RecordFailure)
+// and skipped by later runs until a newer one is offered.
 #pragma once
 
 #include <string>
@@ -50,6 +52,7 @@ AutoUpdatePlan PlanAutoUpdate(const std::string& id, const std::string& installe
                               const std::vector<CatalogueOffer>& offers, bool beta);
 
 // `kivoctl auto-update [--dry-run]`: one line per installed package on
-// stdout, each outcome also to syslog. Exit status 0 when nothing failed, 1
-// when an upgrade or the catalogue failed, 2 on a usage error.
+// stdout, each outcome also to syslog. Exit status 0 when nothing failed (a
+// version held back because it failed before is a skip), 1 when an upgrade
+// or the catalogue failed, 2 on a usage error. --dry-run writes nothing.
 int KivoctlAutoUpdate(const std::vector<std::string>& args);
