@@ -1,0 +1,401 @@
+// Upgrades a package whose data folder holds many files (1 GiB in 10,000 by
+// default) with the safety copy of its data and without it, and prints both
+// times next to `cp -a` of the same folder, all measured in the same run:
+// first on the file system of the temporary root, then on an XFS file system
+// with reflinks that the benchmark makes in a file under the temporary root
+// and mounts through a loop device as the root's only volume (this needs
+// root, mkfs.xfs and a free loop device; the benchmark says which is
+// missing).
+//
+//   upgrade_bench [data MiB] [files] [rounds]      (default 1024, 10000, 3)
+//
+// Each figure is the median of `rounds` measurements. Every timed step
+// starts after a sync, so that none pays for writing back what the one
+// before it wrote, and reads the data from the page cache.
+
+#include <algorithm>
+#include <cerrno>
+#include <chrono>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <fcntl.h>
+#include <functional>
+#include <string>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <vector>
+
+#include "bench_setup.h"
+#include "pkgtool/data_snapshot.h"
+#include "pkgtool/tree_copy.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+constexpr char kId[] = "bench-data";
+// What the tool's operation log says when the package declines the copy.
+constexpr char kNoCopyNote[] = "no safety copy of the data";
+
+struct Options {
+  uint64_t data_bytes = 1024ull << 20;
+  uint64_t files = 10000;
+  int rounds = 3;
+};
+
+// Reads the command line into *o; false when an argument is not a positive
+// number.
+bool ParseOptions(int argc, char** argv, Options* o) {
+  uint64_t values[3] = {o->data_bytes >> 20, o->files, static_cast<uint64_t>(o->rounds)};
+  if (argc > 4) return false;
+  for (int i = 1; i < argc; ++i) {
+    char* end = nullptr;
+    values[i - 1] = std::strtoull(argv[i], &end, 10);
+    if (*end != '\0' || values[i - 1] == 0 || values[i - 1] > 1000000) return false;
+  }
+  o->data_bytes = values[0] << 20;
+  o->files = values[1];
+  o->rounds = static_cast<int>(values[2]);
+  return true;
+}
+
+std::string Trimmed(std::string text) {
+  while (!text.empty() && (text.back() == '\n' || text.back() == ' ')) text.pop_back();
+  return text;
+}
+
+// Runs a command; true when it exits 0. Its output (stdout and stderr) goes
+// to *out.
+bool Succeeds(const std::vector<std::string>& argv, std::string* out = nullptr) {
+  std::string text;
+  const bool ok = RunProgram(argv, &text) == 0;
+  if (out) *out = Trimmed(text);
+  return ok;
+}
+
+// The seconds a command takes, started after a sync; ends the program when
+// the command fails. Its output goes to *out.
+double TimeOrExit(const std::vector<std::string>& argv, std::string* out = nullptr) {
+  Require(Succeeds({"sync"}), "sync");
+  const Clock::time_point start = Clock::now();
+  std::string text;
+  const bool ok = Succeeds(argv, &text);
+  const double seconds = std::chrono::duration<double>(Clock::now() - start).count();
+  Require(ok, argv[0] + " " + argv[1] + ": " + text);
+  if (out) *out = text;
+  return seconds;
+}
+
+// Writes `files` files of `bytes` in all (give or take a few bytes) below
+// `dir`, 100 to a folder, their sizes spread from a quarter of the mean to
+// 1.75 times it. Returns the bytes written.
+uint64_t WriteDataOrExit(const std::string& dir, uint64_t bytes, uint64_t files) {
+  constexpr size_t kChunk = 1 << 20;
+  std::vector<char> random(kChunk + 4096);
+  uint64_t seed = 88172645463325252ull;
+  for (size_t i = 0; i + 8 <= random.size(); i += 8) {
+    seed ^= seed << 13;
+    seed ^= seed >> 7;
+    seed ^= seed << 17;
+    std::copy_n(reinterpret_cast<const char*>(&seed), 8, &random[i]);
+  }
+  const uint64_t mean = bytes / files;
+  const uint64_t quarters[] = {1, 2, 4, 6, 7};  // mean 4 quarters
+  uint64_t written = 0;
+  for (uint64_t n = 0; n < files; ++n) {
+    const std::string folder = dir + "/d" + std::to_string(n / 100);
+    if (n % 100 == 0) MakeDirOrExit(folder);
+    const std::string path = folder + "/f" + std::to_string(n);
+    int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644);
+    Require(fd >= 0, "create " + path);
+    uint64_t left = mean * quarters[n % 5] / 4;
+    for (size_t offset = (n * 8) % 4096; left > 0;) {
+      const ssize_t done = write(fd, &random[offset], std::min<uint64_t>(left, kChunk));
+      Require(done > 0, "write " + path);
+      left -= static_cast<uint64_t>(done);
+      written += static_cast<uint64_t>(done);
+    }
+    Require(close(fd) == 0, "close " + path);
+  }
+  return written;
+}
+
+// Version `major`.0 of the benchmark's package: a small payload, never
+// started, so that an upgrade takes what the tool itself spends. `copy`
+// false declines the safety copy in INFO; nothing else differs.
+std::string BuildVersionOrExit(const std::string& dir, int major, bool copy) {
+  TestPackage p;
+  p.id = kId;
+  p.version = std::to_string(major) + ".0";
+  p.daemon = false;
+  p.info = {{"startable", "no"}};
+  if (!copy) p.info[kPMSDataCopyKey] = "no";
+  p.files = {{"bin/app", "#!/bin/sh\necho " + p.version + "\n"}};
+  const std::string file = p.Build(dir);
+  Require(access(file.c_str(), R_OK) == 0, std::string("build of ") + kId + " " + p.version);
+  return file;
+}
+
+double Median(std::vector<double> v) {
+  std::sort(v.begin(), v.end());
+  return v[v.size() / 2];
+}
+
+struct Samples {
+  std::vector<double> with_copy, without_copy, cp, rm;
+};
+
+// One round: cp -a of the data folder to a sibling (then removed, timed
+// apart), the upgrade to `major`.0 without the copy, the upgrade to
+// `major`+1 with it. Checks from the tool's log that each upgrade did what
+// it is timed as.
+void MeasureRoundOrExit(const std::string& packages, const std::string& data, int major,
+                        Samples* s) {
+  const std::string sibling = data + ".cp";
+  s->cp.push_back(TimeOrExit({"cp", "-a", data, sibling}));
+  s->rm.push_back(TimeOrExit({"rm", "-rf", sibling}));
+  const std::string without = BuildVersionOrExit(packages, major, false);
+  const std::string with = BuildVersionOrExit(packages, major + 1, true);
+  const std::string kivoctl = BuildDir() + "/bin/kivoctl";
+  std::string log;
+  s->without_copy.push_back(TimeOrExit({kivoctl, "install", without}, &log));
+  Require(log.find(kNoCopyNote) != std::string::npos, "the upgrade without a copy: " + log);
+  s->with_copy.push_back(TimeOrExit({kivoctl, "install", with}, &log));
+  Require(log.find(kNoCopyNote) == std::string::npos, "the upgrade with the copy: " + log);
+}
+
+// The room a copy of `dir` takes: what the upgrades must leave unchanged.
+uint64_t SurveyOrExit(const std::string& dir) {
+  TreeSurvey survey;
+  Require(PMSSurveyTree(dir, &survey), "survey of " + dir + ": " + survey.problem);
+  return survey.bytes;
+}
+
+void PrintRow(const char* what, double seconds, double mib) {
+  printf("  %-44s %8.2f", what, seconds);
+  if (mib > 0 && seconds > 0) printf(" %8.0f", mib / seconds);
+  printf("\n");
+}
+
+// Whether a target was met, or that it is another file system's.
+const char* Verdict(bool applies, bool met) {
+  if (!applies) return "does not apply here";
+  return met ? "met" : "NOT met";
+}
+
+void Report(const Samples& s, double mib, bool reflinks) {
+  const double a = Median(s.with_copy), b = Median(s.without_copy);
+  const double cp = Median(s.cp), copy = a - b;
+  printf("  %-44s %8s %8s\n", "", "seconds", "MiB/s");
+  PrintRow("(a) upgrade with the safety copy", a, 0);
+  PrintRow("(b) upgrade with upgrade_data_copy=no", b, 0);
+  PrintRow("    the copy's part, a - b", copy, mib);
+  PrintRow("(c) cp -a of the data folder", cp, mib);
+  PrintRow("    rm -rf of cp -a's copy (not in c)", Median(s.rm), 0);
+  const double overhead = copy / b * 100;
+  printf("  copy overhead (a - b) / b: %.1f%%; target with reflinks < 5%%: %s\n", overhead,
+         Verdict(reflinks, overhead < 5));
+  if (copy <= 0) {
+    printf("  copy speed vs cp -a: the copy took no measurable time\n");
+    return;
+  }
+  const double speed = cp / copy;
+  printf("  copy speed vs cp -a, c / (a - b): %.2fx; target without reflinks >= 0.8x: %s\n", speed,
+         Verdict(!reflinks, speed >= 0.8));
+}
+
+// Installs the package on volume `volume` of `root` (the only volume the
+// tool will choose), fills its data folder and prints the figures. Ends the
+// program when a step fails.
+void MeasureVolume(const TempRoot& root, const std::string& volume, const Options& o) {
+  WriteOrExit(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+  const std::string packages = root.Path("/tmp/packages");
+  MakeDirOrExit(packages);
+  std::string out;
+  const std::string first = BuildVersionOrExit(packages, 1, true);
+  Require(Succeeds({BuildDir() + "/bin/kivoctl", "install", first}, &out), "install: " + out);
+  const std::string appdata = root.Path(volume + "/@appdata");
+  const std::string data = appdata + "/" + kId;
+  const Clock::time_point start = Clock::now();
+  const double mib = WriteDataOrExit(data, o.data_bytes, o.files) / 1048576.0;
+  const double writing = std::chrono::duration<double>(Clock::now() - start).count();
+  const uint64_t room = SurveyOrExit(data);
+  Require(Succeeds({"findmnt", "-n", "-o", "FSTYPE", "-T", data}, &out), "findmnt " + data);
+  const bool reflinks = PMSSnapshotsShareBlocks(appdata);
+  printf("%s: %.0f MiB in %llu files (written in %.1f s), reflinks: %s, median of %d rounds\n",
+         out.c_str(), mib, static_cast<unsigned long long>(o.files), writing,
+         reflinks ? "yes" : "no", o.rounds);
+  Samples s;
+  for (int round = 0; round < o.rounds; ++round)
+    MeasureRoundOrExit(packages, data, 2 + 2 * round, &s);
+  Require(SurveyOrExit(data) == room, "the data folder changed during the upgrades");
+  Report(s, mib, reflinks);
+}
+
+// Runs `measure` in a child process, so that however it ends (a failed step
+// ends the program), the caller still cleans up after it. False when it did
+// not finish.
+bool RunInChild(const std::function<void()>& measure) {
+  fflush(stdout);
+  fflush(stderr);
+  const pid_t pid = fork();
+  if (pid == 0) {
+    signal(SIGINT, SIG_DFL);
+    signal(SIGTERM, SIG_DFL);
+    measure();
+    fflush(stdout);
+    _exit(0);
+  }
+  int status = 0;
+  if (pid < 0) return false;
+  while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+  }
+  if (WIFSIGNALED(status)) printf("The measurement was ended by signal %d.\n", WTERMSIG(status));
+  return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+}
+
+// Keeps SIGINT and SIGTERM from ending this process while it lives: they
+// end the measuring child, and this process then cleans up.
+class HoldSignals {
+ public:
+  HoldSignals() {
+    int_ = signal(SIGINT, SIG_IGN);
+    term_ = signal(SIGTERM, SIG_IGN);
+  }
+  ~HoldSignals() {
+    signal(SIGINT, int_);
+    signal(SIGTERM, term_);
+  }
+  HoldSignals(const HoldSignals&) = delete;
+  HoldSignals& operator=(const HoldSignals&) = delete;
+
+ private:
+  void (*int_)(int);
+  void (*term_)(int);
+};
+
+// The full path of program `name` on PATH or in the system folders root's
+// PATH holds; "" when there is none.
+std::string FindProgram(const std::string& name) {
+  const char* path = getenv("PATH");
+  std::string dirs = std::string(path ? path : "") + ":/usr/sbin:/sbin:/usr/bin:/bin";
+  for (size_t start = 0; start <= dirs.size();) {
+    size_t end = dirs.find(':', start);
+    if (end == std::string::npos) end = dirs.size();
+    const std::string candidate = dirs.substr(start, end - start) + "/" + name;
+    if (end > start && access(candidate.c_str(), X_OK) == 0) return candidate;
+    start = end + 1;
+  }
+  return "";
+}
+
+// An XFS file system with reflinks in a file, attached to a loop device and
+// mounted. The destructor unmounts it and detaches the device, whatever
+// happened in between; the file itself stays for its owner to remove.
+class LoopXfs {
+ public:
+  LoopXfs() = default;
+  ~LoopXfs();
+  LoopXfs(const LoopXfs&) = delete;
+  LoopXfs& operator=(const LoopXfs&) = delete;
+
+  // Makes the file system in the new file `image` (sparse, `bytes` long)
+  // and mounts it on the new folder `mount_point`. False with *why when it
+  // cannot; what was made by then is undone by the destructor.
+  [[nodiscard]] bool Make(const std::string& image, uint64_t bytes, const std::string& mount_point,
+                          std::string* why);
+
+ private:
+  std::string device_, mount_point_;
+};
+
+bool LoopXfs::Make(const std::string& image, uint64_t bytes, const std::string& mount_point,
+                   std::string* why) {
+  const std::string mkfs = FindProgram("mkfs.xfs"), losetup = FindProgram("losetup");
+  std::string out;
+  if (geteuid() != 0)
+    *why = "it is not run as root";
+  else if (mkfs.empty())
+    *why = "mkfs.xfs is not installed (Debian package xfsprogs)";
+  else if (losetup.empty())
+    *why = "losetup is not installed";
+  if (!why->empty()) return false;
+  const int fd = open(image.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
+  const bool sized = fd >= 0 && ftruncate(fd, static_cast<off_t>(bytes)) == 0;
+  if (fd >= 0) close(fd);
+  if (!sized)
+    *why = "the image file " + image + " cannot be made";
+  else if (!Succeeds({mkfs, "-q", "-m", "reflink=1", image}, &out))
+    *why = "mkfs.xfs: " + out;
+  else if (!Succeeds({losetup, "--find", "--show", image}, &out))
+    *why = "no loop device: " + out;
+  if (!why->empty()) return false;
+  device_ = out;
+  if (mkdir(mount_point.c_str(), 0755) != 0)
+    *why = "cannot make " + mount_point;
+  else if (!Succeeds({"mount", "-t", "xfs", device_, mount_point}, &out))
+    *why = "mount: " + out;
+  else
+    mount_point_ = mount_point;
+  return why->empty();
+}
+
+LoopXfs::~LoopXfs() {
+  std::string out;
+  if (!mount_point_.empty() && !Succeeds({"umount", mount_point_}, &out)) {
+    fprintf(stderr, "umount %s: %s; detaching it lazily\n", mount_point_.c_str(), out.c_str());
+    if (!Succeeds({"umount", "-l", mount_point_}, &out))
+      fprintf(stderr, "umount -l %s: %s\n", mount_point_.c_str(), out.c_str());
+  }
+  if (!device_.empty() && !Succeeds({FindProgram("losetup"), "-d", device_}, &out))
+    fprintf(stderr, "losetup -d %s: %s\n", device_.c_str(), out.c_str());
+}
+
+// On the file system of the temporary root, volume /volume1 as the root is
+// made.
+bool MeasureOnTempRoot(const Options& o) {
+  TempRoot root;
+  HoldSignals held;
+  return RunInChild([&] { MeasureVolume(root, "/volume1", o); });
+}
+
+// On an XFS file system mounted as the root's only volume, /volume2.
+bool MeasureOnXfs(const Options& o) {
+  TempRoot root;
+  HoldSignals held;
+  LoopXfs xfs;
+  const std::string volume = "/volume2";
+  const uint64_t image_bytes = 3 * o.data_bytes + (1ull << 30);
+  std::string why;
+  if (!xfs.Make(root.Path("/tmp/xfs.img"), image_bytes, root.Path(volume), &why)) {
+    printf("\nNo XFS measurement: %s.\n", why.c_str());
+    return true;
+  }
+  printf("\nOn XFS (reflink=1) in a loop-mounted file:\n");
+  return RunInChild([&] {
+    WriteOrExit(root.Path("/etc/kivo/volumes.json"),
+                "[{\"path\": \"" + volume + "\", \"status\": \"normal\"}]\n");
+    MeasureVolume(root, volume, o);
+  });
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Options o;
+  if (!ParseOptions(argc, argv, &o)) {
+    fprintf(stderr, "usage: upgrade_bench [data MiB] [files] [rounds]\n");
+    return 2;
+  }
+  UseBuildDirOfThisProgram();
+  std::string cp_version;
+  Require(Succeeds({"cp", "--version"}, &cp_version), "cp --version");
+  printf("cp -a is %s\n", cp_version.substr(0, cp_version.find('\n')).c_str());
+  printf("\nOn the temporary root's file system:\n");
+  // A pass that failed or was interrupted ends the benchmark.
+  return MeasureOnTempRoot(o) && MeasureOnXfs(o) ? 0 : 1;
+}
