@@ -13,6 +13,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include "host/activity_record.h"
 #include "host/cgi_request.h"
 #include "host/host_api.h"
 #include "host/host_config.h"
@@ -94,8 +95,10 @@ void RunModuleAPI(const CgiRequest& cgi, APIRequest* request, APIResponse* respo
   }
   bool by_url = IsLoadedByURL(request->GetAPIClass(), request->GetAPIMethod());
   if (!AuthorizeAdministrator(cgi, by_url, request, response)) return;
-  if (route.checker && !route.checker(request, response)) return;
-  route.handler(request, response);
+  // Begun before the checker, so that a refused change is on record too.
+  CallRecord record(*request, request->GetLoginUserName());
+  if (!route.checker || route.checker(request, response)) route.handler(request, response);
+  record.Finish(*response);
 }
 
 // Opens the multipart reader library beside the platform library and reads

@@ -4,6 +4,8 @@
 #include <syslog.h>
 
 #include "accounts/accounts.h"
+#include "host/activity_api.h"
+#include "host/activity_record.h"
 #include "host/host_config.h"
 #include "host/login_throttle.h"
 #include "host/user_settings_api.h"
@@ -12,6 +14,7 @@
 
 namespace {
 
+using WebAPIName::kActivity;
 using WebAPIName::kAuth;
 using WebAPIName::kInfo;
 using WebAPIName::kUserSettings;
@@ -35,6 +38,7 @@ void InfoQuery(const ModuleTable& modules, APIResponse* response) {
   AddRange(&data, kInfo, 1, 1);
   AddRange(&data, kAuth, 1, 1);
   AddRange(&data, kUserSettings, 1, 1);
+  AddRange(&data, kActivity, 1, 1);
   for (const APIVersionRange& r : modules.Versions())
     AddRange(&data, r.api, r.min_version, r.max_version);
   response->SetSuccess(data);
@@ -93,6 +97,10 @@ bool AdmitSignIn(LoginThrottle* throttle, const std::string& account, const std:
   return false;
 }
 
+void SignIn(const std::string& account, const std::string& password, APIResponse* response);
+
+// Every attempt that names an account is on record, with its outcome; the
+// password never is.
 void Login(const CgiRequest& cgi, const APIRequest& request, APIResponse* response) {
   if (!IsPostedSignIn(cgi)) {
     response->SetError(kErrBadRequest,
@@ -104,6 +112,12 @@ void Login(const CgiRequest& cgi, const APIRequest& request, APIResponse* respon
       !RequireString(request, "passwd", &password, response)) {
     return;
   }
+  SignIn(account, password, response);
+  RecordSignIn(account, *response);
+}
+
+// Checks the password of `account` and opens a session for it.
+void SignIn(const std::string& account, const std::string& password, APIResponse* response) {
   const HostConfig config = LoadHostConfig();
   const std::string address = LoginAddressKey(getenv("REMOTE_ADDR"));
   LoginThrottle throttle(config.login);
@@ -192,7 +206,17 @@ void Logout(const CgiRequest& cgi, const APIRequest& request, APIResponse* respo
 void UserSettings(const CgiRequest& cgi, const APIRequest& request, APIResponse* response) {
   Session session;
   if (!FindProvenSession(cgi, request, &session, response)) return;
+  // The agreement to the terms of service is stored here: a change on record.
+  CallRecord record(request, session.user);
   UserSettingsSet(request, session.user, response);
+  record.Finish(*response);
+}
+
+// The activity log is for administrators only, as every module API is.
+void Activity(const CgiRequest& cgi, APIRequest* request, APIResponse* response) {
+  if (!AuthorizeAdministrator(cgi, false, request, response)) return;
+  if (request->GetAPIMethod() == "list") return ActivityList(*request, response);
+  ActivityExport(*request, response);
 }
 
 // Tells a page that was reloaded who it is signed in as and hands it the
@@ -243,7 +267,7 @@ void HandOverCaller(const CgiRequest& cgi, APIRequest* request) {
 }  // namespace
 
 bool IsHostAPI(const std::string& api) {
-  return api == kInfo || api == kAuth || api == kUserSettings;
+  return api == kInfo || api == kAuth || api == kUserSettings || api == kActivity;
 }
 
 void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* modules,
@@ -252,7 +276,8 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
   const std::string& method = request->GetAPIMethod();
   bool known = (api == kInfo && method == "query") ||
                (api == kAuth && (method == "login" || method == "logout" || method == "session")) ||
-               (api == kUserSettings && method == "set");
+               (api == kUserSettings && method == "set") ||
+               (api == kActivity && (method == "list" || method == "export"));
   if (!known) {
     response->SetError(kErrNoSuchMethod);
   } else if (request->GetAPIVersion() != 1) {
@@ -261,6 +286,8 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
     InfoQuery(*modules, response);
   } else if (api == kUserSettings) {
     UserSettings(cgi, *request, response);
+  } else if (api == kActivity) {
+    Activity(cgi, request, response);
   } else if (method == "login") {
     Login(cgi, *request, response);
   } else if (method == "session") {

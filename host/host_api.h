@@ -9,6 +9,8 @@
 //                            "administrator"}, for a page that was reloaded
 //  "KIVO.API.UserSettings" "set"  the caller's own per-user settings, for any
 //                            signed-in account (host/user_settings_api.h)
+//  "KIVO.Core.Package.Activity" "list", "export"  the activity log, for
+//                            administrators (host/activity_api.h)
 #pragma once
 
 #include <string>

@@ -114,6 +114,16 @@ void DetachFromRequest() {
   if (null > 2) close(null);
 }
 
+// In the worker: waits (up to a minute) until the task's data names `self`
+// as its worker.
+void WaitToBeRecorded(NVX::Task& task, pid_t self) {
+  for (int i = 0; i < 1200; ++i) {
+    const Json::Value data = task.getProperty("data");
+    if (data["pid"].isInt() && data["pid"].asInt() == static_cast<int>(self)) return;
+    usleep(50000);
+  }
+}
+
 // Removes the download folder of the task `task_id` that a new download is
 // about to replace (the task itself is replaced with it).
 void RemoveReplacedDownload(NVX::TaskMgr& mgr, const std::string& task_id) {
@@ -187,7 +197,10 @@ pid_t PackageWebAPI::ForkProcess(NVX::Task* task, Json::Value& result, const std
   if (pid == 0) {
     DetachFromRequest();
     KIVOPackageServer::RegisterCancel();
-    task->waitForDataReady("data", 60);
+    // The task has its data from the start; the worker begins once the
+    // request has recorded it as the task's worker, so that its reports are
+    // never overwritten by that record.
+    WaitToBeRecorded(*task, getpid());
     return 0;
   }
   if (KIVOPackageServer::InitDownload(task, name, size, link, folder, quickInstall, pid,
@@ -219,7 +232,17 @@ bool PackageWebAPI::DownloadAndInstallPackage(const DownloadRequest& d, Json::Va
   std::string folder;
   if (!PMSCreateDownloadTmpDir(d.volume, d.name, static_cast<int64_t>(d.size), folder))
     return false;
-  std::unique_ptr<NVX::Task> task(GetNewTask(kTaskOwner, task_id.c_str()));
+  // The task takes the place of the earlier one with its data in one step:
+  // a listing between the two would find neither download, and a page
+  // reloaded right after asking for the install would offer it again.
+  NVX::Task* claimed = nullptr;
+  const Json::Value first = KIVOPackageServer::NewDownloadData(
+      task_id, d.name, d.size, d.link, folder, d.quick_install, d.origin_change);
+  const auto never_held = [](const Json::Value&) { return false; };
+  if (mgr.claimTask(task_id, first, never_held, &claimed) != NVX::TaskMgr::Claim::kClaimed) {
+    claimed = nullptr;
+  }
+  std::unique_ptr<NVX::Task> task(claimed);
   if (!task) {
     PKG_LOG_ERR("Failed to create task with task id '%s'", task_id.c_str());
     KIVOPackageServer::PMSRemoveDownloadDir(folder);

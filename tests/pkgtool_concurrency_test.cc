@@ -29,7 +29,7 @@
 
 namespace {
 
-enum class Op { kInstall, kUpgrade, kUninstall, kStart, kStop };
+enum class Op { kInstall, kUpgrade, kUninstall, kStart, kStop, kRollback };
 constexpr char kInst[] = "KIVO.Core.Package.Installation";
 
 const Op kOps[] = {Op::kInstall, Op::kUpgrade, Op::kUninstall, Op::kStart, Op::kStop};
@@ -46,14 +46,18 @@ const char* Name(Op op) {
       return "start";
     case Op::kStop:
       return "stop";
+    case Op::kRollback:
+      return "rollback";
   }
   return "?";
 }
 
-// What a package is: absent, or a version that runs or not.
+// What a package is: absent, or a version that runs or not, and the
+// earlier version an upgrade kept (compared only where a test follows it).
 struct State {
   std::string version;  // "" when not installed
   bool running = false;
+  std::string kept;  // "" when none is kept
   bool operator==(const State& o) const {
     return version == o.version && (version.empty() || running == o.running);
   }
@@ -69,13 +73,21 @@ int Apply(Op op, State* s) {
     case Op::kInstall:
     case Op::kUpgrade:
       // A fresh install does not start the package; a reinstall or upgrade
-      // runs it again when it ran.
+      // runs it again when it ran, and keeps the version it replaced.
       s->running = !s->version.empty() && s->running;
+      s->kept = s->version;
       s->version = op == Op::kInstall ? "1.0" : "2.0";
       return PKG_OK;
     case Op::kUninstall:
       if (s->version.empty()) return PKG_ERR_NOT_INSTALLED;
       *s = State();
+      return PKG_OK;
+    case Op::kRollback:
+      // Back to the kept version, which runs when the package ran; the
+      // version left is kept in turn.
+      if (s->version.empty()) return PKG_ERR_NOT_INSTALLED;
+      if (s->kept.empty()) return PKG_ERR_NO_REVISION;
+      std::swap(s->version, s->kept);
       return PKG_OK;
     case Op::kStart:
     case Op::kStop:
@@ -87,15 +99,16 @@ int Apply(Op op, State* s) {
 }
 
 // True when running `first` then `second` on `before` gives the results
-// seen and ends in `after`. A busy answer changes nothing.
+// seen and ends in `after` (with the same kept version when `with_kept`). A
+// busy answer changes nothing.
 bool Explains(const State& before, Op first, int first_result, Op second, int second_result,
-              const State& after) {
+              const State& after, bool with_kept = false) {
   State s = before;
   for (auto step : {std::make_pair(first, first_result), std::make_pair(second, second_result)}) {
     if (step.second == PKG_ERR_BUSY) continue;
     if (Apply(step.first, &s) != step.second) return false;
   }
-  return s == after;
+  return s == after && (!with_kept || s.kept == after.kept);
 }
 
 // A daemon tracked by its pid file whose scripts take a while when the
@@ -210,7 +223,7 @@ class ConcurrencyTest : public ::testing::Test {
       for (const char* version : {"1.0", "2.0"})
         files_[id][version] = SlowPackage(id, version).Build(dir_);
     }
-    Reach(kBystander, State{"1.0", true});
+    Reach(kBystander, State{"1.0", true, ""});
     bystander_record_ = Link(root_.Path("/var/packages/") + kBystander);
   }
   void TearDown() override {
@@ -241,6 +254,16 @@ class ConcurrencyTest : public ::testing::Test {
     return s;
   }
 
+  // The version of `id` an upgrade kept, as kivoctl revisions names it; ""
+  // when none is.
+  std::string Kept(const std::string& id) {
+    std::string out;
+    if (Kivoctl({"revisions", id}, &out) != 0) return "";
+    const std::string head = id + " ";
+    if (out.compare(0, head.size(), head) != 0) return "";
+    return out.substr(head.size(), out.find(' ', head.size()) - head.size());
+  }
+
   // Brings `id` to `want` with quick scripts, through kivoctl.
   void Reach(const std::string& id, const State& want) {
     State now = Now(id);
@@ -266,7 +289,7 @@ class ConcurrencyTest : public ::testing::Test {
       return std::find(ops_on_it.begin(), ops_on_it.end(), op) != ops_on_it.end();
     };
     if (has(Op::kInstall)) return State();
-    return State{"1.0", !has(Op::kStart)};
+    return State{"1.0", !has(Op::kStart), ""};
   }
 
   // Every package whole: its published name a link to a complete record of
@@ -295,10 +318,25 @@ class ConcurrencyTest : public ::testing::Test {
       State s = Now(name);
       listed.insert(name + " " + s.version + (s.running ? " running" : " stopped"));
     }
+    // Earlier versions that upgrades kept keep their records and payloads,
+    // and their copies of data are all that stays in the copies' folder.
+    const std::string copies = root_.Path("/volume1/@appdata/.snapshots");
+    for (const std::string& id : ListDir(copies)) {
+      for (const std::string& name : ListDir(copies + "/" + id)) {
+        const size_t suffix = name.rfind(".kept");
+        ASSERT_EQ(name.size() - 5, suffix) << "a copy left: " << id << "/" << name;
+        const std::string record = name.substr(0, suffix);
+        EXPECT_TRUE(KLIBCFileExist((reg + "/.records/" + record + "/INFO").c_str())) << record;
+        records.insert(record);
+        const std::string target = Link(reg + "/.records/" + record + "/target");
+        payloads.insert(target.substr(target.rfind('/') + 1));
+      }
+    }
     EXPECT_EQ(records, ListDir(reg + "/.records")) << "orphaned records";
     EXPECT_EQ(payloads, ListDir(root_.Path("/volume1/@appstore"))) << "orphaned payloads";
     std::set<std::string> data;
     for (const std::string& line : listed) data.insert(line.substr(0, line.find(' ')));
+    if (!ListDir(copies).empty()) data.insert(".snapshots");
     EXPECT_EQ(data, ListDir(root_.Path("/volume1/@appdata"))) << "data folders";
     std::string out;
     ASSERT_EQ(0, Kivoctl({"list"}, &out)) << out;
@@ -307,7 +345,7 @@ class ConcurrencyTest : public ::testing::Test {
       lines.insert(out.substr(at, nl - at));
     EXPECT_EQ(listed, lines) << "kivoctl list";
     EXPECT_EQ(bystander_record_, Link(reg + "/" + kBystander)) << "the bystander was touched";
-    EXPECT_TRUE(Now(kBystander) == (State{"1.0", true})) << Describe(Now(kBystander));
+    EXPECT_TRUE(Now(kBystander) == (State{"1.0", true, ""})) << Describe(Now(kBystander));
   }
 
   // Readies operation `index` (0 or 1) of a pair before the pair starts.
@@ -374,7 +412,7 @@ class KivoctlConcurrencyTest : public ConcurrencyTest {
     std::vector<std::string> args;
     if (op == Op::kInstall || op == Op::kUpgrade) {
       args = {"install", files_[id][op == Op::kInstall ? "1.0" : "2.0"]};
-    } else {
+    } else {  // uninstall, start, stop, rollback
       args = {Name(op), id};
     }
     return ToolResult(Kivoctl(args, &out), out);
@@ -396,6 +434,39 @@ TEST_F(KivoctlConcurrencyTest, PairsOnTwoPackages) {
 TEST_F(KivoctlConcurrencyTest, PairsWhoseLoserIsBusy) {
   LockWait(0);
   EXPECT_GT(Matrix(true), 0);
+}
+
+// A rollback and another operation of the same package at once, from 2.0
+// running with 1.0 kept: they run one after the other, each answer and the
+// package's version, run state and kept version as one of the two orders
+// explains, the registry whole.
+TEST_F(KivoctlConcurrencyTest, RollbackBesideEachOperationOnOnePackage) {
+  LockWait(3);
+  for (Op other : {Op::kUpgrade, Op::kUninstall, Op::kStart, Op::kStop, Op::kRollback}) {
+    Slow(false);
+    std::string out;
+    if (PackageRegistry::IsInstalled(kFirst)) {
+      ASSERT_EQ(0, Kivoctl({"uninstall", kFirst}, &out)) << out;
+    }
+    ASSERT_EQ(0, Kivoctl({"install", files_[kFirst]["1.0"]}, &out)) << out;
+    ASSERT_EQ(0, Kivoctl({"start", kFirst}, &out)) << out;
+    ASSERT_EQ(0, Kivoctl({"install", files_[kFirst]["2.0"]}, &out)) << out;
+    const State before{"2.0", true, "1.0"};
+    ASSERT_TRUE(Now(kFirst) == before && Kept(kFirst) == "1.0") << Describe(Now(kFirst));
+    Slow(true);
+    auto r =
+        RunTogether([this](int index, Op op, const std::string& id) { return Run(index, op, id); },
+                    Op::kRollback, kFirst, other, kFirst);
+    State after = Now(kFirst);
+    after.kept = Kept(kFirst);
+    const std::string context = std::string("rollback with ") + Name(other) + ": results " +
+                                std::to_string(r.first) + ", " + std::to_string(r.second);
+    EXPECT_TRUE(Explains(before, Op::kRollback, r.first, other, r.second, after, true) ||
+                Explains(before, other, r.second, Op::kRollback, r.first, after, true))
+        << context << " left " << Describe(after) << ", kept " << after.kept;
+    ExpectRegistryWhole(context);
+    if (HasFatalFailure()) return;
+  }
 }
 
 // Two uninstalls of one package 0.3 s apart, the first held up in a slow
@@ -462,6 +533,8 @@ class HostConcurrencyTest : public ConcurrencyTest {
       case Op::kStop:
         return ToolCode(op, client_->Call("KIVO.Core.Package.Control", Name(op), 1,
                                           {{"id", "[\"" + id + "\"]"}}));
+      case Op::kRollback:
+        break;  // not among the pairs the host runs
     }
     return -1;
   }

@@ -58,14 +58,17 @@ class CrashTest : public ::testing::TestWithParam<const char*> {
     EXPECT_EQ(version.substr(0, 1) + "\n", Data());
   }
 
-  // Another operation recovers: nothing is left that no package owns.
+  // Another operation recovers: nothing is left that no package owns; only
+  // kept earlier versions (each with its record and payload) stay besides
+  // the installed packages.
   void ExpectRecoveredByNextOperation() {
     std::string out;
     ASSERT_EQ(0, Kivoctl({"install", other_.Build(dir_)}, &out)) << out;
-    EXPECT_FALSE(KLIBCFileExist(root_.Path("/volume1/@appdata/.snapshots").c_str()));
+    const DataCopies copies = ListDataCopies(root_.Path("/volume1/@appdata/.snapshots"));
+    EXPECT_EQ(copies.kept, copies.entries.size()) << "copies left: " << copies.entries.size();
     for (const char* dir : {"/var/packages/.records", "/volume1/@appstore"}) {
       RunProgram({"ls", "-A", root_.Path(dir)}, &out);
-      EXPECT_EQ(PackageRegistry::List().size(),
+      EXPECT_EQ(PackageRegistry::List().size() + copies.kept,
                 static_cast<size_t>(std::count(out.begin(), out.end(), '\n')))
           << dir << ":\n"
           << out;
@@ -149,6 +152,40 @@ TEST_P(RestoreCrashTest, FailedUpgrade) {
 INSTANTIATE_TEST_SUITE_P(Steps, RestoreCrashTest, ::testing::ValuesIn(kRestoreSteps));
 
 INSTANTIATE_TEST_SUITE_P(Steps, InstallCrashTest, ::testing::ValuesIn(kInstallSteps));
+
+// The steps of a rollback to the version an upgrade kept.
+const char* const kRollbackSteps[] = {"rollback_begun", "rollback_data_kept", "rollback_published",
+                                      "rollback_done"};
+
+class RollbackCrashTest : public CrashTest {};
+
+TEST_P(RollbackCrashTest, Rollback) {
+  const std::string step = GetParam();
+  std::string out;
+  ASSERT_EQ(0, Kivoctl({"install", v1_.Build(dir_), "--run"}, &out)) << out;
+  ASSERT_EQ(0, Kivoctl({"install", v2_.Build(dir_)}, &out)) << out;
+  ExpectWholeWithData("2.0");
+  CrashAt(step.c_str(), {"rollback", "test-app"});
+  if (step == "rollback_begun") {
+    ExpectWholeWithData("2.0");
+  } else if (step == "rollback_done") {
+    ExpectWholeWithData("1.0");
+  } else {
+    // Between the moves of the data folder it is away; the next operation
+    // puts the kept copy in its place.
+    ExpectWhole(step == "rollback_published" ? "1.0" : "2.0");
+    EXPECT_EQ("", Data());
+  }
+  ExpectRecoveredByNextOperation();
+  ExpectWholeWithData("1.0");
+  Kivoctl({"status", "test-app"}, &out);
+  EXPECT_EQ(step == "rollback_done" ? "test-app 1.0 running\n" : "test-app 1.0 stopped\n", out);
+  // What 2.0 wrote was kept: a second rollback undoes the first.
+  ASSERT_EQ(0, Kivoctl({"rollback", "test-app"}, &out)) << out;
+  ExpectWholeWithData("2.0");
+}
+
+INSTANTIATE_TEST_SUITE_P(Steps, RollbackCrashTest, ::testing::ValuesIn(kRollbackSteps));
 
 class UninstallCrashTest : public CrashTest {};
 

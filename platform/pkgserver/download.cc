@@ -193,14 +193,13 @@ bool IsInstalling(const std::string& name) {
   return data.isObject() && data["pid"].isInt() && KLIBCProcAlive(data["pid"].asInt()) == 1;
 }
 
-bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const std::string& link,
-                  const std::string& folder, bool quickInstall, pid_t pid, PMSOriginChange change) {
-  if (!task) return false;
+Json::Value NewDownloadData(const std::string& taskId, const std::string& name, uint64_t size,
+                            const std::string& link, const std::string& folder, bool quickInstall,
+                            PMSOriginChange change) {
   Json::Value data(Json::objectValue);
   data["id"] = name;
   data["name"] = name;
-  data["taskid"] = task->getTaskId();
-  data["pid"] = static_cast<int>(pid);
+  data["taskid"] = taskId;
   data["link"] = link;
   data["size"] = static_cast<Json::UInt64>(size);
   data["tmp_folder"] = folder;
@@ -208,6 +207,15 @@ bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const
   if (change == PMSOriginChange::kAllow) data["switch_origin"] = true;
   data["installing"] = false;
   data["status"] = "downloading";
+  return data;
+}
+
+bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const std::string& link,
+                  const std::string& folder, bool quickInstall, pid_t pid, PMSOriginChange change) {
+  if (!task) return false;
+  Json::Value data =
+      NewDownloadData(task->getTaskId(), name, size, link, folder, quickInstall, change);
+  data["pid"] = static_cast<int>(pid);
   return task->setFinishValue(false) && WriteTaskData(task, data, 0.0);
 }
 

@@ -49,6 +49,12 @@ namespace KIVOPackageServer {
 // worker lives.
 bool IsInstalling(const std::string& name);
 
+// The "data" above of a new download in task `taskId`, with "status"
+// "downloading", before its worker has a "pid".
+Json::Value NewDownloadData(const std::string& taskId, const std::string& name, uint64_t size,
+                            const std::string& link, const std::string& folder, bool quickInstall,
+                            PMSOriginChange change);
+
 // Records a new download in `task`: the "data" above with "status"
 // "downloading", "progress" 0, not finished. `change` kAllow records that
 // the install may switch the package's origin. False when the task cannot be

@@ -13,6 +13,7 @@
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/revisions.h"
 #include "pkgtool/upgrade_recovery.h"
 #include "taskmgr/task.h"
 #include "taskmgr/task_names.h"
@@ -202,6 +203,8 @@ int PackageManager::RemovePackage(const std::string& id, const PackageInfo& info
   // The package is uninstalled from here on; what follows cannot undo that.
   if (!PMSRunPackageScript(record, "postuninst", "", env, op)) op.Log("postuninst failed");
   if (!RemoveUnpublished(record, op)) op.Log("uninstalled; some of its files stay");
+  // Its kept earlier versions go with it: no rollback can reach them now.
+  if (!PMSTrimRevisions(id, 0)) op.Log("uninstalled; some of its earlier versions stay");
   PMSFaultPoint("uninstall_done");
   return PKG_OK;
 }

@@ -30,14 +30,6 @@ void SyncDir(const std::string& dir) {
 
 std::string Parent(const std::string& path) { return path.substr(0, path.rfind('/')); }
 
-// Renames `from` to `to` and makes the change durable in both folders.
-bool Move(const std::string& from, const std::string& to) {
-  if (rename(from.c_str(), to.c_str()) != 0) return false;
-  SyncDir(Parent(to));
-  if (Parent(from) != Parent(to)) SyncDir(Parent(from));
-  return true;
-}
-
 // Removes the copies' folders of `s` that hold nothing any more.
 void RemoveEmptyFolders(const DataSnapshot& s) {
   rmdir(s.folder().c_str());
@@ -51,15 +43,15 @@ std::string Because(const std::string& what) { return what + " (" + strerror(err
 RestoreState PutCopyBack(const DataSnapshot& s, std::string* error) {
   const std::string data = s.data_dir(), aside = s.Named(".replaced");
   const bool aside_before = Exists(aside);
-  if (!aside_before && Exists(data) && !Move(data, aside)) {
+  if (!aside_before && Exists(data) && !PMSRenameDurably(data, aside)) {
     *error = Because("cannot move the data folder aside");
     return RestoreState::kUntouched;
   }
   PMSFaultPoint("restore_half_done");
-  if (Move(s.copy(), data)) return RestoreState::kRestored;
+  if (PMSRenameDurably(s.copy(), data)) return RestoreState::kRestored;
   *error = Because("cannot move the copy of the data into place");
   if (!Exists(aside)) return RestoreState::kUntouched;  // there was no data folder to move
-  return Move(aside, data) ? RestoreState::kUntouched : RestoreState::kDataAside;
+  return PMSRenameDurably(aside, data) ? RestoreState::kUntouched : RestoreState::kDataAside;
 }
 
 bool PublishAgain(const DataSnapshot& s, std::string* error) {
@@ -71,6 +63,13 @@ bool PublishAgain(const DataSnapshot& s, std::string* error) {
 }
 
 }  // namespace
+
+bool PMSRenameDurably(const std::string& from, const std::string& to) {
+  if (rename(from.c_str(), to.c_str()) != 0) return false;
+  SyncDir(Parent(to));
+  if (Parent(from) != Parent(to)) SyncDir(Parent(from));
+  return true;
+}
 
 DataSnapshot::DataSnapshot(std::string appdata, std::string id, std::string record)
     : appdata_(std::move(appdata)), id_(std::move(id)), record_(std::move(record)) {}
@@ -105,7 +104,7 @@ TreeCopyResult PMSTakeSnapshot(const DataSnapshot& s, std::string* error) {
     return TreeCopyResult::kFailed;
   }
   TreeCopyResult result = PMSCopyTree(s.data_dir(), partial, error);
-  if (result == TreeCopyResult::kCopied && !Move(partial, s.copy())) {
+  if (result == TreeCopyResult::kCopied && !PMSRenameDurably(partial, s.copy())) {
     *error = Because("cannot complete the copy");
     result = TreeCopyResult::kFailed;
   }
@@ -123,7 +122,7 @@ bool PMSDiscardSnapshot(const DataSnapshot& s) {
     errno = EINVAL;
     return false;
   }
-  if (!Move(s.copy(), gone)) return false;
+  if (!PMSRenameDurably(s.copy(), gone)) return false;
   static_cast<void>(PMSRemoveTree(s.folder(), gone));
   RemoveEmptyFolders(s);
   return true;

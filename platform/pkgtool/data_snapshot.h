@@ -10,6 +10,11 @@
 //                                                   left it, moved aside by
 //                                                   a restore under way
 //   <volume>/@appdata/.snapshots/<id>/<R>.discard   a copy being removed
+//   <volume>/@appdata/.snapshots/<id>/<R>.kept      D as version R left it, kept
+//                                                   after a confirmed upgrade
+//                                                   (revisions.h)
+//   <volume>/@appdata/.snapshots/<id>/<R>.back      the same, while a rollback
+//                                                   to R is under way (rollback.h)
 //
 // <R> is the record name ("<id>.<nonce>", registry.h) of the version being
 // replaced. ".snapshots" is never a package's data folder: ids start with a
@@ -56,6 +61,10 @@ class DataSnapshot {
  private:
   std::string appdata_, id_, record_;
 };
+
+// Renames `from` to `to` and makes the change durable in both folders: the
+// names of the copies are journals. False (errno set) when it failed.
+[[nodiscard]] bool PMSRenameDurably(const std::string& from, const std::string& to);
 
 // "<appdata>/.snapshots", the folder of every package's copies on a volume.
 // It exists only while a copy is in it.

@@ -32,6 +32,7 @@
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/revisions.h"
 #include "pkgtool/signature.h"
 #include "storage/volume_space.h"
 
@@ -243,6 +244,9 @@ class Installer {
   // An upgraded package that ran (or was asked to) starts and must pass
   // the health gate; one that was stopped is judged by its scripts alone.
   int StartUpgraded(const PackageInfo& info, Staging* s);
+  // The commit of an upgrade that copied the data: the copy becomes the old
+  // version's kept revision, or is dropped when keep_revisions is 0.
+  [[nodiscard]] bool ConfirmUpgrade();
   [[nodiscard]] bool RemoveOldVersion();
 
   const InstallJob& job_;
@@ -255,6 +259,7 @@ class Installer {
   bool new_started_ = false;                // the new version was started: a restore stops it first
   std::unique_ptr<DataSnapshot> snapshot_;  // the planned copy of the data; null for none
   bool copy_taken_ = false;
+  bool old_kept_ = false;  // the old version stays as a kept revision (revisions.h)
   PackageInfo old_;
   std::string old_record_;
   std::string id_;
@@ -550,7 +555,7 @@ int Installer::Finish(const PackageInfo& info, Staging* s) {
     int code = StartUpgraded(info, s);
     if (code != PKG_OK) return code;
     // The commit of the upgrade: from here on the new version stays.
-    if (copy_taken_ && !PMSDiscardSnapshot(*snapshot_)) {
+    if (copy_taken_ && !ConfirmUpgrade()) {
       return RestoreAfterFailure(info, s,
                                  std::string("could not be confirmed (") + strerror(errno) + ")");
     }
@@ -562,9 +567,15 @@ int Installer::Finish(const PackageInfo& info, Staging* s) {
   if (started && !KIVOWriteFileAtomic(s->record + "/enabled", "", SyncToDisk::No)) {
     op_->Log("started, but cannot record that the package is meant to run");
   }
-  // The old version's record and files are no longer reachable; what cannot
-  // be removed now, the next operation's clean-up removes.
-  if (upgrade_ && !RemoveOldVersion()) op_->Log("some files of the previous version stay");
+  // Unless it is kept, the old version's record and files are no longer
+  // reachable; what cannot be removed now, the next operation's clean-up
+  // removes.
+  if (upgrade_ && !old_kept_ && !RemoveOldVersion()) {
+    op_->Log("some files of the previous version stay");
+  }
+  if (upgrade_ && !PMSTrimRevisions(id_, PMSKeepRevisionsSetting())) {
+    op_->Log("some earlier versions beyond keep_revisions stay until the next operation");
+  }
   PMSFaultPoint("done");
   return PKG_OK;
 }
@@ -579,6 +590,13 @@ int Installer::StartUpgraded(const PackageInfo& info, Staging* s) {
   HealthVerdict verdict = PMSHealthGate(id_, info, s->record, env, *op_);
   if (verdict == HealthVerdict::kHealthy) return PKG_OK;
   return RestoreAfterFailure(info, s, PMSHealthVerdictText(verdict, PMSHealthLimits(info)));
+}
+
+bool Installer::ConfirmUpgrade() {
+  if (PMSKeepRevisionsSetting() == 0) return PMSDiscardSnapshot(*snapshot_);
+  old_kept_ = PMSKeepAsRevision(*snapshot_, snapshot_->copy());
+  if (old_kept_) op_->Log(old_.getVersion() + " and its data are kept: a rollback returns to them");
+  return old_kept_;
 }
 
 bool Installer::RemoveOldVersion() {

@@ -4,10 +4,11 @@
 // changing operations leave an operation log (getLogFilePath) and worker
 // messages (getJsonParam("worker_msg")) for the caller to read and delete.
 //
-// Changing operations (install, upgrade, uninstall, start, stop) take the
-// tool's exclusive lock; when another operation holds it past a short wait
-// they fail with 275 instead of waiting. They first remove what an
-// interrupted operation left behind (see registry.h).
+// Changing operations (install, upgrade, uninstall, start, stop, rollback,
+// dropping kept versions) take the tool's exclusive lock; when another
+// operation holds it past a short wait they fail with 275 instead of
+// waiting. They first remove what an interrupted operation left behind (see
+// registry.h).
 #pragma once
 
 #include <cstdint>
@@ -126,6 +127,15 @@ class PackageManager {
   [[nodiscard]] bool uninstall(const std::string& id, const Json::Value* wizardValues,
                                const std::string& language, int opType, bool force,
                                const std::string& user);
+
+  // Rolls `id` back to its most recently replaced kept version, with that
+  // version's data; the data the installed version wrote is kept in turn,
+  // so a second rollback undoes the first (rollback.h). 309 when no
+  // version is kept; the log says what happened in words.
+  [[nodiscard]] bool rollback(const std::string& id, const std::string& user);
+  // Removes the kept versions of `id` with their data (revisions.h); 309
+  // when none is kept. The log names each with the room it took.
+  [[nodiscard]] bool dropRevisions(const std::string& id);
 
   // The tool's exclusive lock, waiting at most `seconds`. False when another
   // process holds it.

@@ -84,6 +84,8 @@ const char* PMSResultText(int code) {
       return "not enough space for a safety copy of the package's data";
     case PKG_ERR_DATA_NOT_COPYABLE:
       return "the package's data cannot be copied safely";
+    case PKG_ERR_NO_REVISION:
+      return "no earlier version of the package is kept";
   }
   return "unknown result";
 }

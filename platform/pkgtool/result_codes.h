@@ -50,6 +50,9 @@ enum PKG_ERRCODE {
   // an upgrade whose package data holds what cannot be copied safely (a
   // fifo, a socket, a device, an unreadable file, a symlink leading out)
   PKG_ERR_DATA_NOT_COPYABLE = 308,
+  // a rollback, or the removal of a kept version, when no earlier version
+  // of the package is kept
+  PKG_ERR_NO_REVISION = 309,
 };
 
 // A short English text for a code, for logs and the command line.

@@ -10,6 +10,8 @@
 #include "pkgtool/lifecycle.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/revisions.h"
+#include "pkgtool/rollback.h"
 #include "storage/volumes.h"
 
 namespace {
@@ -25,26 +27,38 @@ bool EndsWith(const std::string& text, const std::string& end) {
 
 // One package's entries in its copies' folder, sorted by what they are.
 struct PackageCopies {
-  std::set<std::string> whole;     // records R with a copy <R>
-  std::set<std::string> restores;  // records R with a <R>.replaced: a restore under way
-  std::vector<std::string> junk;   // incomplete or discarded copies, anything else
+  std::set<std::string> whole;      // records R with a copy <R>
+  std::set<std::string> restores;   // records R with a <R>.replaced: a restore under way
+  std::set<std::string> kept;       // records R with a <R>.kept: kept revisions (revisions.h)
+  std::set<std::string> rollbacks;  // records R with a <R>.back: a rollback under way
+  std::vector<std::string> junk;    // incomplete or discarded copies, anything else
 };
 
 PackageCopies SortCopies(const std::string& id, const std::string& folder) {
   PackageCopies copies;
-  const std::string replaced = ".replaced";
+  const std::pair<std::string, std::set<std::string>*> kinds[] = {
+      {".replaced", &copies.restores},
+      {kPMSKeptSuffix, &copies.kept},
+      {kPMSRollbackSuffix, &copies.rollbacks}};
   for (const std::string& name : PMSListDir(folder)) {
     // Only a folder can be a copy: a symlink put here must never be moved
     // into a data folder's place.
     const bool folder_entry = IsFolder(folder + "/" + name);
-    const std::string record =
-        EndsWith(name, replaced) ? name.substr(0, name.size() - replaced.size()) : name;
+    std::string record = name;
+    std::set<std::string>* into = &copies.whole;
+    for (const auto& kind : kinds) {
+      if (EndsWith(name, kind.first)) {
+        record = name.substr(0, name.size() - kind.first.size());
+        into = kind.second;
+        break;
+      }
+    }
     const bool named = !EndsWith(record, ".copying") && !EndsWith(record, ".discard") &&
                        PackageRegistry::IsRecordNameOf(id, ".records/" + record);
     if (!folder_entry || !named) {
       copies.junk.push_back(name);
     } else {
-      (record == name ? copies.whole : copies.restores).insert(record);
+      into->insert(record);
     }
   }
   return copies;
@@ -77,6 +91,11 @@ bool StopPublished(const std::string& id) {
 bool RemoveOthers(const std::string& folder, const PackageCopies& copies,
                   const std::string& record) {
   bool ok = true;
+  // A rollback of a package that is no longer installed has nothing to
+  // finish.
+  for (const std::string& r : copies.rollbacks) {
+    ok &= PMSRemoveTree(folder, folder + "/" + r + kPMSRollbackSuffix);
+  }
   for (const std::string& name : copies.junk) ok &= PMSRemoveTree(folder, folder + "/" + name);
   for (const std::string& r : copies.whole) {
     if (r != record) ok &= PMSRemoveTree(folder, folder + "/" + r);
@@ -112,18 +131,76 @@ bool Restore(const DataSnapshot& s) {
   return false;
 }
 
+// Finishes the rollback under way in `copies` (the first; any other is
+// junk). False when it stays to be done: then every record a copy names
+// must stay.
+bool FinishRollback(const std::string& appdata, const std::string& id, const std::string& folder,
+                    const PackageCopies& copies) {
+  const std::string record = *copies.rollbacks.begin();
+  bool ok = true;
+  for (const std::string& r : copies.rollbacks) {
+    if (r != record) ok &= PMSRemoveTree(folder, folder + "/" + r + kPMSRollbackSuffix);
+  }
+  if (!StopPublished(id)) {
+    syslog(LOG_ERR, "pkgtool: %s: an interrupted rollback cannot be finished yet: it does not stop",
+           id.c_str());
+    return false;
+  }
+  std::string error;
+  if (PMSFinishRollback(DataSnapshot(appdata, id, record), &error) != RollbackState::kDone) {
+    syslog(LOG_ERR, "pkgtool: %s: an interrupted rollback cannot be finished yet: %s", id.c_str(),
+           error.c_str());
+    return false;
+  }
+  syslog(LOG_NOTICE, "pkgtool: %s: an interrupted rollback was finished; %s is back with its data",
+         id.c_str(), record.c_str());
+  return ok;
+}
+
+// Keeps the kept revisions that are whole (their records go into `kept`)
+// and removes the others; a package that is not installed keeps none.
+bool SortOutRevisions(const std::string& appdata, const std::string& id, const std::string& folder,
+                      const std::set<std::string>& revisions, std::set<std::string>* kept) {
+  bool ok = true;
+  for (const std::string& r : revisions) {
+    PMSRevision revision;
+    if (!PackageRegistry::PublishedRecord(id).empty() &&
+        PMSReadRevision(appdata, id, r, &revision)) {
+      if (kept) kept->insert(r);
+    } else {
+      ok &= PMSRemoveTree(folder, folder + "/" + r + kPMSKeptSuffix);
+    }
+  }
+  return ok;
+}
+
 bool RecoverPackage(const std::string& appdata, const std::string& id,
                     std::set<std::string>* kept) {
   const std::string folder = PMSSnapshotsDir(appdata) + "/" + id;
   if (!IsFolder(folder)) return PMSRemoveTree(PMSSnapshotsDir(appdata), folder);
-  const PackageCopies copies = SortCopies(id, folder);
+  PackageCopies copies = SortCopies(id, folder);
+  bool ok = true;
+  if (!copies.rollbacks.empty() && !PackageRegistry::PublishedRecord(id).empty()) {
+    if (!FinishRollback(appdata, id, folder, copies)) {
+      // Half way, the data of a version may lie in any of the copies: all
+      // stay, with the records they name, for the next try.
+      if (kept) {
+        for (const auto* names : {&copies.rollbacks, &copies.kept, &copies.whole}) {
+          kept->insert(names->begin(), names->end());
+        }
+      }
+      return false;
+    }
+    copies = SortCopies(id, folder);
+  }
   const std::string published = PackageRegistry::PublishedRecord(id);
   const std::string record = published.empty() ? "" : ChooseRecord(copies, published);
-  bool ok = RemoveOthers(folder, copies, record);
+  ok &= RemoveOthers(folder, copies, record);
   if (!record.empty() && !Restore(DataSnapshot(appdata, id, record))) {
     if (kept) kept->insert(record);
     ok = false;
   }
+  ok &= SortOutRevisions(appdata, id, folder, copies.kept, kept);
   rmdir(folder.c_str());  // only when nothing stays in it
   return ok;
 }

@@ -1,7 +1,8 @@
 // The SQLite functions the task store uses, loaded from libsqlite3 on first
 // use. Every web API request is a new process, and Debian's libsqlite3
 // binds some 1600 symbols when it is loaded; most requests never open the
-// task store. Internal to platform/taskmgr.
+// task store. Internal to the platform libraries that keep a database
+// (platform/taskmgr, platform/activity).
 #pragma once
 
 #include <sqlite3.h>

@@ -10,6 +10,8 @@ namespace WebAPIName {
 inline constexpr char kInfo[] = "KIVO.API.Info";
 inline constexpr char kAuth[] = "KIVO.API.Auth";
 inline constexpr char kUserSettings[] = "KIVO.API.UserSettings";
+// The activity log, beside the module's APIs (host/activity_api.h).
+inline constexpr char kActivity[] = "KIVO.Core.Package.Activity";
 
 // Served by the package center's module.
 inline constexpr char kPackage[] = "KIVO.Core.Package";

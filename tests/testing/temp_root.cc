@@ -21,6 +21,32 @@ int CountEntries(const std::string& dir, const std::string& prefix) {
   return n;
 }
 
+DataCopies ListDataCopies(const std::string& snapshots_dir) {
+  DataCopies copies;
+  const std::string kept = ".kept";
+  DIR* d = opendir(snapshots_dir.c_str());
+  if (!d) return copies;
+  while (dirent* e = readdir(d)) {
+    const std::string id = e->d_name;
+    if (id == "." || id == "..") continue;
+    DIR* inner = opendir((snapshots_dir + "/" + id).c_str());
+    if (!inner) {
+      copies.entries.push_back(id);
+      continue;
+    }
+    while (dirent* c = readdir(inner)) {
+      const std::string name = c->d_name;
+      if (name == "." || name == "..") continue;
+      copies.entries.push_back(id + "/" + name);
+      copies.kept += name.size() > kept.size() &&
+                     name.compare(name.size() - kept.size(), kept.size(), kept) == 0;
+    }
+    closedir(inner);
+  }
+  closedir(d);
+  return copies;
+}
+
 std::string FileText(const std::string& path) {
   std::string text;
   return KIVOReadFile(path, &text) ? text : "";

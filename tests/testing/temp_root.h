@@ -28,6 +28,17 @@ class TempRoot {
 // the folder cannot be read): what an operation left behind.
 int CountEntries(const std::string& dir, const std::string& prefix);
 
+// What the package tool's data copies folder of a volume holds
+// ("<root>/<volume>/@appdata/.snapshots"): every entry as "<id>/<name>",
+// and how many of them are kept earlier versions ("<record>.kept"), each of
+// which keeps its record and payload too. An upgrade or a rollback that
+// ended leaves nothing else there.
+struct DataCopies {
+  std::vector<std::string> entries;
+  size_t kept = 0;
+};
+DataCopies ListDataCopies(const std::string& snapshots_dir);
+
 // The whole content of file `path`; "" when it cannot be read.
 std::string FileText(const std::string& path);
 

@@ -8,6 +8,7 @@
 //                                      [--allow-private-image-addresses yes|no]
 //   kivoctl build|sign|inspect|index|icon ...  (package authors)
 //   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
+//   kivoctl [--root DIR] rollback|revisions|drop-revision ID
 //   kivoctl [--root DIR] auto-update [--dry-run]
 
 #include <cstdio>
@@ -18,6 +19,7 @@
 #include <vector>
 
 #include "accounts/accounts.h"
+#include "activity/command_record.h"
 #include "host/host_config.h"
 #include "klibc/atomic_file.h"
 #include "klibc/key_value_file.h"
@@ -79,6 +81,12 @@ const char kUsage[] =
     "  start ID | stop ID | status ID     control a package\n"
     "  list                               installed packages\n"
     "  log ID                             the package's own log\n"
+    "  rollback ID                        go back to the version an upgrade replaced,\n"
+    "                                     with its data; the data of the version left\n"
+    "                                     is kept, so a second rollback undoes it\n"
+    "  revisions ID                       the kept earlier version: when it was\n"
+    "                                     replaced and the room its copy takes\n"
+    "  drop-revision ID                   remove the kept earlier version and its data\n"
     "  auto-update [--dry-run]            upgrade the packages the automatic-update\n"
     "                                     settings choose (--dry-run: only say what)\n"
     "\n"
@@ -200,6 +208,9 @@ int WebConfig(const std::vector<std::string>& args) {
 
 }  // namespace
 
+// Runs `command` with `args`; its exit status.
+int RunCommand(const std::string& command, const std::vector<std::string>& args);
+
 int main(int argc, char** argv) {
   std::vector<std::string> args(argv + 1, argv + argc);
   if (args.size() >= 2 && args[0] == "--root") {
@@ -212,6 +223,15 @@ int main(int argc, char** argv) {
   }
   std::string command = args[0];
   args.erase(args.begin());
+  // Changing commands are on record before they start: one killed half way
+  // is left unfinished in the activity log.
+  KivoActivity::CommandRecord record(command, args);
+  int status = RunCommand(command, args);
+  record.Finish(status);
+  return status;
+}
+
+int RunCommand(const std::string& command, const std::vector<std::string>& args) {
   if (command == "init-root") return InitRoot(args);
   if (command == "user-add") return UserAdd(args);
   if (command == "web-config") return WebConfig(args);
@@ -228,6 +248,9 @@ int main(int argc, char** argv) {
   if (command == "status") return KivoctlStatus(args);
   if (command == "list") return KivoctlList(args);
   if (command == "log") return KivoctlLog(args);
+  if (command == "rollback") return KivoctlRollback(args);
+  if (command == "revisions") return KivoctlRevisions(args);
+  if (command == "drop-revision") return KivoctlDropRevision(args);
   if (command == "auto-update") return KivoctlAutoUpdate(args);
   if (command == "install-server") return KivoctlInstallServer(args);
   std::cerr << kUsage;

@@ -10,6 +10,7 @@
 #include "pkgtool/package_file.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
+#include "pkgtool/revisions.h"
 #include "pkgtool/signature.h"
 
 namespace {
@@ -206,4 +207,36 @@ int KivoctlLog(const std::vector<std::string>& args) {
   if (pm.getResult() == PKG_ERR_NOT_INSTALLED) return Fail(args[0] + " is not installed");
   std::cout << (path.empty() ? "" : PMSReadPackageLog(path));
   return 0;
+}
+
+int KivoctlRollback(const std::vector<std::string>& args) {
+  if (args.size() != 1) return Usage("kivoctl rollback ID");
+  PackageManager pm;
+  if (!pm.init()) return Fail("the package registry cannot be read");
+  const char* user = getenv("USER");
+  return Report(pm, pm.rollback(args[0], user ? user : "root"), "rollback " + args[0]);
+}
+
+int KivoctlRevisions(const std::vector<std::string>& args) {
+  if (args.size() != 1) return Usage("kivoctl revisions ID");
+  PackageManager pm;
+  PackageInfo info;
+  if (!pm.init() || !pm.getPackageInfo(args[0], info)) {
+    return Fail(args[0] + ": " + PMSResultText(pm.getResult()) + " [" +
+                std::to_string(pm.getResult()) + "]");
+  }
+  const std::vector<PMSRevision> revisions = PMSListRevisions(args[0]);
+  if (revisions.empty()) std::cout << "no earlier version of " << args[0] << " is kept\n";
+  for (const PMSRevision& r : revisions) {
+    std::cout << args[0] << " " << r.version << " replaced " << PMSReplacedText(r.replaced)
+              << ", takes " << PMSRevisionBytes(r) << " bytes\n";
+  }
+  return 0;
+}
+
+int KivoctlDropRevision(const std::vector<std::string>& args) {
+  if (args.size() != 1) return Usage("kivoctl drop-revision ID");
+  PackageManager pm;
+  if (!pm.init()) return Fail("the package registry cannot be read");
+  return Report(pm, pm.dropRevisions(args[0]), "drop-revision " + args[0]);
 }

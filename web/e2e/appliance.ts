@@ -12,6 +12,9 @@ import { dirname, join, resolve } from 'node:path';
 
 export const kRepo = resolve(import.meta.dirname, '../..');
 export const kPassword = 'admin';
+// The build the appliances run: build/, or $BUILD_DIR as scripts/build.sh
+// takes it (relative to the checkout).
+export const kBuild = resolve(kRepo, process.env.BUILD_DIR ?? 'build');
 
 export function freePort(): Promise<number> {
   return new Promise((done, fail) => {
@@ -41,14 +44,19 @@ export class Appliance {
   private constructor(
     readonly root: string,
     readonly url: string,
+    // The port demo-web serves its own page on in this appliance.
+    readonly demoWebPort: number,
     private readonly server: ChildProcess,
   ) {}
 
   static async start(): Promise<Appliance> {
     const root = mkdtempSync(join(tmpdir(), 'kivo-page-'));
     const port = await freePort();
+    // demo-web gets a port of its own too, so that appliances of other test
+    // files, or a demo left running, never take it.
+    const demoWebPort = await freePort();
     execFileSync(join(kRepo, 'scripts/demo-root.sh'), [root, String(port)], {
-      env: { ...process.env, KIVO_DEMO_PASSWORD: kPassword },
+      env: { ...process.env, KIVO_DEMO_PASSWORD: kPassword, DEMO_WEB_PORT: String(demoWebPort) },
       stdio: ['ignore', 'ignore', 'inherit'],
     });
     const server = spawn('/usr/sbin/lighttpd', ['-D', '-f', join(root, 'lighttpd.conf')], {
@@ -57,27 +65,26 @@ export class Appliance {
     server.stderr?.on('data', (chunk: Buffer) => process.env.KIVO_E2E_VERBOSE && process.stderr.write(chunk));
     const url = `http://127.0.0.1:${port}/`;
     await waitForPage(url, server);
-    const appliance = new Appliance(root, url, server);
+    const appliance = new Appliance(root, url, demoWebPort, server);
     appliance.expectDemoRunning();
     return appliance;
   }
 
-  // The demo runs demo-web on the fixed port 8095, and demo-notes needs it:
-  // an appliance elsewhere on this machine holding that port (a demo left
-  // running) would leave both out and every test here failing for no
-  // visible reason, so say so at once.
+  // demo-web and demo-notes (which needs it) run from the start: if another
+  // program took demo-web's port between its choice and the start, every
+  // test here would fail for no visible reason, so say so at once.
   private expectDemoRunning(): void {
     const listed = this.kivoctl('list');
     for (const id of ['demo-web', 'demo-notes']) {
       if (!new RegExp(`^${id} .* running$`, 'm').test(listed)) {
-        throw new Error(`${id} does not run in the test appliance; is another demo holding port 8095?\n${listed}`);
+        throw new Error(`${id} does not run in the test appliance; is something else holding port ${this.demoWebPort}?\n${listed}`);
       }
     }
   }
 
   // Runs kivoctl on this appliance's root, e.g. kivoctl('status', 'demo-web').
   kivoctl(...args: string[]): string {
-    return execFileSync(join(kRepo, 'build/bin/kivoctl'), ['--root', this.root, ...args], { encoding: 'utf8' });
+    return execFileSync(join(kBuild, 'bin/kivoctl'), ['--root', this.root, ...args], { encoding: 'utf8' });
   }
 
   // Records that `account` agreed to the terms of service the demo's vendor

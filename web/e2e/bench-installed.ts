@@ -15,12 +15,12 @@ import { tmpdir } from 'node:os';
 import { join } from 'node:path';
 import { promisify } from 'node:util';
 import { createHash } from 'node:crypto';
-import { freePort, kRepo } from './appliance.ts';
+import { freePort, kBuild } from './appliance.ts';
 import type { Response } from 'playwright-core';
 import { launch, signIn } from './browser.ts';
 
 const kCount = Number(process.argv[2] ?? 300);
-const kKivoctl = join(kRepo, 'build/bin/kivoctl');
+const kKivoctl = join(kBuild, 'bin/kivoctl');
 const run = promisify(execFile);
 
 // A package source with nothing to run: the screen's cost does not depend
@@ -67,7 +67,7 @@ async function main(): Promise<void> {
   writeFileSync(join(feed, 'terms-of-service.txt'), 'Benchmark terms.\n');
   writeFileSync(join(feed, 'company-info.json'), JSON.stringify({ content_hash: createHash('sha256').update('Benchmark terms.\n').digest('hex') }));
   execFileSync(kKivoctl, ['--root', root, 'server-config', '--company-info', `http://127.0.0.1:${port}/feed/company-info.json`], { stdio: 'ignore' });
-  cpSync(process.env.KIVO_PAGE_DIR ?? join(kRepo, 'build/page'), join(root, 'usr/kivo/www'), { recursive: true });
+  cpSync(process.env.KIVO_PAGE_DIR ?? join(kBuild, 'page'), join(root, 'usr/kivo/www'), { recursive: true });
   const started = performance.now();
   await installAll(root, work);
   console.log(`set-up: ${kCount} packages built and installed in ${((performance.now() - started) / 1000).toFixed(1)} s`);

@@ -8,10 +8,10 @@ import { createRequire } from 'node:module';
 import { join } from 'node:path';
 import assert from 'node:assert/strict';
 import { chromium, type Browser, type BrowserContext, type Page } from 'playwright-core';
-import { kPassword, kRepo } from './appliance.ts';
+import { kBuild, kPassword } from './appliance.ts';
 
 const kChromium = process.env.KIVO_CHROMIUM ?? '/usr/bin/chromium';
-export const kScreenshots = join(kRepo, 'build/screenshots');
+export const kScreenshots = join(kBuild, 'screenshots');
 const axeSource = readFileSync(createRequire(import.meta.url).resolve('axe-core/axe.min.js'), 'utf8');
 
 export async function launch(): Promise<Browser> {

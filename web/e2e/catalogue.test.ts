@@ -4,21 +4,16 @@
 // across a reload and in a second tab, then cancelled; a withdrawn file that
 // fails in words; a package from the community feed.
 
-import { after, before, test } from 'node:test';
+import { test } from 'node:test';
 import assert from 'node:assert/strict';
 import { execFileSync } from 'node:child_process';
 import { readdirSync, readFileSync } from 'node:fs';
 import { createServer, type Server } from 'node:http';
 import type { AddressInfo } from 'node:net';
-import type { Browser, BrowserContext, Locator, Page } from 'playwright-core';
-import { Appliance, kPassword } from './appliance.ts';
-import { checkAccessibility, launch, openPage, screenshot, signedInPage, type Watch } from './browser.ts';
-
-let appliance: Appliance;
-let browser: Browser;
-let slowServer: Server;
-let slowFeed = '';
-const watch: Watch = { problems: [] };
+import type { Locator, Page } from 'playwright-core';
+import { kPassword } from './appliance.ts';
+import { checkAccessibility, openPage, screenshot } from './browser.ts';
+import { pagesPerTest, useSuite, type Opened } from './suite.ts';
 
 // The slow package: large enough, and sent slowly enough (64 KiB a second),
 // that a download is still under way while the test reloads and looks from a
@@ -54,10 +49,25 @@ function startSlowServer(): Promise<Server> {
   return new Promise((done) => server.listen(0, '127.0.0.1', () => done(server)));
 }
 
+let slowServer: Server | undefined;
+
+const suite = useSuite({
+  prepare: async (appliance) => {
+    appliance.agreeToTerms();
+    slowServer = await startSlowServer();
+    await addFeed(`http://127.0.0.1:${(slowServer.address() as AddressInfo).port}/catalogue.json`, 'slow');
+  },
+  cleanUp: () => {
+    slowServer?.closeAllConnections();
+    slowServer?.close();
+  },
+});
+const pages = pagesPerTest(suite);
+
 // The web API as a script calls it (with the session id), for what the test
 // arranges outside the page.
 async function callApi(params: Record<string, string>): Promise<{ success: boolean; data?: unknown; error?: { code: number } }> {
-  const endpoint = new URL('webapi/entry.cgi', appliance.url);
+  const endpoint = new URL('webapi/entry.cgi', suite.appliance.url);
   const login = await fetch(endpoint, { method: 'POST', body: new URLSearchParams({ api: 'KIVO.API.Auth', version: '1', method: 'login', account: 'admin', passwd: kPassword }) });
   const { data } = (await login.json()) as { data: { sid: string } };
   const answer = await fetch(endpoint, { method: 'POST', body: new URLSearchParams({ ...params, _sid: data.sid }) });
@@ -76,7 +86,7 @@ function card(page: Page, name: string): Locator {
 // Opens the catalogue, agreeing to the terms of service when the package
 // center asks first (the account's first visit).
 async function openCatalogue(page: Page): Promise<void> {
-  await page.goto(new URL('#/catalogue', appliance.url).href);
+  await page.goto(new URL('#/catalogue', suite.appliance.url).href);
   const agree = page.getByRole('button', { name: 'I agree' });
   const listed = page.getByRole('heading', { name: 'Recommended' });
   await agree.or(listed).first().waitFor();
@@ -84,11 +94,11 @@ async function openCatalogue(page: Page): Promise<void> {
   await listed.waitFor();
 }
 
-// A browser context of its own, signed in and showing the catalogue.
-async function signedInCatalogue(): Promise<{ context: BrowserContext; page: Page }> {
-  const { context, page } = await signedInPage(browser, appliance.url, watch);
-  await openCatalogue(page);
-  return { context, page };
+// A browser context of the test's own, signed in and showing the catalogue.
+async function signedInCatalogue(): Promise<Opened> {
+  const opened = await pages.signedIn();
+  await openCatalogue(opened.page);
+  return opened;
 }
 
 // The download bar's value, waiting until the bar shows a number.
@@ -103,28 +113,11 @@ async function downloadPercent(scope: Locator): Promise<number> {
 }
 
 function downloadFolders(): string[] {
-  return readdirSync(appliance.file('/volume1/@tmp')).filter((name) => name.startsWith('download-'));
+  return readdirSync(suite.appliance.file('/volume1/@tmp')).filter((name) => name.startsWith('download-'));
 }
 
-before(async () => {
-  appliance = await Appliance.start();
-  appliance.agreeToTerms();
-  slowServer = await startSlowServer();
-  slowFeed = `http://127.0.0.1:${(slowServer.address() as AddressInfo).port}/catalogue.json`;
-  await addFeed(slowFeed, 'slow');
-  browser = await launch();
-});
-
-after(async () => {
-  await browser?.close();
-  slowServer?.closeAllConnections();
-  slowServer?.close();
-  await appliance?.stop();
-  assert.deepEqual(watch.problems, []);
-});
-
 test('the catalogue shows icons, recommendations first in the server order, the beta mark, the upgrade and the feed', async () => {
-  const { context, page } = await signedInCatalogue();
+  const { page } = await signedInCatalogue();
 
   const recommended = page.getByRole('list').first();
   assert.deepEqual(await recommended.getByRole('heading').allTextContents(), ['Demo Web', 'Demo Beta']);
@@ -150,11 +143,10 @@ test('the catalogue shows icons, recommendations first in the server order, the 
   assert.equal(await page.getByRole('listitem').count(), 1);
   await page.getByLabel('Search packages').fill('no such thing');
   await page.getByText('No package matches').waitFor();
-  await context.close();
 });
 
 test('demo-wizard installs from the server through its wizard, with progress, and its answer arrives', async () => {
-  const { context, page } = await signedInCatalogue();
+  const { page } = await signedInCatalogue();
 
   await card(page, 'Demo Wizard').getByRole('button', { name: 'Install Demo Wizard' }).click();
   const dialog = page.getByRole('dialog', { name: 'Install Demo Wizard' });
@@ -170,11 +162,10 @@ test('demo-wizard installs from the server through its wizard, with progress, an
 
   await card(page, 'Demo Wizard').getByText('Demo Wizard is installed.').waitFor({ timeout: 30_000 });
   await card(page, 'Demo Wizard').getByText(/^Installed/).waitFor();
-  assert.match(appliance.kivoctl('list'), /demo-wizard\s+1\.0/);
-  const greeting = execFileSync('find', [appliance.root, '-name', 'greeting.txt'], { encoding: 'utf8' }).trim().split('\n')[0];
+  assert.match(suite.appliance.kivoctl('list'), /demo-wizard\s+1\.0/);
+  const greeting = execFileSync('find', [suite.appliance.root, '-name', 'greeting.txt'], { encoding: 'utf8' }).trim().split('\n')[0];
   assert.equal(readFileSync(greeting, 'utf8').trim(), 'Good morning');
   assert.deepEqual(downloadFolders(), []);
-  await context.close();
 });
 
 test('a download goes on across a reload and shows in a second tab; cancelling it ends it everywhere', async () => {
@@ -196,7 +187,7 @@ test('a download goes on across a reload and shows in a second tab; cancelling i
   );
   assert.match((await bar.getAttribute('aria-label')) ?? '', /^Downloading Demo Slow \(.* of 8\.4 MB\)$/);
 
-  const second = await openPage(context, new URL('#/catalogue', appliance.url).href, watch);
+  const second = await openPage(context, new URL('#/catalogue', suite.appliance.url).href, suite.watch);
   assert.ok((await downloadPercent(card(second, 'Demo Slow'))) > 0);
   assert.equal(downloadFolders().length, 1);
 
@@ -207,18 +198,17 @@ test('a download goes on across a reload and shows in a second tab; cancelling i
   assert.deepEqual(downloadFolders(), []);
   const status = await callApi({ api: 'KIVO.Core.Package.Installation', version: '1', method: 'status', task_id: '@KIVOPKG_DOWNLOAD_demo-slow' });
   assert.deepEqual(status.data, { finished: true });
-  await context.close();
 });
 
 test('a withdrawn package file fails with the server message, and a community package installs from its feed', async () => {
-  const { context, page } = await signedInCatalogue();
+  const { page } = await signedInCatalogue();
 
   await card(page, 'Demo Gone').getByRole('button', { name: 'Install Demo Gone' }).click();
   await card(page, 'Demo Gone').getByRole('alert').filter({ hasText: 'the server answered HTTP 404' }).waitFor();
   await card(page, 'Demo Gone').getByRole('button', { name: 'Install Demo Gone' }).waitFor();
   assert.deepEqual(downloadFolders(), []);
 
-  await addFeed(new URL('community/catalogue.json', appliance.url).href, 'community');
+  await addFeed(new URL('community/catalogue.json', suite.appliance.url).href, 'community');
   await page.getByRole('button', { name: 'Refresh' }).click();
   const unsigned = card(page, 'Demo Unsigned');
   await unsigned.getByText('From the feed community').waitFor();
@@ -228,6 +218,5 @@ test('a withdrawn package file fails with the server message, and a community pa
   await dialog.getByRole('button', { name: 'Next' }).click();
   await dialog.getByRole('button', { name: 'Install', exact: true }).click();
   await unsigned.getByText('Demo Unsigned is installed.').waitFor({ timeout: 30_000 });
-  assert.match(appliance.kivoctl('list'), /demo-unsigned\s/);
-  await context.close();
+  assert.match(suite.appliance.kivoctl('list'), /demo-unsigned\s/);
 });

@@ -3,51 +3,31 @@
 // (a stop refused while a dependent runs, with the reason shown), and an
 // uninstall through the package's own wizard.
 
-import { after, afterEach, before, beforeEach, test } from 'node:test';
+import { beforeEach, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { existsSync, readFileSync } from 'node:fs';
-import type { Browser, BrowserContext, Locator, Page } from 'playwright-core';
-import { Appliance } from './appliance.ts';
-import { checkAccessibility, launch, screenshot, signedInPage, type Watch } from './browser.ts';
+import type { Locator, Page } from 'playwright-core';
+import { checkAccessibility, screenshot } from './browser.ts';
+import { pagesPerTest, useSuite } from './suite.ts';
 
-let appliance: Appliance;
-let browser: Browser;
-let context: BrowserContext | undefined;
+// The first visit would ask for the terms of service (e2e/settings.test.ts tests that).
+const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
+const pages = pagesPerTest(suite);
 let page: Page;
-const watch: Watch = { problems: [] };
+
+// Each test starts signed in on the installed list.
+beforeEach(async () => {
+  ({ page } = await pages.signedIn());
+  await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
+});
 
 function statusOf(id: string): string {
   try {
-    return appliance.kivoctl('status', id);
+    return suite.appliance.kivoctl('status', id);
   } catch (e) {
     return String((e as { stdout?: string }).stdout ?? e);
   }
 }
-
-before(async () => {
-  appliance = await Appliance.start();
-  // The first visit would ask for the terms of service (e2e/settings.test.ts tests that).
-  appliance.agreeToTerms();
-  browser = await launch();
-});
-
-// Each test starts signed in on the installed list, in a browser context
-// of its own.
-beforeEach(async () => {
-  ({ context, page } = await signedInPage(browser, appliance.url, watch));
-  await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
-});
-
-afterEach(async () => {
-  await context?.close();
-  context = undefined;
-});
-
-after(async () => {
-  await browser?.close();
-  await appliance?.stop();
-  assert.deepEqual(watch.problems, []);
-});
 
 function row(name: string): Locator {
   return page
@@ -64,7 +44,7 @@ test('the list shows each installed package with its state and the upgrade a ser
   await waitForStatus('Demo Web', 'Running');
   await waitForStatus('Demo Notes', 'Running');
   // The vendor's catalogue offers demo-web 1.1.0 and nothing newer for demo-notes.
-  await row('Demo Web').getByText('Upgrade to 1.1.0-0001').waitFor();
+  await row('Demo Web').getByRole('button', { name: 'Upgrade Demo Web to 1.1.0-0001' }).waitFor();
   assert.equal(await row('Demo Notes').getByText(/Upgrade to/).count(), 0);
   // The icon is decorative (the name stands beside it) but must load.
   const icon = await row('Demo Web').locator('img.package-icon').elementHandle();
@@ -85,17 +65,18 @@ test('a package shows its details, its web address while it runs, what it needs,
   await page.getByRole('link', { name: 'Demo Notes', exact: true }).click();
   await page.getByRole('heading', { name: 'Demo Notes' }).waitFor();
   await page.getByText('Keeps notes; needs Demo Web 1.0 or later to run.').waitFor();
-  await page.getByRole('link', { name: 'demo-web' }).click();
+  await page.getByRole('link', { name: 'Demo Web', exact: true }).click();
 
   await page.getByRole('heading', { name: 'Demo Web' }).waitFor();
-  await page.getByText('A small web service on port 8095: start it and open its page.').waitFor();
+  const port = suite.appliance.demoWebPort;
+  await page.getByText(`A small web service on port ${port}: start it and open its page.`).waitFor();
   await page.getByRole('link', { name: 'KIVO Samples' }).first().waitFor();
   await page.getByRole('link', { name: 'Help' }).waitFor();
-  const address = page.getByRole('link', { name: /^http:\/\/127\.0\.0\.1:8095/ });
-  assert.equal(await address.getAttribute('href'), 'http://127.0.0.1:8095/');
+  const address = page.getByRole('link', { name: new RegExp(`^http://127\\.0\\.0\\.1:${port}`) });
+  assert.equal(await address.getAttribute('href'), `http://127.0.0.1:${port}/`);
   await page.getByText('No other packages.').waitFor();
   const log = page.getByRole('region', { name: 'Log' });
-  await log.getByText(/demo-web 1\.0\.0-0001 serving on port 8095/).waitFor();
+  await log.getByText(`demo-web 1.0.0-0001 serving on port ${port}`).waitFor();
   await screenshot(page, 'package-details');
   await checkAccessibility(page, 'package-details');
   await page.getByRole('link', { name: '← Installed packages' }).click();
@@ -104,7 +85,7 @@ test('a package shows its details, its web address while it runs, what it needs,
 test('stopping demo-web is refused while demo-notes runs; stopped and started in order it works', async () => {
   await row('Demo Web').getByRole('button', { name: 'Stop Demo Web' }).click();
   const refusal = page.getByRole('dialog', { name: 'Could not stop Demo Web' });
-  await refusal.getByText('demo-notes runs and needs demo-web.').waitFor();
+  await refusal.getByText('Demo Notes runs and needs Demo Web.').waitFor();
   await refusal.getByRole('button', { name: 'Close' }).click();
   assert.match(statusOf('demo-web'), /running/);
 
@@ -113,7 +94,7 @@ test('stopping demo-web is refused while demo-notes runs; stopped and started in
   // With its dependent stopped, the stop is allowed after a warning.
   await row('Demo Web').getByRole('button', { name: 'Stop Demo Web' }).click();
   const confirm = page.getByRole('dialog', { name: 'Stop Demo Web?' });
-  await confirm.getByText(/demo-notes/).waitFor();
+  await confirm.getByText(/Demo Notes/).waitFor();
   await confirm.getByRole('button', { name: 'Stop anyway' }).click();
   await waitForStatus('Demo Web', 'Stopped');
   assert.doesNotMatch(statusOf('demo-web'), /running/);
@@ -121,7 +102,7 @@ test('stopping demo-web is refused while demo-notes runs; stopped and started in
   // A start whose dependency is stopped is refused and names it.
   await row('Demo Notes').getByRole('button', { name: 'Start Demo Notes' }).click();
   const failed = page.getByRole('dialog', { name: 'Could not start Demo Notes' });
-  await failed.getByText('Not running: demo-web.').waitFor();
+  await failed.getByText('Not running: Demo Web.').waitFor();
   await failed.getByRole('button', { name: 'Close' }).click();
 
   await row('Demo Web').getByRole('button', { name: 'Start Demo Web' }).click();
@@ -132,12 +113,12 @@ test('stopping demo-web is refused while demo-notes runs; stopped and started in
 });
 
 test('a package with an uninstall wizard is removed with the answers given', async () => {
-  appliance.kivoctl('install', appliance.file('/volume1/public/packages/demo-wizard.kpk'), '--wizard', '{"greeting":"Ahoy"}', '--run');
+  suite.appliance.kivoctl('install', suite.appliance.file('/volume1/public/packages/demo-wizard.kpk'), '--wizard', '{"greeting":"Ahoy"}', '--run');
   await page.reload();
   await row('Demo Wizard').getByRole('button', { name: 'Uninstall Demo Wizard' }).click();
   const dialog = page.getByRole('dialog', { name: 'Uninstall Demo Wizard' });
   // The soft reason first, then the package's own page.
-  await dialog.getByText('Removing demo-wizard deletes the data it keeps.').waitFor();
+  await dialog.getByText('Removing Demo Wizard deletes the data it keeps.').waitFor();
   await dialog.getByRole('button', { name: 'Continue anyway' }).click();
   await dialog.getByRole('group', { name: 'Keep a copy of the greeting?' }).waitFor();
   assert.ok(await dialog.getByRole('checkbox', { name: 'Keep a copy' }).isChecked());
@@ -146,9 +127,9 @@ test('a package with an uninstall wizard is removed with the answers given', asy
   await dialog.getByRole('button', { name: 'Next' }).click();
   await dialog.getByRole('button', { name: 'Uninstall' }).click();
   await row('Demo Wizard').waitFor({ state: 'detached' });
-  assert.doesNotMatch(appliance.kivoctl('list'), /demo-wizard/);
+  assert.doesNotMatch(suite.appliance.kivoctl('list'), /demo-wizard/);
   // The wizard's answer reached the package's script: it kept the greeting.
-  const kept = appliance.file('/volume1/public/demo-wizard-greeting.txt');
+  const kept = suite.appliance.file('/volume1/public/demo-wizard-greeting.txt');
   assert.ok(existsSync(kept));
   assert.equal(readFileSync(kept, 'utf8').trim(), 'Ahoy');
 });

@@ -3,7 +3,7 @@
 // reload, the community feed added, renamed and deleted, and a key file
 // imported into the keyring and deleted, with bad key files refused in words.
 
-import { after, afterEach, before, test } from 'node:test';
+import { test } from 'node:test';
 import assert from 'node:assert/strict';
 import { execFileSync } from 'node:child_process';
 import { mkdtempSync, readFileSync, rmSync, writeFileSync } from 'node:fs';
@@ -11,15 +11,10 @@ import { createServer, type Server } from 'node:http';
 import type { AddressInfo } from 'node:net';
 import { tmpdir } from 'node:os';
 import { join } from 'node:path';
-import type { Browser, BrowserContext, Page } from 'playwright-core';
-import { Appliance, kPassword } from './appliance.ts';
-import { checkAccessibility, kScreenshots, launch, screenshot, signedInPage, type Watch } from './browser.ts';
-
-let appliance: Appliance;
-let browser: Browser;
-let context: BrowserContext | undefined;
-let keys: string;
-const watch: Watch = { problems: [] };
+import type { Page } from 'playwright-core';
+import { kPassword } from './appliance.ts';
+import { checkAccessibility, kScreenshots, screenshot } from './browser.ts';
+import { pagesPerTest, useSuite } from './suite.ts';
 
 const kCompanyInfo = '/usr/kivo/www/feed/company-info.json';
 const kCompanyInfoAddress = 'feed/company-info.json';
@@ -38,45 +33,38 @@ function makeKeyFiles(dir: string): void {
   execFileSync('gpgconf', ['--homedir', home, '--kill', 'gpg-agent']);
 }
 
-before(async () => {
-  appliance = await Appliance.start();
-  // A package that needs no port of its own, to choose for automatic updates.
-  appliance.kivoctl('install', appliance.file('/volume1/public/packages/demo-beta.kpk'));
-  keys = mkdtempSync(join(tmpdir(), 'kivo-keys-'));
-  makeKeyFiles(keys);
-  browser = await launch();
-});
+// The folder of the key files, made before the first test.
+let keys = '';
 
-afterEach(async () => {
-  await context?.close();
-  context = undefined;
+const suite = useSuite({
+  prepare: (appliance) => {
+    // A package that needs no port of its own, to choose for automatic updates.
+    appliance.kivoctl('install', appliance.file('/volume1/public/packages/demo-beta.kpk'));
+    keys = mkdtempSync(join(tmpdir(), 'kivo-keys-'));
+    makeKeyFiles(keys);
+  },
+  cleanUp: () => {
+    if (keys) rmSync(keys, { recursive: true, force: true });
+  },
 });
-
-after(async () => {
-  await browser?.close();
-  await appliance?.stop();
-  if (keys) rmSync(keys, { recursive: true, force: true });
-  assert.deepEqual(watch.problems, []);
-});
+const pages = pagesPerTest(suite);
 
 // A page of the test's own, signed in as an administrator of the test's
 // own: the agreement to the terms is per account, so no test (nor a request
 // of another test's page still under way) can change what this one finds.
 // With `agreed`, the account has agreed to the current terms.
 async function signedIn(account: string, agreed: boolean): Promise<Page> {
-  appliance.kivoctl('user-add', account, '--password', kPassword, '--group', 'administrators');
-  if (agreed) appliance.agreeToTerms(account);
-  const opened = await signedInPage(browser, appliance.url, watch, account);
-  context = opened.context;
-  return opened.page;
+  suite.appliance.kivoctl('user-add', account, '--password', kPassword, '--group', 'administrators');
+  if (agreed) suite.appliance.agreeToTerms(account);
+  return (await pages.signedIn(account)).page;
 }
 
 // The terms' hash is trusted for up to an hour after it was fetched: make it
 // an hour old, as that hour passing would.
 function ageTermsHash(account: string): void {
-  const settings = JSON.parse(readFileSync(appliance.file(settingsFile(account)), 'utf8'));
+  const settings = JSON.parse(readFileSync(suite.appliance.file(settingsFile(account)), 'utf8'));
   settings[kApp].tos_hash_timestamp = Math.floor(Date.now() / 1000) - 3600;
-  appliance.replace(settingsFile(account), JSON.stringify(settings));
+  suite.appliance.replace(settingsFile(account), JSON.stringify(settings));
 }
 
 function settingsFile(account: string): string {
@@ -84,7 +72,7 @@ function settingsFile(account: string): string {
 }
 
 function storedAgreement(account: string): Record<string, unknown> {
-  return JSON.parse(readFileSync(appliance.file(settingsFile(account)), 'utf8'))[kApp];
+  return JSON.parse(readFileSync(suite.appliance.file(settingsFile(account)), 'utf8'))[kApp];
 }
 
 test('the terms of service are asked on the first visit and again when they change', async () => {
@@ -102,15 +90,15 @@ test('the terms of service are asked on the first visit and again when they chan
   const stored = await page.evaluate(() => JSON.stringify({ ...localStorage }) + JSON.stringify({ ...sessionStorage }));
   assert.equal(stored, '{}{}');
 
-  await page.goto(`${appliance.url}#/settings`);
+  await page.goto(`${suite.appliance.url}#/settings`);
   await page.reload();
   await page.getByRole('heading', { name: 'Settings', level: 1 }).waitFor();
   assert.equal(await page.getByRole('heading', { name: /terms of service/i }).count(), 0);
 
   // The vendor publishes new terms, and the hour the appliance trusts the
   // hash it fetched has passed.
-  const published = readFileSync(appliance.file(kCompanyInfo), 'utf8');
-  await appliance.replaceServed(kCompanyInfo, kCompanyInfoAddress, JSON.stringify({ content_hash: 'a'.repeat(64) }));
+  const published = readFileSync(suite.appliance.file(kCompanyInfo), 'utf8');
+  await suite.appliance.replaceServed(kCompanyInfo, kCompanyInfoAddress, JSON.stringify({ content_hash: 'a'.repeat(64) }));
   try {
     ageTermsHash('first-visit');
     await page.reload();
@@ -120,13 +108,13 @@ test('the terms of service are asked on the first visit and again when they chan
     await page.getByRole('heading', { name: 'Settings', level: 1 }).waitFor();
     assert.equal(storedAgreement('first-visit').agreed_tos_hash, 'a'.repeat(64));
   } finally {
-    await appliance.replaceServed(kCompanyInfo, kCompanyInfoAddress, published);
+    await suite.appliance.replaceServed(kCompanyInfo, kCompanyInfoAddress, published);
   }
 });
 
 test('preferences are saved on the appliance and come back after a reload', async () => {
   const page = await signedIn('preferences', true);
-  await page.goto(`${appliance.url}#/settings`);
+  await page.goto(`${suite.appliance.url}#/settings`);
   const preferences = page.getByRole('region', { name: 'Preferences' });
   await preferences.getByRole('radio', { name: 'Stable versions only' }).waitFor();
   assert.ok(await preferences.getByRole('radio', { name: 'Stable versions only' }).isChecked());
@@ -171,12 +159,12 @@ test('preferences are saved on the appliance and come back after a reload', asyn
 
 test('the community feed is added with its keys, renamed and deleted; a dead feed is refused', async () => {
   const page = await signedIn('feeds', true);
-  await page.goto(`${appliance.url}#/settings`);
+  await page.goto(`${suite.appliance.url}#/settings`);
   const feeds = page.getByRole('region', { name: 'Feeds' });
   await feeds.getByText('No feed is added.').waitFor();
-  const community = `${appliance.url}community/catalogue.json`;
+  const community = `${suite.appliance.url}community/catalogue.json`;
 
-  await feeds.getByLabel('Address').fill(`${appliance.url}nothing-here/catalogue.json`);
+  await feeds.getByLabel('Address').fill(`${suite.appliance.url}nothing-here/catalogue.json`);
   await feeds.getByRole('button', { name: 'Add feed' }).click();
   await feeds.getByRole('alert').filter({ hasText: /package server|package source/i }).waitFor();
 
@@ -203,13 +191,13 @@ test('the community feed is added with its keys, renamed and deleted; a dead fee
   await checkAccessibility(page, 'delete feed');
   await confirm.getByRole('button', { name: 'Delete feed' }).click();
   await feeds.getByText('No feed is added.').waitFor();
-  const list = JSON.parse(readFileSync(appliance.file('/usr/kivo/etc/packages/feeds'), 'utf8'));
+  const list = JSON.parse(readFileSync(suite.appliance.file('/usr/kivo/etc/packages/feeds'), 'utf8'));
   assert.deepEqual(list, []);
 });
 
 test('a public key file is imported and deleted; a secret key and garbage are refused in words', async () => {
   const page = await signedIn('keys', true);
-  await page.goto(`${appliance.url}#/settings`);
+  await page.goto(`${suite.appliance.url}#/settings`);
   const keyring = page.getByRole('region', { name: 'Code-signing keys' });
   await keyring.getByRole('cell', { name: /^KIVO Demo Publisher/ }).waitFor();
 
@@ -266,9 +254,9 @@ async function tryAgain(page: Page): Promise<void> {
 test('when the vendor cannot confirm its terms, packages can still be managed, and Try again works once it answers whole', async () => {
   let answer: VendorAnswer = 'cut short';
   const vendor = await startVendor(() => answer);
-  const configured = /^company_info_url=(.*)$/m.exec(appliance.kivoctl('server-config'))?.[1] ?? '';
+  const configured = /^company_info_url=(.*)$/m.exec(suite.appliance.kivoctl('server-config'))?.[1] ?? '';
   assert.notEqual(configured, '');
-  appliance.kivoctl('server-config', '--company-info', `http://127.0.0.1:${(vendor.address() as AddressInfo).port}/company-info`);
+  suite.appliance.kivoctl('server-config', '--company-info', `http://127.0.0.1:${(vendor.address() as AddressInfo).port}/company-info`);
   try {
     // The account agreed before; the hash must now be asked again, and the
     // vendor's answer is cut short.
@@ -297,7 +285,7 @@ test('when the vendor cannot confirm its terms, packages can still be managed, a
     await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
     assert.equal(storedAgreement('unconfirmed').agreed_tos_hash, 'c'.repeat(64));
   } finally {
-    appliance.kivoctl('server-config', '--company-info', configured);
+    suite.appliance.kivoctl('server-config', '--company-info', configured);
     vendor.closeAllConnections();
     vendor.close();
   }

@@ -1,31 +1,21 @@
 // Signing in and out, a session that survives a reload without any stored
 // secret, and the refusal of an account that is not an administrator.
 
-import { after, before, test } from 'node:test';
+import { test } from 'node:test';
 import assert from 'node:assert/strict';
-import type { Browser } from 'playwright-core';
-import { Appliance } from './appliance.ts';
-import { checkAccessibility, launch, openPage, screenshot, signIn, type Watch } from './browser.ts';
+import { checkAccessibility, screenshot, signIn } from './browser.ts';
+import { pagesPerTest, useSuite } from './suite.ts';
 
-let appliance: Appliance;
-let browser: Browser;
-const watch: Watch = { problems: [] };
-
-before(async () => {
-  appliance = await Appliance.start();
-  appliance.kivoctl('user-add', 'viewer', '--password', 'viewer-pw', '--group', 'users');
-  browser = await launch();
+// An account that may sign in but is no administrator.
+const suite = useSuite({
+  prepare: (appliance) => {
+    appliance.kivoctl('user-add', 'viewer', '--password', 'viewer-pw', '--group', 'users');
+  },
 });
-
-after(async () => {
-  await browser?.close();
-  await appliance?.stop();
-  assert.deepEqual(watch.problems, []);
-});
+const pages = pagesPerTest(suite);
 
 test('an administrator signs in, stays signed in across a reload and signs out', async () => {
-  const context = await browser.newContext();
-  const page = await openPage(context, appliance.url, watch);
+  const { context, page } = await pages.signedOut();
   await screenshot(page, 'sign-in');
   await checkAccessibility(page, 'sign-in');
 
@@ -48,12 +38,10 @@ test('an administrator signs in, stays signed in across a reload and signs out',
   await page.getByRole('button', { name: 'Sign in' }).waitFor();
   await page.reload();
   await page.getByRole('button', { name: 'Sign in' }).waitFor();
-  await context.close();
 });
 
 test('an account that is not an administrator is told so and can sign out', async () => {
-  const context = await browser.newContext();
-  const page = await openPage(context, appliance.url, watch);
+  const { page } = await pages.signedOut();
   await page.getByLabel('Account').fill('viewer');
   await page.getByLabel('Password').fill('viewer-pw');
   await page.getByRole('button', { name: 'Sign in' }).click();
@@ -68,5 +56,4 @@ test('an account that is not an administrator is told so and can sign out', asyn
   assert.equal(answer.success, false);
   await page.getByRole('button', { name: 'Sign out' }).click();
   await page.getByRole('button', { name: 'Sign in' }).waitFor();
-  await context.close();
 });

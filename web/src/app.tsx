@@ -81,7 +81,7 @@ export function App() {
     const result = await api.signOut();
     // A session the server has already ended is signed out all the same.
     const failed = !result.ok && !isSessionGone(result.error.code);
-    setState({ kind: 'signed-out', notice: failed ? `Signing out failed: ${messageFor(result.error)}` : undefined });
+    setState({ kind: 'signed-out', notice: failed ? `Signing out failed: ${messageFor(result.error)}` : 'Signed out.' });
   };
   if (state.kind === 'loading') return <p class="loading">Loading…</p>;
   if (state.kind === 'signed-out')

@@ -8,6 +8,9 @@ import { HostCode } from './codes';
 
 export const kEndpoint = '/webapi/entry.cgi';
 
+// Signing in and out, and the session the cookie carries.
+const kAuth = 'KIVO.API.Auth';
+
 // Why a call failed: the API's own code and details, or kNoAnswer when no
 // answer came back at all (the network, or a body that is not JSON).
 export interface ApiFailure {
@@ -65,8 +68,8 @@ export class Api {
   // user to sign in again instead of showing the error on every panel.
   onSessionEnded: (code: number) => void = () => {};
 
-  // `keepalive` lets the request outlive the page, for a clean-up sent as
-  // the page is left.
+  // `keepalive` lets the request outlive the page: a clean-up sent as the
+  // page is left, an operation the user started just before a reload.
   async call<T = unknown>(api: string, method: string, version: number, params: Params = {}, keepalive = false): Promise<Result<T>> {
     let text: string;
     try {
@@ -123,7 +126,7 @@ export class Api {
   }
 
   async signIn(account: string, passwd: string): Promise<Result<SessionInfo>> {
-    const signedIn = await this.call<{ token: string }>('KIVO.API.Auth', 'login', 1, { account, passwd });
+    const signedIn = await this.call<{ token: string }>(kAuth, 'login', 1, { account, passwd });
     if (!signedIn.ok) return signedIn;
     this.token = signedIn.data.token;
     return this.restoreSession();
@@ -131,14 +134,14 @@ export class Api {
 
   // Picks up the session that the cookie carries, if any.
   async restoreSession(): Promise<Result<SessionInfo>> {
-    const session = await this.call<SessionInfo & { token: string }>('KIVO.API.Auth', 'session', 1);
+    const session = await this.call<SessionInfo & { token: string }>(kAuth, 'session', 1);
     if (!session.ok) return session;
     this.token = session.data.token;
     return { ok: true, data: { account: session.data.account, administrator: session.data.administrator } };
   }
 
   async signOut(): Promise<Result<unknown>> {
-    const result = await this.call('KIVO.API.Auth', 'logout', 1);
+    const result = await this.call(kAuth, 'logout', 1);
     this.token = '';
     return result;
   }

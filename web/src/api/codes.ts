@@ -76,6 +76,8 @@ export const PackageCode = {
 // a failed install from a package server carries one in its task's
 // "error"."result".
 export const ToolCode = {
+  // Running packages need a version this one is not (an upgrade).
+  DependentsRunning: 269,
   OtherOrigin: 306,
 } as const;
 

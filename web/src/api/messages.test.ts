@@ -80,7 +80,8 @@ test('details that say what stands in the way are told', () => {
   assert.match(said(HostCode.NotPermitted, { reason: 'missing or wrong X-KIVO-Token' }), /\(missing or wrong X-KIVO-Token\)/);
   // Lists arrive as arrays, as plain "a, b" text, or as JSON text.
   assert.match(said(PackageCode.StopDependents, { packages: 'demo-web, demo-notes' }), /Running dependents: demo-web, demo-notes\./);
-  assert.match(said(PackageCode.InstallDependency, { packages: '["demo-base>=2"]', message: '' }), /Needed packages: demo-base>=2\./);
+  // A requirement in its text form is told in words.
+  assert.match(said(PackageCode.InstallDependency, { packages: '["demo-base>=2"]', message: '' }), /Needed packages: demo-base 2 or later\./);
   assert.match(
     said(PackageCode.DependencyMissing, { uninstall_packages: ['demo-base'], unstart_packages: 'demo-db' }),
     /Not installed: demo-base\. Not running: demo-db\./,
@@ -130,4 +131,15 @@ test("a batch start or stop tells each failed package's reason under its id", ()
   assert.match(text, /demo-base: Running packages need this one\. Stop them first\. Running dependents: demo-notes\./);
   assert.match(text, /demo-db: Another package operation is under way/);
   assert.doesNotMatch(text, /demo-web/);
+});
+
+test('packages an answer names by id are told by their display names, requirements in words', () => {
+  const names: Record<string, string> = { 'demo-web': 'Demo Web', 'demo-notes': 'Demo Notes' };
+  const nameOf = (id: string) => names[id] ?? id;
+  assert.equal(
+    messageFor({ code: PackageCode.StartDependency, errors: { unstart_packages: 'demo-web', uninstall_packages: 'demo-web<2,other' } }, nameOf),
+    `${messageFor({ code: PackageCode.StartDependency })} Not installed: Demo Web older than 2, other. Not running: Demo Web.`,
+  );
+  assert.equal(explain({ code: PackageCode.StopDependents, errors: { packages: ['demo-notes'] } }, nameOf).details[0], 'Running dependents: Demo Notes.');
+  assert.equal(explain({ code: PackageCode.StartFailed, errors: { 'demo-web': { code: PackageCode.StartFailed } } }, nameOf).details[0], `Demo Web: ${messageFor({ code: PackageCode.StartFailed })}`);
 });

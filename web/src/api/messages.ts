@@ -7,8 +7,14 @@
 
 import { kNoAnswer, type ApiFailure } from './client';
 import { HostCode, PackageCode } from './codes';
+import { settingStepWords } from './setting';
 
 type Errors = Record<string, unknown>;
+
+// Sentences that more than one code stands for: an install and a start
+// refused for the same reason read the same.
+const kNeedsOthers = 'This package needs other packages that are not installed or not running.';
+const kVersionMismatch = 'A package this one needs is installed in a version that does not fit. Upgrade it first.';
 
 const messages: Record<number, string> = {
   [kNoAnswer]: 'The appliance did not answer. Check the connection and try again.',
@@ -38,7 +44,7 @@ const messages: Record<number, string> = {
   [PackageCode.BadPackageFile]: 'This file is not a valid package. Get a fresh copy from its publisher.',
   [PackageCode.Conflict]: 'This package cannot be installed next to a package that is already installed.',
   [PackageCode.ServiceNotRunning]: 'A service this package needs is not running. Start it, then try again.',
-  [PackageCode.DependencyMissing]: 'This package needs other packages that are not installed or not running.',
+  [PackageCode.DependencyMissing]: kNeedsOthers,
   [PackageCode.PortInUse]: 'The network port this package uses is taken by another program.',
   [PackageCode.NotSupported]: 'This package does not run on this appliance (another architecture or model, or a built-in package).',
   [PackageCode.UnsafeMember]: 'This package file holds unsafe content and was refused.',
@@ -59,7 +65,7 @@ const messages: Record<number, string> = {
   [PackageCode.InstallNotInstalled]: 'This package is not installed.',
   [PackageCode.NotNewer]: 'The same or a newer version of this package is already installed.',
   [PackageCode.InstallDependency]: 'This package needs other packages that are missing or stopped. Install or start them first.',
-  [PackageCode.VersionLimit]: 'A package this one needs is installed in a version that does not fit. Upgrade it first.',
+  [PackageCode.VersionLimit]: kVersionMismatch,
   [PackageCode.ScriptFailed]: 'A script of the package failed.',
   [PackageCode.Cancelled]: 'The install was cancelled.',
   [PackageCode.DependentsRunning]: 'Running packages depend on this one. Stop them first.',
@@ -70,8 +76,8 @@ const messages: Record<number, string> = {
   [PackageCode.StartFailed]: 'The package could not be started.',
   [PackageCode.StopFailed]: 'The package could not be stopped.',
   [PackageCode.StopDependents]: 'Running packages need this one. Stop them first.',
-  [PackageCode.StartVersionLimit]: 'A package this one needs is installed in a version that does not fit. Upgrade it first.',
-  [PackageCode.StartDependency]: 'This package needs other packages that are not installed or not running.',
+  [PackageCode.StartVersionLimit]: kVersionMismatch,
+  [PackageCode.StartDependency]: kNeedsOthers,
   [PackageCode.ImageNotFound]: 'This screenshot is not available.',
   [PackageCode.FeedNotServer]:
     'That address does not answer as a package source: it is down, too slow, not http or https, or not a package server. Check the address.',
@@ -81,6 +87,12 @@ const messages: Record<number, string> = {
   [PackageCode.KeySecret]: 'This file holds a secret key, which must never be imported. Ask the publisher for the public key.',
   [PackageCode.KeyringUnwritable]: 'The appliance\'s keyring could not be written. Check the system volume, then try again.',
 };
+
+// The name people know a package by, for its id; the id itself when the
+// page knows no other (a package that is not installed).
+export type NameOf = (id: string) => string;
+
+const asItIs: NameOf = (id) => id;
 
 // An answer's detail as words: a list of names (an array, or the keys of an
 // object) joined with commas; a string as it stands, or the value it
@@ -104,9 +116,63 @@ function names(value: unknown): string {
   return '';
 }
 
+// A package's requirement on another (docs/package-format.md,
+// "Dependencies"): an operator and a version, or neither for any version.
+export interface Requirement {
+  operator?: string;
+  version?: string;
+}
+
+// What a requirement asks of the package `name`, in words.
+export function needsWords(name: string, needs: Requirement): string {
+  const v = needs.version;
+  if (!needs.operator || !v) return `${name} (any version)`;
+  switch (needs.operator) {
+    case '>=':
+      return `${name} ${v} or later`;
+    case '>':
+      return `${name} newer than ${v}`;
+    case '<=':
+      return `${name} ${v} or older`;
+    case '<':
+      return `${name} older than ${v}`;
+    case '=':
+      return `${name} ${v} exactly`;
+    case '!=':
+      return `any ${name} but ${v}`;
+    default:
+      return `${name} ${needs.operator} ${v}`;
+  }
+}
+
+// One entry of a dependency list in its text form: an id, and an operator
+// with a version when it asks for one ("demo-web>=1.0").
+const kRequirementText = /^([A-Za-z0-9][A-Za-z0-9._+-]*?)(>=|<=|!=|=|<|>)(\S+)$/;
+
+// A list of packages as names: each item of `names(value)` that is a
+// package id the page knows becomes that package's display name, and a
+// requirement in the text form becomes words.
+function packageNames(value: unknown, nameOf: NameOf): string {
+  const text = names(value);
+  if (text === '') return '';
+  return text
+    .split(/,\s*/)
+    .map((item) => {
+      const requirement = kRequirementText.exec(item);
+      return requirement ? needsWords(nameOf(requirement[1]), { operator: requirement[2], version: requirement[3] }) : nameOf(item);
+    })
+    .join(', ');
+}
+
 // "Label: names." when `value` names anything, else nothing.
 function listed(label: string, value: unknown): string | undefined {
   const text = names(value);
+  return text === '' ? undefined : `${label}: ${text}.`;
+}
+
+// The same for a list of packages, by their display names.
+function listedPackages(label: string, value: unknown, nameOf: NameOf): string | undefined {
+  const text = packageNames(value, nameOf);
   return text === '' ? undefined : `${label}: ${text}.`;
 }
 
@@ -138,18 +204,9 @@ function versions(e: Errors): string | undefined {
   return parts.length === 0 ? undefined : `Version ${parts.join('; ')}.`;
 }
 
-function missingPackages(e: Errors): (string | undefined)[] {
-  return [listed('Not installed', e.uninstall_packages), listed('Not running', e.unstart_packages)];
+function missingPackages(e: Errors, nameOf: NameOf): (string | undefined)[] {
+  return [listedPackages('Not installed', e.uninstall_packages, nameOf), listedPackages('Not running', e.unstart_packages, nameOf)];
 }
-
-// The settings are stored one step after another; a failing step names
-// itself, and those before it stay stored.
-const kSettingSteps: Record<string, string> = {
-  trust_level: 'the trust level',
-  update_channel: 'the update channel',
-  notification: 'the notifications',
-  autoupdate: 'the automatic updates',
-};
 
 // Why the stored default volume cannot take packages.
 const kVolumeStates: Record<string, string> = {
@@ -159,8 +216,16 @@ const kVolumeStates: Record<string, string> = {
   unknown: 'cannot be used',
 };
 
+// The settings are stored one step after another; a failing step names
+// itself, and those before it stay stored.
+function failedStep(failed: unknown): string | undefined {
+  if (typeof failed !== 'string') return undefined;
+  const words = settingStepWords(failed);
+  return words ? `the ${words}` : `"${failed}"`;
+}
+
 function generalFailure(e: Errors): (string | undefined)[] {
-  const step = typeof e.failed === 'string' ? (kSettingSteps[e.failed] ?? `"${e.failed}"`) : undefined;
+  const step = failedStep(e.failed);
   const volume = typeof e.volume_status === 'string' ? (kVolumeStates[e.volume_status] ?? 'cannot be used') : undefined;
   return [
     step && `Could not store ${step}; the settings before it were stored.`,
@@ -174,7 +239,7 @@ function hostReason(e: Errors): string | undefined {
 
 // What a code's "errors" add to its sentence, for the codes whose details
 // say what stands in the way.
-const details: Partial<Record<number, (e: Errors) => (string | undefined)[]>> = {
+const details: Partial<Record<number, (e: Errors, nameOf: NameOf) => (string | undefined)[]>> = {
   [HostCode.Unknown]: (e) => [hostReason(e)],
   [HostCode.BadRequest]: (e) => [hostReason(e)],
   [HostCode.NotPermitted]: (e) => [hostReason(e)],
@@ -183,7 +248,7 @@ const details: Partial<Record<number, (e: Errors) => (string | undefined)[]>> = 
     [typeof e.retry_after === 'number' ? `Try again in ${seconds(e.retry_after)}.` : 'Wait a while, then try again.'],
   [PackageCode.BadParameter]: (e) => [parameterProblem(e)],
   [PackageCode.Failed]: generalFailure,
-  [PackageCode.Conflict]: (e) => [listed('Conflicting packages', e.packages)],
+  [PackageCode.Conflict]: (e, n) => [listedPackages('Conflicting packages', e.packages, n)],
   [PackageCode.ServiceNotRunning]: (e) => [listed('Services not running', e.services)],
   [PackageCode.DependencyMissing]: missingPackages,
   [PackageCode.StartDependency]: missingPackages,
@@ -193,10 +258,10 @@ const details: Partial<Record<number, (e: Errors) => (string | undefined)[]>> = 
   [PackageCode.NotNewer]: (e) => [versions(e)],
   [PackageCode.VersionLimit]: (e) => [versions(e)],
   [PackageCode.StartVersionLimit]: (e) => [versions(e)],
-  [PackageCode.InstallDependency]: (e) => [listed('Needed packages', e.packages)],
-  [PackageCode.DependentsRunning]: (e) => [listed('Running dependents', e.packages)],
-  [PackageCode.UninstallDependents]: (e) => [listed('Dependent packages', e.packages)],
-  [PackageCode.StopDependents]: (e) => [listed('Running dependents', e.packages)],
+  [PackageCode.InstallDependency]: (e, n) => [listedPackages('Needed packages', e.packages, n)],
+  [PackageCode.DependentsRunning]: (e, n) => [listedPackages('Running dependents', e.packages, n)],
+  [PackageCode.UninstallDependents]: (e, n) => [listedPackages('Dependent packages', e.packages, n)],
+  [PackageCode.StopDependents]: (e, n) => [listedPackages('Running dependents', e.packages, n)],
   [PackageCode.NotFeasible]: feasibility,
 };
 
@@ -223,7 +288,7 @@ function toolWords(e: Errors): string[] {
 
 // A start or stop of several packages fails as a whole with each package's
 // own outcome under its id: {"<id>": {"code", "errors"}} or {"<id>": {"data"}}.
-function batchFailures(e: Errors): string[] {
+function batchFailures(e: Errors, nameOf: NameOf): string[] {
   if ('message' in e || 'worker_message' in e || 'code' in e) return [];
   const told: string[] = [];
   for (const [id, outcome] of Object.entries(e)) {
@@ -231,7 +296,7 @@ function batchFailures(e: Errors): string[] {
     const { code, errors } = outcome as { code?: unknown; errors?: unknown };
     if (typeof code !== 'number') continue;
     const inner = errors !== null && typeof errors === 'object' ? (errors as Errors) : undefined;
-    told.push(`${id}: ${messageFor({ code, errors: inner })}`);
+    told.push(`${nameOf(id)}: ${messageFor({ code, errors: inner }, nameOf)}`);
   }
   return told;
 }
@@ -245,18 +310,19 @@ export interface Explanation {
 }
 
 // `failure` explained in parts, for a screen that shows the details apart
-// (a list of reasons, say). messageFor joins the same parts.
-export function explain(failure: ApiFailure): Explanation {
+// (a list of reasons, say). messageFor joins the same parts. `nameOf` gives
+// the packages the answer names by id their display names.
+export function explain(failure: ApiFailure, nameOf: NameOf = asItIs): Explanation {
   const errors = failure.errors ?? {};
   const summary = messages[failure.code] ?? `The appliance answered with error ${failure.code}.`;
-  const own = details[failure.code]?.(errors) ?? [];
-  const parts = [...own, ...batchFailures(errors), ...toolWords(errors)];
+  const own = details[failure.code]?.(errors, nameOf) ?? [];
+  const parts = [...own, ...batchFailures(errors, nameOf), ...toolWords(errors)];
   return { summary, details: parts.filter((p): p is string => p !== undefined && p !== '') };
 }
 
 // The sentence for `failure`, with the details the answer carries that a
 // user can act on.
-export function messageFor(failure: ApiFailure): string {
-  const { summary, details: told } = explain(failure);
+export function messageFor(failure: ApiFailure, nameOf: NameOf = asItIs): string {
+  const { summary, details: told } = explain(failure, nameOf);
   return [summary, ...told].join(' ');
 }

@@ -1,23 +1,19 @@
 import { useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
+import { addFeed, deleteFeed, listFeeds, renameFeed, type Feed } from '../api/feed';
 import { useSession } from '../session';
 import { Dialog } from '../ui/dialog';
 import { ErrorText } from '../ui/error-text';
-import { ConfirmDelete, ListTable, Outcome, useListing } from './settings-list';
+import { FormButtons, TextField } from '../ui/form';
+import { ConfirmDelete, ListingTable, useListing } from '../ui/listing';
 
-// A feed: a package server added beside the vendor's ("KIVO.Core.Package.Feed",
-// docs/feeds.md). The address is the feed's key.
-interface Feed {
-  feed: string;
-  name: string;
-}
-
-// The Feed methods take their argument as one JSON text in `list`.
-const feedApi = 'KIVO.Core.Package.Feed';
+// The feeds: package servers added beside the vendor's (docs/feeds.md), each
+// with the signing keys it may bring.
 
 export function FeedsSection() {
   const { api } = useSession();
-  const { items: feeds, error, setError, notice, done } = useListing<Feed>(feedApi);
+  const listing = useListing<Feed>(listFeeds);
+  const { setError, done } = listing;
   const [renaming, setRenaming] = useState<Feed | null>(null);
   const [deleting, setDeleting] = useState<Feed | null>(null);
 
@@ -31,7 +27,7 @@ export function FeedsSection() {
     );
 
   const remove = async (feed: Feed) => {
-    const result = await api.call(feedApi, 'delete', 1, { list: JSON.stringify([feed.feed]) });
+    const result = await deleteFeed(api, feed);
     setDeleting(null);
     if (!result.ok) return setError(result.error);
     await done(`Feed “${feed.name}” deleted, with the signing keys it brought.`);
@@ -44,27 +40,29 @@ export function FeedsSection() {
         Package servers besides the vendor's. Their packages appear under All packages. A feed may publish its publishers'
         signing keys; they vouch for that feed's packages only.
       </p>
-      {feeds === null && !error && <p class="hint">Loading…</p>}
-      {feeds && feeds.length === 0 && <p>No feed is added.</p>}
-      {feeds && feeds.length > 0 && (
-        <ListTable caption="Feeds" columns={['Name', 'Address']}>
-          {feeds.map((f) => (
-            <tr key={f.feed}>
-              <td>{f.name}</td>
-              <td class="address">{f.feed}</td>
-              <td class="row-actions">
-                <button type="button" onClick={() => setRenaming(f)} aria-label={`Rename ${f.name}`}>
-                  Rename
-                </button>
-                <button type="button" onClick={() => setDeleting(f)} aria-label={`Delete ${f.name}`}>
-                  Delete
-                </button>
-              </td>
-            </tr>
-          ))}
-        </ListTable>
-      )}
-      <Outcome notice={notice} error={error} />
+      <ListingTable
+        listing={listing}
+        caption="Feeds"
+        columns={['Name', 'Address']}
+        empty="No feed is added."
+        keyOf={(f) => f.feed}
+        cells={(f) => (
+          <>
+            <td>{f.name}</td>
+            <td class="address">{f.feed}</td>
+          </>
+        )}
+        actions={(f) => (
+          <>
+            <button type="button" onClick={() => setRenaming(f)} aria-label={`Rename ${f.name}`}>
+              Rename
+            </button>
+            <button type="button" onClick={() => setDeleting(f)} aria-label={`Delete ${f.name}`}>
+              Delete
+            </button>
+          </>
+        )}
+      />
       <AddFeedForm onAdded={added} />
       {renaming && (
         <RenameFeedDialog
@@ -98,9 +96,7 @@ function AddFeedForm({ onAdded }: { onAdded: (feed: Feed, hasKeys: boolean) => P
     e.preventDefault();
     setBusy(true);
     const feed = { feed: address.trim(), name: name.trim() };
-    // The appliance asks the server before it stores the feed, which may
-    // take up to its catalogue time-out.
-    const result = await api.call<{ has_keyrings?: boolean } | null>(feedApi, 'add', 1, { list: JSON.stringify(feed) });
+    const result = await addFeed(api, feed);
     setBusy(false);
     if (!result.ok) return setError(result.error);
     setError(null);
@@ -111,30 +107,18 @@ function AddFeedForm({ onAdded }: { onAdded: (feed: Feed, hasKeys: boolean) => P
   return (
     <form class="add-feed" onSubmit={submit} aria-labelledby="add-feed-title">
       <h3 id="add-feed-title">Add a feed</h3>
-      <div class="field">
-        <label for="feed-name">Name</label>
-        <input id="feed-name" value={name} onInput={(e) => setName(e.currentTarget.value)} aria-describedby="feed-name-hint" />
-        <span class="hint" id="feed-name-hint">
-          Optional: without one, the feed is named after its server.
-        </span>
-      </div>
-      <div class="field">
-        <label for="feed-address">Address</label>
-        <input
-          id="feed-address"
-          type="url"
-          required
-          placeholder="https://example.org/catalogue.json"
-          value={address}
-          onInput={(e) => setAddress(e.currentTarget.value)}
-        />
-      </div>
+      <TextField id="feed-name" label="Name" value={name} onValue={setName} hint="Optional: without one, the feed is named after its server." />
+      <TextField
+        id="feed-address"
+        label="Address"
+        type="url"
+        required
+        placeholder="https://example.org/catalogue.json"
+        value={address}
+        onValue={setAddress}
+      />
       <ErrorText error={error} />
-      <div class="buttons">
-        <button type="submit" class="primary" disabled={busy}>
-          {busy ? 'Asking the server…' : 'Add feed'}
-        </button>
-      </div>
+      <FormButtons label={busy ? 'Asking the server…' : 'Add feed'} busy={busy} />
     </form>
   );
 }
@@ -147,8 +131,7 @@ function RenameFeedDialog({ feed, onClose, onRenamed }: { feed: Feed; onClose: (
   const submit = async (e: Event) => {
     e.preventDefault();
     setBusy(true);
-    // "set" changes name and address together; the address stays.
-    const result = await api.call(feedApi, 'set', 1, { list: JSON.stringify({ orifeed: feed.feed, feed: feed.feed, name: name.trim() }) });
+    const result = await renameFeed(api, feed, name.trim());
     setBusy(false);
     if (!result.ok) return setError(result.error);
     await onRenamed(name.trim() || feed.feed);
@@ -157,19 +140,9 @@ function RenameFeedDialog({ feed, onClose, onRenamed }: { feed: Feed; onClose: (
     <Dialog title="Rename feed" onClose={onClose}>
       <form onSubmit={submit}>
         <p class="hint">{feed.feed}</p>
-        <div class="field">
-          <label for="rename-feed">New name</label>
-          <input id="rename-feed" required value={name} onInput={(e) => setName(e.currentTarget.value)} />
-        </div>
+        <TextField id="rename-feed" label="New name" required value={name} onValue={setName} />
         <ErrorText error={error} />
-        <div class="buttons">
-          <button type="button" onClick={onClose}>
-            Cancel
-          </button>
-          <button type="submit" class="primary" disabled={busy}>
-            Rename
-          </button>
-        </div>
+        <FormButtons label="Rename" busy={busy} onCancel={onClose} />
       </form>
     </Dialog>
   );

@@ -1,101 +1,51 @@
 import './installed.css';
 import { Component } from 'preact';
-import { useCallback, useEffect, useRef, useState } from 'preact/hooks';
-import type { Api, ApiFailure, Result } from '../api/client';
+import { useCallback, useEffect, useState } from 'preact/hooks';
+import type { Result } from '../api/client';
+import { listPackages, type PackageInfo } from '../api/package';
+import type { ServerEntry } from '../api/server';
 import { routeHref } from '../route';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
+import { PackageActions } from '../ui/package-actions';
 import { PackageIcon } from '../ui/package-icon';
-import { isBusyStatus, StatusBadge } from '../ui/status-badge';
-import { PackageActions } from './package-actions';
+import { usePoll } from '../ui/poll';
+import { isBusyStatus, kBusyPollMs, StatusBadge } from '../ui/status-badge';
+import { useUpgradeOffers } from '../ui/upgrade-flow';
 
-// The installed packages: each with its icon, version, state and an upgrade
-// mark when a package server offers a newer version, and what can be done
-// with it. The list is fetched once and again only while some package is
-// busy (installing, starting...), so an idle page sends nothing.
+// The installed packages: each with its icon, version, state and what can
+// be done with it (open its page, upgrade it when a package server offers a
+// newer version, start, stop, uninstall). The list is fetched once and again
+// only while some package is busy (installing, starting...), so an idle
+// page sends nothing.
 
-export interface InstalledPackage {
-  id: string;
-  name: string;
-  version: string;
-  additional?: {
-    status?: string;
-    startable?: boolean;
-    is_uninstall_pages?: boolean;
-    beta?: boolean;
-    installing_progress?: number;
-  };
+// The fields of "list" the page shows.
+interface ListFields {
+  status?: string;
+  startable?: boolean;
+  is_uninstall_pages?: boolean;
+  beta?: boolean;
+  installing_progress?: number;
+  url?: string | string[];
 }
 
-const kListFields = ['status', 'startable', 'is_uninstall_pages', 'beta', 'installing_progress'];
+type InstalledPackage = PackageInfo<ListFields>;
 
-// How often a busy package's state is asked again.
-export const kPollMs = 1500;
+const kListFields = ['status', 'startable', 'is_uninstall_pages', 'beta', 'installing_progress', 'url'];
 
-// Loads with `load` now and whenever `reload` is called, and again every
-// kPollMs while `busy` says the answer will change by itself. A load that
-// finishes after a newer one started is dropped.
-export function usePolled<T>(load: () => Promise<Result<T>>, busy: (data: T) => boolean) {
-  const [result, setResult] = useState<Result<T> | null>(null);
-  const latest = useRef(0);
-  const reload = useCallback(async () => {
-    const mine = ++latest.current;
-    const answer = await load();
-    if (mine === latest.current) setResult(answer);
-  }, [load]);
-  useEffect(() => {
-    reload();
-  }, [reload]);
-  const polling = result !== null && result.ok && busy(result.data);
-  useEffect(() => {
-    if (!polling) return;
-    const timer = setTimeout(reload, kPollMs);
-    return () => clearTimeout(timer);
-  }, [polling, result, reload]);
-  return { result, reload };
-}
-
-interface ServerEntry {
-  id?: string;
-  version?: string;
-  blupgrade?: boolean;
-}
-
-// The newest version each package server and feed offers for installed
-// packages it has newer versions of, by id. Asked once per visit: the
-// catalogue changes seldom, and the platform caches it.
-function useUpgrades(api: Api): { upgrades: Map<string, string>; error: ApiFailure | null } {
-  const [state, setState] = useState<{ upgrades: Map<string, string>; error: ApiFailure | null }>({ upgrades: new Map(), error: null });
-  useEffect(() => {
-    let live = true;
-    const ask = (blloadothers: boolean) =>
-      api.call<{ data?: ServerEntry[] }>('KIVO.Core.Package.Server', 'list', 1, { blloadothers });
-    Promise.all([ask(false), ask(true)]).then(async (answers) => {
-      const upgrades = new Map<string, string>();
-      let error: ApiFailure | null = null;
-      for (const answer of answers) {
-        if (!answer.ok) {
-          error = answer.error;
-          continue;
-        }
-        for (const entry of answer.data.data ?? [])
-          if (entry.blupgrade && entry.id && entry.version && !upgrades.has(entry.id)) upgrades.set(entry.id, entry.version);
-      }
-      if (live) setState({ upgrades, error });
-      // Tells the appliance the user has seen the upgrades, which refreshes
-      // its upgrade count on the desktop.
-      if (upgrades.size === 0 || !live) return;
-      const seen = await api.call('KIVO.Core.Package.Server', 'check', 1);
-      if (!seen.ok && live) setState({ upgrades, error: seen.error });
-    });
-    return () => {
-      live = false;
-    };
-  }, [api]);
-  return state;
-}
-
-function Row({ pkg, upgrade, onChanged }: { pkg: InstalledPackage; upgrade: string | undefined; onChanged: () => void }) {
+function Row({
+  pkg,
+  upgrade,
+  onChanged,
+  onUpgraded,
+  onRemoved,
+}: {
+  pkg: InstalledPackage;
+  upgrade: ServerEntry | undefined;
+  onChanged: () => void;
+  onUpgraded: () => void;
+  onRemoved: (words: string) => void;
+}) {
   const extra = pkg.additional ?? {};
   const progress = extra.installing_progress;
   return (
@@ -106,7 +56,7 @@ function Row({ pkg, upgrade, onChanged }: { pkg: InstalledPackage; upgrade: stri
         <span class="installed-version">
           {pkg.version}
           {extra.beta && <span class="badge beta">Beta</span>}
-          {upgrade && <span class="badge upgrade">Upgrade to {upgrade}</span>}
+          {upgrade && <span class="badge upgrade">{upgrade.version} available</span>}
         </span>
       </div>
       <div class="installed-status">
@@ -114,8 +64,19 @@ function Row({ pkg, upgrade, onChanged }: { pkg: InstalledPackage; upgrade: stri
         {typeof progress === 'number' && progress >= 0 && <span class="hint"> {Math.round(progress * 100)}%</span>}
       </div>
       <PackageActions
-        pkg={{ id: pkg.id, name: pkg.name, status: extra.status, startable: extra.startable, hasUninstallPages: extra.is_uninstall_pages }}
+        pkg={{
+          id: pkg.id,
+          name: pkg.name,
+          version: pkg.version,
+          status: extra.status,
+          startable: extra.startable,
+          hasUninstallPages: extra.is_uninstall_pages,
+          url: extra.url,
+          upgrade,
+        }}
         onChanged={onChanged}
+        onUpgraded={onUpgraded}
+        onRemoved={onRemoved}
       />
     </li>
   );
@@ -124,8 +85,10 @@ function Row({ pkg, upgrade, onChanged }: { pkg: InstalledPackage; upgrade: stri
 interface RowsProps {
   packages: InstalledPackage[];
   from: number;
-  upgrades: Map<string, string>;
+  upgrades: Map<string, ServerEntry>;
   onChanged: () => void;
+  onUpgraded: () => void;
+  onRemoved: (words: string) => void;
 }
 
 // kRowsPerFrame rows from `from` on. A chunk renders again only when the
@@ -134,13 +97,15 @@ interface RowsProps {
 class Rows extends Component<RowsProps> {
   shouldComponentUpdate(next: RowsProps): boolean {
     const p = this.props;
-    return next.packages !== p.packages || next.from !== p.from || next.upgrades !== p.upgrades || next.onChanged !== p.onChanged;
+    return (
+      next.packages !== p.packages || next.from !== p.from || next.upgrades !== p.upgrades || next.onChanged !== p.onChanged || next.onRemoved !== p.onRemoved || next.onUpgraded !== p.onUpgraded
+    );
   }
 
-  render({ packages, from, upgrades, onChanged }: RowsProps) {
+  render({ packages, from, upgrades, onChanged, onUpgraded, onRemoved }: RowsProps) {
     return packages
       .slice(from, from + kRowsPerFrame)
-      .map((pkg) => <Row key={pkg.id} pkg={pkg} upgrade={upgrades.get(pkg.id)} onChanged={onChanged} />);
+      .map((pkg) => <Row key={pkg.id} pkg={pkg} upgrade={upgrades.get(pkg.id)} onChanged={onChanged} onUpgraded={onUpgraded} onRemoved={onRemoved} />);
   }
 }
 
@@ -158,21 +123,37 @@ function useGrowingCount(total: number): number {
   return Math.min(count, total);
 }
 
-const anyBusy = (data: { packages: InstalledPackage[] }) => data.packages.some((p) => isBusyStatus(p.additional?.status));
+const anyBusy = (result: Result<{ packages: InstalledPackage[] }>) => result.ok && result.data.packages.some((p) => isBusyStatus(p.additional?.status));
 
 export function InstalledScreen() {
   const { api } = useSession();
-  const load = useCallback(
-    () => api.call<{ packages: InstalledPackage[]; total: number }>('KIVO.Core.Package', 'list', 1, { additional: kListFields }),
-    [api],
+  const load = useCallback(() => listPackages<ListFields>(api, kListFields), [api]);
+  const { result, reload } = usePoll(load, { everyMs: kBusyPollMs, again: anyBusy });
+  // Asked again after an upgrade: what is offered changes with what is
+  // installed.
+  const [upgraded, setUpgraded] = useState(0);
+  const { offers: upgrades, error: upgradeError } = useUpgradeOffers(api, true, upgraded);
+  const onUpgraded = useCallback(() => {
+    setUpgraded((n) => n + 1);
+    void reload();
+  }, [reload]);
+  // The last package removed, in words, until another is.
+  const [removed, setRemoved] = useState<string | null>(null);
+  const onRemoved = useCallback(
+    (words: string) => {
+      setRemoved(words);
+      void reload();
+    },
+    [reload],
   );
-  const { result, reload } = usePolled(load, anyBusy);
-  const { upgrades, error: upgradeError } = useUpgrades(api);
   const packages = result?.ok ? result.data.packages : [];
   const shown = useGrowingCount(packages.length);
   return (
     <section class="installed" aria-labelledby="installed-title">
       <h1 id="installed-title">Installed packages</h1>
+      <p class="hint" role="status">
+        {removed}
+      </p>
       {result === null && <p class="hint">Loading the installed packages…</p>}
       {result !== null && !result.ok && <ErrorText error={result.error} />}
       {upgradeError && (
@@ -184,7 +165,7 @@ export function InstalledScreen() {
       {packages.length > 0 && (
         <ul class="installed-list" aria-label="Installed packages">
           {Array.from({ length: Math.ceil(shown / kRowsPerFrame) }, (_, i) => (
-            <Rows key={i} packages={packages} from={i * kRowsPerFrame} upgrades={upgrades} onChanged={reload} />
+            <Rows key={i} packages={packages} from={i * kRowsPerFrame} upgrades={upgrades} onChanged={reload} onUpgraded={onUpgraded} onRemoved={onRemoved} />
           ))}
         </ul>
       )}

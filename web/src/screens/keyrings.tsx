@@ -1,20 +1,13 @@
 import { useRef, useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
+import { deleteKey, importKey, listKeys, type SigningKey } from '../api/keyring';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
-import { ConfirmDelete, ListTable, Outcome, useListing } from './settings-list';
+import { Field, FormButtons, hintId } from '../ui/form';
+import { ConfirmDelete, ListingTable, useListing } from '../ui/listing';
 
-// A key of the appliance's code-signing keyring, as the listing gives it
-// (docs/feeds.md, "The appliance keyring").
-interface SigningKey {
-  fingerprint: string;
-  uids: string[];
-  created: number;
-  expires: number | null;
-  revoked: boolean;
-}
-
-const keyringApi = 'KIVO.Core.Package.Feed.Keyring';
+// The appliance's code-signing keyring (docs/feeds.md, "The appliance
+// keyring"): the keys of the publishers it trusts.
 
 // Fingerprints read more easily, and are compared by eye more reliably, in
 // groups of four.
@@ -34,11 +27,12 @@ function keyState(key: SigningKey): string {
 
 export function KeyringsSection() {
   const { api } = useSession();
-  const { items: keys, error, setError, notice, done } = useListing<SigningKey>(keyringApi);
+  const listing = useListing<SigningKey>(listKeys);
+  const { setError, done } = listing;
   const [deleting, setDeleting] = useState<SigningKey | null>(null);
 
   const remove = async (key: SigningKey) => {
-    const result = await api.call(keyringApi, 'delete', 1, { list: JSON.stringify([key.fingerprint]) });
+    const result = await deleteKey(api, key);
     setDeleting(null);
     if (!result.ok) return setError(result.error);
     await done(`Key ${grouped(key.fingerprint)} deleted.`);
@@ -51,26 +45,26 @@ export function KeyringsSection() {
         The keys of publishers this appliance trusts. At the strictest trust level only packages signed by one of these keys (or
         by a key their feed brings) can be installed.
       </p>
-      {keys === null && !error && <p class="hint">Loading…</p>}
-      {keys && keys.length === 0 && <p>The keyring holds no key.</p>}
-      {keys && keys.length > 0 && (
-        <ListTable caption="Keys of the keyring" columns={['Publisher', 'Fingerprint', 'Created', 'State']}>
-          {keys.map((k) => (
-            <tr key={k.fingerprint}>
-              <td>{k.uids.join(', ') || <span class="hint">No name</span>}</td>
-              <td class="fingerprint">{grouped(k.fingerprint)}</td>
-              <td>{day(k.created)}</td>
-              <td>{keyState(k)}</td>
-              <td class="row-actions">
-                <button type="button" onClick={() => setDeleting(k)} aria-label={`Delete key ${k.uids[0] ?? k.fingerprint}`}>
-                  Delete
-                </button>
-              </td>
-            </tr>
-          ))}
-        </ListTable>
-      )}
-      <Outcome notice={notice} error={error} />
+      <ListingTable
+        listing={listing}
+        caption="Keys of the keyring"
+        columns={['Publisher', 'Fingerprint', 'Created', 'State']}
+        empty="The keyring holds no key."
+        keyOf={(k) => k.fingerprint}
+        cells={(k) => (
+          <>
+            <td>{k.uids.join(', ') || <span class="hint">No name</span>}</td>
+            <td class="fingerprint">{grouped(k.fingerprint)}</td>
+            <td>{day(k.created)}</td>
+            <td>{keyState(k)}</td>
+          </>
+        )}
+        actions={(k) => (
+          <button type="button" onClick={() => setDeleting(k)} aria-label={`Delete key ${k.uids[0] ?? k.fingerprint}`}>
+            Delete
+          </button>
+        )}
+      />
       <ImportKeyForm onImported={(name) => done(`Key file “${name}” imported.`)} />
       {deleting && (
         <ConfirmDelete title="Delete this key?" confirm="Delete key" onConfirm={() => void remove(deleting)} onClose={() => setDeleting(null)}>
@@ -94,8 +88,7 @@ function ImportKeyForm({ onImported }: { onImported: (name: string) => Promise<v
     const file = input.current?.files?.[0];
     if (!file) return;
     setBusy(true);
-    // Key files are small: no progress bar is worth showing.
-    const result = await api.upload(keyringApi, 'add', 1, {}, file, () => {}, undefined, 'upload_keyring');
+    const result = await importKey(api, file);
     setBusy(false);
     if (!result.ok) return setError(result.error);
     setError(null);
@@ -105,19 +98,11 @@ function ImportKeyForm({ onImported }: { onImported: (name: string) => Promise<v
   return (
     <form class="import-key" onSubmit={submit} aria-labelledby="import-key-title">
       <h3 id="import-key-title">Import a public key</h3>
-      <div class="field">
-        <label for="key-file">Key file</label>
-        <input id="key-file" type="file" required ref={input} aria-describedby="key-file-hint" />
-        <span class="hint" id="key-file-hint">
-          A publisher's OpenPGP public key (.asc or .gpg). Never import a secret key: it is refused.
-        </span>
-      </div>
+      <Field id="key-file" label="Key file" hint="A publisher's OpenPGP public key (.asc or .gpg). Never import a secret key: it is refused.">
+        <input id="key-file" type="file" required ref={input} aria-describedby={hintId('key-file')} />
+      </Field>
       <ErrorText error={error} />
-      <div class="buttons">
-        <button type="submit" class="primary" disabled={busy}>
-          Import key
-        </button>
-      </div>
+      <FormButtons label="Import key" busy={busy} />
     </form>
   );
 }

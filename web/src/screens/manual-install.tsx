@@ -1,24 +1,28 @@
 import './manual-install.css';
-import { useEffect, useRef, useState } from 'preact/hooks';
+import { useCallback, useEffect, useRef, useState } from 'preact/hooks';
 import type { Api, ApiFailure, Result } from '../api/client';
 import { PackageCode } from '../api/codes';
+import {
+  cleanUpload,
+  downloadTaskId,
+  installUploaded,
+  taskStatus,
+  uploadPackage,
+  type InstallAnswer,
+  type UploadAnswer,
+} from '../api/installation';
 import { messageFor } from '../api/messages';
+import { getPackage } from '../api/package';
+import { getSettings } from '../api/setting';
 import { useSession } from '../session';
 import { routeHref } from '../route';
 import { Dialog } from '../ui/dialog';
 import { OriginSwitch } from '../ui/origin-switch';
 import { ErrorText } from '../ui/error-text';
+import { usePoll } from '../ui/poll';
 import { ProgressBar } from '../ui/progress';
-import { Steps, type StepPage } from '../ui/steps';
-import {
-  CheckRefusal,
-  checkEnvironment,
-  installPages,
-  installParams,
-  type InstallChoices,
-  type PackageFacts,
-  type Volume,
-} from '../ui/install-pages';
+import type { StepPage } from '../ui/steps';
+import { CheckRefusal, checkEnvironment, InstallSteps, installParams, type InstallChoices, type PackageFacts, type Volume } from '../ui/install-pages';
 
 // Manual install: the administrator picks a package file, which is uploaded
 // and inspected by the appliance; the environment check runs; the wizard asks
@@ -28,29 +32,11 @@ import {
 // it, so every way out of the wizard other than a successful install asks the
 // appliance to clean it up.
 
-const kApi = 'KIVO.Core.Package.Installation';
 const kPollMs = 500;
-
-interface UploadAnswer {
-  id: string;
-  name: string;
-  version: string;
-  task_id: string;
-  licence?: string;
-  install_pages?: string;
-  codesign_error?: number;
-  codesign_message?: string;
-  additional?: { dependent_packages?: unknown; start_dependent_services?: unknown; install_type?: unknown };
-}
 
 interface CheckAnswer {
   volume_path?: string;
   is_occupied?: boolean;
-}
-
-interface InstallAnswer {
-  message?: string;
-  worker_message?: unknown;
 }
 
 // The trust level at which no confirmation lets an unverified package in
@@ -77,10 +63,13 @@ type Phase =
   | { kind: 'refused'; file: File; error: ApiFailure }
   | { kind: 'wizard'; prepared: Prepared; choices: InstallChoices }
   | { kind: 'installing'; prepared: Prepared; choices: InstallChoices; progress: number | null }
-  | { kind: 'done'; prepared: Prepared; choices: InstallChoices; trustUnverified: boolean; outcome: Result<InstallAnswer> };
+  | { kind: 'done'; prepared: Prepared; choices: InstallChoices; trustUnverified: boolean; outcome: Result<InstallAnswer>; status: string | null };
 
 // What the check needs to know about the package, from the upload's answer.
-function checkParams(upload: UploadAnswer) {
+// `upgrade`: the package is installed, in another version. The check then
+// does not refuse for the running packages that need it: whether the new
+// version still suits them, the package tool judges at the install.
+function checkParams(upload: UploadAnswer, upgrade: boolean) {
   const extra = upload.additional ?? {};
   const deps = extra.dependent_packages;
   const services = Array.isArray(extra.start_dependent_services) ? extra.start_dependent_services.filter((s) => typeof s === 'string') : [];
@@ -90,34 +79,33 @@ function checkParams(upload: UploadAnswer) {
     deppkgs: typeof deps === 'object' && deps !== null && Object.keys(deps).length > 0 ? deps : undefined,
     depsers: services.length > 0 ? services.join(':') : undefined,
     install_type: typeof extra.install_type === 'string' ? extra.install_type : undefined,
+    blCheckDep: upgrade ? false : undefined,
   };
 }
 
 async function prepare(api: Api, upload: UploadAnswer): Promise<Result<Prepared>> {
+  const installed = await getPackage(api, upload.id, []);
   const facts: PackageFacts = {
     id: upload.id,
     name: upload.name,
     version: upload.version,
     licence: upload.licence,
     installPages: upload.install_pages,
+    replaces: installed.ok ? installed.data.version : undefined,
   };
-  const environment = await checkEnvironment<CheckAnswer>(api, facts, checkParams(upload));
+  const environment = await checkEnvironment<CheckAnswer>(api, facts, checkParams(upload, installed.ok));
   if (!environment.ok) return environment;
   const { answer, volumes, choices, defaultVolumeError } = environment.data;
   const trustLevel = upload.codesign_error !== undefined ? await readTrustLevel(api) : null;
-  return { ok: true, data: { upload, trustLevel, facts, volumes, busy: answer.is_occupied === true, defaultVolumeError, initial: choices } };
+  // A package from a file starts once installed unless the user says not to,
+  // as one from a package server does.
+  const initial = { ...choices, startAfter: true };
+  return { ok: true, data: { upload, trustLevel, facts, volumes, busy: answer.is_occupied === true, defaultVolumeError, initial } };
 }
 
 async function readTrustLevel(api: Api): Promise<number | null> {
-  const settings = await api.call<{ trust_level?: unknown }>('KIVO.Core.Package.Setting', 'get', 1);
+  const settings = await getSettings(api);
   return settings.ok && typeof settings.data.trust_level === 'number' ? settings.data.trust_level : null;
-}
-
-function clean(api: Api, taskId: string): void {
-  // The appliance answers at once and removes the file in the background;
-  // an upload nobody comes back for is swept after a day anyway. The call is
-  // kept alive so that it also goes out when the page itself is left.
-  void api.call(kApi, 'clean', 1, { task_id: taskId }, true);
 }
 
 function workerMessages(answer: InstallAnswer): string[] {
@@ -184,13 +172,9 @@ function InstallWizard({
   onInstall: (choices: InstallChoices, trustUnverified: boolean) => void;
   onCancel: () => void;
 }) {
-  const [choices, setChoices] = useState(start);
   const [trustUnverified, setTrustUnverified] = useState(false);
   const unverified = prepared.upload.codesign_error !== undefined;
-  const pages = [
-    ...(unverified ? [codesignPage(prepared, trustUnverified, setTrustUnverified)] : []),
-    ...installPages(prepared.facts, prepared.volumes, choices, setChoices),
-  ];
+  const before = unverified ? [codesignPage(prepared, trustUnverified, setTrustUnverified)] : [];
   return (
     <>
       {prepared.busy && <p class="hint">Another package operation is under way; the install may have to wait for it.</p>}
@@ -200,12 +184,28 @@ function InstallWizard({
           <ErrorText error={prepared.defaultVolumeError} />
         </div>
       )}
-      <Steps pages={pages} finishLabel="Install" onFinish={() => onInstall(choices, trustUnverified)} onCancel={onCancel} />
+      <InstallSteps
+        facts={prepared.facts}
+        volumes={prepared.volumes}
+        start={start}
+        before={before}
+        onFinish={(choices) => onInstall(choices, trustUnverified)}
+        onCancel={onCancel}
+      />
     </>
   );
 }
 
-function InstallOutcome({ prepared, outcome }: { prepared: Prepared; outcome: Result<InstallAnswer> }) {
+// The package's state as the list reports it; null when it cannot be read
+// or the package has no service to run.
+async function statusOf(api: Api, id: string): Promise<string | null> {
+  const got = await getPackage<{ status?: string; startable?: boolean }>(api, id, ['status', 'startable']);
+  if (!got.ok || got.data.additional?.startable === false) return null;
+  return got.data.additional?.status ?? null;
+}
+
+// `status`: the state read after an install asked to start it.
+function InstallOutcome({ prepared, outcome, status }: { prepared: Prepared; outcome: Result<InstallAnswer>; status: string | null }) {
   const name = prepared.facts.name || prepared.facts.id;
   if (!outcome.ok) {
     return (
@@ -221,7 +221,8 @@ function InstallOutcome({ prepared, outcome }: { prepared: Prepared; outcome: Re
   return (
     <>
       <p class="installed-note" role="status">
-        {name} {prepared.facts.version} is installed. <a href={routeHref({ screen: 'package', id: prepared.facts.id })}>Show the package</a>
+        {name} {prepared.facts.version} is installed{status === null ? '' : status === 'running' ? ' and running' : ', but it does not run'}.{' '}
+        <a href={routeHref({ screen: 'package', id: prepared.facts.id })}>Show the package</a>
       </p>
       {lines.length > 0 && <MessageList lines={lines} />}
     </>
@@ -241,24 +242,17 @@ function MessageList({ lines }: { lines: string[] }) {
   );
 }
 
-// Polls the install task's progress while `active`; stops when it ends.
-function useInstallProgress(api: Api, packageId: string, active: boolean, onProgress: (value: number | null) => void) {
+// Polls the install task's progress while `active`, reporting each progress
+// the task gives; a status that fails is asked again all the same.
+function useInstallProgress(api: Api, packageId: string, active: boolean, onProgress: (value: number) => void) {
+  const load = useCallback(() => taskStatus(api, downloadTaskId(packageId)), [api, packageId]);
+  const { result } = usePoll(load, { everyMs: kPollMs, again: () => true, active, waitFirst: true });
+  const reported = useRef(onProgress);
+  reported.current = onProgress;
   useEffect(() => {
-    if (!active) return;
-    let stopped = false;
-    let timer: ReturnType<typeof setTimeout> | undefined;
-    const poll = async () => {
-      const status = await api.call<{ progress?: number; finished?: boolean }>(kApi, 'status', 1, { task_id: `@KIVOPKG_DOWNLOAD_${packageId}` });
-      if (stopped) return;
-      if (status.ok && typeof status.data.progress === 'number') onProgress(status.data.progress);
-      timer = setTimeout(poll, kPollMs);
-    };
-    timer = setTimeout(poll, kPollMs);
-    return () => {
-      stopped = true;
-      clearTimeout(timer);
-    };
-  }, [api, packageId, active]);
+    const progress = result?.ok ? result.data.progress : undefined;
+    if (typeof progress === 'number') reported.current(progress);
+  }, [result]);
 }
 
 function dialogTitle(phase: Phase): string {
@@ -288,7 +282,7 @@ export function ManualInstallScreen() {
   useEffect(() => {
     const leave = () => {
       abort.current?.abort();
-      if (pendingUpload.current) clean(api, pendingUpload.current);
+      if (pendingUpload.current) cleanUpload(api, pendingUpload.current);
       pendingUpload.current = null;
     };
     addEventListener('pagehide', leave);
@@ -307,12 +301,8 @@ export function ManualInstallScreen() {
     const controller = new AbortController();
     abort.current = controller;
     setPhase({ kind: 'uploading', file: chosen, sent: 0, total: chosen.size });
-    const additional = ['dependent_packages', 'start_dependent_services', 'install_type'];
-    const answer = await api.upload<UploadAnswer>(
-      kApi,
-      'upload',
-      1,
-      { additional },
+    const answer = await uploadPackage(
+      api,
       chosen,
       (sent, total) => setPhase((p) => (p.kind === 'uploading' ? { ...p, sent, total } : p)),
       controller.signal,
@@ -331,7 +321,7 @@ export function ManualInstallScreen() {
   };
 
   const finishUpload = () => {
-    if (pendingUpload.current) clean(api, pendingUpload.current);
+    if (pendingUpload.current) cleanUpload(api, pendingUpload.current);
     pendingUpload.current = null;
   };
 
@@ -339,15 +329,13 @@ export function ManualInstallScreen() {
   // came from elsewhere, is from now on a file's installed by hand.
   const install = async (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean, switchOrigin = false) => {
     setPhase({ kind: 'installing', prepared, choices, progress: null });
-    const outcome = await api.call<InstallAnswer>(kApi, 'install', 1, {
-      task_id: prepared.upload.task_id,
-      ...installParams(prepared.facts, choices),
-      check_codesign: trustUnverified ? false : undefined,
-      switch_origin: switchOrigin ? true : undefined,
-    });
+    const options = { trustUnverified, switchOrigin, start: choices.startAfter === true };
+    const outcome = await installUploaded(api, prepared.upload.task_id, installParams(prepared.facts, choices), options);
     // A successful install took the file; a failed one leaves it for a retry.
     if (outcome.ok) pendingUpload.current = null;
-    setPhase({ kind: 'done', prepared, choices, trustUnverified, outcome });
+    // Whether it runs is read back, not assumed from the request.
+    const status = outcome.ok && options.start ? await statusOf(api, prepared.facts.id) : null;
+    setPhase({ kind: 'done', prepared, choices, trustUnverified, outcome, status });
   };
 
   const close = () => {
@@ -448,7 +436,7 @@ function PhaseBody({
       }
       return (
         <>
-          <InstallOutcome prepared={phase.prepared} outcome={phase.outcome} />
+          <InstallOutcome prepared={phase.prepared} outcome={phase.outcome} status={phase.status} />
           <div class="buttons">
             {!phase.outcome.ok && (
               <button type="button" onClick={() => onRetry(phase.prepared, phase.choices)}>

@@ -1,43 +1,44 @@
 import './package-details.css';
 import { useCallback, useState } from 'preact/hooks';
+import { screenshotUrl } from '../api/images';
+import { getPackage, packageLog } from '../api/package';
 import { routeHref } from '../route';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
+import { PackageActions } from '../ui/package-actions';
 import { PackageIcon } from '../ui/package-icon';
-import { isBusyStatus, StatusBadge } from '../ui/status-badge';
-import { usePolled } from './installed';
-import { PackageActions } from './package-actions';
+import { usePoll } from '../ui/poll';
+import { usePackageNames } from '../ui/package-names';
+import { isBusyStatus, kBusyPollMs, StatusBadge } from '../ui/status-badge';
+import { useUpgradeOffers } from '../ui/upgrade-flow';
 
 // One installed package: what it is, who makes it, where to get help, what
 // it needs, the address of its own web page while it runs, its screenshots
-// and its log.
+// and its log, with what can be done with it (an upgrade a package server
+// offers included).
 
 interface Dependency {
   operator?: string;
   version?: string;
 }
 
-interface PackageDetails {
-  id: string;
-  name: string;
-  version: string;
-  additional?: {
-    description?: string;
-    maintainer?: string;
-    maintainer_url?: string;
-    distributor?: string;
-    distributor_url?: string;
-    help_url?: string;
-    support_url?: string;
-    report_beta_url?: string;
-    beta?: boolean;
-    startable?: boolean;
-    status?: string;
-    url?: string | string[];
-    is_uninstall_pages?: boolean;
-    dependent_packages?: Record<string, Dependency> | null;
-    installed_info?: { path?: string };
-  };
+// The fields of "get" the page shows.
+interface DetailFields {
+  description?: string;
+  maintainer?: string;
+  maintainer_url?: string;
+  distributor?: string;
+  distributor_url?: string;
+  help_url?: string;
+  support_url?: string;
+  report_beta_url?: string;
+  beta?: boolean;
+  startable?: boolean;
+  status?: string;
+  url?: string | string[];
+  is_uninstall_pages?: boolean;
+  dependent_packages?: Record<string, Dependency> | null;
+  installed_info?: { path?: string };
 }
 
 const kDetailFields = [
@@ -73,7 +74,7 @@ function Person({ label, name, url }: { label: string; name?: string; url?: stri
   );
 }
 
-function Links({ extra }: { extra: NonNullable<PackageDetails['additional']> }) {
+function Links({ extra }: { extra: DetailFields }) {
   const links = [
     { label: 'Help', url: extra.help_url },
     { label: 'Support', url: extra.support_url },
@@ -97,7 +98,9 @@ function Links({ extra }: { extra: NonNullable<PackageDetails['additional']> }) 
 }
 
 function Dependencies({ deps }: { deps: Record<string, Dependency> | null | undefined }) {
+  const { api } = useSession();
   const ids = Object.keys(deps ?? {});
+  const nameOf = usePackageNames(api, ids.length > 0);
   return (
     <>
       <dt>Needs</dt>
@@ -110,7 +113,7 @@ function Dependencies({ deps }: { deps: Record<string, Dependency> | null | unde
               const dep = deps?.[id] ?? {};
               return (
                 <li key={id}>
-                  <a href={routeHref({ screen: 'package', id })}>{id}</a>
+                  <a href={routeHref({ screen: 'package', id })}>{nameOf(id)}</a>
                   {dep.operator && dep.version ? ` ${dep.operator} ${dep.version}` : ''}
                 </li>
               );
@@ -142,7 +145,7 @@ function WebAddress({ url }: { url: string | string[] | undefined }) {
 // A package has up to eight screenshots and the API does not say how
 // many: each one is asked for after the one before it loaded, and the first
 // that is missing ends the row.
-function Screenshots({ id, version }: { id: string; version: string }) {
+function Screenshots({ id, name, version }: { id: string; name: string; version: string }) {
   const { api } = useSession();
   const [loaded, setLoaded] = useState(0);
   const [ended, setEnded] = useState(false);
@@ -155,8 +158,8 @@ function Screenshots({ id, version }: { id: string; version: string }) {
         {indexes.map((index) => (
           <img
             key={index}
-            src={api.url('KIVO.Core.Package.Screenshot', 'get', 1, { name: id, ver: version, index })}
-            alt={`Screenshot ${index} of ${id}`}
+            src={screenshotUrl(api, id, version, index)}
+            alt={`Screenshot ${index} of ${name}`}
             hidden={index > loaded}
             onLoad={() => setLoaded((n) => Math.max(n, index))}
             onError={() => setEnded(true)}
@@ -169,8 +172,9 @@ function Screenshots({ id, version }: { id: string; version: string }) {
 
 function Log({ id }: { id: string }) {
   const { api } = useSession();
-  const load = useCallback(() => api.call<{ pkglog: string }>('KIVO.Core.Package.Log', 'get', 1, { name: id }), [api, id]);
-  const { result, reload } = usePolled(load, () => false);
+  const load = useCallback(() => packageLog(api, id), [api, id]);
+  // Asked once; the button asks again.
+  const { result, reload } = usePoll(load, { everyMs: kBusyPollMs, again: () => false });
   return (
     <section aria-labelledby="log-title">
       <div class="section-head">
@@ -188,13 +192,26 @@ function Log({ id }: { id: string }) {
 
 export function PackageScreen({ id }: { id: string }) {
   const { api } = useSession();
-  const load = useCallback(() => api.call<PackageDetails>('KIVO.Core.Package', 'get', 1, { id, additional: kDetailFields }), [api, id]);
-  const { result, reload } = usePolled(load, (p) => isBusyStatus(p.additional?.status));
+  const load = useCallback(() => getPackage<DetailFields>(api, id, kDetailFields), [api, id]);
+  const { result, reload } = usePoll(load, { everyMs: kBusyPollMs, again: (r) => r.ok && isBusyStatus(r.data.additional?.status) });
+  // Asked again after an upgrade: what is offered changes with what is
+  // installed.
+  const [upgraded, setUpgraded] = useState(0);
+  const { offers } = useUpgradeOffers(api, false, upgraded);
+  // The words that the package was uninstalled, once it was.
+  const [removed, setRemoved] = useState<string | null>(null);
   const back = (
     <p>
       <a href={routeHref({ screen: 'installed' })}>← Installed packages</a>
     </p>
   );
+  if (removed !== null)
+    return (
+      <section>
+        {back}
+        <p role="status">{removed}</p>
+      </section>
+    );
   if (result === null) return <p class="hint">Loading {id}…</p>;
   if (!result.ok)
     return (
@@ -214,13 +231,27 @@ export function PackageScreen({ id }: { id: string }) {
         <div>
           <h1 id="details-title">{pkg.name}</h1>
           <p class="details-version">
-            Version {pkg.version} {extra.beta && <span class="badge beta">Beta</span>} <StatusBadge status={extra.status} withReason />
+            Version {pkg.version} {extra.beta && <span class="badge beta">Beta</span>}{' '}
+            {offers.has(pkg.id) && <span class="badge upgrade">{offers.get(pkg.id)?.version} available</span>} <StatusBadge status={extra.status} withReason />
           </p>
         </div>
         <PackageActions
-          pkg={{ id: pkg.id, name: pkg.name, status: extra.status, startable: extra.startable, hasUninstallPages: extra.is_uninstall_pages }}
+          pkg={{
+            id: pkg.id,
+            name: pkg.name,
+            version: pkg.version,
+            status: extra.status,
+            startable: extra.startable,
+            hasUninstallPages: extra.is_uninstall_pages,
+            url: extra.url,
+            upgrade: offers.get(pkg.id),
+          }}
           onChanged={reload}
-          onRemoved={() => (location.hash = routeHref({ screen: 'installed' }))}
+          onUpgraded={() => {
+            setUpgraded((n) => n + 1);
+            void reload();
+          }}
+          onRemoved={setRemoved}
         />
       </header>
       {extra.description && <p class="details-description">{extra.description}</p>}
@@ -239,7 +270,7 @@ export function PackageScreen({ id }: { id: string }) {
           </>
         )}
       </dl>
-      <Screenshots id={pkg.id} version={pkg.version} />
+      <Screenshots id={pkg.id} name={pkg.name} version={pkg.version} />
       <Log id={pkg.id} />
     </article>
   );

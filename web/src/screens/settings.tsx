@@ -1,30 +1,15 @@
 import { useEffect, useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
+import { listPackages, type PackageInfo } from '../api/package';
+import { getSettings, setSettings, settingStepWords, type StoredSettings } from '../api/setting';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
+import { Field, FormButtons } from '../ui/form';
 import { FeedsSection } from './feeds';
 import { KeyringsSection } from './keyrings';
 import './settings.css';
 
-// What "KIVO.Core.Package.Setting" "get" answers (docs/settings.md).
-interface StoredSettings {
-  enable_email: boolean;
-  enable_nvx: boolean;
-  mailset: boolean;
-  trust_level: number;
-  update_channel: boolean;
-  volumes?: { volume_path: string; status: string; size_free_byte?: string }[];
-  default_vol?: string;
-  volume_status?: string;
-  enable_autoupdate: boolean;
-  autoupdateall: boolean;
-}
-
-interface InstalledPackage {
-  id: string;
-  name: string;
-  additional?: { autoupdate?: boolean };
-}
+type InstalledPackage = PackageInfo<{ autoupdate?: boolean }>;
 
 type AutoUpdate = 'off' | 'all' | 'chosen';
 
@@ -93,10 +78,7 @@ function PreferencesSection() {
   const [busy, setBusy] = useState(false);
 
   const load = async () => {
-    const [settings, list] = await Promise.all([
-      api.call<StoredSettings>('KIVO.Core.Package.Setting', 'get', 1),
-      api.call<{ packages: InstalledPackage[] }>('KIVO.Core.Package', 'list', 1, { additional: ['autoupdate'] }),
-    ]);
+    const [settings, list] = await Promise.all([getSettings(api), listPackages<{ autoupdate?: boolean }>(api, ['autoupdate'])]);
     if (!settings.ok) return setLoadError(settings.error);
     if (!list.ok) return setLoadError(list.error);
     setLoadError(null);
@@ -118,7 +100,7 @@ function PreferencesSection() {
     if (!choices) return;
     setBusy(true);
     setSaved(false);
-    const result = await api.call('KIVO.Core.Package.Setting', 'set', 1, {
+    const result = await setSettings(api, {
       update_channel: choices.channel,
       trust_level: choices.trustLevel,
       enable_nvx: choices.notifyDesktop,
@@ -168,7 +150,7 @@ function PreferencesSection() {
           <VolumeChoice stored={stored} value={choices.volume} onChange={(volume) => change({ volume })} />
           {saveError && (
             <div>
-              <p>The settings were not all saved{saveError.step ? ` (stopped at: ${stepWords(saveError.step)})` : ''}.</p>
+              <p>The settings were not all saved{saveError.step ? ` (stopped at: ${settingStepWords(saveError.step) ?? saveError.step})` : ''}.</p>
               <ErrorText error={saveError.failure} />
             </div>
           )}
@@ -177,25 +159,11 @@ function PreferencesSection() {
               Settings saved.
             </p>
           )}
-          <div class="buttons">
-            <button type="submit" class="primary" disabled={busy}>
-              Save settings
-            </button>
-          </div>
+          <FormButtons label="Save settings" busy={busy} />
         </form>
       )}
     </section>
   );
-}
-
-function stepWords(step: string): string {
-  const words: Record<string, string> = {
-    trust_level: 'trust level',
-    update_channel: 'update channel',
-    notification: 'notifications',
-    autoupdate: 'automatic updates',
-  };
-  return words[step] ?? step;
 }
 
 function ChannelChoice({ value, onChange }: { value: 'stable' | 'beta'; onChange: (v: 'stable' | 'beta') => void }) {
@@ -314,8 +282,7 @@ function NotificationChoice({
 function VolumeChoice({ stored, value, onChange }: { stored: StoredSettings; value: string; onChange: (v: string) => void }) {
   const volumes = stored.volumes ?? [];
   return (
-    <div class="field">
-      <label for="default-volume">Default volume for new packages</label>
+    <Field id="default-volume" label="Default volume for new packages">
       <select id="default-volume" value={value} onChange={(e) => onChange(e.currentTarget.value)}>
         {value === '' && <option value="">Not chosen: ask at each install</option>}
         {value !== '' && !volumes.some((v) => v.volume_path === value) && <option value={value}>{value} (not available)</option>}
@@ -327,6 +294,6 @@ function VolumeChoice({ stored, value, onChange }: { stored: StoredSettings; val
         ))}
       </select>
       {stored.volume_status && <p class="warning">{kVolumeProblems[stored.volume_status] ?? kVolumeProblems.unknown}</p>}
-    </div>
+    </Field>
   );
 }

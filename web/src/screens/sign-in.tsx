@@ -1,6 +1,7 @@
 import { useState } from 'preact/hooks';
 import type { ApiFailure, Api, SessionInfo } from '../api/client';
 import { ErrorText } from '../ui/error-text';
+import { TextField } from '../ui/form';
 
 export function SignInScreen({ api, onSignedIn, notice }: { api: Api; onSignedIn: (s: SessionInfo) => void; notice?: string }) {
   const [account, setAccount] = useState('');
@@ -22,21 +23,8 @@ export function SignInScreen({ api, onSignedIn, notice }: { api: Api; onSignedIn
         <h1 id="sign-in-title">Package Center</h1>
         <p>Sign in with an administrator account of this appliance.</p>
         {notice && <p class="hint">{notice}</p>}
-        <div class="field">
-          <label for="account">Account</label>
-          <input id="account" autocomplete="username" required value={account} onInput={(e) => setAccount(e.currentTarget.value)} />
-        </div>
-        <div class="field">
-          <label for="password">Password</label>
-          <input
-            id="password"
-            type="password"
-            autocomplete="current-password"
-            required
-            value={password}
-            onInput={(e) => setPassword(e.currentTarget.value)}
-          />
-        </div>
+        <TextField id="account" label="Account" autocomplete="username" required value={account} onValue={setAccount} />
+        <TextField id="password" label="Password" type="password" autocomplete="current-password" required value={password} onValue={setPassword} />
         <ErrorText error={error} />
         <button type="submit" class="primary" disabled={busy}>
           Sign in

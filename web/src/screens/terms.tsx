@@ -1,26 +1,14 @@
 import type { ComponentChildren } from 'preact';
 import { useEffect, useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
+import { agreeToTerms, readPackageCenterInfo } from '../api/terms';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
-import './settings.css';
-
-// What "KIVO.Core.Package.Info" "get" says about the terms of service
-// (docs/settings.md): "new" until the user agreed, "change" when the text
-// changed since (or its hash cannot be confirmed), "no" otherwise.
-interface PackageCenterInfo {
-  show_tos: 'no' | 'new' | 'change';
-  tos_hash: string;
-}
+import './terms.css';
 
 // The vendor publishes the text beside its catalogue, which this appliance's
 // web server serves under /feed/.
 const kTermsAddress = '/feed/terms-of-service.txt';
-
-// The package center's own object in the user's settings on the appliance,
-// the same one the information reads the agreement from. The agreement lives
-// there, per account, never in the browser.
-const kPackageCenterSettings = 'KIVO.PXS.PkgManApp.Instance';
 
 type Gate =
   | { kind: 'checking' }
@@ -35,7 +23,7 @@ export function TermsGate({ children }: { children: ComponentChildren }) {
   const [gate, setGate] = useState<Gate>({ kind: 'checking' });
   const check = async () => {
     setGate({ kind: 'checking' });
-    const info = await api.call<PackageCenterInfo>('KIVO.Core.Package.Info', 'get', 1);
+    const info = await readPackageCenterInfo(api);
     if (!info.ok) return setGate({ kind: 'failed', error: info.error });
     if (info.data.show_tos === 'no') return setGate({ kind: 'open' });
     setGate({ kind: 'ask', changed: info.data.show_tos === 'change', hash: info.data.tos_hash });
@@ -97,10 +85,7 @@ function TermsScreen({
 
   const agree = async () => {
     setBusy(true);
-    const result = await api.call('KIVO.API.UserSettings', 'set', 1, {
-      app: kPackageCenterSettings,
-      settings: { termofservice: true, termofservice_4_2: true, agreed_tos_hash: hash },
-    });
+    const result = await agreeToTerms(api, hash);
     setBusy(false);
     if (!result.ok) return setError(result.error);
     await onAgreed();

@@ -7,6 +7,9 @@
 //   the flow keeps an `InstallChoices` (useState) and rebuilds the pages on
 //   every render, passing the choices in and a setter out. Pages whose
 //   answers are incomplete carry a `problem`, so Steps keeps the user there.
+// - `InstallSteps` runs those pages as a Back/Next flow that keeps the
+//   choices itself, after pages of the flow's own, and hands the choices
+//   to `onFinish`.
 // - `installPages` builds the whole sequence from what the API said about the
 //   package (`PackageFacts`: the licence and wizard pages as the API sends
 //   them, URL-encoded) and the volumes (`readVolumes` of a `check` or
@@ -19,14 +22,20 @@
 //   (`volume_path`, `extra_values`: the wizard's answers as JSON text).
 // - `CheckRefusal` shows why the environment check (or the upload's
 //   inspection, which makes the same tests, or the install) refused, with
-//   the packages, services or system versions the answer names.
-// - `loadDefaultVolume` asks KIVO.Core.Package.Setting.Volume "get"; an
-//   appliance with none set answers an empty string, not a failure.
+//   the packages (by their display names), services or system versions the
+//   answer names.
+// - `checkEnvironment` runs the environment check and reads the default
+//   volume, and gives the volumes and first choices for the pages.
 
 import './install-pages.css';
+import { useState } from 'preact/hooks';
 import type { Api, ApiFailure, Params, Result } from '../api/client';
+import { checkInstall, type InstallValues } from '../api/installation';
 import { explain } from '../api/messages';
-import type { StepPage } from './steps';
+import { getDefaultVolume } from '../api/setting';
+import { useSession } from '../session';
+import { usePackageNames } from './package-names';
+import { Steps, type StepPage } from './steps';
 import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from './wizard';
 
 export interface Volume {
@@ -41,12 +50,17 @@ export interface PackageFacts {
   version: string;
   licence?: unknown;
   installPages?: unknown;
+  // The version this install replaces, for an upgrade.
+  replaces?: string;
 }
 
 export interface InstallChoices {
   licenceAccepted: boolean;
   wizard: WizardValues;
   volume: string;
+  // Whether the package starts once installed, where the flow lets the user
+  // choose (the summary then asks); undefined where the flow decides.
+  startAfter?: boolean;
 }
 
 function isObject(value: unknown): value is Record<string, unknown> {
@@ -65,12 +79,6 @@ export function readVolumes(answer: unknown): Volume[] {
   return answer.volumes
     .filter((v): v is Record<string, unknown> => isObject(v) && typeof v.volume_path === 'string' && v.volume_path !== '')
     .map((v) => ({ path: v.volume_path as string, freeBytes: byteCount(v.size_free_byte), totalBytes: byteCount(v.size_total_byte) }));
-}
-
-export async function loadDefaultVolume(api: Api): Promise<Result<string>> {
-  const answer = await api.call<{ default_vol?: string } | null>('KIVO.Core.Package.Setting.Volume', 'get', 1);
-  if (!answer.ok) return answer;
-  return { ok: true, data: typeof answer.data?.default_vol === 'string' ? answer.data.default_vol : '' };
 }
 
 // The licence text the API sent URL-encoded, or null when there is none.
@@ -102,10 +110,7 @@ export async function checkEnvironment<T extends { volume_path?: string }>(
   facts: PackageFacts,
   params: Params,
 ): Promise<Result<Environment<T>>> {
-  const [check, defaultVolume] = await Promise.all([
-    api.call<T>('KIVO.Core.Package.Installation', 'check', 2, params),
-    loadDefaultVolume(api),
-  ]);
+  const [check, defaultVolume] = await Promise.all([checkInstall<T>(api, params), getDefaultVolume(api)]);
   if (!check.ok) return check;
   const volumes = readVolumes(check.data);
   const choices = initialChoices(facts, volumes, check.data.volume_path ?? '', defaultVolume.ok ? defaultVolume.data : '');
@@ -121,7 +126,7 @@ export function initialChoices(facts: PackageFacts, volumes: Volume[], installed
   return { licenceAccepted: false, wizard: steps ? initialWizardValues(steps) : {}, volume };
 }
 
-export function installParams(facts: PackageFacts, choices: InstallChoices): { volume_path: string; extra_values?: string } {
+export function installParams(facts: PackageFacts, choices: InstallChoices): InstallValues {
   const hasWizard = decodeWizard(facts.installPages) !== null;
   return { volume_path: choices.volume, extra_values: hasWizard ? JSON.stringify(choices.wizard) : undefined };
 }
@@ -200,10 +205,11 @@ export function volumePage(volumes: Volume[], choices: InstallChoices, onChange:
   };
 }
 
-export function summaryPage(facts: PackageFacts, choices: InstallChoices, extra: { label: string; value: string }[] = []): StepPage {
+export function summaryPage(facts: PackageFacts, choices: InstallChoices, extra: { label: string; value: string }[] = [], onChange?: Change): StepPage {
   const rows = [
     { label: 'Package', value: facts.name || facts.id },
-    { label: 'Version', value: facts.version },
+    ...(facts.replaces !== undefined ? [{ label: 'Installed now', value: facts.replaces }] : []),
+    { label: facts.replaces !== undefined ? 'New version' : 'Version', value: facts.version },
     { label: 'Volume', value: choices.volume },
     ...extra,
   ];
@@ -211,7 +217,7 @@ export function summaryPage(facts: PackageFacts, choices: InstallChoices, extra:
     title: 'Summary',
     body: (
       <>
-        <p>The package will be installed with these choices.</p>
+        <p>{facts.replaces !== undefined ? 'The package will replace the installed version, with these choices.' : 'The package will be installed with these choices.'}</p>
         <dl class="summary">
           {rows.map((r) => (
             <div key={r.label}>
@@ -220,6 +226,12 @@ export function summaryPage(facts: PackageFacts, choices: InstallChoices, extra:
             </div>
           ))}
         </dl>
+        {choices.startAfter !== undefined && onChange && (
+          <label class="choice">
+            <input type="checkbox" checked={choices.startAfter} onChange={(e) => onChange({ ...choices, startAfter: e.currentTarget.checked })} /> Start{' '}
+            {facts.name || facts.id} once it is installed
+          </label>
+        )}
       </>
     ),
   };
@@ -234,15 +246,44 @@ export function installPages(facts: PackageFacts, volumes: Volume[], choices: In
     ...(licence !== null ? [licencePage(licence, choices, onChange)] : []),
     ...(steps ? wizardPages(steps, choices, onChange) : []),
     volumePage(volumes, choices, onChange),
-    summaryPage(facts, choices),
+    summaryPage(facts, choices, [], onChange),
   ];
+}
+
+// The install pages as a Back/Next flow from the choices `start`, after the
+// flow's own pages `before` (which may depend on state of the flow's own);
+// Finish hands the choices to `onFinish`.
+export function InstallSteps({
+  facts,
+  volumes,
+  start,
+  before = [],
+  busy,
+  finishLabel = 'Install',
+  onFinish,
+  onCancel,
+}: {
+  facts: PackageFacts;
+  volumes: Volume[];
+  start: InstallChoices;
+  before?: StepPage[];
+  busy?: boolean;
+  finishLabel?: string;
+  onFinish: (choices: InstallChoices) => void;
+  onCancel: () => void;
+}) {
+  const [choices, setChoices] = useState(start);
+  const pages = [...before, ...installPages(facts, volumes, choices, setChoices)];
+  return <Steps pages={pages} finishLabel={finishLabel} onFinish={() => onFinish(choices)} onCancel={onCancel} busy={busy} />;
 }
 
 // A refusal of the environment check, of a package file or of an install,
 // in words: what happened, then each thing the answer names as in the way,
 // one line each.
 export function CheckRefusal({ error }: { error: ApiFailure }) {
-  const { summary, details } = explain(error);
+  const { api } = useSession();
+  const nameOf = usePackageNames(api, true);
+  const { summary, details } = explain(error, nameOf);
   return (
     <div class="refusal" role="alert" data-code={error.code}>
       <p class="error">{summary}</p>

@@ -1,3 +1,4 @@
+import { iconUrl } from '../api/images';
 import { useSession } from '../session';
 
 // An installed package's icon, loaded by URL (the cookie is enough for
@@ -7,6 +8,5 @@ import { useSession } from '../session';
 // and not per package.
 export function PackageIcon({ id, version, size = 72, shown = 48 }: { id: string; version: string; size?: 72 | 256; shown?: number }) {
   const { api } = useSession();
-  const src = api.url('KIVO.Core.Package.Thumb', 'get', 1, { name: id, ver: version, size });
-  return <img class="package-icon" src={src} alt="" width={shown} height={shown} loading="lazy" decoding="async" />;
+  return <img class="package-icon" src={iconUrl(api, id, version, size)} alt="" width={shown} height={shown} loading="lazy" decoding="async" />;
 }

@@ -32,6 +32,9 @@ const kStatuses: Record<string, StatusText> = {
 // without anyone asking for it.
 const kBusy = new Set(['starting', 'stopping', 'installing', 'upgrading', 'uninstalling']);
 
+// How often the state of a busy package is asked again.
+export const kBusyPollMs = 1500;
+
 export function isBusyStatus(status: string | undefined): boolean {
   return status !== undefined && kBusy.has(status);
 }

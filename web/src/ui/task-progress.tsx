@@ -5,49 +5,28 @@
 // ends as soon as the task does, and with the component.
 
 import './task-progress.css';
-import { useEffect, useRef, useState } from 'preact/hooks';
-import type { ApiFailure } from '../api/client';
+import { useCallback, useEffect, useRef, useState } from 'preact/hooks';
+import type { ApiFailure, Result } from '../api/client';
 import { messageFor } from '../api/messages';
-import { DownloadCode } from '../api/codes';
+import { DownloadCode, ToolCode } from '../api/codes';
+import { cancelTask, taskStatus, type TaskData } from '../api/installation';
 import { useSession } from '../session';
 import { ErrorText } from './error-text';
 import { formatBytes } from './install-pages';
+import { usePoll } from './poll';
 import { ProgressBar } from './progress';
 
 const kPollMs = 500;
 
-// The download task's "data" (docs/package-server.md), as "status" answers it.
-export interface TaskData {
-  id?: string;
-  taskid?: string;
-  status?: string;
-  finished?: boolean;
-  installing?: boolean;
-  blqinst?: boolean;
-  progress?: number | string;
-  size?: number;
-  // A download's failure is {code, message}; a failed install from a package
-  // server adds the package tool's code ("result"). A job whose process died
-  // reads as failed with the API code alone and the reason in "message". A
-  // failed install from a file keeps its data as it started ("installing"
-  // true): its task is finished, or no longer installing in the catalogue,
-  // while its status still says installing (the install's own answer says
-  // why).
-  error?: { code?: number; message?: string; result?: number } | number;
-  message?: string;
-  signature?: string;
-  feed?: string;
-  origin?: string;
-}
-
 // How a followed task ended: `done` with its last data; `gone` when it was
 // no longer there (another page read its end first); `failed` with the
-// reason in words (and the package tool's code, when the install refused);
-// `cancelled` by this page.
+// reason in words (and the package tool's code, when the install refused,
+// with the running package an upgrade would break); `cancelled` by this
+// page.
 export type TaskEnd =
   | { kind: 'done'; data: TaskData }
   | { kind: 'gone' }
-  | { kind: 'failed'; text: string; result?: number }
+  | { kind: 'failed'; text: string; result?: number; dependent?: string }
   | { kind: 'cancelled' };
 
 // Words for the download worker's own error codes (not API codes).
@@ -61,13 +40,17 @@ const kDownloadProblems: Record<number, string> = {
   [DownloadCode.Request]: 'The catalogue gives no usable address for this package, or no folder could be made for it.',
 };
 
+const kDependentsBlock = 'The upgrade was not made: a running package needs the version installed now. It can go ahead while that package is stopped.';
+
 // The reason a task failed, in words, or null when it did not fail.
 export function taskFailure(data: TaskData): string | null {
   const { error } = data;
   if (typeof error === 'number') return messageFor({ code: error, errors: data.message ? { message: data.message } : undefined });
   if (error && typeof error === 'object') {
     const known = error.code !== undefined ? kDownloadProblems[error.code] : undefined;
-    const summary = known ?? `The download failed (error ${error.code ?? 'unknown'}).`;
+    // A temporary block, not a package that cannot be installed.
+    const blocked = error.result === ToolCode.DependentsRunning ? kDependentsBlock : undefined;
+    const summary = blocked ?? known ?? `The download failed (error ${error.code ?? 'unknown'}).`;
     return error.message ? `${summary} ${error.message}` : summary;
   }
   if (installEndedUnfinished(data)) return 'The install did not complete.';
@@ -85,8 +68,8 @@ function installEndedUnfinished(data: TaskData): boolean {
 export function taskEnd(data: TaskData): TaskEnd {
   const failure = taskFailure(data);
   if (failure !== null) {
-    const result = typeof data.error === 'object' ? data.error.result : undefined;
-    return { kind: 'failed', text: failure, result };
+    const error = typeof data.error === 'object' ? data.error : undefined;
+    return { kind: 'failed', text: failure, result: error?.result, dependent: error?.deppkg };
   }
   return data.status === undefined ? { kind: 'gone' } : { kind: 'done', data };
 }
@@ -109,6 +92,13 @@ function amount(data: TaskData, progress: number | null): string {
   return ` (${formatBytes(Math.round(data.size * progress))} of ${formatBytes(data.size)})`;
 }
 
+// The task's data as last answered: a failed status leaves it shown.
+function useLastData(result: Result<TaskData> | null): TaskData | null {
+  const last = useRef<TaskData | null>(null);
+  if (result?.ok) last.current = result.data;
+  return last.current;
+}
+
 export function TaskProgress({
   taskId,
   name,
@@ -120,44 +110,31 @@ export function TaskProgress({
   onEnd: (end: TaskEnd) => void;
 }) {
   const { api } = useSession();
-  const [data, setData] = useState<TaskData | null>(null);
-  const [failure, setFailure] = useState<ApiFailure | null>(null);
+  const load = useCallback(() => taskStatus(api, taskId), [api, taskId]);
+  // A failed status is not asked again: the user retries ("Check again")
+  // once the cause is seen to.
+  const { result, reload } = usePoll(load, { everyMs: kPollMs, again: (r) => r.ok && !r.data.finished });
+  const data = useLastData(result);
+  const [cancelFailure, setCancelFailure] = useState<ApiFailure | null>(null);
   const [cancelling, setCancelling] = useState(false);
-  const [attempt, setAttempt] = useState(0);
   const ended = useRef(onEnd);
   ended.current = onEnd;
 
   useEffect(() => {
-    let stopped = false;
-    let timer: ReturnType<typeof setTimeout> | undefined;
-    const poll = async () => {
-      const answer = await api.call<TaskData>('KIVO.Core.Package.Installation', 'status', 1, { task_id: taskId });
-      if (stopped) return;
-      if (!answer.ok) {
-        // Not polled on: the user retries once the cause is seen to.
-        setFailure(answer.error);
-        return;
-      }
-      setFailure(null);
-      setData(answer.data);
-      if (answer.data.finished) ended.current(taskEnd(answer.data));
-      else timer = setTimeout(poll, kPollMs);
-    };
-    void poll();
-    return () => {
-      stopped = true;
-      clearTimeout(timer);
-    };
-  }, [api, taskId, attempt]);
+    if (!result?.ok) return;
+    setCancelFailure(null);
+    if (result.data.finished) ended.current(taskEnd(result.data));
+  }, [result]);
 
   const cancel = async () => {
     setCancelling(true);
-    const answer = await api.call('KIVO.Core.Package.Installation', 'cancel', 1, { taskid: taskId });
+    const answer = await cancelTask(api, taskId);
     setCancelling(false);
     if (answer.ok) ended.current({ kind: 'cancelled' });
-    else setFailure(answer.error);
+    else setCancelFailure(answer.error);
   };
 
+  const failure = cancelFailure ?? (result && !result.ok ? result.error : null);
   const progress = progressOf(data);
   const words = (data?.status && kStatusWords[data.status]) || 'Starting';
   return (
@@ -166,7 +143,7 @@ export function TaskProgress({
       {failure && (
         <>
           <ErrorText error={failure} />
-          <button type="button" onClick={() => setAttempt(attempt + 1)}>
+          <button type="button" onClick={() => void reload()}>
             Check again
           </button>
         </>

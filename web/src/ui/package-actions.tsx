@@ -2,25 +2,39 @@ import './package-actions.css';
 import { useState } from 'preact/hooks';
 import type { Api, ApiFailure, Result } from '../api/client';
 import { PackageCode } from '../api/codes';
-import { Dialog } from '../ui/dialog';
+import { controlPackages, uninstallPackage } from '../api/control';
 import { explain } from '../api/messages';
-import { Steps, type StepPage } from '../ui/steps';
-import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from '../ui/wizard';
-import { isBusyStatus } from '../ui/status-badge';
+import { feasibilityCheck, getPackage } from '../api/package';
+import type { ServerEntry } from '../api/server';
 import { useSession } from '../session';
+import { Dialog } from './dialog';
+import { OpenLink } from './open-link';
+import { usePackageNames } from './package-names';
+import { Steps, type StepPage } from './steps';
+import { UpgradeFlow } from './upgrade-flow';
+import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from './wizard';
+import { isBusyStatus } from './status-badge';
 
-// Start, stop and uninstall of one installed package. Stop and uninstall
-// ask the appliance first whether they are allowed (the feasibility check,
-// docs/feasibility.md): hard reasons refuse and are shown, soft reasons are
-// shown and need a confirmation. The check knows no start: what a start
-// needs (its dependencies running) the start itself refuses, and says so.
+// What can be done with one installed package: open its web page while it
+// runs, upgrade it when a package server offers a newer version (the same
+// upgrade dialog as the catalogue's, ui/upgrade-flow.tsx), start, stop and
+// uninstall it. Stop and uninstall ask the appliance first whether they are
+// allowed (the feasibility check, docs/feasibility.md): hard reasons refuse
+// and are shown, soft reasons are shown and need a confirmation. The check
+// knows no start: what a start needs (its dependencies running) the start
+// itself refuses, and says so.
 
 export interface ActionPackage {
   id: string;
   name: string;
+  version: string;
   status?: string;
   startable?: boolean;
   hasUninstallPages?: boolean;
+  // Its web page's address(es) while it runs.
+  url?: string | string[];
+  // The newer version a package server offers.
+  upgrade?: ServerEntry;
 }
 
 type Action = 'start' | 'stop' | 'uninstall';
@@ -49,17 +63,20 @@ function strings(value: unknown): string[] {
 // check that cannot be made refuses, as the API does.
 async function checkFeasible(api: Api, action: 'stop' | 'uninstall', id: string): Promise<Feasibility> {
   const type = action === 'stop' ? 'stop_check' : 'uninstall_check';
-  const answer = await api.call('KIVO.Core.Package', 'feasibility_check', 1, { type, packages: [id] });
+  const answer = await feasibilityCheck(api, type, [id]);
   if (answer.ok) return { allowed: true, soft: [] };
   const { code, errors } = answer.error;
   if (code === PackageCode.NotFeasible && errors?.check_type === 'soft') return { allowed: true, soft: strings(errors.reasons) };
   return { allowed: false, hard: code === PackageCode.NotFeasible ? strings(errors?.reasons) : [], error: answer.error };
 }
 
-// A failure in words, with what stands in the way (packages, versions,
-// services, what the package's scripts said) as a list beneath.
+// A failure in words, with what stands in the way (packages, by their
+// display names, versions, services, what the package's scripts said) as a
+// list beneath.
 export function ActionFailure({ error }: { error: ApiFailure }) {
-  const { summary, details } = explain(error);
+  const { api } = useSession();
+  const nameOf = usePackageNames(api, true);
+  const { summary, details } = explain(error, nameOf);
   return (
     <div class="action-failure" role="alert" data-code={error.code}>
       <p class="error">{summary}</p>
@@ -82,9 +99,9 @@ async function control(api: Api, action: Action, id: string, wizard: WizardValue
   if (action === 'uninstall') {
     // The API takes the wizard's answers as one JSON text.
     const extra = wizard ? JSON.stringify(wizard) : undefined;
-    return api.call('KIVO.Core.Package.Uninstallation', 'uninstall', 1, { id, extra_values: extra });
+    return uninstallPackage(api, id, extra);
   }
-  return api.call('KIVO.Core.Package.Control', action, 1, { id: [id] });
+  return controlPackages(api, action, [id]);
 }
 
 // The uninstall's pages: the soft reasons to confirm, the package's own
@@ -105,12 +122,25 @@ function uninstallPages(name: string, reasons: string[], wizard: WizardStep[], v
 
 // Buttons for what can be done with `pkg` now; `onChanged` runs when its
 // state may have changed (also when an action begins, so a list shows the
-// package as busy), `onRemoved` after an uninstall.
-export function PackageActions({ pkg, onChanged, onRemoved }: { pkg: ActionPackage; onChanged: () => void; onRemoved?: () => void }) {
+// package as busy), `onUpgraded` when the upgrade dialog closed (what is
+// installed and offered may have changed), `onRemoved` after an uninstall,
+// with the words that say so.
+export function PackageActions({
+  pkg,
+  onChanged,
+  onUpgraded,
+  onRemoved,
+}: {
+  pkg: ActionPackage;
+  onChanged: () => void;
+  onUpgraded: () => void;
+  onRemoved: (words: string) => void;
+}) {
   const { api } = useSession();
   const [flow, setFlow] = useState<Flow | null>(null);
   const [values, setValues] = useState<WizardValues>({});
-  const busy = isBusyStatus(pkg.status) || flow !== null;
+  const [upgrading, setUpgrading] = useState(false);
+  const busy = isBusyStatus(pkg.status) || flow !== null || upgrading;
 
   const run = async (action: Action, wizard: WizardValues | null) => {
     setFlow({ kind: 'running', action });
@@ -123,7 +153,7 @@ export function PackageActions({ pkg, onChanged, onRemoved }: { pkg: ActionPacka
       return;
     }
     setFlow(null);
-    if (action === 'uninstall' && onRemoved) onRemoved();
+    if (action === 'uninstall') onRemoved(`${pkg.name} was uninstalled.`);
     else onChanged();
   };
 
@@ -135,10 +165,7 @@ export function PackageActions({ pkg, onChanged, onRemoved }: { pkg: ActionPacka
     if (action === 'stop') return feasible.soft.length > 0 ? setFlow({ kind: 'confirm', action, reasons: feasible.soft }) : run('stop', null);
     let wizard: WizardStep[] = [];
     if (pkg.hasUninstallPages) {
-      const got = await api.call<{ additional?: { uninstall_pages?: string } }>('KIVO.Core.Package', 'get', 1, {
-        id: pkg.id,
-        additional: ['uninstall_pages'],
-      });
+      const got = await getPackage<{ uninstall_pages?: string }>(api, pkg.id, ['uninstall_pages']);
       if (!got.ok) return setFlow({ kind: 'failed', action, error: got.error });
       wizard = decodeWizard(got.data.additional?.uninstall_pages) ?? [];
     }
@@ -148,8 +175,15 @@ export function PackageActions({ pkg, onChanged, onRemoved }: { pkg: ActionPacka
 
   const close = () => setFlow(null);
   const canControl = pkg.startable !== false && !busy;
+  const upgrade = pkg.upgrade;
   return (
     <div class="package-actions">
+      {pkg.status === 'running' && <OpenLink name={pkg.name} url={pkg.url} />}
+      {upgrade && (
+        <button type="button" class="primary" aria-label={`Upgrade ${pkg.name} to ${upgrade.version}`} disabled={busy} onClick={() => setUpgrading(true)}>
+          Upgrade
+        </button>
+      )}
       {pkg.status === 'running' ? (
         <button type="button" aria-label={`Stop ${pkg.name}`} disabled={!canControl} onClick={() => begin('stop')}>
           Stop
@@ -163,6 +197,16 @@ export function PackageActions({ pkg, onChanged, onRemoved }: { pkg: ActionPacka
         Uninstall
       </button>
       {flow && <FlowDialog pkg={pkg} flow={flow} values={values} onValues={setValues} onClose={close} onRun={run} />}
+      {upgrading && upgrade && (
+        <UpgradeFlow
+          entry={upgrade}
+          installed={{ name: pkg.name, version: pkg.version }}
+          onClose={() => {
+            setUpgrading(false);
+            onUpgraded();
+          }}
+        />
+      )}
     </div>
   );
 }
