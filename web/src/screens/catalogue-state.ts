@@ -9,6 +9,7 @@ import type { Api, Result } from '../api/client';
 import { listFeeds, type Feed } from '../api/feed';
 import { downloadTaskId } from '../api/installation';
 import { listCatalogue, type ServerEntry, type ServerList } from '../api/server';
+import { getSettings } from '../api/setting';
 import { taskFailure } from '../ui/task-progress';
 
 export interface Catalogue {
@@ -16,6 +17,8 @@ export interface Catalogue {
   feeds: Result<{ items: Feed[] }>;
   // null when no feed is added: there is nothing to ask then.
   others: Result<ServerList> | null;
+  // How many beta versions the stable channel left out (offeredOnChannel).
+  betasLeftOut: number;
 }
 
 // What the page shows for one package besides its description: a download
@@ -33,11 +36,44 @@ export type Phases = Record<string, Phase>;
 
 const kBusyStatus = new Set(['downloading', 'installing', 'upgrading']);
 
+// A beta version is offered only on the beta channel. A static catalogue
+// lists its beta entries whatever channel the query names, so the page
+// judges: on the stable channel a beta entry of a package that is not
+// installed is left out, and a beta version is no upgrade for one that is.
+// When the settings cannot be read (null), everything is offered, beta
+// entries marked as always.
+export function offeredOnChannel(entry: ServerEntry, betaChannel: boolean | null): ServerEntry | null {
+  if (!entry.beta || betaChannel !== false) return entry;
+  if (!isInstalled(entry)) return null;
+  return entry.blupgrade ? { ...entry, blupgrade: false } : entry;
+}
+
+// `list` with what the channel does not offer left out; `left` counts it.
+function onChannel(list: Result<ServerList>, betaChannel: boolean | null, left: { count: number }): Result<ServerList> {
+  if (!list.ok) return list;
+  const keep = (entries: ServerEntry[]) =>
+    entries.flatMap((entry) => {
+      const offered = offeredOnChannel(entry, betaChannel);
+      return offered ? [offered] : [];
+    });
+  const data = keep(list.data.data);
+  left.count += list.data.data.length - data.length;
+  const recommend = list.data.recommend && keep(list.data.recommend);
+  return { ok: true, data: { ...list.data, data, recommend } };
+}
+
 async function loadCatalogue(api: Api, reload: boolean): Promise<Catalogue> {
-  const [vendor, feeds] = await Promise.all([listCatalogue(api, { reload }), listFeeds(api)]);
+  const [vendor, feeds, settings] = await Promise.all([listCatalogue(api, { reload }), listFeeds(api), getSettings(api)]);
   const anyFeed = !feeds.ok || feeds.data.items.length > 0;
   const others = anyFeed ? await listCatalogue(api, { reload, others: true }) : null;
-  return { vendor, feeds, others };
+  const betaChannel = settings.ok ? settings.data.update_channel : null;
+  const left = { count: 0 };
+  return {
+    vendor: onChannel(vendor, betaChannel, left),
+    feeds,
+    others: others && onChannel(others, betaChannel, left),
+    betasLeftOut: left.count,
+  };
 }
 
 // The task a catalogue entry reports, as the page follows it.

@@ -58,6 +58,12 @@ export function CatalogueScreen() {
         </p>
       )}
       {catalogue !== null && query.trim() !== '' && shown === 0 && <p class="hint">No package matches “{query.trim()}”.</p>}
+      {catalogue !== null && catalogue.betasLeftOut > 0 && (
+        <p class="hint">
+          {catalogue.betasLeftOut === 1 ? 'One beta version is' : `${catalogue.betasLeftOut} beta versions are`} not offered: the update channel is “Stable versions only”.
+          Choose the beta channel in Settings to see {catalogue.betasLeftOut === 1 ? 'it' : 'them'}.
+        </p>
+      )}
       {catalogue && !catalogue.vendor.ok && (
         <Problem error={catalogue.vendor.error}>The vendor's package server sent no catalogue: it may be unreachable or answer something else.</Problem>
       )}
