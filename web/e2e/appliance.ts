@@ -96,6 +96,14 @@ export class Appliance {
     this.replace(`/usr/kivo/etc/users/${account}/settings.json`, JSON.stringify({ 'KIVO.PXS.PkgManApp.Instance': agreed }));
   }
 
+  // Sets the update channel as Settings stores it: on "stable" the catalogue
+  // offers no beta version.
+  setUpdateChannel(channel: 'stable' | 'beta'): void {
+    const info = '/etc/kivoinfo.conf';
+    const text = readFileSync(this.file(info), 'utf8');
+    this.replace(info, text.replace(/^package_update_channel=.*$/m, `package_update_channel="${channel}"`));
+  }
+
   // Replaces a file under the root the way the appliance writes the files
   // others read: a whole new file renamed over the old one. The web server
   // and the web API read these files while tests change them; a file

@@ -116,13 +116,6 @@ function downloadFolders(): string[] {
   return readdirSync(suite.appliance.file('/volume1/@tmp')).filter((name) => name.startsWith('download-'));
 }
 
-// Sets the appliance's update channel as Settings stores it.
-function setUpdateChannel(channel: 'stable' | 'beta'): void {
-  const info = '/etc/kivoinfo.conf';
-  const text = readFileSync(suite.appliance.file(info), 'utf8');
-  suite.appliance.replace(info, text.replace(/^package_update_channel=.*$/m, `package_update_channel="${channel}"`));
-}
-
 test('on the stable channel beta versions are not offered; on the beta channel they are, marked', async () => {
   const { page } = await signedInCatalogue();
   const recommended = page.getByRole('list').first();
@@ -131,19 +124,19 @@ test('on the stable channel beta versions are not offered; on the beta channel t
   assert.equal(await card(page, 'Demo Beta').count(), 0);
   await screenshot(page, 'catalogue-stable-channel');
 
-  setUpdateChannel('beta');
+  suite.appliance.setUpdateChannel('beta');
   try {
     await page.getByRole('button', { name: 'Refresh' }).click();
     await card(page, 'Demo Beta').getByText('Beta', { exact: true }).waitFor();
     assert.deepEqual(await recommended.getByRole('heading').allTextContents(), ['Demo Web', 'Demo Beta']);
     assert.equal(await page.getByText('not offered: the update channel').count(), 0);
   } finally {
-    setUpdateChannel('stable');
+    suite.appliance.setUpdateChannel('stable');
   }
 });
 
 test('the catalogue shows icons, recommendations first in the server order, the beta mark, the upgrade and the feed', async () => {
-  setUpdateChannel('beta');
+  suite.appliance.setUpdateChannel('beta');
   const { page } = await signedInCatalogue();
 
   const recommended = page.getByRole('list').first();
@@ -170,7 +163,7 @@ test('the catalogue shows icons, recommendations first in the server order, the 
   assert.equal(await page.getByRole('listitem').count(), 1);
   await page.getByLabel('Search packages').fill('no such thing');
   await page.getByText('No package matches').waitFor();
-  setUpdateChannel('stable');
+  suite.appliance.setUpdateChannel('stable');
 });
 
 test('demo-wizard installs from the server through its wizard, with progress, and its answer arrives', async () => {

@@ -9,29 +9,20 @@
 
 import { test } from 'node:test';
 import assert from 'node:assert/strict';
-import type { Locator, Page, Route } from 'playwright-core';
+import type { Page, Route } from 'playwright-core';
 import { screenshot } from './browser.ts';
 import { callApi, installedState, waitUntil } from './published.ts';
+import { card, openCatalogue, row } from './screens.ts';
 import { pagesPerTest, useSuite } from './suite.ts';
 
-const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
+// Demo Beta is the sample these installs use: the beta channel offers it.
+const suite = useSuite({
+  prepare: (appliance) => {
+    appliance.agreeToTerms();
+    appliance.setUpdateChannel('beta');
+  },
+});
 const pages = pagesPerTest(suite);
-
-async function openCatalogue(page: Page): Promise<void> {
-  await page.goto(new URL('#/catalogue', suite.appliance.url).href);
-  await page.getByRole('heading', { name: 'Recommended' }).waitFor();
-}
-
-function card(page: Page, name: string): Locator {
-  return page.getByRole('listitem', { name, exact: true });
-}
-
-function row(page: Page, name: string): Locator {
-  return page
-    .getByRole('list', { name: 'Installed packages' })
-    .getByRole('listitem')
-    .filter({ has: page.getByRole('link', { name, exact: true }) });
-}
 
 function uninstall(id: string): void {
   if (installedState(suite.appliance, id).version !== '') suite.appliance.kivoctl('uninstall', id);
@@ -65,7 +56,7 @@ test('a reload right after the wizard’s Install never loses the install (ten t
   const { page } = await pages.signedIn();
   for (let round = 1; round <= 10; ++round) {
     uninstall('demo-beta');
-    await openCatalogue(page);
+    await openCatalogue(page, suite.appliance);
     await page.reload();
     await page.getByRole('heading', { name: 'Recommended' }).waitFor();
     try {
@@ -83,7 +74,7 @@ test('a reload right after the wizard’s Install never loses the install (ten t
 test('the wizard opens when a catalogue refresh reports the download done before its progress does', async () => {
   uninstall('demo-wizard');
   const { page } = await pages.signedIn();
-  await openCatalogue(page);
+  await openCatalogue(page, suite.appliance);
   // The download's progress is held back (a slow network), so that the
   // refresh below is the first to learn that the download is done.
   const held: Route[] = [];
@@ -111,7 +102,7 @@ test('the wizard opens when a catalogue refresh reports the download done before
 test('a card never shows that a package is installed beside its Install button', async () => {
   uninstall('demo-beta');
   const { page } = await pages.signedIn();
-  await openCatalogue(page);
+  await openCatalogue(page, suite.appliance);
   // Every state the card passes through is looked at as it is drawn (a
   // script of its own: the test's compiled functions carry helpers the
   // page does not have).

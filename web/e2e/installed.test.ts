@@ -6,8 +6,9 @@
 import { beforeEach, test } from 'node:test';
 import assert from 'node:assert/strict';
 import { existsSync, readFileSync } from 'node:fs';
-import type { Locator, Page } from 'playwright-core';
+import type { Page } from 'playwright-core';
 import { checkAccessibility, screenshot } from './browser.ts';
+import { row } from './screens.ts';
 import { pagesPerTest, useSuite } from './suite.ts';
 
 // The first visit would ask for the terms of service (e2e/settings.test.ts tests that).
@@ -29,25 +30,18 @@ function statusOf(id: string): string {
   }
 }
 
-function row(name: string): Locator {
-  return page
-    .getByRole('list', { name: 'Installed packages' })
-    .getByRole('listitem')
-    .filter({ has: page.getByRole('link', { name, exact: true }) });
-}
-
 async function waitForStatus(name: string, label: string): Promise<void> {
-  await row(name).locator('.badge').getByText(label, { exact: true }).waitFor();
+  await row(page, name).locator('.badge').getByText(label, { exact: true }).waitFor();
 }
 
 test('the list shows each installed package with its state and the upgrade a server offers', async () => {
   await waitForStatus('Demo Web', 'Running');
   await waitForStatus('Demo Notes', 'Running');
   // The vendor's catalogue offers demo-web 1.1.0 and nothing newer for demo-notes.
-  await row('Demo Web').getByRole('button', { name: 'Upgrade Demo Web to 1.1.0-0001' }).waitFor();
-  assert.equal(await row('Demo Notes').getByText(/Upgrade to/).count(), 0);
+  await row(page, 'Demo Web').getByRole('button', { name: 'Upgrade Demo Web to 1.1.0-0001' }).waitFor();
+  assert.equal(await row(page, 'Demo Notes').getByText(/Upgrade to/).count(), 0);
   // The icon is decorative (the name stands beside it) but must load.
-  const icon = await row('Demo Web').locator('img.package-icon').elementHandle();
+  const icon = await row(page, 'Demo Web').locator('img.package-icon').elementHandle();
   await page.waitForFunction((img) => img instanceof HTMLImageElement && img.complete && img.naturalWidth > 0, icon);
   await screenshot(page, 'installed');
   await checkAccessibility(page, 'installed');
@@ -83,16 +77,16 @@ test('a package shows its details, its web address while it runs, what it needs,
 });
 
 test('stopping demo-web is refused while demo-notes runs; stopped and started in order it works', async () => {
-  await row('Demo Web').getByRole('button', { name: 'Stop Demo Web' }).click();
+  await row(page, 'Demo Web').getByRole('button', { name: 'Stop Demo Web' }).click();
   const refusal = page.getByRole('dialog', { name: 'Could not stop Demo Web' });
   await refusal.getByText('Demo Notes runs and needs Demo Web.').waitFor();
   await refusal.getByRole('button', { name: 'Close' }).click();
   assert.match(statusOf('demo-web'), /running/);
 
-  await row('Demo Notes').getByRole('button', { name: 'Stop Demo Notes' }).click();
+  await row(page, 'Demo Notes').getByRole('button', { name: 'Stop Demo Notes' }).click();
   await waitForStatus('Demo Notes', 'Stopped');
   // With its dependent stopped, the stop is allowed after a warning.
-  await row('Demo Web').getByRole('button', { name: 'Stop Demo Web' }).click();
+  await row(page, 'Demo Web').getByRole('button', { name: 'Stop Demo Web' }).click();
   const confirm = page.getByRole('dialog', { name: 'Stop Demo Web?' });
   await confirm.getByText(/Demo Notes/).waitFor();
   await confirm.getByRole('button', { name: 'Stop anyway' }).click();
@@ -100,14 +94,14 @@ test('stopping demo-web is refused while demo-notes runs; stopped and started in
   assert.doesNotMatch(statusOf('demo-web'), /running/);
 
   // A start whose dependency is stopped is refused and names it.
-  await row('Demo Notes').getByRole('button', { name: 'Start Demo Notes' }).click();
+  await row(page, 'Demo Notes').getByRole('button', { name: 'Start Demo Notes' }).click();
   const failed = page.getByRole('dialog', { name: 'Could not start Demo Notes' });
   await failed.getByText('Not running: Demo Web.').waitFor();
   await failed.getByRole('button', { name: 'Close' }).click();
 
-  await row('Demo Web').getByRole('button', { name: 'Start Demo Web' }).click();
+  await row(page, 'Demo Web').getByRole('button', { name: 'Start Demo Web' }).click();
   await waitForStatus('Demo Web', 'Running');
-  await row('Demo Notes').getByRole('button', { name: 'Start Demo Notes' }).click();
+  await row(page, 'Demo Notes').getByRole('button', { name: 'Start Demo Notes' }).click();
   await waitForStatus('Demo Notes', 'Running');
   assert.match(statusOf('demo-notes'), /running/);
 });
@@ -115,7 +109,7 @@ test('stopping demo-web is refused while demo-notes runs; stopped and started in
 test('a package with an uninstall wizard is removed with the answers given', async () => {
   suite.appliance.kivoctl('install', suite.appliance.file('/volume1/public/packages/demo-wizard.kpk'), '--wizard', '{"greeting":"Ahoy"}', '--run');
   await page.reload();
-  await row('Demo Wizard').getByRole('button', { name: 'Uninstall Demo Wizard' }).click();
+  await row(page, 'Demo Wizard').getByRole('button', { name: 'Uninstall Demo Wizard' }).click();
   const dialog = page.getByRole('dialog', { name: 'Uninstall Demo Wizard' });
   // The soft reason first, then the package's own page.
   await dialog.getByText('Removing Demo Wizard deletes the data it keeps.').waitFor();
@@ -126,7 +120,7 @@ test('a package with an uninstall wizard is removed with the answers given', asy
   await checkAccessibility(page, 'uninstall-wizard');
   await dialog.getByRole('button', { name: 'Next' }).click();
   await dialog.getByRole('button', { name: 'Uninstall' }).click();
-  await row('Demo Wizard').waitFor({ state: 'detached' });
+  await row(page, 'Demo Wizard').waitFor({ state: 'detached' });
   assert.doesNotMatch(suite.appliance.kivoctl('list'), /demo-wizard/);
   // The wizard's answer reached the package's script: it kept the greeting.
   const kept = suite.appliance.file('/volume1/public/demo-wizard-greeting.txt');

@@ -14,6 +14,7 @@ import assert from 'node:assert/strict';
 import type { Locator, Page } from 'playwright-core';
 import { checkAccessibility, screenshot } from './browser.ts';
 import { buildSample, installedState, offerInVendorCatalogue, waitUntil } from './published.ts';
+import { card, openCatalogue, row } from './screens.ts';
 import { pagesPerTest, useSuite } from './suite.ts';
 
 const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
@@ -29,22 +30,6 @@ async function offerNextDemoWeb(): Promise<{ from: string; to: string; major: nu
   const kpk = buildSample(suite.appliance, 'demo-web-update', { package: 'demo-web', version: to });
   await offerInVendorCatalogue(suite.appliance, kpk, `demo-web-${to}.kpk`);
   return { from, to, major };
-}
-
-async function openCatalogue(page: Page): Promise<void> {
-  await page.goto(new URL('#/catalogue', suite.appliance.url).href);
-  await page.getByRole('heading', { name: 'Recommended' }).waitFor();
-}
-
-function card(page: Page, name: string): Locator {
-  return page.getByRole('listitem', { name, exact: true });
-}
-
-function row(page: Page, name: string): Locator {
-  return page
-    .getByRole('list', { name: 'Installed packages' })
-    .getByRole('listitem')
-    .filter({ has: page.getByRole('link', { name, exact: true }) });
 }
 
 // Goes through the upgrade dialog's wizard (volume, summary) to "Upgrade".
@@ -66,7 +51,7 @@ test('the catalogue upgrades Demo Web while Demo Notes runs, titled with both ve
   const { from, to } = await offerNextDemoWeb();
   assert.ok(installedState(suite.appliance, 'demo-notes').running, 'Demo Notes runs before the upgrade');
   const { page } = await pages.signedIn();
-  await openCatalogue(page);
+  await openCatalogue(page, suite.appliance);
 
   await card(page, 'Demo Web').getByRole('button', { name: 'Upgrade Demo Web' }).click();
   const dialog = upgradeDialog(page, from, to);
@@ -138,7 +123,7 @@ test('an upgrade that would break a running package names it and what it needs, 
     assert.ok(installedState(suite.appliance, 'demo-pinned').running);
     const { from, to, major } = await offerNextDemoWeb();
     const { page } = await pages.signedIn();
-    await openCatalogue(page);
+    await openCatalogue(page, suite.appliance);
 
     await card(page, 'Demo Web').getByRole('button', { name: 'Upgrade Demo Web' }).click();
     const dialog = upgradeDialog(page, from, to);

@@ -7,7 +7,7 @@ import type { ServerEntry } from '../api/server';
 import { routeHref } from '../route';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
-import { PackageActions } from '../ui/package-actions';
+import { PackageActions, type ActionFields } from '../ui/package-actions';
 import { PackageIcon } from '../ui/package-icon';
 import { usePoll } from '../ui/poll';
 import { isBusyStatus, kBusyPollMs, StatusBadge } from '../ui/status-badge';
@@ -19,14 +19,10 @@ import { useUpgradeOffers } from '../ui/upgrade-flow';
 // only while some package is busy (installing, starting...), so an idle
 // page sends nothing.
 
-// The fields of "list" the page shows.
-interface ListFields {
-  status?: string;
-  startable?: boolean;
-  is_uninstall_pages?: boolean;
+// The fields of "list" the page shows, besides those of its actions.
+interface ListFields extends ActionFields {
   beta?: boolean;
   installing_progress?: number;
-  url?: string | string[];
 }
 
 type InstalledPackage = PackageInfo<ListFields>;
@@ -64,16 +60,8 @@ function Row({
         {typeof progress === 'number' && progress >= 0 && <span class="hint"> {Math.round(progress * 100)}%</span>}
       </div>
       <PackageActions
-        pkg={{
-          id: pkg.id,
-          name: pkg.name,
-          version: pkg.version,
-          status: extra.status,
-          startable: extra.startable,
-          hasUninstallPages: extra.is_uninstall_pages,
-          url: extra.url,
-          upgrade,
-        }}
+        pkg={pkg}
+        upgrade={upgrade}
         onChanged={onChanged}
         onUpgraded={onUpgraded}
         onRemoved={onRemoved}

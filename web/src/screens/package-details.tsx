@@ -5,7 +5,7 @@ import { getPackage, packageLog } from '../api/package';
 import { routeHref } from '../route';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
-import { PackageActions } from '../ui/package-actions';
+import { PackageActions, type ActionFields } from '../ui/package-actions';
 import { PackageIcon } from '../ui/package-icon';
 import { usePoll } from '../ui/poll';
 import { usePackageNames } from '../ui/package-names';
@@ -22,8 +22,8 @@ interface Dependency {
   version?: string;
 }
 
-// The fields of "get" the page shows.
-interface DetailFields {
+// The fields of "get" the page shows, besides those of its actions.
+interface DetailFields extends ActionFields {
   description?: string;
   maintainer?: string;
   maintainer_url?: string;
@@ -33,10 +33,6 @@ interface DetailFields {
   support_url?: string;
   report_beta_url?: string;
   beta?: boolean;
-  startable?: boolean;
-  status?: string;
-  url?: string | string[];
-  is_uninstall_pages?: boolean;
   dependent_packages?: Record<string, Dependency> | null;
   installed_info?: { path?: string };
 }
@@ -236,16 +232,8 @@ export function PackageScreen({ id }: { id: string }) {
           </p>
         </div>
         <PackageActions
-          pkg={{
-            id: pkg.id,
-            name: pkg.name,
-            version: pkg.version,
-            status: extra.status,
-            startable: extra.startable,
-            hasUninstallPages: extra.is_uninstall_pages,
-            url: extra.url,
-            upgrade: offers.get(pkg.id),
-          }}
+          pkg={pkg}
+          upgrade={offers.get(pkg.id)}
           onChanged={reload}
           onUpgraded={() => {
             setUpgraded((n) => n + 1);

@@ -4,7 +4,7 @@ import type { Api, ApiFailure, Result } from '../api/client';
 import { PackageCode } from '../api/codes';
 import { controlPackages, uninstallPackage } from '../api/control';
 import { explain } from '../api/messages';
-import { feasibilityCheck, getPackage } from '../api/package';
+import { feasibilityCheck, getPackage, type PackageInfo } from '../api/package';
 import type { ServerEntry } from '../api/server';
 import { useSession } from '../session';
 import { Dialog } from './dialog';
@@ -24,17 +24,40 @@ import { isBusyStatus } from './status-badge';
 // knows no start: what a start needs (its dependencies running) the start
 // itself refuses, and says so.
 
-export interface ActionPackage {
+// The fields of the appliance's "list" and "get" answers the actions need;
+// a screen asks for them among its own.
+export interface ActionFields {
+  status?: string;
+  startable?: boolean;
+  is_uninstall_pages?: boolean;
+  // Its web page's address(es) while it runs.
+  url?: string | string[];
+}
+
+interface ActionPackage {
   id: string;
   name: string;
   version: string;
   status?: string;
   startable?: boolean;
   hasUninstallPages?: boolean;
-  // Its web page's address(es) while it runs.
   url?: string | string[];
   // The newer version a package server offers.
   upgrade?: ServerEntry;
+}
+
+function actionPackage(pkg: PackageInfo<ActionFields>, upgrade: ServerEntry | undefined): ActionPackage {
+  const extra = pkg.additional ?? {};
+  return {
+    id: pkg.id,
+    name: pkg.name,
+    version: pkg.version,
+    status: extra.status,
+    startable: extra.startable,
+    hasUninstallPages: extra.is_uninstall_pages,
+    url: extra.url,
+    upgrade,
+  };
 }
 
 type Action = 'start' | 'stop' | 'uninstall';
@@ -120,22 +143,26 @@ function uninstallPages(name: string, reasons: string[], wizard: WizardStep[], v
   return pages;
 }
 
-// Buttons for what can be done with `pkg` now; `onChanged` runs when its
-// state may have changed (also when an action begins, so a list shows the
-// package as busy), `onUpgraded` when the upgrade dialog closed (what is
+// Buttons for what can be done with `pkg` (as the appliance lists it) now,
+// `upgrade` the newer version a package server offers, if any; `onChanged`
+// runs when its state may have changed (also when an action begins, so a
+// list shows the package as busy), `onUpgraded` when the upgrade dialog closed (what is
 // installed and offered may have changed), `onRemoved` after an uninstall,
 // with the words that say so.
 export function PackageActions({
-  pkg,
+  pkg: listed,
+  upgrade: offered,
   onChanged,
   onUpgraded,
   onRemoved,
 }: {
-  pkg: ActionPackage;
+  pkg: PackageInfo<ActionFields>;
+  upgrade: ServerEntry | undefined;
   onChanged: () => void;
   onUpgraded: () => void;
   onRemoved: (words: string) => void;
 }) {
+  const pkg = actionPackage(listed, offered);
   const { api } = useSession();
   const [flow, setFlow] = useState<Flow | null>(null);
   const [values, setValues] = useState<WizardValues>({});

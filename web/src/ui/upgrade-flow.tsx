@@ -113,7 +113,7 @@ export function UpgradeFlow({
   const [stage, setStage] = useState<Stage>(resume ? { kind: 'wizard', taskId: resume.downloaded } : { kind: 'starting' });
   const [dependents, setDependents] = useState<Dependent[]>([]);
   const name = current?.name ?? entry.dname ?? entry.id;
-  const to = entry.version ?? 'the new version';
+  const to = offeredVersion(entry);
 
   useEffect(() => {
     let live = true;
@@ -211,7 +211,7 @@ function ReleaseNotes({ entry }: { entry: ServerEntry }) {
   if (!entry.desc) return null;
   return (
     <section class="release-notes" aria-labelledby="release-notes-title">
-      <h3 id="release-notes-title">About {entry.version ?? 'the new version'}</h3>
+      <h3 id="release-notes-title">About {offeredVersion(entry)}</h3>
       <p>{entry.desc}</p>
     </section>
   );
@@ -244,6 +244,20 @@ function CloseButton({ onClose, label = 'Close' }: { onClose: () => void; label?
   );
 }
 
+// What a stage with a view of its own is given: the stage, the offered
+// entry, the package's name, and the way on to the next stage.
+interface StageProps<Kind extends Stage['kind']> {
+  stage: Extract<Stage, { kind: Kind }>;
+  entry: ServerEntry;
+  name: string;
+  onStage: (stage: Stage) => void;
+}
+
+// The offered version as the dialog names it, also when the server names none.
+function offeredVersion(entry: ServerEntry): string {
+  return entry.version ?? 'the new version';
+}
+
 function StageView({
   stage,
   entry,
@@ -263,7 +277,7 @@ function StageView({
   afterUpgrade: (end: TaskEnd, values: InstallValues) => Promise<void>;
   onClose: () => void;
 }) {
-  const to = entry.version ?? 'the new version';
+  const to = offeredVersion(entry);
   switch (stage.kind) {
     case 'starting':
       return <p class="hint">Starting the download of {name}…</p>;
@@ -355,21 +369,9 @@ function Now({ lines }: { lines: string[] }) {
 
 // The upgrade would break a running package: which, what it needs, and the
 // action that stops it for the upgrade and starts it again.
-function Blocked({
-  stage,
-  entry,
-  name,
-  onStage,
-  onClose,
-}: {
-  stage: Extract<Stage, { kind: 'blocked' }>;
-  entry: ServerEntry;
-  name: string;
-  onStage: (stage: Stage) => void;
-  onClose: () => void;
-}) {
+function Blocked({ stage, entry, name, onStage, onClose }: StageProps<'blocked'> & { onClose: () => void }) {
   const { dependent, values } = stage;
-  const to = entry.version ?? 'the new version';
+  const to = offeredVersion(entry);
   return (
     <>
       <div role="alert" class="upgrade-blocked">
@@ -401,20 +403,10 @@ function Blocked({
 // is said with its reason; the dependent is started again whether the
 // upgrade worked or not (it ran before), and the end says what runs now,
 // read from the appliance.
-function Acting({
-  stage,
-  entry,
-  name,
-  onStage,
-}: {
-  stage: Extract<Stage, { kind: 'acting' }>;
-  entry: ServerEntry;
-  name: string;
-  onStage: (stage: Stage) => void;
-}) {
+function Acting({ stage, entry, name, onStage }: StageProps<'acting'>) {
   const { api } = useSession();
   const { dependent, values } = stage;
-  const to = entry.version ?? 'the new version';
+  const to = offeredVersion(entry);
   const [steps, setSteps] = useState<ActionStep[]>(() => [
     { label: `Stop ${dependent.name}`, state: 'waiting' },
     { label: `Upgrade ${name} to ${to}`, state: 'waiting' },
