@@ -75,8 +75,17 @@ TempRoot::TempRoot() {
   setenv("KIVO_ROOT", dir_.c_str(), 1);
 }
 
+// A worker a test's request forked (a download that failed, a clean-up)
+// may still be writing its last files under the root as the test ends: the
+// removal is tried again until the root is gone, for up to five seconds.
 TempRoot::~TempRoot() {
-  EXPECT_EQ(0, KLIBCExec("/bin/rm", "-rf", dir_.c_str(), nullptr, nullptr)) << dir_;
+  int status = -1;
+  for (int attempt = 0; attempt < 100; ++attempt) {
+    status = KLIBCExec("/bin/rm", "-rf", dir_.c_str(), nullptr, nullptr);
+    if (status == 0 && access(dir_.c_str(), F_OK) != 0) return;
+    usleep(50 * 1000);
+  }
+  ADD_FAILURE() << dir_ << " could not be removed (rm: " << status << ")";
 }
 
 void TempRoot::Write(const std::string& fixed, const std::string& content) const {
