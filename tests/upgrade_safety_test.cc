@@ -3,7 +3,6 @@
 // of the old version with its data, and the refusals that come before
 // anything changes.
 
-#include <algorithm>
 #include <fcntl.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
@@ -16,114 +15,20 @@
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
 #include "pkgtool/tree_copy.h"
-#include "testing/package_factory.h"
-#include "testing/temp_root.h"
+#include "testing/upgrade_fixture.h"
 
 namespace {
 
-// What v1 keeps in its data folder: files of several kinds and modes, a
-// subfolder, a symlink and a hard link inside it.
-const char kWriteData[] =
-    "D=\"$KIVO_PKG_VAR\"\n"
-    "mkdir -p \"$D/db/journal\"\n"
-    "printf 'row1\\000row2\\377\\n' > \"$D/db/main.db\"\n"
-    "echo 'entry' > \"$D/db/journal/0001\"\n"
-    "echo 'secret=1' > \"$D/config\"; chmod 600 \"$D/config\"\n"
-    "ln -s db/main.db \"$D/current\"\n"
-    "ln \"$D/config\" \"$D/config.bak\"\n"
-    "touch -d '2001-02-03 04:05:06' \"$D/db/journal/0001\" \"$D/db\"\n";
-
-// What a migration does to it before it fails.
-const char kRewriteData[] =
-    "D=\"$KIVO_PKG_VAR\"\n"
-    "echo 'migrated' > \"$D/db/main.db\"\n"
-    "rm -rf \"$D/db/journal\" \"$D/current\"\n"
-    "echo 'new' > \"$D/v2-only\"\n"
-    "chmod 644 \"$D/config\"\n";
-
-class UpgradeSafetyTest : public ::testing::Test {
+class UpgradeSafetyTest : public UpgradeFixture {
  protected:
-  void SetUp() override {
-    root_.Write("/etc/kivoinfo.conf", "pkg_source_trust_level=\"1\"\n");
-    dir_ = root_.Path("/tmp/packages");
-    data_ = root_.Path("/volume1/@appdata/test-app");
-    ASSERT_EQ(0, KIVOFSMkdirP(dir_.c_str()));
-    v1_.files = {{"version.txt", "1\n"}};
-    v1_.scripts = {{"postinst", kWriteData}};
-    v2_ = v1_;
-    v2_.version = "2.0";
-    v2_.files = {{"version.txt", "2\n"}};
-    v2_.scripts = {};
-  }
-  void TearDown() override { StopInstalledPackages(); }
-
-  int Install(const TestPackage& p, std::vector<std::string> extra = {}) {
-    std::vector<std::string> args = {"install", p.Build(dir_)};
-    args.insert(args.end(), extra.begin(), extra.end());
-    return Kivoctl(args, &out_);
-  }
   void ExpectRefused(int code, const TestPackage& p) {
     EXPECT_EQ(1, Install(p)) << out_;
     EXPECT_NE(std::string::npos, out_.find("[" + std::to_string(code) + "]")) << out_;
-  }
-  void ExpectSaid(const std::string& words) {
-    EXPECT_NE(std::string::npos, out_.find(words)) << "missing: " << words << "\n" << out_;
-  }
-  std::string Status() {
-    std::string out;
-    Kivoctl({"status", "test-app"}, &out);
-    return out;
-  }
-  // Every entry of the data folder: path, type, mode, owner, size, times,
-  // link target and content digest, so that two equal answers mean the
-  // same data byte for byte.
-  std::string Fingerprint() {
-    std::string listing, digests;
-    RunProgram({"find", data_, "-printf", "%P|%y|%m|%U:%G|%s|%T@|%n|%l\n"}, &listing);
-    RunProgram({"sh", "-c", "cd \"$1\" && find . -type f -exec sha256sum {} + | sort", "sh", data_},
-               &digests);
-    return SortLines(listing) + digests;
-  }
-  static std::string SortLines(const std::string& text) {
-    std::vector<std::string> lines;
-    size_t start = 0;
-    for (size_t end; (end = text.find('\n', start)) != std::string::npos; start = end + 1) {
-      lines.push_back(text.substr(start, end - start));
-    }
-    std::sort(lines.begin(), lines.end());
-    std::string out;
-    for (const std::string& l : lines) out += l + "\n";
-    return out;
-  }
-  // No copy of any package's data stays but `kept` earlier versions that a
-  // confirmed upgrade kept, and no record or payload that neither a package
-  // nor one of those owns.
-  void ExpectNothingLeft(size_t kept = 0) {
-    const DataCopies copies = ListDataCopies(root_.Path("/volume1/@appdata/.snapshots"));
-    EXPECT_EQ(kept, copies.entries.size());
-    EXPECT_EQ(kept, copies.kept);
-    const size_t installed = PackageRegistry::List().size();
-    for (const char* dir : {"/var/packages/.records", "/volume1/@appstore"}) {
-      const std::string names = Entries(dir);
-      EXPECT_EQ(installed + kept, static_cast<size_t>(std::count(names.begin(), names.end(), '\n')))
-          << dir << ":\n"
-          << names;
-    }
-  }
-  // The names in a folder under the root, one a line.
-  std::string Entries(const std::string& dir) {
-    std::string out;
-    RunProgram({"ls", "-A", root_.Path(dir)}, &out);
-    return out.find("No such file") != std::string::npos ? "" : out;
   }
   std::string InstalledVersion() {
     KeyValueMap info;
     return PackageRegistry::ReadInfo("test-app", &info) ? info["version"] : "";
   }
-
-  TempRoot root_;
-  std::string dir_, data_, out_;
-  TestPackage v1_, v2_;
 };
 
 TEST_F(UpgradeSafetyTest, FailedMigrationGetsTheOldDataBackByteForByte) {
@@ -132,7 +37,7 @@ TEST_F(UpgradeSafetyTest, FailedMigrationGetsTheOldDataBackByteForByte) {
   const std::string before = Fingerprint();
   ASSERT_NE(std::string::npos, before.find("db/journal/0001|f|644")) << before;
 
-  v2_.scripts = {{"postupgrade", std::string(kRewriteData) + "exit 3\n"}};
+  v2_.scripts = {{"postupgrade", std::string(kRewriteTestData) + "exit 3\n"}};
   ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, v2_);
   ExpectSaid("The upgrade to 2.0 failed in postupgrade; 1.0 and its data were restored.");
   EXPECT_EQ("1.0", InstalledVersion());
@@ -140,16 +45,16 @@ TEST_F(UpgradeSafetyTest, FailedMigrationGetsTheOldDataBackByteForByte) {
   EXPECT_EQ(before, Fingerprint());
   char owner[8] = {};
   EXPECT_EQ(3, getxattr((data_ + "/config").c_str(), "user.owner", owner, sizeof(owner)));
-  ExpectNothingLeft();
+  ExpectNothingLeftBut(0);
 
   // A migration that fails before the new version is registered, likewise.
   TestPackage early = v2_;
   early.version = "2.1";  // a package file of its own
-  early.scripts = {{"preupgrade", std::string(kRewriteData) + "exit 1\n"}};
+  early.scripts = {{"preupgrade", std::string(kRewriteTestData) + "exit 1\n"}};
   ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, early);
   ExpectSaid("The upgrade to 2.1 failed in preupgrade; 1.0 and its data were restored.");
   EXPECT_EQ(before, Fingerprint());
-  ExpectNothingLeft();
+  ExpectNothingLeftBut(0);
 }
 
 TEST_F(UpgradeSafetyTest, ServiceThatNeverStartsIsReplacedByTheOldVersionWithItsData) {
@@ -160,7 +65,7 @@ TEST_F(UpgradeSafetyTest, ServiceThatNeverStartsIsReplacedByTheOldVersionWithIts
   v2_.daemon = false;
   v2_.info = {{"logfile", "app.log"}, {"health_grace_seconds", "1"}};
   v2_.scripts = {
-      {"postupgrade", kRewriteData},
+      {"postupgrade", kRewriteTestData},
       {"start-stop-status",
        "case \"$1\" in start) echo 'cannot open port 8080' >> \"$KIVO_PKG_VAR/app.log\";;"
        " status) exit 1;; esac\n"}};
@@ -170,19 +75,19 @@ TEST_F(UpgradeSafetyTest, ServiceThatNeverStartsIsReplacedByTheOldVersionWithIts
   EXPECT_EQ("test-app 1.0 running\n", Status());
   EXPECT_EQ(data_before, FileText(data_ + "/db/main.db"));
   EXPECT_FALSE(KLIBCFileExist((data_ + "/v2-only").c_str()));
-  ExpectNothingLeft();
+  ExpectNothingLeftBut(0);
 }
 
 TEST_F(UpgradeSafetyTest, FailingHealthCheckIsReplacedByTheOldVersion) {
   ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
-  v2_.scripts = {{"postupgrade", kRewriteData},
+  v2_.scripts = {{"postupgrade", kRewriteTestData},
                  {"health", "echo 'database unreachable'; exit 2\n"}};
   ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, v2_);
   ExpectSaid("The upgrade to 2.0 failed its health check; 1.0 and its data were restored.");
   ExpectSaid("database unreachable");
   EXPECT_EQ("test-app 1.0 running\n", Status());
   EXPECT_FALSE(KLIBCFileExist((data_ + "/v2-only").c_str()));
-  ExpectNothingLeft();
+  ExpectNothingLeftBut(0);
 }
 
 TEST_F(UpgradeSafetyTest, HangingAndNoisyHealthCheckIsCutShort) {
@@ -204,7 +109,7 @@ TEST_F(UpgradeSafetyTest, HangingAndNoisyHealthCheckIsCutShort) {
 
 TEST_F(UpgradeSafetyTest, HealthyUpgradeKeepsTheNewDataAndTheCopyAsTheOldVersion) {
   ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
-  v2_.scripts = {{"postupgrade", kRewriteData},
+  v2_.scripts = {{"postupgrade", kRewriteTestData},
                  {"health",
                   "head -c 5000000 /dev/zero | tr '\\000' y || exit 9\n"
                   "[ -f \"$KIVO_PKG_VAR/v2-only\" ] && echo healthy\n"}};
@@ -213,7 +118,7 @@ TEST_F(UpgradeSafetyTest, HealthyUpgradeKeepsTheNewDataAndTheCopyAsTheOldVersion
   EXPECT_EQ("test-app 2.0 running\n", Status());
   EXPECT_EQ("migrated\n", FileText(data_ + "/db/main.db"));
   // The copy is 1.0's kept revision now (rollback_test.cc).
-  ExpectNothingLeft(1);
+  ExpectNothingLeftBut(1);
 }
 
 TEST_F(UpgradeSafetyTest, NewVersionThatDoesNotStopKeepsTheCopyUntilTheNextOperation) {
@@ -221,7 +126,7 @@ TEST_F(UpgradeSafetyTest, NewVersionThatDoesNotStopKeepsTheCopyUntilTheNextOpera
   const std::string before = FileText(data_ + "/db/main.db");
   const std::string up = data_ + "/v2-up";
   v2_.daemon = false;
-  v2_.scripts = {{"postupgrade", kRewriteData},
+  v2_.scripts = {{"postupgrade", kRewriteTestData},
                  {"health", "exit 1\n"},
                  {"start-stop-status",
                   "case \"$1\" in start) touch \"$KIVO_PKG_VAR/v2-up\";; stop) exit 1;;"
@@ -244,7 +149,7 @@ TEST_F(UpgradeSafetyTest, NewVersionThatDoesNotStopKeepsTheCopyUntilTheNextOpera
   EXPECT_EQ(before, FileText(data_ + "/db/main.db"));
   // 2.0's record and payload, no one's now, go with the next clean-up.
   EXPECT_EQ(0, Kivoctl({"uninstall", "other-app"}, &out_)) << out_;
-  ExpectNothingLeft();
+  ExpectNothingLeftBut(0);
 }
 
 TEST_F(UpgradeSafetyTest, StoppedPackageIsJudgedByItsScriptsAndStaysStopped) {
@@ -252,7 +157,7 @@ TEST_F(UpgradeSafetyTest, StoppedPackageIsJudgedByItsScriptsAndStaysStopped) {
   const std::string before = Fingerprint();
   TestPackage failing = v2_;
   failing.version = "1.5";
-  failing.scripts = {{"postupgrade", std::string(kRewriteData) + "exit 1\n"}};
+  failing.scripts = {{"postupgrade", std::string(kRewriteTestData) + "exit 1\n"}};
   ExpectRefused(PKG_ERR_UPGRADE_ROLLED_BACK, failing);
   ExpectSaid("The upgrade to 1.5 failed in postupgrade; 1.0 and its data were restored.");
   EXPECT_EQ("test-app 1.0 stopped\n", Status());
@@ -268,7 +173,7 @@ TEST_F(UpgradeSafetyTest, StoppedPackageIsJudgedByItsScriptsAndStaysStopped) {
   ASSERT_EQ(0, Install(v2_)) << out_;
   EXPECT_EQ("test-app 2.0 stopped\n", Status());
   EXPECT_FALSE(KLIBCFileExist(root_.Path("/tmp/started").c_str()));
-  ExpectNothingLeft(1);
+  ExpectNothingLeftBut(1);
 }
 
 TEST_F(UpgradeSafetyTest, DataWithAFifoIsRefusedBeforeAnythingChanges) {
@@ -279,7 +184,7 @@ TEST_F(UpgradeSafetyTest, DataWithAFifoIsRefusedBeforeAnythingChanges) {
       "The data of test-app cannot be copied safely before the upgrade: queue is a fifo. "
       "Nothing was changed.");
   EXPECT_EQ("test-app 1.0 running\n", Status());
-  ExpectNothingLeft();
+  ExpectNothingLeftBut(0);
 }
 
 TEST_F(UpgradeSafetyTest, DataWithASymlinkLeadingOutIsRefusedAndNothingOutsideIsRead) {
@@ -300,7 +205,7 @@ TEST_F(UpgradeSafetyTest, DataWithASymlinkLeadingOutIsRefusedAndNothingOutsideIs
   char events[4096];
   EXPECT_LT(read(watch, events, sizeof(events)), 0) << "something outside was touched";
   close(watch);
-  ExpectNothingLeft();
+  ExpectNothingLeftBut(0);
 }
 
 TEST_F(UpgradeSafetyTest, NoRoomForTheCopyIsRefusedInWordsUnlessThePackageNeedsNone) {
@@ -321,7 +226,7 @@ TEST_F(UpgradeSafetyTest, NoRoomForTheCopyIsRefusedInWordsUnlessThePackageNeedsN
   uncopied.info = {{"upgrade_data_copy", "no"}};
   ASSERT_EQ(0, Install(uncopied)) << out_;
   EXPECT_EQ("test-app 2.1 running\n", Status());
-  ExpectNothingLeft();
+  ExpectNothingLeftBut(0);
 }
 
 TEST_F(UpgradeSafetyTest, HealthLimitsInInfoMustBeInBounds) {

@@ -22,15 +22,15 @@ namespace KivoActivity {
 namespace {
 
 using NVX::Sqlite;
+using NVX::SqliteStatementUse;
 
 // A write waits this long for a reader or another writer; after that the
 // operation it records goes on unrecorded rather than wait.
 constexpr int kBusyTimeoutMs = 2000;
 constexpr size_t kMaxWords = 500;
 
-// Several processes write this file at once, so it keeps the rollback
-// journal, as the task store does: the SQLite of Debian 12 predates a fix for
-// WAL files written by several processes.
+// Several processes write this file at once (SqliteOpenStore keeps the
+// rollback journal for them).
 const char kSchema[] =
     "CREATE TABLE IF NOT EXISTS activity ("
     "  id INTEGER PRIMARY KEY AUTOINCREMENT, started INTEGER NOT NULL, ended INTEGER,"
@@ -46,40 +46,22 @@ const char kSchema[] =
     "CREATE INDEX IF NOT EXISTS activity_package_entry ON activity_package (entry);";
 
 // One statement, finalized when it goes out of scope.
-class Statement {
+class Statement : public SqliteStatementUse {
  public:
-  Statement(sqlite3* db, const std::string& sql) {
-    if (db && Sqlite()->prepare_v2(db, sql.c_str(), -1, &stmt_, nullptr) != SQLITE_OK) {
-      syslog(LOG_ERR, "%s:%d activity log: %s", "activity_log", __LINE__, Sqlite()->errmsg(db));
-      stmt_ = nullptr;
-    }
-  }
+  Statement(sqlite3* db, const std::string& sql) : SqliteStatementUse(Prepare(db, sql)) {}
   ~Statement() {
     if (stmt_) Sqlite()->finalize(stmt_);
   }
-  Statement(const Statement&) = delete;
-  Statement& operator=(const Statement&) = delete;
-
-  Statement& Bind(int i, const std::string& text) {
-    if (stmt_)
-      Sqlite()->bind_text(stmt_, i, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
-    return *this;
-  }
-  Statement& Bind(int i, long long value) {
-    if (stmt_) Sqlite()->bind_int64(stmt_, i, value);
-    return *this;
-  }
-  bool Run() { return stmt_ && Sqlite()->step(stmt_) == SQLITE_DONE; }
-  bool Row() { return stmt_ && Sqlite()->step(stmt_) == SQLITE_ROW; }
-  bool ok() const { return stmt_ != nullptr; }
-  std::string Text(int col) {
-    const unsigned char* t = Sqlite()->column_text(stmt_, col);
-    return t ? reinterpret_cast<const char*>(t) : "";
-  }
-  long long Int(int col) { return Sqlite()->column_int64(stmt_, col); }
 
  private:
-  sqlite3_stmt* stmt_ = nullptr;
+  static sqlite3_stmt* Prepare(sqlite3* db, const std::string& sql) {
+    sqlite3_stmt* stmt = nullptr;
+    if (db && Sqlite()->prepare_v2(db, sql.c_str(), -1, &stmt, nullptr) != SQLITE_OK) {
+      syslog(LOG_ERR, "%s:%d activity log: %s", "activity_log", __LINE__, Sqlite()->errmsg(db));
+      return nullptr;
+    }
+    return stmt;
+  }
 };
 
 // The start time of process `pid` in clock ticks since boot (field 22 of its
@@ -129,30 +111,24 @@ std::string Cut(const std::string& text, size_t max) {
 std::string WhereClause(const Filter& f, std::vector<std::string>* texts,
                         std::vector<long long>* numbers) {
   std::string where = " WHERE 1";
-  if (!f.package.empty()) {
-    where += " AND id IN (SELECT entry FROM activity_package WHERE package = ?)";
-    texts->push_back(f.package);
-  }
-  if (!f.account.empty()) {
-    where += " AND actor = ?";
-    texts->push_back(f.account);
-  }
-  if (!f.operation.empty()) {
-    where += " AND operation = ?";
-    texts->push_back(f.operation);
-  }
-  if (!f.state.empty()) {
-    where += " AND state = ?";
-    texts->push_back(f.state);
-  }
-  if (f.since_ms >= 0) {
-    where += " AND started >= ?";
-    numbers->push_back(f.since_ms);
-  }
-  if (f.until_ms >= 0) {
-    where += " AND started <= ?";
-    numbers->push_back(f.until_ms);
-  }
+  // A condition counts when its value is given: a text not empty, a time
+  // not negative.
+  auto add_text = [&](const std::string& value, const char* condition) {
+    if (value.empty()) return;
+    where += condition;
+    texts->push_back(value);
+  };
+  auto add_time = [&](long long value, const char* condition) {
+    if (value < 0) return;
+    where += condition;
+    numbers->push_back(value);
+  };
+  add_text(f.package, " AND id IN (SELECT entry FROM activity_package WHERE package = ?)");
+  add_text(f.account, " AND actor = ?");
+  add_text(f.operation, " AND operation = ?");
+  add_text(f.state, " AND state = ?");
+  add_time(f.since_ms, " AND started >= ?");
+  add_time(f.until_ms, " AND started <= ?");
   return where;
 }
 
@@ -256,20 +232,9 @@ bool ActivityLog::OpenFile(const std::string& path) {
     return true;
   }
   close(fd);
-  if (Sqlite()->open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE, nullptr) != SQLITE_OK) {
-    syslog(LOG_ERR, "%s:%d cannot open %s", "activity_log", __LINE__, path.c_str());
-    Sqlite()->close(db_);
-    db_ = nullptr;
-    return true;
-  }
-  Sqlite()->busy_timeout(db_, kBusyTimeoutMs);
-  char* error = nullptr;
-  int rc = Sqlite()->exec(db_, "PRAGMA synchronous=NORMAL;", nullptr, nullptr, nullptr);
-  if (rc == SQLITE_OK) rc = Sqlite()->exec(db_, kSchema, nullptr, nullptr, &error);
+  const int rc = NVX::SqliteOpenStore(path, SQLITE_OPEN_READWRITE, kBusyTimeoutMs, kSchema,
+                                      "activity log", &db_);
   if (rc == SQLITE_OK) return true;
-  syslog(LOG_ERR, "%s:%d activity log %s: %s", "activity_log", __LINE__, path.c_str(),
-         error ? error : "cannot be read");
-  Sqlite()->free(error);
   Sqlite()->close(db_);
   db_ = nullptr;
   return rc != SQLITE_NOTADB && rc != SQLITE_CORRUPT;

@@ -32,13 +32,21 @@ std::string Link(const std::string& path) {
   return n > 0 ? std::string(buf, static_cast<size_t>(n)) : "";
 }
 
-// What a refused rollback or removal says when nothing is kept.
-std::string NothingKept(const std::string& id) {
-  return "no earlier version of " + id + " is kept to roll back to" +
-         (PMSKeepRevisionsSetting() == 0
-              ? " (keep_revisions is 0 in /etc/kivo/pkgtool.conf: upgrades keep none)"
-              : "") +
-         "; nothing was changed";
+// The versions of `id` that earlier upgrades kept (PMSListRevisions) when
+// *result is PKG_OK; none otherwise. When none is kept, a refused rollback
+// or removal says so in the log of `op` and *result is PKG_ERR_NO_REVISION.
+std::vector<PMSRevision> KeptRevisions(const std::string& id, const Operation& op, int* result) {
+  if (*result != PKG_OK) return {};
+  std::vector<PMSRevision> revisions = PMSListRevisions(id);
+  if (revisions.empty()) {
+    op.Log("no earlier version of " + id + " is kept to roll back to" +
+           (PMSKeepRevisionsSetting() == 0
+                ? " (keep_revisions is 0 in /etc/kivo/pkgtool.conf: upgrades keep none)"
+                : "") +
+           "; nothing was changed");
+    *result = PKG_ERR_NO_REVISION;
+  }
+  return revisions;
 }
 
 // Runs the published version's start-stop-status with `action`.
@@ -134,12 +142,7 @@ bool PackageManager::rollback(const std::string& id, const std::string& user) {
   Operation op("rollback", PMSIsValidPackageId(id) ? id : "invalid");
   PackageInfo info;
   int result = LockAndLoad(id, &info);
-  const std::vector<PMSRevision> revisions =
-      result == PKG_OK ? PMSListRevisions(id) : std::vector<PMSRevision>();
-  if (result == PKG_OK && revisions.empty()) {
-    op.Log(NothingKept(id));
-    result = PKG_ERR_NO_REVISION;
-  }
+  const std::vector<PMSRevision> revisions = KeptRevisions(id, op, &result);
   bool ran = false;
   if (result == PKG_OK) result = RollBackTo(id, info, revisions.front(), op, &ran);
   if (result == PKG_OK) {
@@ -170,12 +173,7 @@ bool PackageManager::dropRevisions(const std::string& id) {
   Operation op("drop-revision", PMSIsValidPackageId(id) ? id : "invalid");
   PackageInfo info;
   int result = LockAndLoad(id, &info);
-  const std::vector<PMSRevision> revisions =
-      result == PKG_OK ? PMSListRevisions(id) : std::vector<PMSRevision>();
-  if (result == PKG_OK && revisions.empty()) {
-    op.Log(NothingKept(id));
-    result = PKG_ERR_NO_REVISION;
-  }
+  const std::vector<PMSRevision> revisions = KeptRevisions(id, op, &result);
   for (size_t i = 0; result == PKG_OK && i < revisions.size(); ++i) {
     const PMSRevision& r = revisions[i];
     const uint64_t bytes = PMSRevisionBytes(r);

@@ -41,4 +41,49 @@ const SqliteApi* Sqlite() {
   return api;
 }
 
+int SqliteOpenStore(const std::string& path, int flags, int busy_ms, const char* schema,
+                    const char* what, sqlite3** db) {
+  int rc = Sqlite()->open_v2(path.c_str(), db, flags, nullptr);
+  if (rc != SQLITE_OK) {
+    syslog(LOG_ERR, "%s:%d %s: cannot open %s: %s", "sqlite_api", __LINE__, what, path.c_str(),
+           *db ? Sqlite()->errmsg(*db) : "out of memory");
+    Sqlite()->close(*db);
+    *db = nullptr;
+    return rc;
+  }
+  Sqlite()->busy_timeout(*db, busy_ms);
+  char* error = nullptr;
+  rc = Sqlite()->exec(*db, "PRAGMA journal_mode=DELETE; PRAGMA synchronous=NORMAL;", nullptr,
+                      nullptr, &error);
+  if (rc == SQLITE_OK) rc = Sqlite()->exec(*db, schema, nullptr, nullptr, &error);
+  if (rc != SQLITE_OK) {
+    syslog(LOG_ERR, "%s:%d %s %s: %s", "sqlite_api", __LINE__, what, path.c_str(),
+           error ? error : "cannot be read");
+    Sqlite()->free(error);
+  }
+  return rc;
+}
+
+SqliteStatementUse& SqliteStatementUse::Bind(int i, const std::string& text) {
+  if (stmt_)
+    Sqlite()->bind_text(stmt_, i, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
+  return *this;
+}
+
+SqliteStatementUse& SqliteStatementUse::Bind(int i, long long value) {
+  if (stmt_) Sqlite()->bind_int64(stmt_, i, value);
+  return *this;
+}
+
+bool SqliteStatementUse::Run() { return stmt_ && Sqlite()->step(stmt_) == SQLITE_DONE; }
+
+bool SqliteStatementUse::Row() { return stmt_ && Sqlite()->step(stmt_) == SQLITE_ROW; }
+
+std::string SqliteStatementUse::Text(int col) {
+  const unsigned char* t = Sqlite()->column_text(stmt_, col);
+  return t ? reinterpret_cast<const char*>(t) : "";
+}
+
+long long SqliteStatementUse::Int(int col) { return Sqlite()->column_int64(stmt_, col); }
+
 }  // namespace NVX

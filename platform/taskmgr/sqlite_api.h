@@ -5,6 +5,8 @@
 // (platform/taskmgr, platform/activity).
 #pragma once
 
+#include <string>
+
 #include <sqlite3.h>
 
 namespace NVX {
@@ -29,5 +31,44 @@ struct SqliteApi {
 
 // The loaded functions, or null when libsqlite3 cannot be loaded.
 const SqliteApi* Sqlite();
+
+// Opens the database file `path` with `flags` (SQLITE_OPEN_*) the way every
+// store of the platform does: a writer waits up to `busy_ms` for the others,
+// the file keeps the rollback journal (several processes write it, and the
+// SQLite of Debian 12 predates a fix for WAL files written by several
+// processes), synchronous=NORMAL, and `schema` is run. *db is the
+// connection, or null when the file could not be opened. Returns SQLITE_OK
+// or the code of the step that failed, logged under `what` (the store's
+// name); a failure after the open leaves *db open for the caller to close or
+// keep. Needs Sqlite().
+[[nodiscard]] int SqliteOpenStore(const std::string& path, int flags, int busy_ms,
+                                  const char* schema, const char* what, sqlite3** db);
+
+// One use of a prepared statement: binds values, steps, reads columns. A
+// null statement (a prepare that failed) binds nothing and neither runs nor
+// has a row. Who ends the statement (finalize, or reset to keep it) is the
+// class that holds it, which derives from this one.
+class SqliteStatementUse {
+ public:
+  SqliteStatementUse(const SqliteStatementUse&) = delete;
+  SqliteStatementUse& operator=(const SqliteStatementUse&) = delete;
+
+  SqliteStatementUse& Bind(int i, const std::string& text);
+  SqliteStatementUse& Bind(int i, long long value);
+  // Runs a statement without results. False on failure.
+  bool Run();
+  // Steps to the next row. False when there is none (or on failure).
+  bool Row();
+  bool ok() const { return stmt_ != nullptr; }
+  // Column `col` of the current row; "" or 0 for NULL.
+  std::string Text(int col);
+  long long Int(int col);
+
+ protected:
+  explicit SqliteStatementUse(sqlite3_stmt* stmt) : stmt_(stmt) {}
+  ~SqliteStatementUse() = default;
+
+  sqlite3_stmt* stmt_;
+};
 
 }  // namespace NVX

@@ -15,36 +15,12 @@ namespace {
 
 // One use of a statement the store keeps prepared; reset after use, so the
 // store's read locks end with the statement.
-class Statement {
+class Statement : public SqliteStatementUse {
  public:
-  Statement(TaskStore& store, const char* sql) : stmt_(store.Prepared(sql)) {}
+  Statement(TaskStore& store, const char* sql) : SqliteStatementUse(store.Prepared(sql)) {}
   ~Statement() {
     if (stmt_) Sqlite()->reset(stmt_);
   }
-  Statement(const Statement&) = delete;
-  Statement& operator=(const Statement&) = delete;
-
-  Statement& Bind(int i, const std::string& text) {
-    if (stmt_)
-      Sqlite()->bind_text(stmt_, i, text.data(), static_cast<int>(text.size()), SQLITE_TRANSIENT);
-    return *this;
-  }
-  Statement& Bind(int i, long long value) {
-    if (stmt_) Sqlite()->bind_int64(stmt_, i, value);
-    return *this;
-  }
-  // Runs a statement without results. False on failure.
-  bool Run() { return stmt_ && Sqlite()->step(stmt_) == SQLITE_DONE; }
-  // Steps to the next row. False when there is none (or on failure).
-  bool Row() { return stmt_ && Sqlite()->step(stmt_) == SQLITE_ROW; }
-  std::string Text(int col) {
-    const unsigned char* t = Sqlite()->column_text(stmt_, col);
-    return t ? reinterpret_cast<const char*>(t) : "";
-  }
-  long long Int(int col) { return Sqlite()->column_int64(stmt_, col); }
-
- private:
-  sqlite3_stmt* stmt_ = nullptr;
 };
 
 // Runs `sql`, an UPDATE of one task's row whose parameters are a flag, the

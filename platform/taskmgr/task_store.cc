@@ -62,18 +62,10 @@ sqlite3* TaskStore::db() {
   path_ = path;
   // A folder that cannot be made shows as the open failure below.
   static_cast<void>(KIVOFSMkdirP(dir.c_str()));
-  if (Sqlite()->open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) !=
-      SQLITE_OK) {
-    syslog(LOG_ERR, "%s:%d cannot open %s: %s", "task_store", __LINE__, path.c_str(),
-           db_ ? Sqlite()->errmsg(db_) : "out of memory");
-    Sqlite()->close(db_);
-    db_ = nullptr;
-    return nullptr;
-  }
-  Sqlite()->busy_timeout(db_, kBusyTimeoutMs);
-  // Several processes write this file: keep the rollback journal (see task.h).
-  Exec("PRAGMA journal_mode=DELETE; PRAGMA synchronous=NORMAL;");
-  Exec(kSchema);
+  // A file that cannot be opened leaves db_ null; a schema that cannot be
+  // made shows as the failure of each statement.
+  static_cast<void>(SqliteOpenStore(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE,
+                                    kBusyTimeoutMs, kSchema, "task store", &db_));
   return db_;
 }
 

@@ -52,6 +52,14 @@ std::vector<std::string> Positional(const std::vector<std::string>& args,
 
 void PrintJson(const Json::Value& value) { std::cout << KIVOWriteJson(value, "  ") << "\n"; }
 
+// Says why the package tool's last call failed: "WHAT: words (DETAIL) [code]",
+// without the parentheses when `detail` is empty.
+int FailWithResult(PackageManager& pm, const std::string& what, const std::string& detail = "") {
+  return Fail(what + ": " + PMSResultText(pm.getResult()) +
+              (detail.empty() ? "" : " (" + detail + ")") + " [" + std::to_string(pm.getResult()) +
+              "]");
+}
+
 // Prints and deletes an operation's log, prints its worker messages.
 int Report(PackageManager& pm, bool ok, const std::string& what) {
   std::string log = PMSReadPackageLog(pm.getLogFilePath());
@@ -59,10 +67,7 @@ int Report(PackageManager& pm, bool ok, const std::string& what) {
   if (!pm.getLogFilePath().empty()) unlink(pm.getLogFilePath().c_str());
   for (const Json::Value& m : pm.getJsonParam("worker_msg")) std::cout << m.asString() << "\n";
   if (ok) return 0;
-  std::string detail = pm.getMapParam("deppkg");
-  return Fail(what + ": " + PMSResultText(pm.getResult()) +
-              (detail.empty() ? "" : " (" + detail + ")") + " [" + std::to_string(pm.getResult()) +
-              "]");
+  return FailWithResult(pm, what, pm.getMapParam("deppkg"));
 }
 
 // "running" or "stopped"; "broken" when its installed files are gone.
@@ -180,8 +185,7 @@ int KivoctlStatus(const std::vector<std::string>& args) {
   PackageManager pm;
   PackageInfo info;
   if (!pm.init() || !pm.getPackageInfo(args[0], info)) {
-    return Fail(args[0] + ": " + PMSResultText(pm.getResult()) + " [" +
-                std::to_string(pm.getResult()) + "]");
+    return FailWithResult(pm, args[0]);
   }
   std::cout << args[0] << " " << info.getVersion() << " " << RunState(pm, info) << "\n";
   return 0;
@@ -222,8 +226,7 @@ int KivoctlRevisions(const std::vector<std::string>& args) {
   PackageManager pm;
   PackageInfo info;
   if (!pm.init() || !pm.getPackageInfo(args[0], info)) {
-    return Fail(args[0] + ": " + PMSResultText(pm.getResult()) + " [" +
-                std::to_string(pm.getResult()) + "]");
+    return FailWithResult(pm, args[0]);
   }
   const std::vector<PMSRevision> revisions = PMSListRevisions(args[0]);
   if (revisions.empty()) std::cout << "no earlier version of " << args[0] << " is kept\n";
