@@ -9,7 +9,13 @@ import type { Page } from 'playwright-core';
 import { checkAccessibility, screenshot } from './browser.ts';
 import { pagesPerTest, useSuite } from './suite.ts';
 
-const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
+// The beta channel, so that the catalogue offers every sample (Demo Beta too).
+const suite = useSuite({
+  prepare: (appliance) => {
+    appliance.agreeToTerms();
+    appliance.setUpdateChannel('beta');
+  },
+});
 const pages = pagesPerTest(suite);
 
 // The pictures of the images `selector` finds, by the name of the list item
