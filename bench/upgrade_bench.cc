@@ -2,10 +2,11 @@
 // default) with the safety copy of its data and without it, and prints both
 // times next to `cp -a` of the same folder, all measured in the same run:
 // first on the file system of the temporary root, then on an XFS file system
-// with reflinks that the benchmark makes in a file under the temporary root
-// and mounts through a loop device as the root's only volume (this needs
-// root, mkfs.xfs and a free loop device; the benchmark says which is
-// missing).
+// with reflinks and last on a Btrfs one (where the data folder is a
+// subvolume and its copy a snapshot), each made in a file under the
+// temporary root and mounted through a loop device as the root's only
+// volume (this needs root, mkfs.xfs or mkfs.btrfs and a free loop device;
+// the benchmark says which is missing).
 //
 //   upgrade_bench [data MiB] [files] [rounds]      (default 1024, 10000, 3)
 //
@@ -28,6 +29,7 @@
 #include <vector>
 
 #include "bench_setup.h"
+#include "pkgtool/btrfs_subvolume.h"
 #include "pkgtool/data_snapshot.h"
 #include "pkgtool/tree_copy.h"
 #include "testing/package_factory.h"
@@ -226,9 +228,11 @@ void MeasureVolume(const TempRoot& root, const std::string& volume, const Option
   const uint64_t room = SurveyOrExit(data);
   Require(Succeeds({"findmnt", "-n", "-o", "FSTYPE", "-T", data}, &out), "findmnt " + data);
   const bool reflinks = PMSSnapshotsShareBlocks(appdata);
-  printf("%s: %.0f MiB in %llu files (written in %.1f s), reflinks: %s, median of %d rounds\n",
-         out.c_str(), mib, static_cast<unsigned long long>(o.files), writing,
-         reflinks ? "yes" : "no", o.rounds);
+  printf(
+      "%s: %.0f MiB in %llu files (written in %.1f s), reflinks: %s, copy: %s, median of %d "
+      "rounds\n",
+      out.c_str(), mib, static_cast<unsigned long long>(o.files), writing, reflinks ? "yes" : "no",
+      PMSIsSubvolume(data) ? "a snapshot" : "file by file", o.rounds);
   Samples s;
   for (int round = 0; round < o.rounds; ++round)
     MeasureRoundOrExit(packages, data, 2 + 2 * round, &s);
@@ -293,15 +297,26 @@ std::string FindProgram(const std::string& name) {
   return "";
 }
 
-// An XFS file system with reflinks in a file, attached to a loop device and
-// mounted. The destructor unmounts it and detaches the device, whatever
-// happened in between; the file itself stays for its owner to remove.
-class LoopXfs {
+// A file system that shares blocks between copies: XFS with reflinks, or
+// Btrfs, whose package data folders are subvolumes copied by snapshot.
+struct LoopFsKind {
+  const char* type;        // for mount -t
+  const char* mkfs;        // the program that makes it
+  const char* package;     // the Debian package that brings `mkfs`
+  const char* options[3];  // its options before the image, up to a null
+};
+constexpr LoopFsKind kXfs = {"xfs", "mkfs.xfs", "xfsprogs", {"-q", "-m", "reflink=1"}};
+constexpr LoopFsKind kBtrfs = {"btrfs", "mkfs.btrfs", "btrfs-progs", {"-q", nullptr, nullptr}};
+
+// Such a file system in a file, attached to a loop device and mounted. The
+// destructor unmounts it and detaches the device, whatever happened in
+// between; the file itself stays for its owner to remove.
+class LoopFs {
  public:
-  LoopXfs() = default;
-  ~LoopXfs();
-  LoopXfs(const LoopXfs&) = delete;
-  LoopXfs& operator=(const LoopXfs&) = delete;
+  explicit LoopFs(const LoopFsKind& kind) : kind_(kind) {}
+  ~LoopFs();
+  LoopFs(const LoopFs&) = delete;
+  LoopFs& operator=(const LoopFs&) = delete;
 
   // Makes the file system in the new file `image` (sparse, `bytes` long)
   // and mounts it on the new folder `mount_point`. False with *why when it
@@ -310,17 +325,20 @@ class LoopXfs {
                           std::string* why);
 
  private:
+  std::vector<std::string> MkfsCommand(const std::string& mkfs, const std::string& image) const;
+
+  const LoopFsKind& kind_;
   std::string device_, mount_point_;
 };
 
-bool LoopXfs::Make(const std::string& image, uint64_t bytes, const std::string& mount_point,
-                   std::string* why) {
-  const std::string mkfs = FindProgram("mkfs.xfs"), losetup = FindProgram("losetup");
+bool LoopFs::Make(const std::string& image, uint64_t bytes, const std::string& mount_point,
+                  std::string* why) {
+  const std::string mkfs = FindProgram(kind_.mkfs), losetup = FindProgram("losetup");
   std::string out;
   if (geteuid() != 0)
     *why = "it is not run as root";
   else if (mkfs.empty())
-    *why = "mkfs.xfs is not installed (Debian package xfsprogs)";
+    *why = std::string(kind_.mkfs) + " is not installed (Debian package " + kind_.package + ")";
   else if (losetup.empty())
     *why = "losetup is not installed";
   if (!why->empty()) return false;
@@ -329,22 +347,32 @@ bool LoopXfs::Make(const std::string& image, uint64_t bytes, const std::string& 
   if (fd >= 0) close(fd);
   if (!sized)
     *why = "the image file " + image + " cannot be made";
-  else if (!Succeeds({mkfs, "-q", "-m", "reflink=1", image}, &out))
-    *why = "mkfs.xfs: " + out;
+  else if (!Succeeds(MkfsCommand(mkfs, image), &out))
+    *why = std::string(kind_.mkfs) + ": " + out;
   else if (!Succeeds({losetup, "--find", "--show", image}, &out))
     *why = "no loop device: " + out;
   if (!why->empty()) return false;
   device_ = out;
   if (mkdir(mount_point.c_str(), 0755) != 0)
     *why = "cannot make " + mount_point;
-  else if (!Succeeds({"mount", "-t", "xfs", device_, mount_point}, &out))
+  else if (!Succeeds({"mount", "-t", kind_.type, device_, mount_point}, &out))
     *why = "mount: " + out;
   else
     mount_point_ = mount_point;
   return why->empty();
 }
 
-LoopXfs::~LoopXfs() {
+std::vector<std::string> LoopFs::MkfsCommand(const std::string& mkfs,
+                                             const std::string& image) const {
+  std::vector<std::string> command = {mkfs};
+  for (const char* option : kind_.options) {
+    if (option) command.push_back(option);
+  }
+  command.push_back(image);
+  return command;
+}
+
+LoopFs::~LoopFs() {
   std::string out;
   if (!mount_point_.empty() && !Succeeds({"umount", mount_point_}, &out)) {
     fprintf(stderr, "umount %s: %s; detaching it lazily\n", mount_point_.c_str(), out.c_str());
@@ -363,19 +391,20 @@ bool MeasureOnTempRoot(const Options& o) {
   return RunInChild([&] { MeasureVolume(root, "/volume1", o); });
 }
 
-// On an XFS file system mounted as the root's only volume, /volume2.
-bool MeasureOnXfs(const Options& o) {
+// On a file system of kind `kind` (`title` in the report) mounted as the
+// root's only volume, /volume2.
+bool MeasureOnLoop(const Options& o, const LoopFsKind& kind, const char* title) {
   TempRoot root;
   HoldSignals held;
-  LoopXfs xfs;
+  LoopFs fs(kind);
   const std::string volume = "/volume2";
   const uint64_t image_bytes = 3 * o.data_bytes + (1ull << 30);
   std::string why;
-  if (!xfs.Make(root.Path("/tmp/xfs.img"), image_bytes, root.Path(volume), &why)) {
-    printf("\nNo XFS measurement: %s.\n", why.c_str());
+  if (!fs.Make(root.Path("/tmp/fs.img"), image_bytes, root.Path(volume), &why)) {
+    printf("\nNo %s measurement: %s.\n", title, why.c_str());
     return true;
   }
-  printf("\nOn XFS (reflink=1) in a loop-mounted file:\n");
+  printf("\nOn %s in a loop-mounted file:\n", title);
   return RunInChild([&] {
     WriteOrExit(root.Path("/etc/kivo/volumes.json"),
                 "[{\"path\": \"" + volume + "\", \"status\": \"normal\"}]\n");
@@ -397,5 +426,8 @@ int main(int argc, char** argv) {
   printf("cp -a is %s\n", cp_version.substr(0, cp_version.find('\n')).c_str());
   printf("\nOn the temporary root's file system:\n");
   // A pass that failed or was interrupted ends the benchmark.
-  return MeasureOnTempRoot(o) && MeasureOnXfs(o) ? 0 : 1;
+  return MeasureOnTempRoot(o) && MeasureOnLoop(o, kXfs, "XFS (reflink=1)") &&
+                 MeasureOnLoop(o, kBtrfs, "Btrfs (data folders are subvolumes)")
+             ? 0
+             : 1;
 }

@@ -42,6 +42,11 @@ constexpr struct {
     {api::kUpdateSetting, "add"},
     {api::kUpdateSetting, "delete"},
     {api::kUserSettings, "set"},
+    {api::kAutoUpdate, "set"},
+    {api::kAutoUpdate, "hold"},
+    {api::kAutoUpdate, "release"},
+    {api::kRevision, "rollback"},
+    {api::kRevision, "drop"},
 };
 
 // The parameters whose values may be recorded: what a call names, never
@@ -63,9 +68,17 @@ constexpr const char* kRecordedParams[] = {
     "packages",
     "list",
     "switch_origin",
+    "without_data_copy",
     "check_codesign",
     "force",
     "app",
+    // The maintenance window and holds of automatic updates.
+    "limited",
+    "days",
+    "start",
+    "end",
+    "random_delay_minutes",
+    "until",
 };
 
 constexpr size_t kMaxValueBytes = 1024;

@@ -6,9 +6,14 @@
 #include "accounts/accounts.h"
 #include "host/activity_api.h"
 #include "host/activity_record.h"
+#include "host/auto_update_api.h"
 #include "host/host_config.h"
 #include "host/login_throttle.h"
+#include "host/revision_api.h"
+#include "host/sources_api.h"
+#include "host/usage_api.h"
 #include "host/user_settings_api.h"
+#include "host/watchdog_api.h"
 #include "webapi/api_names.h"
 #include "webapi/web_man.h"
 
@@ -16,8 +21,13 @@ namespace {
 
 using WebAPIName::kActivity;
 using WebAPIName::kAuth;
+using WebAPIName::kAutoUpdate;
 using WebAPIName::kInfo;
+using WebAPIName::kRevision;
+using WebAPIName::kSources;
+using WebAPIName::kUsage;
 using WebAPIName::kUserSettings;
+using WebAPIName::kWatchdog;
 constexpr char kAdminGroup[] = "administrators";
 
 Json::Value Reason(const std::string& reason) {
@@ -39,6 +49,11 @@ void InfoQuery(const ModuleTable& modules, APIResponse* response) {
   AddRange(&data, kAuth, 1, 1);
   AddRange(&data, kUserSettings, 1, 1);
   AddRange(&data, kActivity, 1, 1);
+  AddRange(&data, kAutoUpdate, 1, 1);
+  AddRange(&data, kWatchdog, 1, 1);
+  AddRange(&data, kRevision, 1, 1);
+  AddRange(&data, kSources, 1, 1);
+  AddRange(&data, kUsage, 1, 1);
   for (const APIVersionRange& r : modules.Versions())
     AddRange(&data, r.api, r.min_version, r.max_version);
   response->SetSuccess(data);
@@ -219,6 +234,43 @@ void Activity(const CgiRequest& cgi, APIRequest* request, APIResponse* response)
   ActivityExport(*request, response);
 }
 
+// Kept versions and rollback are for administrators only, as every package
+// API is.
+void Revision(const CgiRequest& cgi, APIRequest* request, APIResponse* response) {
+  if (!AuthorizeAdministrator(cgi, false, request, response)) return;
+  const std::string& method = request->GetAPIMethod();
+  const std::string account = request->GetLoginUserName();
+  if (method == "list") return RevisionList(*request, response);
+  if (method == "rollback") return RevisionRollback(*request, account, response);
+  RevisionDrop(*request, account, response);
+}
+
+// How fresh the catalogue is: for administrators, as the catalogue is.
+void Sources(const CgiRequest& cgi, APIRequest* request, APIResponse* response) {
+  if (AuthorizeAdministrator(cgi, false, request, response)) SourcesList(*request, response);
+}
+
+// What the watchdog did: for administrators, as every package API is.
+void Watchdog(const CgiRequest& cgi, APIRequest* request, APIResponse* response) {
+  if (AuthorizeAdministrator(cgi, false, request, response)) WatchdogList(*request, response);
+}
+
+// What each package uses: for administrators, as every package API is.
+void Usage(const CgiRequest& cgi, APIRequest* request, APIResponse* response) {
+  if (!AuthorizeAdministrator(cgi, false, request, response)) return;
+  if (request->GetAPIMethod() == "list") return UsageList(*request, response);
+  UsageGet(*request, response);
+}
+
+// The window and holds of automatic updates are for administrators only, as
+// every package API is; a change is on record.
+void AutoUpdate(const CgiRequest& cgi, APIRequest* request, APIResponse* response) {
+  if (!AuthorizeAdministrator(cgi, false, request, response)) return;
+  CallRecord record(*request, request->GetLoginUserName());
+  AutoUpdateAnswer(*request, response);
+  record.Finish(*response);
+}
+
 // Tells a page that was reloaded who it is signed in as and hands it the
 // session's token again, so that the page keeps the token in memory only and
 // never needs to store it. Only the cookie session is asked: a cross-site
@@ -267,7 +319,9 @@ void HandOverCaller(const CgiRequest& cgi, APIRequest* request) {
 }  // namespace
 
 bool IsHostAPI(const std::string& api) {
-  return api == kInfo || api == kAuth || api == kUserSettings || api == kActivity;
+  if (api == kAutoUpdate) return true;
+  return api == kInfo || api == kAuth || api == kUserSettings || api == kActivity ||
+         api == kSources || api == kRevision || api == kWatchdog || api == kUsage;
 }
 
 void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* modules,
@@ -277,7 +331,11 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
   bool known = (api == kInfo && method == "query") ||
                (api == kAuth && (method == "login" || method == "logout" || method == "session")) ||
                (api == kUserSettings && method == "set") ||
-               (api == kActivity && (method == "list" || method == "export"));
+               (api == kAutoUpdate && IsAutoUpdateMethod(method)) ||
+               (api == kActivity && (method == "list" || method == "export")) ||
+               (api == kSources && method == "list") || (api == kWatchdog && method == "list") ||
+               (api == kUsage && (method == "list" || method == "get")) ||
+               (api == kRevision && (method == "list" || method == "rollback" || method == "drop"));
   if (!known) {
     response->SetError(kErrNoSuchMethod);
   } else if (request->GetAPIVersion() != 1) {
@@ -286,8 +344,18 @@ void RunHostAPI(const CgiRequest& cgi, APIRequest* request, const ModuleTable* m
     InfoQuery(*modules, response);
   } else if (api == kUserSettings) {
     UserSettings(cgi, *request, response);
+  } else if (api == kAutoUpdate) {
+    AutoUpdate(cgi, request, response);
   } else if (api == kActivity) {
     Activity(cgi, request, response);
+  } else if (api == kRevision) {
+    Revision(cgi, request, response);
+  } else if (api == kSources) {
+    Sources(cgi, request, response);
+  } else if (api == kWatchdog) {
+    Watchdog(cgi, request, response);
+  } else if (api == kUsage) {
+    Usage(cgi, request, response);
   } else if (method == "login") {
     Login(cgi, *request, response);
   } else if (method == "session") {

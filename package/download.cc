@@ -10,6 +10,7 @@
 #include <memory>
 #include <unistd.h>
 
+#include "download_record.h"
 #include "error_codes.h"
 #include "klibc/last_error.h"
 #include "klibc/process.h"
@@ -61,6 +62,15 @@ void PackageWebAPI::ReadProgress() {
     if (progress != -1.0) data["progress"] = progress;
   } else {
     data["progress"] = DownloadTaskProgress(*task, data);
+  }
+  // A server download's worker puts its outcome on record from the task
+  // once it has finished it (download_record.h): until the worker is gone
+  // the task is neither reported finished nor dropped.
+  if (task->isFinished() && data["link"].isString() && data["pid"].isInt() &&
+      KLIBCProcAlive(data["pid"].asInt()) == 1) {
+    data["finished"] = false;
+    response->SetSuccess(data);
+    return;
   }
   if (queued) {
     bool gone =
@@ -143,7 +153,7 @@ bool PackageWebAPI::DeterminePackageInfo(DownloadRequest& d) const {
   d.install_and_run = FlagParamOr(request, "installrunpackage", false);
   d.volume = request->GetParam("volume_path", "").asString();
   d.wizard_values = request->GetParam("customuivalues", "").asString();
-  d.origin_change = OriginChangeParam();
+  d.choices = InstallChoicesParam();
   if (!PMSIsValidPackageId(d.name)) {
     Json::Value details(Json::objectValue);
     details["name"] = "name";
@@ -186,7 +196,7 @@ bool PackageWebAPI::DeterminePackageInfo(DownloadRequest& d) const {
 
 pid_t PackageWebAPI::ForkProcess(NVX::Task* task, Json::Value& result, const std::string& name,
                                  uint64_t size, const std::string& link, const std::string& folder,
-                                 bool quickInstall, PMSOriginChange originChange) {
+                                 bool quickInstall, const PMSInstallChoices& choices) {
   if (name.empty() || !task || link.empty() || folder.empty()) return -1;
   pid_t pid = KLIBCProcFork();
   if (pid < 0) {
@@ -203,8 +213,9 @@ pid_t PackageWebAPI::ForkProcess(NVX::Task* task, Json::Value& result, const std
     WaitToBeRecorded(*task, getpid());
     return 0;
   }
-  if (KIVOPackageServer::InitDownload(task, name, size, link, folder, quickInstall, pid,
-                                      originChange)) {
+  // Before the worker is released: its end is the install's outcome.
+  HandDownloadEntryTo(pid);
+  if (KIVOPackageServer::InitDownload(task, name, size, link, folder, quickInstall, pid, choices)) {
     result["taskid"] = task->getTaskId();
     result["progress"] = "0.00001";  // a string, as clients have always received it
   }
@@ -236,8 +247,8 @@ bool PackageWebAPI::DownloadAndInstallPackage(const DownloadRequest& d, Json::Va
   // a listing between the two would find neither download, and a page
   // reloaded right after asking for the install would offer it again.
   NVX::Task* claimed = nullptr;
-  const Json::Value first = KIVOPackageServer::NewDownloadData(
-      task_id, d.name, d.size, d.link, folder, d.quick_install, d.origin_change);
+  const Json::Value first = KIVOPackageServer::NewDownloadData(task_id, d.name, d.size, d.link,
+                                                               folder, d.quick_install, d.choices);
   const auto never_held = [](const Json::Value&) { return false; };
   if (mgr.claimTask(task_id, first, never_held, &claimed) != NVX::TaskMgr::Claim::kClaimed) {
     claimed = nullptr;
@@ -248,8 +259,8 @@ bool PackageWebAPI::DownloadAndInstallPackage(const DownloadRequest& d, Json::Va
     KIVOPackageServer::PMSRemoveDownloadDir(folder);
     return false;
   }
-  pid_t pid = ForkProcess(task.get(), result, d.name, d.size, d.link, folder, d.quick_install,
-                          d.origin_change);
+  pid_t pid =
+      ForkProcess(task.get(), result, d.name, d.size, d.link, folder, d.quick_install, d.choices);
   if (pid < 0) {
     KIVOPackageServer::PMSRemoveDownloadDir(folder);
     return false;
@@ -265,6 +276,7 @@ bool PackageWebAPI::DownloadAndInstallPackage(const DownloadRequest& d, Json::Va
     (void)KIVOPackageServer::Install(task.get(), user, d.volume, d.name, folder, d.install_and_run,
                                      d.wizard_values, d.type_flag, language);
   }
+  EndDownloadEntry(task.get(), KIVOPackageServer::isCanceled());
   task.reset();
   _exit(0);
 }

@@ -48,6 +48,8 @@ enum ApiError : int {
   kErrScriptFailed = 4549,
   kErrCancelled = 4550,
   kErrDependentsRunning = 4552,
+  kErrNoRoomForDataCopy = 4553,  // no room for the safety copy an upgrade takes of the data
+  kErrDataNotCopyable = 4554,    // the data holds what a safety copy cannot hold
   kErrNotFeasible = 4556,
   kErrUninstallFailed = 4560,
   kErrUninstallBadValues = 4561,
@@ -64,6 +66,10 @@ enum ApiError : int {
   kErrKeyNotPublic = 4593,       // the file holds no OpenPGP public key
   kErrKeySecret = 4594,          // the file holds a secret key
   kErrKeyringUnwritable = 4595,  // the appliance keyring cannot be written
+  // INFO memory_limit_mb or process_limit above the appliance's bound
+  kErrLimitAboveBound = 4615,
+  // a package that asks to run as root, not signed by a key of the appliance keyring
+  kErrRootNotTrusted = 4620,
 };
 
 // One row of a table that maps a code of something the module calls onto

@@ -17,6 +17,7 @@
 #include "pkgserver/catalogue.h"
 #include "pkgserver/feed_file.h"
 #include "pkgserver/feed_keys.h"
+#include "pkgserver/source_status.h"
 #include "request_values.h"
 #include "settings/web_utils.h"
 
@@ -286,6 +287,9 @@ void PackageWebAPI::AddFeedList() {
   Json::Value keys = PublishedKeys(probed);
   Json::Value answer;
   if (!keys.isNull()) answer["has_keyrings"] = true;
+  // A feed that answers but lists nothing is added, and the answer says so:
+  // the page tells the administrator rather than showing an empty feed.
+  answer["packages"] = static_cast<Json::Int64>(KIVOPackageServer::PMSListedEntryCount(probed));
   UpdateKeys(feed, keys);
   response->SetSuccess(answer);
 }
@@ -328,9 +332,16 @@ void PackageWebAPI::EditFeedList() {
   if (!ApplyFeedChange(&feeds, change)) return;
   if (!SaveFeeds(feeds)) return response->SetError(kErrFailed, Json::Value());
   // The old address's keys vouch for nothing once it is gone from the list.
-  if (changed && orifeed != feed) UpdateKeys(orifeed, Json::Value());
+  if (changed && orifeed != feed) {
+    UpdateKeys(orifeed, Json::Value());
+    KIVOPackageServer::PMSForgetSourceStatus(orifeed);
+  }
   if (changed) UpdateKeys(feed, PublishedKeys(probed));
-  response->SetSuccess(Json::Value());
+  Json::Value answer;
+  if (changed) {
+    answer["packages"] = static_cast<Json::Int64>(KIVOPackageServer::PMSListedEntryCount(probed));
+  }
+  response->SetSuccess(answer);
 }
 
 void PackageWebAPI::DelFeedList() {
@@ -349,6 +360,7 @@ void PackageWebAPI::DelFeedList() {
       kept.append(item);
     } else {
       UpdateKeys(feed, Json::Value());
+      KIVOPackageServer::PMSForgetSourceStatus(feed);
     }
   }
   if (!SaveFeeds(kept)) return response->SetError(kErrFailed, Json::Value());

@@ -16,6 +16,7 @@
 #include "klibc/process.h"
 #include "log_line.h"
 #include "package_webapi.h"
+#include "permissions.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/result_codes.h"
 #include "remove_tree.h"
@@ -55,6 +56,8 @@ constexpr ToolCodeMapping kCheckErrors[] = {
     {PKG_ERR_NO_VOLUME, kErrNoVolume},
     {PKG_ERR_OS_TOO_NEW, kErrOsTooNew},
     {PKG_ERR_OS_TOO_OLD, kErrOsTooOld},
+    {PKG_ERR_ROOT_NOT_TRUSTED, kErrRootNotTrusted},
+    {PKG_ERR_LIMIT_ABOVE_BOUND, kErrLimitAboveBound},
 };
 
 // The install itself.
@@ -79,6 +82,10 @@ constexpr ToolCodeMapping kInstallErrors[] = {
     {PKG_ERR_CANCELLED, kErrCancelled},
     {PKG_ERR_UPGRADE_ROLLED_BACK, kErrUpgradeRolledBack},
     {PKG_ERR_OTHER_ORIGIN, kErrOtherOrigin},
+    {PKG_ERR_ROOT_NOT_TRUSTED, kErrRootNotTrusted},
+    {PKG_ERR_LIMIT_ABOVE_BOUND, kErrLimitAboveBound},
+    {PKG_ERR_NO_ROOM_FOR_DATA_COPY, kErrNoRoomForDataCopy},
+    {PKG_ERR_DATA_NOT_COPYABLE, kErrDataNotCopyable},
 };
 
 bool IsCodesignCode(int code) {
@@ -123,10 +130,12 @@ bool PackageWebAPI::CheckPackageFileInfo(const char* path, PackageInfo& info, bo
   Json::Value details(Json::objectValue);
   if (CheckPackageFileInfoImpl(request->GetUILanguage().c_str(), path, message, code, details,
                                info)) {
+    result["permissions"] = DescribePermissions(info, details);
     return true;
   }
   if (IsCodesignCode(code)) {
     if (!strictCodesign) {
+      result["permissions"] = DescribePermissions(info, details);
       result["codesign_error"] = MapToolCode(kCodesignErrors, code);
       if (!message.empty()) result["codesign_message"] = message;
       return true;
@@ -229,6 +238,8 @@ bool PackageWebAPI::UploadAndDescribe(const std::string& file, Json::Value& resu
   }
   PackageUtils::DumpInfo(info, mask, result);
   if (!info.getLicense().empty()) PackageUtils::DumpLicense(info, result);
+  // Plain text the page shows before a manual upgrade (as text, never markup).
+  if (!info.getReleaseNotes().empty()) result["changelog"] = info.getReleaseNotes();
   if (!info.getUIFile().isNull() && !info.getUIFile().empty()) {
     PackageUtils::DumpUIFIle(info, result["install_pages"]);
   }
@@ -358,7 +369,7 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
   Json::Value details;
   // An uploaded file, or one on the device: a file's origin.
   PMSInstallSource source;
-  source.change = OriginChangeParam();
+  source.choices = InstallChoicesParam();
   bool ok = InstallPackageFileImpl(request->GetLoginUserName(), path, volume, 0, extra, type_flag,
                                    request->GetUILanguage(), message, code, details, force,
                                    check_codesign, &source);
@@ -400,9 +411,15 @@ bool PackageWebAPI::InstallPackageFile(const char* path) {
   return false;
 }
 
-PMSOriginChange PackageWebAPI::OriginChangeParam() const {
-  Json::Value v = request->GetParam("switch_origin", false);
-  return v.isBool() && v.asBool() ? PMSOriginChange::kAllow : PMSOriginChange::kRefuse;
+PMSInstallChoices PackageWebAPI::InstallChoicesParam() const {
+  const auto flag = [this](const char* name) {
+    Json::Value v = request->GetParam(name, false);
+    return v.isBool() && v.asBool();
+  };
+  PMSInstallChoices choices;
+  if (flag("switch_origin")) choices.change = PMSOriginChange::kAllow;
+  choices.without_data_copy = flag("without_data_copy");
+  return choices;
 }
 
 void PackageWebAPI::CancelProgress() {

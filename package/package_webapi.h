@@ -110,10 +110,12 @@ class PackageWebAPI {
   NVX::Task* ClaimInstallTask(NVX::TaskMgr& mgr, const PackageInfo& info);
   void RecordFailure(NVX::Task& task);
   bool InstallPackageFile(const char* path);
-  // "switch_origin" (bool, default false) of an install: the administrator
-  // switches the package to the origin of this file or download
-  // (pkgtool/package_origin.h).
-  PMSOriginChange OriginChangeParam() const;
+  // What the administrator allowed an install or a download's install
+  // (pkgtool/package_origin.h): "switch_origin" (bool, default false)
+  // switches the package to the origin of this file or download;
+  // "without_data_copy" (bool, default false) lets an upgrade go on when
+  // there is no room for the safety copy of the package's data.
+  PMSInstallChoices InstallChoicesParam() const;
   bool VolumeListGet(Json::Value& out);
   bool TinboxSpaceOk(const std::string& install_type);
   bool CheckEnvConflicts(PackageManager& manager, const std::string& id, const std::string& version,
@@ -131,14 +133,14 @@ class PackageWebAPI {
     std::string name, link, checksum, volume, wizard_values;
     uint64_t size = 0;
     bool quick_install = false, install_and_run = false, type_flag = false;
-    PMSOriginChange origin_change = PMSOriginChange::kRefuse;
+    PMSInstallChoices choices;
   };
   void Download();
   bool DeterminePackageInfo(DownloadRequest& d) const;
   bool DownloadAndInstallPackage(const DownloadRequest& d, Json::Value& result);
   pid_t ForkProcess(NVX::Task* task, Json::Value& result, const std::string& name, uint64_t size,
                     const std::string& link, const std::string& folder, bool quickInstall,
-                    PMSOriginChange originChange = PMSOriginChange::kRefuse);
+                    const PMSInstallChoices& choices);
   // The progress a download task reports: 1.0 only once its file is there,
   // never below 0.
   static double DownloadTaskProgress(NVX::Task& task, const Json::Value& data);

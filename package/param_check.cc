@@ -216,7 +216,8 @@ bool CheckInstall(APIRequest* req, APIResponse* resp) {
            {"installrunpackage", Type::Bool, kOpt},
            {"force", Type::Bool, kOpt},
            {"check_codesign", Type::Bool, kOpt},
-           {"switch_origin", Type::Bool, kOpt}});
+           {"switch_origin", Type::Bool, kOpt},
+           {"without_data_copy", Type::Bool, kOpt}});
   if (!c.TypesOk()) return false;
   auto filled = [&c](const char* name) {
     const ReadParam& p = c[name];

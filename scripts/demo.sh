@@ -6,7 +6,7 @@
 #
 # Installs what is missing (as root), builds, creates demo-root/ inside the
 # checkout with the account admin (password $KIVO_DEMO_PASSWORD, default
-# "admin"), and serves it with lighttpd.
+# "admin"), and serves it with lighttpd, with the package watchdog beside it.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 PORT=${1:-${PORT:-5000}}
@@ -61,7 +61,16 @@ stop_packages() {
   in_passes stop "$STOPPED"
   echo "stopped: $(tr '\n' ' ' <"$STOPPED")"
 }
-trap stop_packages EXIT
+# The watchdog runs beside lighttpd (its lines in $ROOT/watchdog.log) and
+# ends first, so that it never meets the packages the demo stops.
+$K watchdog >>"$ROOT/watchdog.log" 2>&1 &
+WATCHDOG=$!
+echo "watchdog: pid $WATCHDOG, its log $ROOT/watchdog.log"
+end_demo() {
+  kill -TERM "$WATCHDOG" 2>/dev/null && wait "$WATCHDOG" || true
+  stop_packages
+}
+trap end_demo EXIT
 # Ctrl-C reaches lighttpd, which ends; the shell goes on to the trap above.
 trap : INT TERM
 /usr/sbin/lighttpd -D -f "$ROOT/lighttpd.conf"

@@ -18,7 +18,8 @@ PACKAGES=(
   lighttpd lighttpd-mod-deflate php-cli gnupg curl procps
 )
 # The page's browser tests drive Debian's chromium; the demo does not need it.
-[ "${1:-}" = --tests ] && PACKAGES+=(chromium)
+# The tests and the upgrade benchmark make XFS and Btrfs volumes in files.
+[ "${1:-}" = --tests ] && PACKAGES+=(chromium xfsprogs btrfs-progs)
 
 missing=()
 for p in "${PACKAGES[@]}"; do

@@ -191,7 +191,7 @@ TEST_F(ActivityTest, TheLogKeepsItsBound) {
 TEST_F(ActivityTest, AKivoctlKilledHalfWayLeavesAnUnfinishedEntry) {
   std::string out;
   ASSERT_EQ(
-      0, Kivoctl({"install", Package("slow", "touch \"$KIVO_ROOT/tmp/starting\"; sleep 30")}, &out))
+      0, Kivoctl({"install", Package("slow", "touch \"$KIVO_PKG_VAR/starting\"; sleep 30")}, &out))
       << out;
   pid_t pid = fork();
   if (pid == 0) {
@@ -201,7 +201,8 @@ TEST_F(ActivityTest, AKivoctlKilledHalfWayLeavesAnUnfinishedEntry) {
     _exit(127);
   }
   setpgid(pid, pid);
-  for (int i = 0; i < 400 && access(root_.Path("/tmp/starting").c_str(), F_OK) != 0; ++i)
+  for (int i = 0;
+       i < 400 && access(root_.Path("/volume1/@appdata/slow/starting").c_str(), F_OK) != 0; ++i)
     usleep(25000);
   Json::Value running = Newest("Control.start");
   EXPECT_EQ("running", running["state"].asString()) << running;

@@ -272,8 +272,9 @@ TEST_F(CodeMappingTest, InstallFailures) {
 // install looks again: 268 at the install -> 4547 (at the check it is
 // 4526). Its status script answers "running" once more, then "stopped".
 TEST_F(CodeMappingTest, DependencyGoneBeforeInstall) {
-  const std::string flag = root_.Path("/tmp/flaky-stops-after-next-status");
-  const std::string down = root_.Path("/tmp/flaky-down");
+  // In flaky's own data folder: its confined scripts reach no other.
+  const std::string flag = root_.Path("/volume1/@appdata/flaky/stops-after-next-status");
+  const std::string down = root_.Path("/volume1/@appdata/flaky/down");
   TestPackage flaky;
   flaky.id = "flaky";
   flaky.daemon = false;
@@ -307,8 +308,8 @@ TEST_F(CodeMappingTest, DependencyGoneBeforeInstall) {
 // look under the lock finds 2.0, 259 -> 4583. The upgrade's preupgrade
 // holds it until the start has looked.
 TEST_F(CodeMappingTest, StartAfterNeededPackageUpgraded) {
-  const std::string gate = root_.Path("/tmp/gate");
-  ASSERT_EQ(0, KIVOFSMkdirP(gate.c_str()));
+  // The gate is lib's own data folder: its confined scripts reach no other.
+  const std::string gate = root_.Path("/volume1/@appdata/lib");
   root_.Write("/etc/kivo/pkgtool.conf", "lock_wait=\"30\"\n");
   TestPackage lib;
   lib.id = "lib";
@@ -337,7 +338,7 @@ TEST_F(CodeMappingTest, StartAfterNeededPackageUpgraded) {
     return api.Call(kControl, "start", 1, {{"id", "app"}});
   });
   bool looked = AppearsSoon(gate + "/asked");
-  root_.Write("/tmp/gate/go", "");
+  root_.Write("/volume1/@appdata/lib/go", "");
   ASSERT_TRUE(looked);
   CgiAnswer upgraded = upgrade.get();
   ASSERT_TRUE(upgraded.Success()) << upgraded.body;

@@ -4,6 +4,9 @@
 set -uo pipefail
 BUILD=$1
 WORK=$(mktemp -d)
+# Packages run as their own accounts, which must pass through the folder
+# that holds the root (the tool opens the root itself, not what is above it).
+chmod 711 "$WORK"
 trap 'KIVO_ROOT=$ROOT $BUILD/bin/kivoctl stop demo-wizard >/dev/null 2>&1; rm -rf "$WORK"' EXIT
 "$(dirname "$0")/../examples/build.sh" "$BUILD/bin/kivoctl" "$WORK/out" >/dev/null || exit 1
 ROOT=$WORK/root
@@ -33,7 +36,7 @@ sed -i 's/^pgsql=.*/pgsql="stopped"/' "$ROOT/etc/kivo/services.conf"
 expect 260 "db needs pgsql" -- $K install $P/demo-db.kpk
 sed -i 's/^pgsql=.*/pgsql="running"/' "$ROOT/etc/kivo/services.conf"
 expect 0 "db" -- $K install $P/demo-db.kpk
-expect 0 "uninstall wizard" -- $K uninstall demo-wizard --wizard '{"keep_copy": true}'
-[ -f "$ROOT/volume1/public/demo-wizard-greeting.txt" ] || { echo "FAIL uninstall wizard answer"; failures=$((failures + 1)); }
+said=$($K uninstall demo-wizard --wizard '{"keep_copy": true}' 2>&1)
+echo "$said" | grep -qx "Your greeting was: Servus" || { echo "FAIL uninstall wizard answer: $said"; failures=$((failures + 1)); }
 echo "$failures failed"
 [ "$failures" = 0 ]

@@ -295,9 +295,8 @@ TEST_F(PackageToolTest, WizardAnswersReachTheScripts) {
   TestPackage app;
   app.members = {{"WIZARD_UIFILES/install_uifile", "[{\"step_title\": \"Name\"}]"},
                  {"WIZARD_UIFILES/uninstall_uifile", "[{\"step_title\": \"Keep\"}]"}};
-  app.scripts = {
-      {"postinst", "echo \"$KIVO_WIZARD_name\" > \"$KIVO_PKG_VAR/name\"\n"},
-      {"preuninst", "cp \"$KIVO_WIZARD_VALUES\" \"$KIVO_ROOT/tmp/uninstall-answers.json\"\n"}};
+  app.scripts = {{"postinst", "echo \"$KIVO_WIZARD_name\" > \"$KIVO_PKG_VAR/name\"\n"},
+                 {"preuninst", "echo \"answers: $(cat \"$KIVO_WIZARD_VALUES\")\"\n"}};
   ASSERT_EQ(0, Install(Build(app), {"--wizard", "{\"name\": \"Ada\", \"n\": 3}"})) << out_;
   std::string text;
   ASSERT_TRUE(KIVOReadFile(root_.Path("/var/packages/test-app/var/name"), &text));
@@ -312,8 +311,10 @@ TEST_F(PackageToolTest, WizardAnswersReachTheScripts) {
 
   ExpectRefused(PKG_ERR_BAD_WIZARD_VALUES, Build(app), {"--wizard", "{broken"});
   ASSERT_EQ(0, Kivoctl({"uninstall", "test-app", "--wizard", "{\"keep\": true}"}, &out_)) << out_;
-  ASSERT_TRUE(KIVOReadFile(root_.Path("/tmp/uninstall-answers.json"), &text));
-  EXPECT_NE(std::string::npos, text.find("\"keep\""));
+  // preuninst read them (its output is in the operation log).
+  const size_t answers = out_.find("answers: {");
+  ASSERT_NE(std::string::npos, answers) << out_;
+  EXPECT_NE(std::string::npos, out_.find("\"keep\"", answers)) << out_;
 }
 
 TEST_F(PackageToolTest, StatusWithoutAPidFileAsksTheScript) {

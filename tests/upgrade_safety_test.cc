@@ -11,6 +11,7 @@
 
 #include <gtest/gtest.h>
 
+#include "feasibility/feasibility_check.h"
 #include "klibc/atomic_file.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
@@ -168,11 +169,11 @@ TEST_F(UpgradeSafetyTest, StoppedPackageIsJudgedByItsScriptsAndStaysStopped) {
   v2_.daemon = false;
   v2_.scripts = {{"health", "exit 1\n"},
                  {"start-stop-status",
-                  "case \"$1\" in start) touch \"$KIVO_ROOT/tmp/started\"; exit 1;; "
+                  "case \"$1\" in start) echo start-script-ran; exit 1;; "
                   "status) exit 1;; esac\n"}};
   ASSERT_EQ(0, Install(v2_)) << out_;
   EXPECT_EQ("test-app 2.0 stopped\n", Status());
-  EXPECT_FALSE(KLIBCFileExist(root_.Path("/tmp/started").c_str()));
+  EXPECT_EQ(std::string::npos, out_.find("start-script-ran")) << out_;
   ExpectNothingLeftBut(1);
 }
 
@@ -220,6 +221,28 @@ TEST_F(UpgradeSafetyTest, NoRoomForTheCopyIsRefusedInWordsUnlessThePackageNeedsN
   ExpectSaid("The upgrade of test-app needs 3 MiB for a safety copy of its data besides");
   ExpectSaid("/volume1 has 2 MiB free. Nothing was changed.");
   EXPECT_EQ("test-app 1.0 running\n", Status());
+  // Before the upgrade, the feasibility check advises what an upgrade
+  // without the copy gives up; with room for the copy it says nothing.
+  PKLIBSZLIST reasons = KLIBCSzListAlloc(8);
+  ASSERT_EQ(2, KIVOFeasibilityCheck(KIVO_FEASIBILITY_INSTALL, KIVO_FEASIBILITY_SOFT, &reasons,
+                                    "test-app", 0));
+  EXPECT_EQ(std::string("Volume /volume1 has no room for a safety copy of the data of test-app (3 "
+                        "MiB needed, 2 MiB free). The upgrade can go on without one, but if it "
+                        "then fails, the data it changed cannot be brought back."),
+            KLIBCSzListGet(reasons, 1));
+  KLIBCSzListFree(reasons);
+  root_.Write("/etc/kivo/volumes.json", "[{\"path\": \"/volume1\", \"status\": \"normal\"}]");
+  reasons = KLIBCSzListAlloc(8);
+  EXPECT_EQ(0, KIVOFeasibilityCheck(KIVO_FEASIBILITY_INSTALL, KIVO_FEASIBILITY_SOFT, &reasons,
+                                    "test-app", 0));
+  KLIBCSzListFree(reasons);
+  root_.Write("/etc/kivo/volumes.json",
+              "[{\"path\": \"/volume1\", \"status\": \"normal\", \"cap_bytes\": 2097152}]");
+
+  // The administrator who accepts that upgrades without the copy.
+  ASSERT_EQ(0, Install(v2_, {"--without-data-copy"})) << out_;
+  EXPECT_EQ("test-app 2.0 running\n", Status());
+  EXPECT_EQ("", Entries("/volume1/@appdata/.snapshots"));
 
   TestPackage uncopied = v2_;
   uncopied.version = "2.1";

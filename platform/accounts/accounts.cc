@@ -12,6 +12,7 @@
 #include <sstream>
 
 #include "klibc/atomic_file.h"
+#include "klibc/file_lock.h"
 #include "klibc/sysroot.h"
 
 namespace {
@@ -195,6 +196,8 @@ bool KIVOAccountSet(const std::string& account, const std::string& password,
   std::string hash = HashPassword(password);
   if (hash.empty()) return (*error = "cannot hash the password"), false;
 
+  FileLock lock(KIVOAccountsLockPath());
+  if (!lock.held()) return (*error = "cannot lock the account files"), false;
   std::vector<std::string> passwd = ReadLines("/etc/passwd");
   std::vector<std::string> shadow = ReadLines("/etc/shadow");
   std::vector<std::string> group = ReadLines("/etc/group");

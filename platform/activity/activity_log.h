@@ -32,6 +32,9 @@ namespace KivoActivity {
 // Where an operation came from.
 inline constexpr char kOriginWeb[] = "web";
 inline constexpr char kOriginKivoctl[] = "kivoctl";
+inline constexpr char kOriginWatchdog[] = "watchdog";
+// The upgrades `kivoctl auto-update` makes, one entry each.
+inline constexpr char kOriginAutoUpdate[] = "auto-update";
 
 // An entry's state: under way, ended well or badly, or begun by a process
 // that is gone without finishing it.
@@ -102,9 +105,20 @@ class ActivityLog {
   // Records that `actor` started `op` now, by this process; drops what falls
   // outside the bounds. The entry's id, or 0 when it cannot be recorded.
   [[nodiscard]] long long Begin(const Actor& actor, const Operation& op);
-  // Records how entry `id` (from Begin) ended. False when it cannot be
-  // written (or `id` is 0).
+  // Records how entry `id` (from Begin) ended, unless this process handed
+  // it over (HandOver), in which case it is left to the taker. False when it
+  // cannot be written (or `id` is 0).
   [[nodiscard]] bool Finish(long long id, const Outcome& outcome);
+  // Hands the entries this process began and has not finished to process
+  // `taker`, a child that goes on with the work after this process answers
+  // (a server install's download worker): from now on they are running
+  // while the taker lives, unfinished once it is gone, and ended by its
+  // FinishHandedOver. False when the log cannot be written; the entries then
+  // stay this process's.
+  [[nodiscard]] bool HandOver(pid_t taker);
+  // In the taker: records how the entries handed to this process ended.
+  // False when they cannot be written; true when there were none.
+  [[nodiscard]] bool FinishHandedOver(const Outcome& outcome);
   // Begin and Finish in one, for an operation that is over as it is known
   // (a sign-in).
   [[nodiscard]] bool Record(const Actor& actor, const Operation& op, const Outcome& outcome);

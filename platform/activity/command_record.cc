@@ -22,7 +22,8 @@ constexpr struct {
     {"uninstall", "Uninstallation.uninstall"},
     {"start", "Control.start"},
     {"stop", "Control.stop"},
-    {"rollback", "rollback"},
+    {"rollback", "Revision.rollback"},
+    {"drop-revision", "Revision.drop"},
     {"auto-update", "auto-update"},
 };
 
@@ -54,7 +55,10 @@ Operation TargetOf(const std::string& command, const std::vector<std::string>& a
     if (args[i] == "--feed" && i + 1 < args.size()) {
       op.target["feed"] = WithoutCredentials(args[++i]).substr(0, 1024);
     } else if (args[i].rfind("--", 0) == 0) {
-      if (args[i] == "--volume" || args[i] == "--wizard") ++i;
+      // Options that take a value: the value names no package.
+      if (args[i] == "--volume" || args[i] == "--wizard" || args[i] == "--now" ||
+          args[i] == "--seed")
+        ++i;
     } else if (!op.target.isMember("id") && !op.target.isMember("file")) {
       bool is_file = command == "install" || command == "upgrade";
       const std::string& word = args[i];

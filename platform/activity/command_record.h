@@ -1,6 +1,6 @@
 // The activity log's entry for a command of the command-line tool: the
 // changing commands (install, upgrade, install-server, uninstall, start,
-// stop, rollback, auto-update) are recorded with origin "kivoctl" and the
+// stop, rollback, drop-revision, auto-update) are recorded with origin "kivoctl" and the
 // unix user who ran them (the one sudo names, when root runs it for them).
 // The entry is begun before the command runs and finished with its exit
 // status, so a command killed half way is left unfinished. Reads and the

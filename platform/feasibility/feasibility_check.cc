@@ -1,5 +1,6 @@
 #include "feasibility/feasibility_check.h"
 
+#include <algorithm>
 #include <memory>
 #include <sstream>
 #include <string>
@@ -8,6 +9,7 @@
 #include "klibc/last_error.h"
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
+#include "pkgtool/data_snapshot.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
@@ -83,6 +85,7 @@ class Checker {
 
  private:
   void InstallVolume(const std::string& id, bool hard);
+  void DataCopyRoom(const std::string& id);
 
   int type_;
   PKLIBSZLIST* reasons_;
@@ -112,6 +115,34 @@ void Checker::InstallVolume(const std::string& id, bool hard) {
   }
 }
 
+std::string MiB(uint64_t bytes) { return std::to_string((bytes + (1 << 20) - 1) >> 20) + " MiB"; }
+
+// An upgrade of an installed package first copies its data, unless the
+// package needs no copy (data_snapshot.h). Where the volume has no room for
+// that copy, the administrator may still upgrade without one: the advice
+// says what that gives up. The room the new version's files take is not
+// known here; the upgrade itself checks both together.
+void Checker::DataCopyRoom(const std::string& id) {
+  PackageInfo installed;
+  std::string path;
+  VolumeConfig volume;
+  if (!PMSLoadInstalled(id, &installed) || !installed.getBool(kPMSDataCopyKey, true) ||
+      !PMSGetPackageVol(id, path) || !KIVOVolumeFind(path, &volume)) {
+    return;
+  }
+  const std::string appdata = KIVORootPath(volume.path + "/@appdata");
+  uint64_t room = 0;
+  std::string problem;
+  if (!PMSDataCopyRoom(appdata, appdata + "/" + id, &room, &problem))
+    return;  // the upgrade says why
+  const int64_t free = std::max<int64_t>(KIVOVolumeFreeBytes(volume), 0);
+  if (room <= static_cast<uint64_t>(free)) return;
+  Add("Volume " + volume.path + " has no room for a safety copy of the data of " + NameOf(id) +
+      " (" + MiB(room) + " needed, " + MiB(free) +
+      " free). The upgrade can go on without one, but if it then fails, the data it changed "
+      "cannot be brought back.");
+}
+
 void Checker::Hard(const std::string& id, NVX::TaskMgr& mgr) {
   if (OperationRunning(mgr, id)) Add(NameOf(id) + " is being installed or changed right now.");
   bool installed = PackageRegistry::IsInstalled(id);
@@ -135,6 +166,7 @@ void Checker::Hard(const std::string& id, NVX::TaskMgr& mgr) {
 void Checker::Soft(const std::string& id) {
   if (type_ == KIVO_FEASIBILITY_INSTALL) {
     InstallVolume(id, false);
+    if (PackageRegistry::IsInstalled(id)) DataCopyRoom(id);
   } else if (type_ == KIVO_FEASIBILITY_UNINSTALL && PackageRegistry::IsInstalled(id)) {
     Add("Removing " + NameOf(id) + " deletes the data it keeps.");
   } else if (type_ == KIVO_FEASIBILITY_STOP) {

@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cctype>
 
+#include "klibc/sysroot.h"
+
 bool KIVOAccountNameValid(const std::string& name) {
   if (name.empty() || name.size() > 32) return false;
   if (!(islower(static_cast<unsigned char>(name[0])) || name[0] == '_')) return false;
@@ -11,3 +13,5 @@ bool KIVOAccountNameValid(const std::string& name) {
            c == '_' || c == '.' || c == '-';
   });
 }
+
+std::string KIVOAccountsLockPath() { return KIVORootPath("/run/kivo/accounts.lock"); }

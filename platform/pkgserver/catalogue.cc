@@ -16,10 +16,11 @@
 #include "klibc/json_text.h"
 #include "klibc/key_value_file.h"
 #include "klibc/sysroot.h"
+#include "pkgserver/feed_file.h"
 #include "pkgserver/server_config.h"
 #include "pkgserver/server_net.h"
+#include "pkgserver/source_status.h"
 #include "pkgtool/version.h"
-#include "settings/web_utils.h"
 
 #define CATALOGUE_LOG(fmt, ...) syslog(LOG_ERR, "%s:%d " fmt, "catalogue", __LINE__, ##__VA_ARGS__)
 
@@ -123,8 +124,16 @@ bool ParseAnswer(const std::string& body, Json::Value& answer) {
   return true;
 }
 
+// A failed fetch of `url`, logged and on its source's record.
+bool FetchFailed(const std::string& url, const std::string& reason, int line) {
+  syslog(LOG_ERR, "%s:%d %s: %s", "catalogue", line, url.c_str(), reason.c_str());
+  PMSRecordFetchFailure(url, reason, time(nullptr));
+  return false;
+}
+
 // Asks the server within `limits`, conditionally when `cached` (read whole)
-// is given, and leaves the answer in `*cached` and the cache file.
+// is given, and leaves the answer in `*cached` and the cache file. The
+// outcome goes on the source's record (source_status.h).
 bool FetchFromServer(const std::string& url, const std::string& query, const std::string& language,
                      const HttpLimits& limits, const std::string& path, CachedCatalogue* cached,
                      bool have) {
@@ -134,10 +143,7 @@ bool FetchFromServer(const std::string& url, const std::string& query, const std
     fetch.if_none_match = cached->meta["etag"].asString();
     fetch.if_modified_since = cached->meta["last_modified"].asString();
   }
-  if (!PMSServerFetch(limits, fetch)) {
-    CATALOGUE_LOG("%s: %s", url.c_str(), fetch.error.c_str());
-    return false;
-  }
+  if (!PMSServerFetch(limits, fetch)) return FetchFailed(url, fetch.error, __LINE__);
   if (have && fetch.status == 304) {
     cached->meta["fetched"] = static_cast<Json::Int64>(time(nullptr));
     // A cache written before the meta named its digest gets it now.
@@ -145,16 +151,16 @@ bool FetchFromServer(const std::string& url, const std::string& query, const std
     if (!MetaDigest(cached->meta, &digest))
       cached->meta["digest"] = DigestText(PMSCatalogueDigest(cached->body));
     WriteCache(path, *cached);
+    // Unchanged: the count of its last whole answer still holds.
+    PMSRecordFetchSuccess(url, -1, cached->meta["fetched"].asInt64());
     return true;
   }
   Json::Value parsed;
   if (fetch.status != 200) {
-    CATALOGUE_LOG("%s: the server answered HTTP %ld", url.c_str(), fetch.status);
-    return false;
+    return FetchFailed(url, "the server answered HTTP " + std::to_string(fetch.status), __LINE__);
   }
   if (!ParseAnswer(fetch.body, parsed)) {
-    CATALOGUE_LOG("%s: the answer is not a JSON catalogue", url.c_str());
-    return false;
+    return FetchFailed(url, "the answer is not a JSON catalogue", __LINE__);
   }
   cached->meta = Json::Value(Json::objectValue);
   cached->meta["url"] = url;
@@ -165,6 +171,15 @@ bool FetchFromServer(const std::string& url, const std::string& query, const std
   cached->meta["digest"] = DigestText(PMSCatalogueDigest(fetch.body));
   cached->body = std::move(fetch.body);
   WriteCache(path, *cached);
+  // JSON that lists no entries at all is cached as before (its readers
+  // judge it), but its source is failing: it serves no catalogue.
+  const int64_t listed = PMSListedEntryCount(parsed);
+  if (listed < 0) {
+    (void)FetchFailed(url, "the answer is neither an array nor an object with \"packages\"",
+                      __LINE__);
+  } else {
+    PMSRecordFetchSuccess(url, listed, cached->meta["fetched"].asInt64());
+  }
   return true;
 }
 
@@ -227,15 +242,8 @@ std::string Text(const Json::Value& v) { return v.isString() ? v.asString() : ""
 }  // namespace
 
 std::vector<std::string> PMSFeedUrls() {
-  Json::Value feeds;
   std::vector<std::string> urls;
-  if (!WebUtils::LoadJsonFile(KIVORootPath("/usr/kivo/etc/packages/feeds"), feeds) ||
-      !feeds.isArray()) {
-    return urls;
-  }
-  for (const Json::Value& feed : feeds) {
-    if (feed.isObject() && feed["feed"].isString()) urls.push_back(feed["feed"].asString());
-  }
+  for (const ListedFeed& feed : PMSListedFeeds()) urls.push_back(feed.url);
   return urls;
 }
 
@@ -270,6 +278,14 @@ const Json::Value* PMSCatalogueEntries(const Json::Value& answer) {
   if (answer.isArray()) return &answer;
   if (answer.isObject() && answer["packages"].isArray()) return &answer["packages"];
   return nullptr;
+}
+
+int64_t PMSListedEntryCount(const Json::Value& answer) {
+  const Json::Value* entries = PMSCatalogueEntries(answer);
+  if (!entries) return -1;
+  int64_t listed = 0;
+  for (const Json::Value& e : *entries) listed += e.isObject() && e["package"].isString();
+  return listed;
 }
 
 bool PMSQueryKivoPkgServer(bool forceReload, const char* language, Json::Value& answer) {

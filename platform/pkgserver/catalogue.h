@@ -82,6 +82,11 @@ bool PMSCatalogueText(const std::string& url, bool forceReload, const std::strin
 // answer itself (array form); null for anything else.
 const Json::Value* PMSCatalogueEntries(const Json::Value& answer);
 
+// How many entries a catalogue answer lists: its entries that are objects
+// with a string "package" (the others are dropped wherever it is read); -1
+// when the answer is no catalogue at all.
+int64_t PMSListedEntryCount(const Json::Value& answer);
+
 // Where a download of package `name` from `link` comes from: the source
 // whose (cached or fetched) catalogue lists the package with exactly that
 // link, whatever link the client named. `preferred` (the installed

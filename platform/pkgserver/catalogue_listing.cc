@@ -24,7 +24,7 @@ namespace {
 
 // The rendering's version. Raise it whenever what RenderEntry writes or the
 // file's layout changes: files of another version are rendered again.
-constexpr int kListingFormat = 1;
+constexpr int kListingFormat = 2;
 constexpr char kMagic[] = "kivo-listing";
 // A listing is about as large as its catalogue (at most catalogue_max_bytes,
 // 16 MiB by default); a larger file is no listing of ours.
@@ -60,11 +60,13 @@ void PutField(std::string* out, const std::string& field) {
   *out += ',';
 }
 
-// Renders catalogue element `element` (consumed) into the fields of a
-// listing file (see Render): everything of a listed entry that does not
-// depend on the appliance. False for an element that is not listed.
-bool RenderEntry(Json::Value& element, ListingSide side, Json::StreamWriter& writer,
-                 std::string* fields) {
+// Renders catalogue element `element` (consumed) of the catalogue at `url`
+// into the fields of a listing file (see Render): everything of a listed
+// entry that does not depend on the appliance. An entry of a feed names the
+// feed in "feed", so that the page shows it beside that feed's state. False
+// for an element that is not listed.
+bool RenderEntry(Json::Value& element, ListingSide side, const std::string& url,
+                 Json::StreamWriter& writer, std::string* fields) {
   if (!element.isObject() || !element["package"].isString()) return false;
   const std::string name = element["package"].asString();
   PutField(fields, name);
@@ -72,6 +74,7 @@ bool RenderEntry(Json::Value& element, ListingSide side, Json::StreamWriter& wri
   element["id"] = name;
   element["blupgrade"] = false;
   element["source"] = SideName(side);
+  if (side == ListingSide::kFeeds) element["feed"] = url;
   RewriteDependencies(element, "conf_deppkgs", "deppkgs", "deppkgs");
   RewriteDependencies(element, "conf_conxpkgs", "conflictpkgs", "conflictpkgs");
   // Listed entries have always carried "icon" (null when the server gave
@@ -146,7 +149,7 @@ bool Render(const std::string& body, uint64_t catalogue, ListingSide side, const
   for (const std::string& name : recommend) PutField(&fields, name);
   const std::unique_ptr<Json::StreamWriter> writer = KIVONewJsonWriter();
   size_t entries = 0;
-  for (Json::Value& element : *list) entries += RenderEntry(element, side, *writer, &fields);
+  for (Json::Value& element : *list) entries += RenderEntry(element, side, url, *writer, &fields);
   *file = Header(side, catalogue, PMSCatalogueDigest(fields), entries, recommend.size()) + fields;
   return true;
 }

@@ -195,7 +195,7 @@ bool IsInstalling(const std::string& name) {
 
 Json::Value NewDownloadData(const std::string& taskId, const std::string& name, uint64_t size,
                             const std::string& link, const std::string& folder, bool quickInstall,
-                            PMSOriginChange change) {
+                            const PMSInstallChoices& choices) {
   Json::Value data(Json::objectValue);
   data["id"] = name;
   data["name"] = name;
@@ -204,17 +204,19 @@ Json::Value NewDownloadData(const std::string& taskId, const std::string& name, 
   data["size"] = static_cast<Json::UInt64>(size);
   data["tmp_folder"] = folder;
   data["blqinst"] = quickInstall;
-  if (change == PMSOriginChange::kAllow) data["switch_origin"] = true;
+  if (choices.change == PMSOriginChange::kAllow) data["switch_origin"] = true;
+  if (choices.without_data_copy) data["without_data_copy"] = true;
   data["installing"] = false;
   data["status"] = "downloading";
   return data;
 }
 
 bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const std::string& link,
-                  const std::string& folder, bool quickInstall, pid_t pid, PMSOriginChange change) {
+                  const std::string& folder, bool quickInstall, pid_t pid,
+                  const PMSInstallChoices& choices) {
   if (!task) return false;
   Json::Value data =
-      NewDownloadData(task->getTaskId(), name, size, link, folder, quickInstall, change);
+      NewDownloadData(task->getTaskId(), name, size, link, folder, quickInstall, choices);
   data["pid"] = static_cast<int>(pid);
   return task->setFinishValue(false) && WriteTaskData(task, data, 0.0);
 }
@@ -271,7 +273,9 @@ bool Install(NVX::Task* task, const std::string& user, const std::string& volume
   if (source.origin.kind == PMSOriginKind::kFeed)
     source.feed_keys = PMSFeedKeys(source.origin.feed);
   if (data["switch_origin"].isBool() && data["switch_origin"].asBool())
-    source.change = PMSOriginChange::kAllow;
+    source.choices.change = PMSOriginChange::kAllow;
+  source.choices.without_data_copy =
+      data["without_data_copy"].isBool() && data["without_data_copy"].asBool();
   std::string message;
   PKG_ERRCODE code = PKG_OK;
   Json::Value details;

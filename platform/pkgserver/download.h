@@ -53,15 +53,14 @@ bool IsInstalling(const std::string& name);
 // "downloading", before its worker has a "pid".
 Json::Value NewDownloadData(const std::string& taskId, const std::string& name, uint64_t size,
                             const std::string& link, const std::string& folder, bool quickInstall,
-                            PMSOriginChange change);
+                            const PMSInstallChoices& choices);
 
 // Records a new download in `task`: the "data" above with "status"
-// "downloading", "progress" 0, not finished. `change` kAllow records that
-// the install may switch the package's origin. False when the task cannot be
-// written.
+// "downloading", "progress" 0, not finished, with what the administrator
+// allowed the install (`choices`). False when the task cannot be written.
 bool InitDownload(NVX::Task* task, const std::string& name, uint64_t size, const std::string& link,
                   const std::string& folder, bool quickInstall, pid_t pid,
-                  PMSOriginChange change = PMSOriginChange::kRefuse);
+                  const PMSInstallChoices& choices = PMSInstallChoices());
 
 // In the worker: makes SIGTERM cancel the transfer under way instead of
 // ending the process at once, so the worker can clean up.
@@ -83,7 +82,8 @@ bool DownloadPackage(NVX::Task* task, const std::string& user, const std::string
 // lower version. The file's origin is the source whose catalogue lists the
 // task's link (catalogue.h, PMSListingOrigin), with that feed's keys; the
 // task's "switch_origin" says whether it may replace a package of another
-// origin. Publishes "installing" with the package tool's progress,
+// origin, its "without_data_copy" whether an upgrade may go on without a
+// safety copy of the data. Publishes "installing" with the package tool's progress,
 // removes the download folder, and finishes the task. False on failure.
 bool Install(NVX::Task* task, const std::string& user, const std::string& volume,
              const std::string& name, const std::string& folder, bool run,

@@ -6,6 +6,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "klibc/file_lock.h"
 
@@ -14,6 +15,16 @@ namespace KIVOPackageServer {
 // The feed file's path and its folder, under the root.
 std::string PMSFeedFilePath();
 std::string PMSFeedFolder();
+
+// A listed feed: its "feed" address and its "name" ("" when it has none).
+struct ListedFeed {
+  std::string url;
+  std::string name;
+};
+
+// The feeds of the list, in its order; elements without a string "feed"
+// are skipped, and a missing or unreadable list has none.
+std::vector<ListedFeed> PMSListedFeeds();
 
 // Holds the feed list's lock for its lifetime. Check held(): false (with
 // errno set) when the lock file cannot be made or locked.

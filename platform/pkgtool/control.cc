@@ -8,13 +8,17 @@
 #include <utility>
 
 #include "klibc/atomic_file.h"
+#include "klibc/sysroot.h"
 #include "pkgtool/lifecycle.h"
+#include "pkgtool/package_cgroup.h"
+#include "pkgtool/package_confinement.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/revisions.h"
 #include "pkgtool/upgrade_recovery.h"
+#include "pkgtool/watchdog_record.h"
 #include "taskmgr/task.h"
 #include "taskmgr/task_names.h"
 
@@ -83,11 +87,11 @@ bool RemoveUnpublished(const std::string& record, const Operation& op) {
 
 }  // namespace
 
-int PackageManager::LockAndLoad(const std::string& id, PackageInfo* info) {
+int PackageManager::LockAndLoad(const std::string& id, PackageInfo* info, int wait_seconds) {
   if (!PMSIsValidPackageId(id)) return PKG_ERR_NOT_INSTALLED;
   // The record is read only once the lock is held: read before, it may be
   // the state another operation is about to change.
-  if (!ExLock(PMSLockWaitSeconds())) return PKG_ERR_BUSY;
+  if (!ExLock(wait_seconds < 0 ? PMSLockWaitSeconds() : wait_seconds)) return PKG_ERR_BUSY;
   // An upgrade killed half way may have left a version over data that is
   // not its own; it is put right before anything starts or stops it. What
   // cannot be put right yet is in the system log and is tried again.
@@ -127,19 +131,48 @@ bool PackageManager::serviceControl(int opType, const std::string& id, bool star
     result = start ? CheckCanRun(info, op, &services) : CheckCanStop(id, op);
   }
   std::string record = PMSIsValidPackageId(id) ? PackageRegistry::RecordDir(id) : "";
-  if (result == PKG_OK && info.isStartable()) {
-    OperationTask task(id, KIVOPackageTasks::kStartStopPrefix, start ? "starting" : "stopping");
-    auto env = PMSScriptEnv(info, record, start ? "start" : "stop", op, Json::Value());
-    if (!PMSRunPackageScript(record, "start-stop-status", start ? "start" : "stop", env, op)) {
-      result = PKG_ERR_SCRIPT_FAILED;
-    }
-  }
+  if (result == PKG_OK) result = RunStartStop(id, info, start, op);
   if (result == PKG_OK && recordState && !RecordEnabled(record, start, op)) {
     result = PKG_ERR_INTERNAL;
+  }
+  // The administrator's start gives a package the watchdog gave up on a
+  // fresh count of restarts (watchdog_record.h).
+  if (result == PKG_OK && recordState && start && !PMSClearWatchdogMarks(record)) {
+    op.Log("started, but the watchdog's marks stay: it may take the package for crashed");
   }
   UnLock();
   auto params = map_params_;
   setOutcome(result, op.log_path(), op.WorkerMessages(), params, services);
+  return result == PKG_OK;
+}
+
+int PackageManager::RunStartStop(const std::string& id, const PackageInfo& info, bool start,
+                                 const Operation& op) {
+  if (!info.isStartable()) return PKG_OK;
+  const std::string record = PackageRegistry::RecordDir(id);
+  // A package installed before packages had accounts gets its own here.
+  if (std::string error;
+      start && PMSSettlePackageAccount(id, record, op.log_path(), &error) != PKG_OK) {
+    op.Log("cannot give " + id + " an account of its own: " + error);
+    return PKG_ERR_INTERNAL;
+  }
+  OperationTask task(id, KIVOPackageTasks::kStartStopPrefix, start ? "starting" : "stopping");
+  auto env = PMSScriptEnv(info, record, start ? "start" : "stop", op, Json::Value());
+  return PMSRunPackageScript(record, "start-stop-status", start ? "start" : "stop", env, op)
+             ? PKG_OK
+             : PKG_ERR_SCRIPT_FAILED;
+}
+
+int PackageManager::lockAndLoadNow(const std::string& id, PackageInfo* info) {
+  return LockAndLoad(id, info, 0);
+}
+
+bool PackageManager::startLocked(const std::string& id, const PackageInfo& info) {
+  Operation op("start", id);
+  Json::Value services(Json::arrayValue);
+  int result = CheckCanRun(info, op, &services);
+  if (result == PKG_OK) result = RunStartStop(id, info, true, op);
+  setOutcome(result, op.log_path(), op.WorkerMessages(), map_params_, services);
   return result == PKG_OK;
 }
 
@@ -203,6 +236,14 @@ int PackageManager::RemovePackage(const std::string& id, const PackageInfo& info
   // The package is uninstalled from here on; what follows cannot undo that.
   if (!PMSRunPackageScript(record, "postuninst", "", env, op)) op.Log("postuninst failed");
   if (!RemoveUnpublished(record, op)) op.Log("uninstalled; some of its files stay");
+  // Then its account; what stays of its data is root's from now on.
+  const std::string data = KIVORootPath(info.get("install_volume") + "/@appdata/" + id);
+  if (std::string error; !PMSRetirePackageAccount(
+          id, PMSVolumeFolderHolding(data, "@appdata").empty() ? "" : data, &error)) {
+    op.Log("uninstalled; " + error);
+  }
+  // Its control group too: what its scripts left running dies with it.
+  if (std::string problem; !PackageCgroupRemove(id, &problem)) op.Log("uninstalled; " + problem);
   // Its kept earlier versions go with it: no rollback can reach them now.
   if (!PMSTrimRevisions(id, 0)) op.Log("uninstalled; some of its earlier versions stay");
   PMSFaultPoint("uninstall_done");

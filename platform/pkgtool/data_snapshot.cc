@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "klibc/atomic_file.h"
+#include "pkgtool/btrfs_subvolume.h"
 #include "pkgtool/lifecycle.h"
 #include "pkgtool/registry.h"
 
@@ -62,6 +63,15 @@ bool PublishAgain(const DataSnapshot& s, std::string* error) {
   return false;
 }
 
+// The copy of a data folder that is a Btrfs subvolume: a snapshot, in one
+// step whatever it holds.
+TreeCopyResult Snapshot(const std::string& data, const std::string& to, std::string* error) {
+  if (PMSSnapshotSubvolume(data, to)) return TreeCopyResult::kCopied;
+  const bool full = errno == ENOSPC || errno == EDQUOT;
+  *error = Because("cannot take a snapshot of the data folder");
+  return full ? TreeCopyResult::kNoSpace : TreeCopyResult::kFailed;
+}
+
 }  // namespace
 
 bool PMSRenameDurably(const std::string& from, const std::string& to) {
@@ -92,6 +102,22 @@ bool PMSSnapshotsShareBlocks(const std::string& appdata) {
   return shared;
 }
 
+bool PMSDataCopyRoom(const std::string& appdata, const std::string& data_dir, uint64_t* bytes,
+                     std::string* problem) {
+  *bytes = 0;
+  if (!KLIBCFileExist(data_dir.c_str())) return true;  // no data to copy
+  // A snapshot holds whatever the subvolume holds, takes no room and reads
+  // nothing: walking the tree would cost what the snapshot saves.
+  if (PMSCopiesBySnapshot(data_dir)) return true;
+  TreeSurvey survey;
+  if (!PMSSurveyTree(data_dir, &survey)) {
+    *problem = survey.problem;
+    return false;
+  }
+  if (!PMSSnapshotsShareBlocks(appdata)) *bytes = survey.bytes;
+  return true;
+}
+
 TreeCopyResult PMSTakeSnapshot(const DataSnapshot& s, std::string* error) {
   if (!s.IsValid()) {
     *error = "the copy's name is not valid";
@@ -103,7 +129,9 @@ TreeCopyResult PMSTakeSnapshot(const DataSnapshot& s, std::string* error) {
     *error = Because("cannot prepare the folder of the copy");
     return TreeCopyResult::kFailed;
   }
-  TreeCopyResult result = PMSCopyTree(s.data_dir(), partial, error);
+  TreeCopyResult result = PMSCopiesBySnapshot(s.data_dir())
+                              ? Snapshot(s.data_dir(), partial, error)
+                              : PMSCopyTree(s.data_dir(), partial, error);
   if (result == TreeCopyResult::kCopied && !PMSRenameDurably(partial, s.copy())) {
     *error = Because("cannot complete the copy");
     result = TreeCopyResult::kFailed;

@@ -75,10 +75,21 @@ std::string PMSSnapshotsDir(const std::string& appdata);
 // removed again (as is the folder, when it was made for the probe).
 [[nodiscard]] bool PMSSnapshotsShareBlocks(const std::string& appdata);
 
-// Copies D to <R> (made as <R>.copying and renamed when whole). The package
-// must be stopped. On failure nothing of the copy stays (unless it cannot
-// be removed: the next operation's clean-up removes a .copying) and *error
-// says why; D is never changed.
+// The room a safety copy of the data folder `data_dir` would take in
+// `appdata`'s copies folder now: 0 when there is no data folder, when it
+// is copied by a Btrfs snapshot (PMSCopiesBySnapshot; the tree is then not
+// walked) or when the copies share blocks with the data, else the tree's
+// size (TreeSurvey).
+// False, with *problem in words, when the data cannot be copied safely.
+// The upgrade itself and the feasibility check's advice both judge by it.
+[[nodiscard]] bool PMSDataCopyRoom(const std::string& appdata, const std::string& data_dir,
+                                   uint64_t* bytes, std::string* problem);
+
+// Copies D to <R> (made as <R>.copying and renamed when whole): a snapshot
+// when PMSCopiesBySnapshot(D) (btrfs_subvolume.h), else a copy of the tree
+// (PMSCopyTree). The package must be stopped. On failure nothing of the
+// copy stays (unless it cannot be removed: the next operation's clean-up
+// removes a .copying) and *error says why; D is never changed.
 [[nodiscard]] TreeCopyResult PMSTakeSnapshot(const DataSnapshot& s, std::string* error);
 
 // Confirms the upgrade: the copy is renamed to <R>.discard, then removed.

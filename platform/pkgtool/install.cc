@@ -21,10 +21,12 @@
 #include "klibc/json_text.h"
 #include "klibc/last_error.h"
 #include "klibc/sysroot.h"
+#include "pkgtool/btrfs_subvolume.h"
 #include "pkgtool/data_snapshot.h"
 #include "pkgtool/health_gate.h"
 #include "pkgtool/install_checks.h"
 #include "pkgtool/lifecycle.h"
+#include "pkgtool/package_confinement.h"
 #include "pkgtool/package_file.h"
 #include "pkgtool/package_file_ops.h"
 #include "pkgtool/package_manager.h"
@@ -32,7 +34,9 @@
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/release_notes.h"
 #include "pkgtool/revisions.h"
+#include "pkgtool/root_request.h"
 #include "pkgtool/signature.h"
 #include "storage/volume_space.h"
 
@@ -46,6 +50,8 @@ void InfoFromHeader(const std::string& path, const PackageFileHeader& header,
   info->setLanguage(language ? language : "");
   auto license = header.members.find("LICENSE");
   if (license != header.members.end()) info->setLicense(license->second);
+  auto notes = header.members.find(kPMSReleaseNotesMember);
+  if (notes != header.members.end()) info->setReleaseNotes(notes->second);
   unsigned mask = 0;
   for (const PMSWizardFile& w : kPMSWizardFiles) {
     auto it = header.members.find(w.member);
@@ -117,6 +123,7 @@ struct Staging {
   std::string appdata;  // <root>/<volume>/@appdata
   std::string data;     // <appdata>/<id>
   bool created_data = false;
+  bool fresh_account = false;  // a fresh install's account: removed with it
   bool committed = false;
 
   ~Staging() {
@@ -127,6 +134,8 @@ struct Staging {
     static_cast<void>(PMSRemoveTree(PackageRegistry::RecordsDir(), record));
     static_cast<void>(PMSRemoveTree(store, target));
     if (created_data) static_cast<void>(PMSRemoveTree(appdata, data));
+    std::string error;
+    if (fresh_account) static_cast<void>(PMSRetirePackageAccount(id, "", &error));
   }
 };
 
@@ -154,28 +163,21 @@ bool ControlRecord(const std::string& record, const PackageInfo& info, const std
   return PMSRunPackageScript(record, "start-stop-status", action, env, op);
 }
 
-std::string MiB(uint64_t bytes) { return std::to_string((bytes + (1 << 20) - 1) >> 20) + " MiB"; }
-
-// The last `count` lines of `text`, without its final newline.
-std::string LastLines(std::string text, int count) {
-  while (!text.empty() && text.back() == '\n') text.pop_back();
-  size_t start = text.size();
-  for (int i = 0; i < count; ++i) {
-    size_t newline = start == 0 ? std::string::npos : text.rfind('\n', start - 1);
-    if (newline == std::string::npos) return text;
-    start = newline;
-  }
-  return text.substr(start + 1);
+// Makes the package's data folder unless it exists: on Btrfs a subvolume,
+// so that the copy before an upgrade is a snapshot (btrfs_subvolume.h). A
+// data folder found in place, of either kind, stays as it is.
+bool MakeDataFolder(const Staging& s) {
+  const bool subvolume =
+      s.created_data && KIVOFSMkdirP(s.appdata.c_str()) == 0 && PMSOnBtrfs(s.appdata);
+  return subvolume ? PMSMakeSubvolume(s.data, 0755) : KIVOFSMkdirP(s.data.c_str()) == 0;
 }
 
-// The last lines of the installed package's own log (INFO "logfile"), at
-// most 4 KiB, for an answer that says why an upgrade failed; "" when it has
-// none.
+std::string MiB(uint64_t bytes) { return std::to_string((bytes + (1 << 20) - 1) >> 20) + " MiB"; }
+
+// The last lines of the installed package's own log, for an answer that
+// says why an upgrade failed; "" when it has none.
 std::string PackageLogTail(const std::string& id) {
-  PackageManager pm;
-  const std::string path = pm.getPackageLog(id);
-  std::string tail = LastLines(path.empty() ? "" : PMSReadPackageLog(path), 10);
-  if (tail.size() > 4096) tail.erase(0, tail.size() - 4096);
+  std::string tail = PMSPackageLogTail(id, 10);
   return tail.empty() ? "" : "\nThe last lines of " + id + "'s log:\n" + tail;
 }
 
@@ -226,6 +228,9 @@ class Installer {
   int PrepareUpgrade(const PackageInfo& info, const std::map<std::string, std::string>& env,
                      Staging* s);
   int TakeDataCopy();
+  // The package's own account (package_confinement.h), before its first
+  // script of this operation.
+  int SettleAccount(Staging* s);
   // After a refusal that changed nothing but stopping the old version: it
   // runs again, and the answer says so.
   int RestartOld(int code);
@@ -310,7 +315,7 @@ int Installer::CheckOrigin(const SignatureSeen& found) {
   std::string why;
   if (PMSJudgeUpgradeOrigin(id_, installed, incoming, PMSOriginChange::kRefuse, &why) == PKG_OK)
     return PKG_OK;
-  if (job_.source.change == PMSOriginChange::kRefuse) {
+  if (job_.source.choices.change == PMSOriginChange::kRefuse) {
     op_->Log("origin: " + why);
     return Refuse(PKG_ERR_OTHER_ORIGIN, why);
   }
@@ -345,7 +350,7 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
   installed["install_volume"] = volume.path;
   installed["installed_time"] = std::to_string(time(nullptr));
   installed["installed_by"] = job_.user;
-  if (KIVOFSMkdirP(s->target.c_str()) != 0 || KIVOFSMkdirP(s->data.c_str()) != 0 ||
+  if (KIVOFSMkdirP(s->target.c_str()) != 0 || !MakeDataFolder(*s) ||
       !WriteRecordMembers(reader->header(), installed, *s) ||
       !KIVOWriteFileAtomic(s->record + "/ORIGIN", PMSOriginText(incoming_), SyncToDisk::No)) {
     return Refuse(KLIBCErrGet() == KLIBC_ERR_NO_SPACE ? PKG_ERR_NO_SPACE : PKG_ERR_INTERNAL,
@@ -371,20 +376,25 @@ int Installer::PlanDataCopy(const PackageInfo& info, const VolumeConfig& volume,
   }
   if (!KLIBCFileExist(snapshot->data_dir().c_str())) return PKG_OK;  // no data to copy
   if (!snapshot->IsValid()) return Refuse(PKG_ERR_INTERNAL, "cannot name the copy of the data");
-  TreeSurvey survey;
-  if (!PMSSurveyTree(snapshot->data_dir(), &survey)) {
-    return Refuse(PKG_ERR_DATA_NOT_COPYABLE, "The data of " + id_ +
-                                                 " cannot be copied safely before the upgrade: " +
-                                                 survey.problem + ". Nothing was changed.");
+  uint64_t room = 0;
+  std::string problem;
+  if (!PMSDataCopyRoom(appdata, snapshot->data_dir(), &room, &problem)) {
+    return Refuse(PKG_ERR_DATA_NOT_COPYABLE,
+                  "The data of " + id_ + " cannot be copied safely before the upgrade: " + problem +
+                      ". Nothing was changed.");
   }
-  // Where the file system shares blocks, the copy takes no room.
-  const bool shared = PMSSnapshotsShareBlocks(appdata);
   VolumeConfig same;
   std::string text;
-  if (!shared &&
-      PMSChooseVolume(info, volume.path, needed + survey.bytes, &same, &text) == PKG_ERR_NO_SPACE) {
+  if (room > 0 &&
+      PMSChooseVolume(info, volume.path, needed + room, &same, &text) == PKG_ERR_NO_SPACE) {
+    if (job_.source.choices.without_data_copy) {
+      op_->Log("no safety copy of the data: " + volume.path + " has no room for its " + MiB(room) +
+               " and " + job_.user +
+               " chose to upgrade without one; a failed upgrade cannot bring the data back");
+      return PKG_OK;
+    }
     return Refuse(PKG_ERR_NO_ROOM_FOR_DATA_COPY,
-                  "The upgrade of " + id_ + " needs " + MiB(survey.bytes) +
+                  "The upgrade of " + id_ + " needs " + MiB(room) +
                       " for a safety copy of its data besides " + MiB(needed) +
                       " for its files, and " + volume.path + " has " +
                       MiB(std::max<int64_t>(KIVOVolumeFreeBytes(volume), 0)) +
@@ -413,6 +423,8 @@ int Installer::RunScriptsAndPublish(const PackageInfo& info, Staging* s) {
 }
 
 int Installer::PrepareInstall(const std::map<std::string, std::string>& env, Staging* s) {
+  int code = SettleAccount(s);
+  if (code != PKG_OK) return code;
   if (PMSRunPackageScript(s->record, "preinst", "", env, *op_)) return PKG_OK;
   return Refuse(PKG_ERR_SCRIPT_FAILED, "preinst failed");
 }
@@ -427,8 +439,19 @@ int Installer::PrepareUpgrade(const PackageInfo& info,
   }
   int code = TakeDataCopy();
   if (code != PKG_OK) return RestartOld(code);
+  // Only now: the old version, stopped above, may have run as root.
+  if ((code = SettleAccount(s)) != PKG_OK) return RestoreAfterFailure(info, s, *message_);
   if (PMSRunPackageScript(s->record, "preupgrade", "", env, *op_)) return PKG_OK;
   return RestoreAfterFailure(info, s, "failed in preupgrade");
+}
+
+int Installer::SettleAccount(Staging* s) {
+  std::string error;
+  const int code = PMSSettlePackageAccount(id_, s->record, op_->log_path(), &error);
+  s->fresh_account = !upgrade_;
+  if (code == PKG_OK) return PKG_OK;
+  op_->Log("account: " + error);
+  return Refuse(code, "cannot give " + id_ + " an account of its own: " + error);
 }
 
 int Installer::TakeDataCopy() {
@@ -632,6 +655,12 @@ int Installer::Run() {
                           job_.check_codesign ? SignatureConfirmed::No : SignatureConfirmed::Yes,
                           message_, &signature_note_, &seen);
   op_->Log("signature: " + signature_note_);
+  // Whatever the trust level let through, root needs the keyring's key.
+  const int root = PMSCheckRootSigner(info, seen.outcome, seen.voucher, message_);
+  if (root != PKG_OK) {
+    op_->Log("root: " + *message_);
+    return root;
+  }
   if (code != PKG_OK) return code;
   code = CheckOrigin(seen);
   if (code != PKG_OK) return code;
@@ -723,9 +752,18 @@ bool CheckFile(const char* language, const std::string& path, std::string& messa
                              &message);
   }
   // The signature comes last, so that a package that cannot be installed
-  // says why before it says who signed it.
-  if (result == PKG_OK)
-    result = SignatureVerdict(reader.header(), nullptr, SignatureConfirmed::No, &message);
+  // says why before it says who signed it. A package that asks for root
+  // and lacks the keyring's signature is refused outright: no confirmation
+  // could let it through later, so the check does not offer one.
+  if (result == PKG_OK) {
+    std::string who;
+    SignatureSeen seen;
+    result =
+        SignatureVerdict(reader.header(), nullptr, SignatureConfirmed::No, &message, &who, &seen);
+    details["signature"] = who;
+    const int root = PMSCheckRootSigner(info, seen.outcome, seen.voucher, &message);
+    if (root != PKG_OK) result = root;
+  }
   code = static_cast<PKG_ERRCODE>(result);
   return result == PKG_OK;
 }

@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include "klibc/last_error.h"
+#include "pkgtool/package_cgroup.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/package_state.h"
 #include "pkgtool/pms.h"
@@ -51,6 +52,17 @@ int Refuse(int code, const std::string& text, std::string* message) {
   return code;
 }
 
+// The package's memory and process limits against this appliance's bounds:
+// above them the package is refused, never silently lowered, so that its
+// author's claim and what it gets never differ at install.
+int CheckLimits(const PackageInfo& info, std::string* message) {
+  PackageLimits limits;
+  const std::string above = PackageLimitsCheck({{"memory_limit_mb", info.get("memory_limit_mb")},
+                                                {"process_limit", info.get("process_limit")}},
+                                               PackageLimitSettingsLoad(), &limits);
+  return above.empty() ? PKG_OK : Refuse(PKG_ERR_LIMIT_ABOVE_BOUND, above, message);
+}
+
 }  // namespace
 
 int PMSCheckPackageFits(const PackageInfo& info, int arch_code, std::string* message,
@@ -68,6 +80,7 @@ int PMSCheckPackageFits(const PackageInfo& info, int arch_code, std::string* mes
       KIVOCompareOSVersion(device.os_version, info.get("os_max_ver")) > 0) {
     return Refuse(PKG_ERR_OS_TOO_NEW, "runs on OS up to " + info.get("os_max_ver"), message);
   }
+  if (int code = CheckLimits(info, message); code != PKG_OK) return code;
   PackageManager pm;
   std::string conflicts;
   if (pm.arePackagesConflict(PackageBasicInfo(info.getId(), info.getVersion()), info.getConflicts(),

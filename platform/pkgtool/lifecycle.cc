@@ -15,6 +15,7 @@
 #include "klibc/json_text.h"
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
+#include "pkgtool/btrfs_subvolume.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/script_runner.h"
 #include "pkgtool/upgrade_recovery.h"
@@ -117,6 +118,9 @@ bool PMSRemoveTree(const std::string& owner, const std::string& path) {
   if (!PMSIsStrictlyInside(path, owner)) return false;
   struct stat st;
   if (lstat(path.c_str(), &st) != 0) return errno == ENOENT;
+  // A Btrfs data folder or its copy goes in one step; rm empties one that
+  // holds a subvolume of its own and removes the emptied subvolumes.
+  if (PMSIsSubvolume(path) && PMSDestroySubvolume(path)) return true;
   return KLIBCExec("/bin/rm", "-rf", "--", path.c_str(), nullptr) == 0;
 }
 

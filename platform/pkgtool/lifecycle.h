@@ -54,7 +54,9 @@ std::set<std::string> PMSListDir(const std::string& dir);
 
 // rm -rf `path`, the one way the package tool removes a folder: only when
 // `path` lies strictly inside `owner` (PMSIsStrictlyInside); anything else is
-// refused without touching the disk. True when `path` is gone afterwards.
+// refused without touching the disk. A Btrfs subvolume (a data folder or its
+// snapshot, btrfs_subvolume.h) is destroyed whole instead, as are the emptied
+// subvolumes inside a folder removed. True when `path` is gone afterwards.
 [[nodiscard]] bool PMSRemoveTree(const std::string& owner, const std::string& path);
 
 // The `kind` folder ("@appstore" or "@appdata") of the configured volume

@@ -19,6 +19,7 @@
 #include "klibc/key_value_file.h"
 #include "pkgtool/package_file.h"
 #include "pkgtool/package_info.h"
+#include "pkgtool/release_notes.h"
 #include "pkgtool/result_codes.h"
 #include "pkgtool/sha256.h"
 #include "pkgtool/signature.h"
@@ -197,6 +198,9 @@ bool CollectMembers(const std::string& source, std::map<std::string, std::string
   if (!members->count("INFO")) return Fail(error, "the package source has no INFO file");
   std::string problem = PMSCheckInfo(KIVOKeyValueParse((*members)["INFO"]));
   if (!problem.empty()) return Fail(error, "INFO: " + problem);
+  auto notes = members->find(kPMSReleaseNotesMember);
+  problem = notes == members->end() ? "" : PMSCheckReleaseNotes(notes->second);
+  if (!problem.empty()) return Fail(error, problem);
   for (const auto& m : *members) {
     Json::Value ui;
     if (m.first.compare(0, 15, "WIZARD_UIFILES/") == 0 && !KIVOParseJson(m.second, &ui)) {

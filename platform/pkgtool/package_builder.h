@@ -14,7 +14,7 @@ struct BuildOptions {
 //   package/             the payload, becomes package.tgz
 //   scripts/...          preinst, postinst, ..., start-stop-status
 //   WIZARD_UIFILES/...   install_uifile[_lang], upgrade_..., uninstall_... (JSON)
-//   LICENSE, PACKAGE_ICON.PNG, PACKAGE_ICON_256.PNG
+//   LICENSE, PACKAGE_ICON.PNG, PACKAGE_ICON_256.PNG, CHANGELOG (release notes)
 // A file that cannot be opened or read, or changes while it is read, fails
 // the build, and so does a result the package-file reader would refuse.
 // Returns false with `*error` telling the author exactly what is wrong; no

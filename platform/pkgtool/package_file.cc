@@ -15,6 +15,7 @@
 
 #include "pkgtool/package_info.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/release_notes.h"
 #include "pkgtool/result_codes.h"
 #include "pkgtool/sha256.h"
 #include "pkgtool/tree_writer.h"
@@ -283,8 +284,13 @@ std::string PMSSha256Hex(const std::string& data) {
 }
 
 bool PMSIsPackageMemberName(const std::string& name) {
-  static const char* const kFixed[] = {"INFO",    "MANIFEST",         "signature.asc",
-                                       "LICENSE", "PACKAGE_ICON.PNG", "PACKAGE_ICON_256.PNG"};
+  static const char* const kFixed[] = {"INFO",
+                                       "MANIFEST",
+                                       "signature.asc",
+                                       "LICENSE",
+                                       "PACKAGE_ICON.PNG",
+                                       "PACKAGE_ICON_256.PNG",
+                                       kPMSReleaseNotesMember};
   for (const char* f : kFixed) {
     if (name == f) return true;
   }
@@ -436,10 +442,20 @@ int PackageFileReader::Open(const std::string& path, std::string* error) {
     // one that breaks them is left empty.
     std::string ignored;
     if (code == PKG_ERR_BAD_SIGNATURE && ReadInfo(&ignored) != PKG_OK) header_.info.clear();
+    if (code == PKG_ERR_BAD_SIGNATURE && CheckReleaseNotes(&ignored) != PKG_OK)
+      header_.members.erase(kPMSReleaseNotesMember);
     at_payload_ = false;
     return code;
   }
-  return ReadInfo(error);
+  if ((code = ReadInfo(error)) != PKG_OK) return code;
+  return CheckReleaseNotes(error);
+}
+
+int PackageFileReader::CheckReleaseNotes(std::string* error) const {
+  auto notes = header_.members.find(kPMSReleaseNotesMember);
+  const std::string problem =
+      notes == header_.members.end() ? "" : PMSCheckReleaseNotes(notes->second);
+  return problem.empty() ? PKG_OK : Fail(error, PKG_ERR_NOT_PACKAGE_FILE, problem);
 }
 
 int PackageFileReader::ReadPayload(Payload mode, const std::string& dest,

@@ -83,6 +83,9 @@ class PackageFileReader {
   int ReadHeaderMembers(std::string* error);
   int VerifyManifest(std::string* error) const;
   int ReadInfo(std::string* error);
+  // PKG_OK when the release notes (CHANGELOG), if any, keep their rules
+  // (release_notes.h); else 261.
+  int CheckReleaseNotes(std::string* error) const;
 
   struct archive* outer_ = nullptr;
   PackageFileHeader header_;

@@ -11,7 +11,9 @@
 
 #include "pkgtool/data_snapshot.h"
 #include "pkgtool/health_gate.h"
+#include "pkgtool/package_cgroup.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/root_request.h"
 
 #include <strings.h>
 
@@ -111,9 +113,9 @@ std::string CheckIdentity(const InfoGetter& get) {
 }
 
 std::string CheckForms(const InfoGetter& get) {
-  for (const char* key :
-       {"beta", "startable", "silent_install", "silent_upgrade", "silent_uninstall",
-        "install_reboot", "support_center", "ctl_uninstall", "checkport", kPMSDataCopyKey}) {
+  for (const char* key : {"beta", "startable", "silent_install", "silent_upgrade",
+                          "silent_uninstall", "install_reboot", "support_center", "ctl_uninstall",
+                          "checkport", kPMSDataCopyKey, kPMSRunAsRootKey}) {
     if (!IsYesNo(get(key))) return std::string(key) + ": must be yes or no";
   }
   for (const char* key : {"os_min_ver", "os_max_ver"}) {
@@ -177,6 +179,7 @@ std::string PMSCheckInfo(const KeyValueMap& info, std::string* field) {
   if (problem.empty()) problem = CheckForms(get);
   if (problem.empty()) problem = CheckPathsAndNames(get);
   if (problem.empty()) problem = PMSHealthInfoProblem(info);
+  if (problem.empty()) problem = PackageLimitsInfoProblem(info);
   if (field) *field = problem.substr(0, problem.find(':'));
   return problem;
 }

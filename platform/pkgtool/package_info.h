@@ -74,6 +74,9 @@ class PackageInfo {
   // The end-user licence text ("" when none).
   const std::string& getLicense() const { return license_; }
   void setLicense(const std::string& text) { license_ = text; }
+  // The package file's release notes, CHANGELOG ("" when none; release_notes.h).
+  const std::string& getReleaseNotes() const { return release_notes_; }
+  void setReleaseNotes(const std::string& text) { release_notes_ = text; }
   // The loaded wizard description of one operation (null when none loaded).
   const Json::Value& getUIFile() const { return ui_file_; }
   void setUIFile(const Json::Value& ui) { ui_file_ = ui; }
@@ -87,6 +90,7 @@ class PackageInfo {
   std::string file_path_;
   std::string target_;
   std::string license_;
+  std::string release_notes_;
   Json::Value ui_file_;
   unsigned wizard_mask_ = 0;
 };

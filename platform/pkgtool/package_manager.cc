@@ -325,3 +325,27 @@ std::string PMSReadPackageLog(const std::string& path) {
   close(fd);
   return text;
 }
+
+namespace {
+
+// The last `count` lines of `text`, without its final newline.
+std::string LastLines(std::string text, int count) {
+  while (!text.empty() && text.back() == '\n') text.pop_back();
+  size_t start = text.size();
+  for (int i = 0; i < count; ++i) {
+    size_t newline = start == 0 ? std::string::npos : text.rfind('\n', start - 1);
+    if (newline == std::string::npos) return text;
+    start = newline;
+  }
+  return text.substr(start + 1);
+}
+
+}  // namespace
+
+std::string PMSPackageLogTail(const std::string& id, int lines) {
+  PackageManager pm;
+  const std::string path = pm.getPackageLog(id);
+  std::string tail = LastLines(path.empty() ? "" : PMSReadPackageLog(path), lines);
+  if (tail.size() > 4096) tail.erase(0, tail.size() - 4096);
+  return tail;
+}

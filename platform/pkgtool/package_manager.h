@@ -137,6 +137,17 @@ class PackageManager {
   // when none is kept. The log names each with the room it took.
   [[nodiscard]] bool dropRevisions(const std::string& id);
 
+  // The watchdog's start (tools/kivoctl/watchdog.h), in two steps so that it
+  // looks at the record under the lock before it acts. lockAndLoadNow takes
+  // the lock in one try (275 when another operation holds it: the watchdog
+  // never waits), finishes an interrupted upgrade and reads the installed
+  // record of `id` (255 when not installed); the lock stays held whatever the
+  // answer, until UnLock. startLocked then starts `id` as serviceControl
+  // does (its services and needed packages checked first), the caller
+  // holding the lock; it leaves the record's markers as they are.
+  int lockAndLoadNow(const std::string& id, PackageInfo* info);
+  [[nodiscard]] bool startLocked(const std::string& id, const PackageInfo& info);
+
   // The tool's exclusive lock, waiting at most `seconds`. False when another
   // process holds it.
   [[nodiscard]] bool ExLock(int seconds);
@@ -147,10 +158,14 @@ class PackageManager {
                   const std::map<std::string, std::string>& params, const Json::Value& services);
 
  private:
-  // Takes the exclusive lock, then reads the installed record of `id`:
-  // PKG_OK, 255 (invalid id or not installed) or 275 (busy). The lock stays
-  // held whatever the answer.
-  int LockAndLoad(const std::string& id, PackageInfo* info);
+  // Takes the exclusive lock, waiting `wait_seconds` (-1: lock_wait), then
+  // reads the installed record of `id`: PKG_OK, 255 (invalid id or not
+  // installed) or 275 (busy). The lock stays held whatever the answer.
+  int LockAndLoad(const std::string& id, PackageInfo* info, int wait_seconds = -1);
+  // Runs the start-stop-status script of `id` with "start" or "stop" (a
+  // package without a service has nothing to run), showing readers a task
+  // meanwhile; the caller holds the lock. PKG_OK or 274.
+  int RunStartStop(const std::string& id, const PackageInfo& info, bool start, const Operation& op);
   // What a start needs: its services running (else 260, named in
   // `services`), the packages it needs installed and running (else 268, or
   // 259 for a refused version).
@@ -203,3 +218,7 @@ class PackageManager {
 // The log text of a package log file; when it is larger than 1 MiB, its last
 // 1 MiB. "" when it cannot be read.
 std::string PMSReadPackageLog(const std::string& path);
+
+// The last `lines` lines of the installed package's own log (INFO
+// "logfile"), at most 4 KiB, without the final newline; "" when it has none.
+std::string PMSPackageLogTail(const std::string& id, int lines);

@@ -78,6 +78,16 @@ struct PMSIncoming {
 int PMSJudgeUpgradeOrigin(const std::string& id, const PMSPackageOrigin& installed,
                           const PMSIncoming& incoming, PMSOriginChange change, std::string* why);
 
+// What the administrator allowed one install beyond the usual rules.
+struct PMSInstallChoices {
+  PMSOriginChange change = PMSOriginChange::kRefuse;
+  // True: when the volume has no room for the safety copy of the data that
+  // an upgrade takes first (docs/package-tool.md), the upgrade goes on
+  // without one instead of being refused. The administrator accepts that a
+  // failed upgrade then cannot bring the data back.
+  bool without_data_copy = false;
+};
+
 // A package file's source as the caller of an install knows it.
 struct PMSInstallSource {
   // Where the file comes from; the signer is the package tool's to find.
@@ -85,5 +95,5 @@ struct PMSInstallSource {
   // The armored keys the feed publishes (kFeed only), which vouch for this
   // file alone.
   std::vector<std::string> feed_keys;
-  PMSOriginChange change = PMSOriginChange::kRefuse;
+  PMSInstallChoices choices;
 };

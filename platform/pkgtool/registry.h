@@ -8,6 +8,8 @@
 //       target ->   <volume>/@appstore/<id>.<n>  (the payload)
 //       var    ->   <volume>/@appdata/<id>       (data, kept across upgrades)
 //       enabled     present while the package is meant to run
+//       restarts, crashed   the watchdog's restarts and its giving up
+//                   (watchdog_record.h)
 //
 // A package is installed exactly when var/packages/<id> resolves to a record
 // with an INFO file. A record is built completely under a fresh name and

@@ -86,6 +86,18 @@ const char* PMSResultText(int code) {
       return "the package's data cannot be copied safely";
     case PKG_ERR_NO_REVISION:
       return "no earlier version of the package is kept";
+    case PKG_ERR_NO_ACCOUNT_ID:
+      return "no free account id is left for the package in the range of pkgtool.conf";
+    case PKG_ERR_ACCOUNT_FILES:
+      return "the package's account cannot be written to the accounts files";
+    case PKG_ERR_LIMIT_ABOVE_BOUND:
+      return "the package asks for more memory or processes than this appliance allows";
+    case PKG_ERR_ROOT_NOT_TRUSTED:
+      return "the package asks to run as root and is not signed by a key of the appliance keyring";
+    case PKG_ERR_CRASHED:
+      return "the package kept stopping; the watchdog stopped restarting it";
+    case PKG_ERR_WATCHDOG_SETTINGS:
+      return "the watchdog's settings are not valid";
   }
   return "unknown result";
 }

@@ -53,6 +53,22 @@ enum PKG_ERRCODE {
   // a rollback, or the removal of a kept version, when no earlier version
   // of the package is kept
   PKG_ERR_NO_REVISION = 309,
+  // no free id for the package's own account in the range of pkgtool.conf
+  // (package_uid_first to package_uid_last)
+  PKG_ERR_NO_ACCOUNT_ID = 310,
+  // the root's account files (etc/passwd, etc/group) cannot be read,
+  // locked or written for the package's own account
+  PKG_ERR_ACCOUNT_FILES = 311,
+  // INFO memory_limit_mb or process_limit above the appliance's bound
+  // (etc/kivo/pkgtool.conf)
+  PKG_ERR_LIMIT_ABOVE_BOUND = 315,
+  // a package that asks to run as root (INFO run_as_root) without a
+  // signature by a key of the appliance keyring
+  PKG_ERR_ROOT_NOT_TRUSTED = 320,
+  // the watchdog gave up restarting a package that kept dying (watchdog_record.h)
+  PKG_ERR_CRASHED = 330,
+  // etc/kivo/watchdog.conf breaks a rule (watchdog_record.h)
+  PKG_ERR_WATCHDOG_SETTINGS = 331,
 };
 
 // A short English text for a code, for logs and the command line.

@@ -3,12 +3,17 @@
 #include <cerrno>
 #include <cstdlib>
 #include <fcntl.h>
+#include <grp.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <vector>
 
+#include "pkgtool/package_cgroup.h"
+#include "pkgtool/package_confinement.h"
 #include "pkgtool/pms.h"
 
 #include <poll.h>
@@ -16,25 +21,48 @@
 
 namespace {
 
-// Runs in the forked child: `out` becomes its stdout and stderr.
-[[noreturn]] void ExecScript(const std::string& script, const std::string& arg,
-                             const std::vector<std::string>& env, int out) {
+// The package's own user and confinement (package_confinement.h), entered
+// here and nowhere else. Runs in the child between fork and exec: nothing
+// here allocates, and a step that fails fails the whole start, since the
+// script must never run with less confinement than its record claims.
+bool EnterConfinement(const PackageConfinement& confinement) {
+  if (confinement.drop_user) {
+    if (setgroups(0, nullptr) != 0 ||
+        setresgid(confinement.gid, confinement.gid, confinement.gid) != 0 ||
+        setresuid(confinement.uid, confinement.uid, confinement.uid) != 0 ||
+        getuid() != confinement.uid || getgid() != confinement.gid) {
+      return false;
+    }
+  }
+  if (confinement.no_new_privs && prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) return false;
+  return confinement.landlock_ruleset < 0 ||
+         syscall(SYS_landlock_restrict_self, confinement.landlock_ruleset, 0) == 0;
+}
+
+// Runs in the forked child: `out` becomes its stdout and stderr. `argv` and
+// `envp` were made before the fork.
+[[noreturn]] void ExecScript(const char* script, char* const* argv, char* const* envp, int out,
+                             const PackageCgroupJoin& group,
+                             const PackageConfinement& confinement) {
   setsid();
+  // The package's control group first: moving into it needs the rights
+  // that confinement may drop further down.
+  if (!group.JoinInChild()) _exit(126);
   int in = open("/dev/null", O_RDONLY);
   if (in >= 0) dup2(in, STDIN_FILENO);
   if (out >= 0) {
     dup2(out, STDOUT_FILENO);
     dup2(out, STDERR_FILENO);
   }
+  if (!EnterConfinement(confinement)) _exit(126);
   for (int fd = 3; fd < 1024; ++fd) close(fd);
   signal(SIGPIPE, SIG_DFL);
-  std::vector<char*> envp;
-  for (const std::string& e : env) envp.push_back(const_cast<char*>(e.c_str()));
-  envp.push_back(nullptr);
-  std::vector<char*> argv{const_cast<char*>(script.c_str())};
-  if (!arg.empty()) argv.push_back(const_cast<char*>(arg.c_str()));
-  argv.push_back(nullptr);
-  execve(script.c_str(), argv.data(), envp.data());
+  // A script (and the service it starts) gets no signal blocked, whatever
+  // its caller blocks: the watchdog waits for its own signals blocked.
+  sigset_t none;
+  sigemptyset(&none);
+  sigprocmask(SIG_SETMASK, &none, nullptr);
+  execve(script, argv, envp);
   _exit(126);
 }
 
@@ -66,11 +94,21 @@ bool IsScript(const std::string& script) {
 // -1.
 pid_t StartScript(const std::string& script, const std::string& arg,
                   const std::map<std::string, std::string>& env, int out) {
+  const PackageCgroupJoin group = PackageCgroupPrepareForScript(script, out);
+  const PackageConfinement confinement = PackageConfinementPrepareForScript(script, arg, env, out);
+  std::map<std::string, std::string> all = env;
+  if (!confinement.tmpdir.empty()) all["TMPDIR"] = confinement.tmpdir;
   std::vector<std::string> vars;
-  for (const auto& e : env) vars.push_back(e.first + "=" + e.second);
+  for (const auto& e : all) vars.push_back(e.first + "=" + e.second);
+  std::vector<char*> envp;
+  for (const std::string& e : vars) envp.push_back(const_cast<char*>(e.c_str()));
+  envp.push_back(nullptr);
+  std::vector<char*> argv{const_cast<char*>(script.c_str())};
+  if (!arg.empty()) argv.push_back(const_cast<char*>(arg.c_str()));
+  argv.push_back(nullptr);
   fflush(nullptr);
   pid_t pid = fork();
-  if (pid == 0) ExecScript(script, arg, vars, out);
+  if (pid == 0) ExecScript(script.c_str(), argv.data(), envp.data(), out, group, confinement);
   return pid;
 }
 

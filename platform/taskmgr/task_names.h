@@ -22,5 +22,7 @@ inline constexpr char kDownloadPrefix[] = "@KIVOPKG_DOWNLOAD_";
 inline constexpr char kStartStopPrefix[] = "@KIVOPKG_STARTSTOP_";
 // An uninstall under way.
 inline constexpr char kUninstallPrefix[] = "@KIVOPKG_UNINSTALL_";
+// A rollback to a kept earlier version, under way or with its outcome.
+inline constexpr char kRollbackPrefix[] = "@KIVOPKG_ROLLBACK_";
 
 }  // namespace KIVOPackageTasks

@@ -12,6 +12,18 @@ inline constexpr char kAuth[] = "KIVO.API.Auth";
 inline constexpr char kUserSettings[] = "KIVO.API.UserSettings";
 // The activity log, beside the module's APIs (host/activity_api.h).
 inline constexpr char kActivity[] = "KIVO.Core.Package.Activity";
+// The maintenance window, holds and last run of automatic updates
+// (host/auto_update_api.h).
+inline constexpr char kAutoUpdate[] = "KIVO.Core.Package.AutoUpdate";
+// Kept earlier versions and rollback, beside the module's APIs
+// (host/revision_api.h).
+inline constexpr char kRevision[] = "KIVO.Core.Package.Revision";
+// How fresh the catalogue is, per source (host/sources_api.h).
+inline constexpr char kSources[] = "KIVO.Core.Package.Sources";
+// What the watchdog did to each package (host/watchdog_api.h).
+inline constexpr char kWatchdog[] = "KIVO.Core.Package.Watchdog";
+// What each package uses now, from its control group (host/usage_api.h).
+inline constexpr char kUsage[] = "KIVO.Core.Package.Usage";
 
 // Served by the package center's module.
 inline constexpr char kPackage[] = "KIVO.Core.Package";

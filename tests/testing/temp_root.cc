@@ -8,6 +8,7 @@
 #include "accounts/accounts.h"
 #include "klibc/atomic_file.h"
 #include "klibc/process.h"
+#include "pkgtool/package_cgroup.h"
 #include "tools/kivoctl/root_setup.h"
 
 #include <stdlib.h>
@@ -79,6 +80,10 @@ TempRoot::TempRoot() {
 // may still be writing its last files under the root as the test ends: the
 // removal is tried again until the root is gone, for up to five seconds.
 TempRoot::~TempRoot() {
+  // The kernel keeps the packages' control groups whatever happens to the
+  // root's files: they go with the root, with what still runs in them.
+  std::string problem;
+  EXPECT_TRUE(PackageCgroupRemoveRoot(dir_, &problem)) << problem;
   int status = -1;
   for (int attempt = 0; attempt < 100; ++attempt) {
     status = KLIBCExec("/bin/rm", "-rf", dir_.c_str(), nullptr, nullptr);

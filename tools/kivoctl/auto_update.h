@@ -15,6 +15,12 @@
 // upgrade leaves the old version in place (the package tool's guarantee),
 // and the version that failed is recorded (KIVOPackageServer::RecordFailure)
 // and skipped by later runs until a newer one is offered.
+//
+// A run upgrades only inside the maintenance window (pkgserver/
+// update_window.h), once per opening of it and after its random delay, and
+// never a held package (pkgserver/update_holds.h). A run that goes ahead
+// records each package's outcome (pkgserver/update_last_run.h), and each
+// upgrade it makes is an entry of origin "auto-update" in the activity log.
 #pragma once
 
 #include <string>
@@ -51,8 +57,13 @@ AutoUpdatePlan PlanAutoUpdate(const std::string& id, const std::string& installe
                               const PMSPackageOrigin& origin,
                               const std::vector<CatalogueOffer>& offers, bool beta);
 
-// `kivoctl auto-update [--dry-run]`: one line per installed package on
-// stdout, each outcome also to syslog. Exit status 0 when nothing failed (a
-// version held back because it failed before is a skip), 1 when an upgrade
-// or the catalogue failed, 2 on a usage error. --dry-run writes nothing.
+// `kivoctl auto-update [--dry-run] [--now YYYY-MM-DDTHH:MM] [--seed N]`: one
+// line per installed package on stdout, each outcome also to syslog. --now
+// runs by that local time instead of the clock's, and --seed fixes the
+// random delay, so that what a run would do at any moment can be seen (and
+// tested) without waiting for it. Exit status 0 when nothing failed (a
+// version held back because it failed before, a held package and a window
+// that is shut are skips), 1 when an upgrade or the catalogue failed or the
+// window or the holds cannot be read, 2 on a usage error. --dry-run writes
+// nothing.
 int KivoctlAutoUpdate(const std::vector<std::string>& args);

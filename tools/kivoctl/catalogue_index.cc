@@ -15,6 +15,8 @@
 #include "pkgtool/dependency.h"
 #include "pkgtool/package_file.h"
 #include "pkgtool/registry.h"
+#include "pkgtool/release_notes.h"
+#include "pkgtool/root_request.h"
 
 #include <openssl/evp.h>
 
@@ -62,11 +64,13 @@ std::vector<std::string> PackageFiles(const std::string& folder) {
 }
 
 // The INFO keys a catalogue entry carries as they stand (and their
-// "_<lang>" variants for the texts).
+// "_<lang>" variants for the texts). The last three say what the package
+// will be allowed to do, which the page shows before anything is
+// downloaded.
 const char* const kPassedKeys[] = {
-    "maintainer", "maintainer_url", "distributor",  "distributor_url",
-    "helpurl",    "support_url",    "report_url",   "os_min_ver",
-    "os_max_ver", "arch",           "install_type", "install_dep_services"};
+    "maintainer",   "maintainer_url",       "distributor",    "distributor_url", "helpurl",
+    "support_url",  "report_url",           "os_min_ver",     "os_max_ver",      "arch",
+    "install_type", "install_dep_services", kPMSRunAsRootKey, "memory_limit_mb", "process_limit"};
 
 void CopyTexts(const KeyValueMap& info, Json::Value& entry) {
   for (const auto& [key, value] : info) {
@@ -142,6 +146,10 @@ bool MakeEntry(const CatalogueIndexOptions& o, const std::string& name, Json::Va
   entry["deppkgs"] = deps == info.end() ? "" : deps->second;
   auto conflicts = info.find("install_conflict_packages");
   entry["conflictpkgs"] = conflicts == info.end() ? "" : conflicts->second;
+  // The release notes, checked by the reader: the page shows them as text.
+  auto notes = reader.header().members.find(kPMSReleaseNotesMember);
+  if (notes != reader.header().members.end() && !notes->second.empty())
+    entry["changelog"] = notes->second;
   const std::string stem = info.at("package") + "-" + info.at("version");
   return WriteIcons(reader.header(), o, stem, entry, error) &&
          WriteScreenshots(reader.header(), o, stem, entry, error);

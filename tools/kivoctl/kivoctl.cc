@@ -9,7 +9,9 @@
 //   kivoctl build|sign|inspect|index|icon ...  (package authors)
 //   kivoctl [--root DIR] install|uninstall|start|stop|status|list|log ...
 //   kivoctl [--root DIR] rollback|revisions|drop-revision ID
-//   kivoctl [--root DIR] auto-update [--dry-run]
+//   kivoctl [--root DIR] auto-update [--dry-run] [--now TIME] [--seed N]
+//   kivoctl [--root DIR] watchdog [--once]
+//   kivoctl [--root DIR] confine ID
 
 #include <cstdio>
 #include <cstdlib>
@@ -26,10 +28,12 @@
 #include "pkgtool/registry.h"
 #include "tools/kivoctl/auto_update.h"
 #include "tools/kivoctl/catalogue_index.h"
+#include "tools/kivoctl/confine_command.h"
 #include "tools/kivoctl/fallback_icon.h"
 #include "tools/kivoctl/package_commands.h"
 #include "tools/kivoctl/root_setup.h"
 #include "tools/kivoctl/server_install.h"
+#include "tools/kivoctl/watchdog.h"
 #include "tools/kivoctl/web_config.h"
 
 namespace {
@@ -73,8 +77,12 @@ const char kUsage[] =
     "                 [--switch-origin]   install, or upgrade an installed package\n"
     "                                     (--switch-origin: also one that came from\n"
     "                                     another source or signer, which from then\n"
-    "                                     on has this file's origin)\n"
+    "                                     on has this file's origin;\n"
+    "                 [--without-data-copy] --without-data-copy: upgrade even when\n"
+    "                                     there is no room for a safety copy of the\n"
+    "                                     data)\n"
     "  install-server ID [--feed URL] [--volume V] [--run] [--switch-origin]\n"
+    "                 [--without-data-copy]\n"
     "                                     install, or upgrade to, the newest ID the\n"
     "                                     vendor's server (or the listed feed) offers\n"
     "  uninstall ID [--wizard JSON]       remove a package\n"
@@ -87,8 +95,16 @@ const char kUsage[] =
     "  revisions ID                       the kept earlier version: when it was\n"
     "                                     replaced and the room its copy takes\n"
     "  drop-revision ID                   remove the kept earlier version and its data\n"
-    "  auto-update [--dry-run]            upgrade the packages the automatic-update\n"
-    "                                     settings choose (--dry-run: only say what)\n"
+    "  auto-update [--dry-run] [--now YYYY-MM-DDTHH:MM] [--seed N]\n"
+    "                                     upgrade the packages the automatic-update\n"
+    "                                     settings choose, in the maintenance window\n"
+    "                                     (--dry-run: only say what; --now, --seed:\n"
+    "                                     as at that local time, with that delay)\n"
+    "  watchdog [--once]                  start again the packages meant to run whose\n"
+    "                                     service died (etc/kivo/watchdog.conf); runs\n"
+    "                                     until SIGTERM (--once: one check)\n"
+    "  confine ID                         give an installed package its own account now\n"
+    "                                     and print what confines it\n"
     "\n"
     "--root DIR selects the system root (default: $KIVO_ROOT, else /).\n";
 
@@ -253,6 +269,8 @@ int RunCommand(const std::string& command, const std::vector<std::string>& args)
   if (command == "drop-revision") return KivoctlDropRevision(args);
   if (command == "auto-update") return KivoctlAutoUpdate(args);
   if (command == "install-server") return KivoctlInstallServer(args);
+  if (command == "watchdog") return KivoctlWatchdog(args);
+  if (command == "confine") return KivoctlConfine(args);
   std::cerr << kUsage;
   return Fail("unknown command: " + command);
 }

@@ -138,7 +138,7 @@ int KivoctlInstall(const std::vector<std::string>& args) {
   if (pos.size() != 1) {
     return Usage(
         "kivoctl install FILE.kpk [--volume /volumeN] [--wizard JSON] [--run] "
-        "[--no-codesign] [--no-force] [--switch-origin]");
+        "[--no-codesign] [--no-force] [--switch-origin] [--without-data-copy]");
   }
   std::string message;
   PKG_ERRCODE code = PKG_OK;
@@ -147,7 +147,8 @@ int KivoctlInstall(const std::vector<std::string>& args) {
   // A file named on the command line has a file's origin; replacing a
   // package that came from elsewhere takes --switch-origin.
   PMSInstallSource source;
-  if (Flag(args, "--switch-origin")) source.change = PMSOriginChange::kAllow;
+  if (Flag(args, "--switch-origin")) source.choices.change = PMSOriginChange::kAllow;
+  source.choices.without_data_copy = Flag(args, "--without-data-copy");
   bool ok = InstallPackageFileImpl(user ? user : "root", pos[0], Option(args, "--volume"), 0,
                                    Option(args, "--wizard"), Flag(args, "--run"), "enu", message,
                                    code, details, !Flag(args, "--no-force"),

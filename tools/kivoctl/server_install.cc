@@ -51,7 +51,7 @@ bool FindOffer(const std::string& id, const std::string& feed, Json::Value& entr
 }  // namespace
 
 bool KivoctlDownloadAndInstall(const std::string& id, const Json::Value& entry, bool run,
-                               const std::string& volume, PMSOriginChange change,
+                               const std::string& volume, const PMSInstallChoices& choices,
                                std::string& message, int& code) {
   const std::string link = Text(entry["link"]), md5 = Text(entry["md5"]);
   const uint64_t size = entry["size"].isUInt64() ? entry["size"].asUInt64() : 0;
@@ -71,7 +71,7 @@ bool KivoctlDownloadAndInstall(const std::string& id, const Json::Value& entry, 
   NVX::TaskMgr mgr(KIVOPackageTasks::kTaskOwner);
   std::unique_ptr<NVX::Task> task(mgr.createTask(KIVOPackageTasks::kDownloadPrefix + id));
   if (!task || !KIVOPackageServer::InitDownload(task.get(), id, size, link, folder, true, getpid(),
-                                                change)) {
+                                                choices)) {
     (void)KIVOPackageServer::PMSRemoveDownloadDir(folder);
     message = "the download task cannot be written";
     return false;
@@ -92,7 +92,7 @@ bool KivoctlDownloadAndInstall(const std::string& id, const Json::Value& entry, 
 int KivoctlInstallServer(const std::vector<std::string>& args) {
   std::string id, feed, volume;
   bool run = false;
-  PMSOriginChange change = PMSOriginChange::kRefuse;
+  PMSInstallChoices choices;
   for (size_t i = 0; i < args.size(); ++i) {
     const bool has_value = i + 1 < args.size();
     if (args[i] == "--feed" && has_value) {
@@ -102,7 +102,9 @@ int KivoctlInstallServer(const std::vector<std::string>& args) {
     } else if (args[i] == "--run") {
       run = true;
     } else if (args[i] == "--switch-origin") {
-      change = PMSOriginChange::kAllow;
+      choices.change = PMSOriginChange::kAllow;
+    } else if (args[i] == "--without-data-copy") {
+      choices.without_data_copy = true;
     } else if (id.empty() && args[i].compare(0, 2, "--") != 0) {
       id = args[i];
     } else {
@@ -112,14 +114,14 @@ int KivoctlInstallServer(const std::vector<std::string>& args) {
   }
   if (!PMSIsValidPackageId(id)) {
     std::cerr << "kivoctl: usage: kivoctl install-server ID [--feed URL] [--volume /volumeN] "
-                 "[--run] [--switch-origin]\n";
+                 "[--run] [--switch-origin] [--without-data-copy]\n";
     return 2;
   }
   Json::Value entry;
   std::string message;
   int code = 0;
   if (!FindOffer(id, feed, entry, &message) ||
-      !KivoctlDownloadAndInstall(id, entry, run, volume, change, message, code)) {
+      !KivoctlDownloadAndInstall(id, entry, run, volume, choices, message, code)) {
     std::cerr << "kivoctl: " << id << ": " << message
               << (code ? " [" + std::to_string(code) + "]" : "") << "\n";
     return 1;

@@ -16,11 +16,11 @@
 // and "size" when given) in the download task the desktop uses, so the
 // desktop sees it and does not start a second one, and installs it onto
 // `volume` ("" for the package's or the default volume), starting it when
-// `run`. `change` kAllow lets the install switch the package's origin. False
+// `run`, with what the administrator allowed (`choices`). False
 // with `message`, and `code` the package tool's result (0 for a failure
 // before the install), on failure.
 bool KivoctlDownloadAndInstall(const std::string& id, const Json::Value& entry, bool run,
-                               const std::string& volume, PMSOriginChange change,
+                               const std::string& volume, const PMSInstallChoices& choices,
                                std::string& message, int& code);
 
 // `kivoctl install-server ID [--feed URL] [--volume V] [--run] [--switch-origin]`:

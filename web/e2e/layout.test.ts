@@ -177,6 +177,11 @@ test('every screen of the package center fits a phone, the header with its tabs 
   await expectTextInside(rename.getByText(address), rename, 'the renamed feed address');
   await screenshotOf(rename, 'phone-settings-rename-feed');
   await rename.getByRole('button', { name: 'Cancel' }).click();
+
+  // The activity log, with the feed just added on record.
+  await nav.getByRole('link', { name: 'Activity' }).click();
+  await page.getByRole('table', { name: 'Activity, newest first' }).getByText('Add a feed').waitFor();
+  await checkScreen(page, 'phone-activity');
 });
 
 test('a failure naming a long address wraps inside its card, on a desktop and on a phone', async () => {

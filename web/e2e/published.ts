@@ -14,8 +14,9 @@ import { kBuild, kPassword, kRepo, type Appliance } from './appliance.ts';
 // Builds examples/packages/`sample` with `info` laid over its INFO, as
 // examples/build.sh builds the samples for this appliance (demo-web's port
 // written in, the common service script added, signed with the appliance's
-// demo key), and answers the package file's path.
-export function buildSample(appliance: Appliance, sample: string, info: Record<string, string>): string {
+// demo key), and answers the package file's path. `files` (paths in the
+// source, such as "scripts/health") are added, executable.
+export function buildSample(appliance: Appliance, sample: string, info: Record<string, string>, files: Record<string, string> = {}): string {
   const work = mkdtempSync(join(tmpdir(), 'kivo-sample-'));
   const examples = join(work, 'examples');
   mkdirSync(join(examples, 'packages'), { recursive: true });
@@ -25,6 +26,10 @@ export function buildSample(appliance: Appliance, sample: string, info: Record<s
   const source = join(examples, 'packages', id);
   cpSync(join(kRepo, 'examples/packages', sample), source, { recursive: true });
   writeFileSync(join(source, 'INFO'), withValues(readFileSync(join(source, 'INFO'), 'utf8'), info));
+  for (const [path, content] of Object.entries(files)) {
+    mkdirSync(join(source, path, '..'), { recursive: true });
+    writeFileSync(join(source, path), content, { mode: 0o755 });
+  }
   const out = join(work, 'out');
   mkdirSync(out);
   cpSync(appliance.file('/.samples/gnupg'), join(out, 'gnupg'), { recursive: true });

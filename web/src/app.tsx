@@ -10,6 +10,7 @@ import { CatalogueScreen } from './screens/catalogue';
 import { ManualInstallScreen } from './screens/manual-install';
 import { SettingsScreen } from './screens/settings';
 import { TermsGate } from './screens/terms';
+import { ActivityScreen } from './screens/activity';
 
 type State = { kind: 'loading' } | { kind: 'signed-out'; notice?: string } | { kind: 'signed-in'; session: SessionInfo };
 
@@ -18,6 +19,7 @@ const kTabs: { screen: Route['screen']; label: string }[] = [
   { screen: 'catalogue', label: 'All packages' },
   { screen: 'manual', label: 'Manual install' },
   { screen: 'settings', label: 'Settings' },
+  { screen: 'activity', label: 'Activity' },
 ];
 
 function Screen({ route }: { route: Route }) {
@@ -30,6 +32,8 @@ function Screen({ route }: { route: Route }) {
       return <ManualInstallScreen />;
     case 'settings':
       return <SettingsScreen />;
+    case 'activity':
+      return <ActivityScreen packageId={route.id} />;
     default:
       return <InstalledScreen />;
   }

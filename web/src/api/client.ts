@@ -73,18 +73,35 @@ export class Api {
   async call<T = unknown>(api: string, method: string, version: number, params: Params = {}, keepalive = false): Promise<Result<T>> {
     let text: string;
     try {
-      const response = await fetch(kEndpoint, {
-        method: 'POST',
-        credentials: 'same-origin',
-        headers: { 'X-KIVO-Token': this.token },
-        body: encode(api, method, version, params),
-        keepalive,
-      });
-      text = await response.text();
+      text = await (await this.post(api, method, version, params, keepalive)).text();
     } catch {
       return failure(kNoAnswer);
     }
     return this.checked(parseAnswer<T>(text));
+  }
+
+  // A method that answers a file to save (an export): the file, or the
+  // API's failure when it answered that instead. Only a file comes as an
+  // attachment.
+  async download(api: string, method: string, version: number, params: Params = {}): Promise<Result<Blob>> {
+    try {
+      const response = await this.post(api, method, version, params);
+      if (response.ok && /^attachment/i.test(response.headers.get('Content-Disposition') ?? '')) return { ok: true, data: await response.blob() };
+      const answer = parseAnswer<unknown>(await response.text());
+      return this.checked(answer.ok ? failure(kNoAnswer) : answer);
+    } catch {
+      return failure(kNoAnswer);
+    }
+  }
+
+  private post(api: string, method: string, version: number, params: Params, keepalive = false): Promise<Response> {
+    return fetch(kEndpoint, {
+      method: 'POST',
+      credentials: 'same-origin',
+      headers: { 'X-KIVO-Token': this.token },
+      body: encode(api, method, version, params),
+      keepalive,
+    });
   }
 
   // Posts `file` as multipart/form-data with `fields` before it, reporting

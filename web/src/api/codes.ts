@@ -54,6 +54,8 @@ export const PackageCode = {
   ScriptFailed: 4549,
   Cancelled: 4550,
   DependentsRunning: 4552,
+  NoRoomForDataCopy: 4553,
+  DataNotCopyable: 4554,
   NotFeasible: 4556,
   UninstallFailed: 4560,
   UninstallBadValues: 4561,
@@ -70,6 +72,20 @@ export const PackageCode = {
   KeyNotPublic: 4593,
   KeySecret: 4594,
   KeyringUnwritable: 4595,
+  // Kept versions and rollback (host/revision_api.h).
+  NoRevision: 4610,
+  RevisionBusy: 4611,
+  RollbackFailed: 4612,
+  DropFailed: 4613,
+  RevisionNotInstalled: 4614,
+  // Memory and process limits, and what packages use (host/usage_api.h).
+  LimitAboveBound: 4615,
+  UsageNotInstalled: 4616,
+  RootNotTrusted: 4620,
+  // The window and holds of automatic updates (host/auto_update_api.h).
+  HoldNotInstalled: 4630,
+  AutoUpdateNotStored: 4631,
+  HoldsUnreadable: 4632,
 } as const;
 
 // The package tool's result codes that the page acts on (docs/package-tool.md):
@@ -78,7 +94,11 @@ export const PackageCode = {
 export const ToolCode = {
   // Running packages need a version this one is not (an upgrade).
   DependentsRunning: 269,
+  // An upgrade failed and the version before it was put back with its data.
+  UpgradeRolledBack: 305,
   OtherOrigin: 306,
+  // The volume has no room for the safety copy of the data an upgrade takes.
+  NoRoomForDataCopy: 307,
 } as const;
 
 // The "code" of the "error" a failed download or install leaves in its task

@@ -15,11 +15,18 @@ export function listFeeds(api: Api): Promise<Result<{ items: Feed[] }>> {
   return api.call<{ items: Feed[] }>(kFeed, 'list', 1);
 }
 
+// What adding a feed found: whether it publishes signing keys, and how many
+// packages its catalogue lists (0: it answers but lists nothing).
+export interface FeedAdded {
+  has_keyrings?: boolean;
+  packages?: number;
+}
+
 // The appliance asks the server before it stores the feed, which may take up
 // to its catalogue time-out. Only this answer says whether the feed
 // publishes signing keys.
-export function addFeed(api: Api, feed: Feed): Promise<Result<{ has_keyrings?: boolean } | null>> {
-  return api.call<{ has_keyrings?: boolean } | null>(kFeed, 'add', 1, { list: JSON.stringify(feed) });
+export function addFeed(api: Api, feed: Feed): Promise<Result<FeedAdded | null>> {
+  return api.call<FeedAdded | null>(kFeed, 'add', 1, { list: JSON.stringify(feed) });
 }
 
 // "set" changes name and address together; the address stays.

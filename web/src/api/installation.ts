@@ -4,6 +4,7 @@
 // that follow them.
 
 import type { Api, Params, Result } from './client';
+import type { PackagePermissions } from './permissions';
 import type { ServerEntry } from './server';
 
 const kInstallation = 'KIVO.Core.Package.Installation';
@@ -103,7 +104,16 @@ export interface InstallValues {
 // It takes the place of the package's finished download (the file the
 // wizard was shown for), which the appliance drops with its file, so the
 // install after a wizard is this one request.
-export function quickInstall(api: Api, entry: ServerEntry, values: InstallValues, switchOrigin: boolean): Promise<Result<Started>> {
+// What the administrator allowed the install beyond the usual rules: to
+// switch the package to this source, or to upgrade without the safety copy
+// of its data when the volume has no room for one.
+export interface InstallAllowances {
+  switchOrigin?: boolean;
+  withoutDataCopy?: boolean;
+}
+
+export function quickInstall(api: Api, entry: ServerEntry, values: InstallValues, allowed: InstallAllowances): Promise<Result<Started>> {
+  const { switchOrigin, withoutDataCopy } = allowed;
   const params = {
     name: entry.id,
     is_kivo: entry.source === 'kivo',
@@ -112,6 +122,7 @@ export function quickInstall(api: Api, entry: ServerEntry, values: InstallValues
     volume_path: values.volume_path,
     customuivalues: values.extra_values,
     ...(switchOrigin ? { ...entryLink(entry), switch_origin: true } : {}),
+    ...(withoutDataCopy ? { without_data_copy: true } : {}),
   };
   return api.call<Started>(kInstallation, 'install', 1, params, kOutlivesPage);
 }
@@ -123,6 +134,7 @@ export interface DownloadedFile {
   version?: string;
   install_pages?: string;
   license?: string;
+  permissions?: PackagePermissions;
 }
 
 export function checkDownloaded(api: Api, taskId: string): Promise<Result<DownloadedFile>> {
@@ -136,9 +148,12 @@ export interface UploadAnswer {
   version: string;
   task_id: string;
   licence?: string;
+  // The file's release notes, plain text (docs/package-format.md).
+  changelog?: string;
   install_pages?: string;
   codesign_error?: number;
   codesign_message?: string;
+  permissions?: PackagePermissions;
   additional?: { dependent_packages?: unknown; start_dependent_services?: unknown; install_type?: unknown };
 }
 
@@ -159,12 +174,11 @@ export interface InstallAnswer {
 }
 
 // How an uploaded file is installed: `trustUnverified`, the administrator
-// confirmed a package whose signature could not be verified; `switchOrigin`,
-// that it replaces a package from elsewhere; `start`, that it starts once
+// confirmed a package whose signature could not be verified; what else the
+// administrator allowed (InstallAllowances); `start`, that it starts once
 // installed.
-export interface UploadInstallOptions {
+export interface UploadInstallOptions extends InstallAllowances {
   trustUnverified: boolean;
-  switchOrigin: boolean;
   start: boolean;
 }
 
@@ -175,6 +189,7 @@ export function installUploaded(api: Api, taskId: string, values: InstallValues,
     ...values,
     check_codesign: options.trustUnverified ? false : undefined,
     switch_origin: options.switchOrigin ? true : undefined,
+    without_data_copy: options.withoutDataCopy ? true : undefined,
     // "type" 1 starts the package once it is installed.
     type: options.start ? 1 : undefined,
   };

@@ -54,6 +54,8 @@ const messages: Record<number, string> = {
   [PackageCode.UnknownSigner]: 'This package is signed by a key this appliance does not trust. Import the publisher\'s key, or lower the trust level.',
   [PackageCode.ExpiredKey]: 'This package is signed with a key that has expired. Ask its publisher for a newer package.',
   [PackageCode.RevokedKey]: 'This package is signed with a key that has been revoked. Do not install it.',
+  [PackageCode.RootNotTrusted]:
+    'This package asks to run with full control of the appliance, which only a package signed by a key of the appliance keyring may. It was refused.',
   [PackageCode.OsTooNew]: 'This package does not support the appliance\'s system version, which is newer than it allows.',
   [PackageCode.OsTooOld]: 'This package needs a newer system version. Update the appliance first.',
   [PackageCode.ExtractFailed]: 'The package\'s contents could not be unpacked. The file may be damaged, or the volume full.',
@@ -69,6 +71,10 @@ const messages: Record<number, string> = {
   [PackageCode.ScriptFailed]: 'A script of the package failed.',
   [PackageCode.Cancelled]: 'The install was cancelled.',
   [PackageCode.DependentsRunning]: 'Running packages depend on this one. Stop them first.',
+  [PackageCode.NoRoomForDataCopy]:
+    'The volume has no room for a safety copy of this package\'s data, which an upgrade takes first. Nothing was changed. Free some room, or upgrade without a safety copy.',
+  [PackageCode.DataNotCopyable]:
+    'This package\'s data holds something a safety copy cannot hold, so the upgrade was not started. Nothing was changed.',
   [PackageCode.NotFeasible]: 'The appliance does not allow this now.',
   [PackageCode.UninstallFailed]: 'The package could not be uninstalled.',
   [PackageCode.UninstallBadValues]: 'The answers of the uninstall wizard could not be read. Go back and answer again.',
@@ -86,6 +92,17 @@ const messages: Record<number, string> = {
   [PackageCode.KeyNotPublic]: 'This file holds no public signing key. Choose the publisher\'s public key file.',
   [PackageCode.KeySecret]: 'This file holds a secret key, which must never be imported. Ask the publisher for the public key.',
   [PackageCode.KeyringUnwritable]: 'The appliance\'s keyring could not be written. Check the system volume, then try again.',
+  [PackageCode.NoRevision]: 'No earlier version of this package is kept.',
+  [PackageCode.RevisionBusy]: 'Another operation on this package is under way. Wait for it to finish, then try again.',
+  [PackageCode.RollbackFailed]: 'The rollback did not complete.',
+  [PackageCode.DropFailed]: 'Some of the kept version could not be removed; the next package operation removes the rest.',
+  [PackageCode.RevisionNotInstalled]: 'This package is not installed.',
+  [PackageCode.LimitAboveBound]:
+    'This package asks for more memory or more processes than this appliance allows a package. Raise the bounds in the package tool\'s settings, or ask its publisher for a package that needs less.',
+  [PackageCode.UsageNotInstalled]: 'This package is not installed, so it uses nothing.',
+  [PackageCode.HoldNotInstalled]: 'This package is not installed, so there is nothing to hold.',
+  [PackageCode.AutoUpdateNotStored]: 'The schedule of automatic updates could not be saved. Check the system volume, then try again.',
+  [PackageCode.HoldsUnreadable]: 'The stored holds of automatic updates are damaged, so automatic updates upgrade nothing. Set a hold again to replace them.',
 };
 
 // The name people know a package by, for its id; the id itself when the

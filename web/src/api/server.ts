@@ -21,6 +21,10 @@ export interface ServerEntry {
   // switched.
   other_origin?: string;
   source: 'kivo' | 'others';
+  // On the feeds' side: the address of the feed that lists it.
+  feed?: string;
+  // The release notes of this version, plain text (shown as text only).
+  changelog?: string;
   status?: string;
   info?: TaskData | null;
   icon?: string | null;

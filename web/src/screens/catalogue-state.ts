@@ -10,6 +10,7 @@ import { listFeeds, type Feed } from '../api/feed';
 import { downloadTaskId } from '../api/installation';
 import { listCatalogue, type ServerEntry, type ServerList } from '../api/server';
 import { getSettings } from '../api/setting';
+import { listSources, type SourcesAnswer } from '../api/sources';
 import { taskFailure } from '../ui/task-progress';
 
 export interface Catalogue {
@@ -19,6 +20,8 @@ export interface Catalogue {
   others: Result<ServerList> | null;
   // How many beta versions the stable channel left out (offeredOnChannel).
   betasLeftOut: number;
+  // How fresh each source is, read after the catalogues were fetched.
+  sources: Result<SourcesAnswer>;
 }
 
 // What the page shows for one package besides its description: a download
@@ -66,6 +69,8 @@ async function loadCatalogue(api: Api, reload: boolean): Promise<Catalogue> {
   const [vendor, feeds, settings] = await Promise.all([listCatalogue(api, { reload }), listFeeds(api), getSettings(api)]);
   const anyFeed = !feeds.ok || feeds.data.items.length > 0;
   const others = anyFeed ? await listCatalogue(api, { reload, others: true }) : null;
+  // Asked once the fetches above are done, so that it tells their outcome.
+  const sources = await listSources(api);
   const betaChannel = settings.ok ? settings.data.update_channel : null;
   const left = { count: 0 };
   return {
@@ -73,6 +78,7 @@ async function loadCatalogue(api: Api, reload: boolean): Promise<Catalogue> {
     feeds,
     others: others && onChannel(others, betaChannel, left),
     betasLeftOut: left.count,
+    sources,
   };
 }
 
@@ -172,9 +178,12 @@ export function useCatalogue(api: Api): CatalogueState {
   return { catalogue, loading, load, phases, setPhase, lastLoad };
 }
 
-// The feed an entry of the other feeds came from: the feed whose address's
-// folder holds the entry's link (the longest such), else the only feed.
+// The feed an entry of the other feeds came from: the one the appliance
+// names (`feed`), else the feed whose address's folder holds the entry's
+// link (the longest such), else the only feed.
 function feedOf(entry: ServerEntry, feeds: Feed[]): string {
+  const named = feeds.find((f) => f.feed === entry.feed);
+  if (named) return named.name || named.feed;
   const folder = (f: Feed) => f.feed.slice(0, f.feed.lastIndexOf('/') + 1);
   const match = feeds
     .filter((f) => entry.link?.startsWith(folder(f)))

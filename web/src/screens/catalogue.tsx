@@ -16,6 +16,7 @@ import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
 import { EntryCard } from './catalogue-card';
 import { InstallDialogs, useInstalls } from './catalogue-installs';
+import { FeedSections, VendorState } from './catalogue-sources';
 import { entriesOf, sourceOf, useCatalogue, type Catalogue } from './catalogue-state';
 
 function matches(entry: ServerEntry, query: string): boolean {
@@ -67,13 +68,14 @@ export function CatalogueScreen() {
       {catalogue && !catalogue.vendor.ok && (
         <Problem error={catalogue.vendor.error}>The vendor's package server sent no catalogue: it may be unreachable or answer something else.</Problem>
       )}
+      <VendorState sources={catalogue?.sources} />
       <Section title="Recommended" entries={recommended} card={card} />
       <Section title={recommended.length > 0 ? 'More from the vendor' : 'From the vendor'} entries={vendorRest} card={card} />
       {catalogue && !catalogue.feeds.ok && <Problem error={catalogue.feeds.error}>The list of added feeds could not be read.</Problem>}
       {catalogue?.others && !catalogue.others.ok && (
         <Problem error={catalogue.others.error}>The added feeds sent no catalogue: they may be unreachable or answer something else.</Problem>
       )}
-      <Section title="From added feeds" entries={fromFeeds} card={card} />
+      <FeedSections sources={catalogue?.sources} entries={fromFeeds} card={card} />
       <InstallDialogs installs={installs} sourceOf={from} />
     </section>
   );

@@ -1,6 +1,6 @@
 import { useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
-import { addFeed, deleteFeed, listFeeds, renameFeed, type Feed } from '../api/feed';
+import { addFeed, deleteFeed, listFeeds, renameFeed, type Feed, type FeedAdded } from '../api/feed';
 import { useSession } from '../session';
 import { Dialog } from '../ui/dialog';
 import { ErrorText } from '../ui/error-text';
@@ -19,11 +19,13 @@ export function FeedsSection() {
 
   // Only the add answer says whether a feed publishes signing keys (the list
   // does not), so the page tells it then.
-  const added = (feed: Feed, hasKeys: boolean) =>
+  // A feed that answers but lists nothing is added too, and said to be empty.
+  const added = (feed: Feed, answer: FeedAdded | null) =>
     done(
-      hasKeys
+      (answer?.has_keyrings === true
         ? `Feed “${feed.name || feed.feed}” added. It brings its publishers' signing keys: packages from this feed are checked against them, and against this appliance's keyring.`
-        : `Feed “${feed.name || feed.feed}” added. It brings no signing keys: its packages must be signed by a key of this appliance's keyring.`,
+        : `Feed “${feed.name || feed.feed}” added. It brings no signing keys: its packages must be signed by a key of this appliance's keyring.`) +
+        (answer?.packages === 0 ? ' It answers, but its catalogue lists no packages: nothing from it appears under All packages until it does.' : ''),
     );
 
   const remove = async (feed: Feed) => {
@@ -86,7 +88,7 @@ export function FeedsSection() {
   );
 }
 
-function AddFeedForm({ onAdded }: { onAdded: (feed: Feed, hasKeys: boolean) => Promise<void> }) {
+function AddFeedForm({ onAdded }: { onAdded: (feed: Feed, answer: FeedAdded | null) => Promise<void> }) {
   const { api } = useSession();
   const [name, setName] = useState('');
   const [address, setAddress] = useState('');
@@ -102,7 +104,7 @@ function AddFeedForm({ onAdded }: { onAdded: (feed: Feed, hasKeys: boolean) => P
     setError(null);
     setName('');
     setAddress('');
-    await onAdded(feed, result.data?.has_keyrings === true);
+    await onAdded(feed, result.data);
   };
   return (
     <form class="add-feed" onSubmit={submit} aria-labelledby="add-feed-title">

@@ -11,7 +11,9 @@ import { PackageActions, type ActionFields } from '../ui/package-actions';
 import { PackageIcon } from '../ui/package-icon';
 import { usePoll } from '../ui/poll';
 import { isBusyStatus, kBusyPollMs, StatusBadge } from '../ui/status-badge';
+import { UsageLine, UsageViews } from '../ui/package-usage';
 import { useUpgradeOffers } from '../ui/upgrade-flow';
+import { WatchdogNote, WatchdogViews } from '../ui/watchdog-note';
 
 // The installed packages: each with its icon, version, state and what can
 // be done with it (open its page, upgrade it when a package server offers a
@@ -58,6 +60,8 @@ function Row({
       <div class="installed-status">
         <StatusBadge status={extra.status} withReason />
         {typeof progress === 'number' && progress >= 0 && <span class="hint"> {Math.round(progress * 100)}%</span>}
+        <WatchdogNote id={pkg.id} name={pkg.name} onStarted={onChanged} />
+        <UsageLine id={pkg.id} />
       </div>
       <PackageActions
         pkg={pkg}
@@ -151,11 +155,15 @@ export function InstalledScreen() {
       )}
       {result?.ok && packages.length === 0 && <p class="hint">No packages are installed.</p>}
       {packages.length > 0 && (
-        <ul class="installed-list" aria-label="Installed packages">
-          {Array.from({ length: Math.ceil(shown / kRowsPerFrame) }, (_, i) => (
-            <Rows key={i} packages={packages} from={i * kRowsPerFrame} upgrades={upgrades} onChanged={reload} onUpgraded={onUpgraded} onRemoved={onRemoved} />
-          ))}
-        </ul>
+        <WatchdogViews refresh={result}>
+          <UsageViews refresh={result}>
+            <ul class="installed-list" aria-label="Installed packages">
+              {Array.from({ length: Math.ceil(shown / kRowsPerFrame) }, (_, i) => (
+                <Rows key={i} packages={packages} from={i * kRowsPerFrame} upgrades={upgrades} onChanged={reload} onUpgraded={onUpgraded} onRemoved={onRemoved} />
+              ))}
+            </ul>
+          </UsageViews>
+        </WatchdogViews>
       )}
     </section>
   );

@@ -8,6 +8,7 @@ import {
   installUploaded,
   taskStatus,
   uploadPackage,
+  type InstallAllowances,
   type InstallAnswer,
   type UploadAnswer,
 } from '../api/installation';
@@ -21,6 +22,7 @@ import { OriginSwitch } from '../ui/origin-switch';
 import { ErrorText } from '../ui/error-text';
 import { usePoll } from '../ui/poll';
 import { ProgressBar } from '../ui/progress';
+import { ReleaseNotes } from '../ui/release-notes';
 import type { StepPage } from '../ui/steps';
 import { CheckRefusal, checkEnvironment, InstallSteps, installParams, type InstallChoices, type PackageFacts, type Volume } from '../ui/install-pages';
 
@@ -63,7 +65,15 @@ type Phase =
   | { kind: 'refused'; file: File; error: ApiFailure }
   | { kind: 'wizard'; prepared: Prepared; choices: InstallChoices }
   | { kind: 'installing'; prepared: Prepared; choices: InstallChoices; progress: number | null }
-  | { kind: 'done'; prepared: Prepared; choices: InstallChoices; trustUnverified: boolean; outcome: Result<InstallAnswer>; status: string | null };
+  | {
+      kind: 'done';
+      prepared: Prepared;
+      choices: InstallChoices;
+      trustUnverified: boolean;
+      allowed: InstallAllowances;
+      outcome: Result<InstallAnswer>;
+      status: string | null;
+    };
 
 // What the check needs to know about the package, from the upload's answer.
 // `upgrade`: the package is installed, in another version. The check then
@@ -92,6 +102,7 @@ async function prepare(api: Api, upload: UploadAnswer): Promise<Result<Prepared>
     licence: upload.licence,
     installPages: upload.install_pages,
     replaces: installed.ok ? installed.data.version : undefined,
+    permissions: upload.permissions,
   };
   const environment = await checkEnvironment<CheckAnswer>(api, facts, checkParams(upload, installed.ok));
   if (!environment.ok) return environment;
@@ -161,6 +172,12 @@ function trustLevelRefusalPage(upload: UploadAnswer): StepPage {
   };
 }
 
+// Before a manual upgrade, the file's release notes, when it has them.
+function releaseNotesPage({ upload, facts }: Prepared): StepPage[] {
+  if (facts.replaces === undefined || !upload.changelog?.trim()) return [];
+  return [{ title: 'Release notes', body: <ReleaseNotes version={upload.version} notes={upload.changelog} /> }];
+}
+
 function InstallWizard({
   prepared,
   start,
@@ -174,7 +191,7 @@ function InstallWizard({
 }) {
   const [trustUnverified, setTrustUnverified] = useState(false);
   const unverified = prepared.upload.codesign_error !== undefined;
-  const before = unverified ? [codesignPage(prepared, trustUnverified, setTrustUnverified)] : [];
+  const before = [...releaseNotesPage(prepared), ...(unverified ? [codesignPage(prepared, trustUnverified, setTrustUnverified)] : [])];
   return (
     <>
       {prepared.busy && <p class="hint">Another package operation is under way; the install may have to wait for it.</p>}
@@ -325,17 +342,18 @@ export function ManualInstallScreen() {
     pendingUpload.current = null;
   };
 
-  // `switchOrigin`: the administrator confirmed that the package, which
-  // came from elsewhere, is from now on a file's installed by hand.
-  const install = async (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean, switchOrigin = false) => {
+  // `allowed`: what the administrator confirmed after a refusal: that the
+  // package, which came from elsewhere, is from now on a file's installed
+  // by hand; that it upgrades without a safety copy of its data.
+  const install = async (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean, allowed: InstallAllowances = {}) => {
     setPhase({ kind: 'installing', prepared, choices, progress: null });
-    const options = { trustUnverified, switchOrigin, start: choices.startAfter === true };
+    const options = { trustUnverified, ...allowed, start: choices.startAfter === true };
     const outcome = await installUploaded(api, prepared.upload.task_id, installParams(prepared.facts, choices), options);
     // A successful install took the file; a failed one leaves it for a retry.
     if (outcome.ok) pendingUpload.current = null;
     // Whether it runs is read back, not assumed from the request.
     const status = outcome.ok && options.start ? await statusOf(api, prepared.facts.id) : null;
-    setPhase({ kind: 'done', prepared, choices, trustUnverified, outcome, status });
+    setPhase({ kind: 'done', prepared, choices, trustUnverified, allowed, outcome, status });
   };
 
   const close = () => {
@@ -391,7 +409,7 @@ function PhaseBody({
 }: {
   phase: Phase;
   onClose: () => void;
-  onInstall: (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean, switchOrigin?: boolean) => void;
+  onInstall: (prepared: Prepared, choices: InstallChoices, trustUnverified: boolean, allowed?: InstallAllowances) => void;
   onRetry: (prepared: Prepared, choices: InstallChoices) => void;
 }) {
   switch (phase.kind) {
@@ -428,9 +446,31 @@ function PhaseBody({
             <OriginSwitch
               name={phase.prepared.facts.name || phase.prepared.facts.id}
               source="files installed by hand"
-              onSwitch={() => onInstall(phase.prepared, phase.choices, phase.trustUnverified, true)}
+              onSwitch={() => onInstall(phase.prepared, phase.choices, phase.trustUnverified, { ...phase.allowed, switchOrigin: true })}
               onCancel={onClose}
             />
+          </>
+        );
+      }
+      if (!phase.outcome.ok && phase.outcome.error.code === PackageCode.NoRoomForDataCopy) {
+        return (
+          <>
+            <CheckRefusal error={phase.outcome.error} />
+            <p class="hint">
+              Without the safety copy the upgrade is made all the same, but if it fails, the data it changed cannot be brought back.
+            </p>
+            <div class="buttons">
+              <button type="button" onClick={onClose}>
+                Close
+              </button>
+              <button
+                type="button"
+                class="primary"
+                onClick={() => onInstall(phase.prepared, phase.choices, phase.trustUnverified, { ...phase.allowed, withoutDataCopy: true })}
+              >
+                Upgrade without a safety copy
+              </button>
+            </div>
           </>
         );
       }

@@ -5,12 +5,17 @@ import { getPackage, packageLog } from '../api/package';
 import { routeHref } from '../route';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
+import { KeptVersionPanel } from '../ui/kept-version';
 import { PackageActions, type ActionFields } from '../ui/package-actions';
+import { PackageHistory } from '../ui/package-history';
+import { PackageHold } from '../ui/package-hold';
 import { PackageIcon } from '../ui/package-icon';
 import { usePoll } from '../ui/poll';
 import { usePackageNames } from '../ui/package-names';
 import { isBusyStatus, kBusyPollMs, StatusBadge } from '../ui/status-badge';
+import { UsageFacts, UsageViews } from '../ui/package-usage';
 import { useUpgradeOffers } from '../ui/upgrade-flow';
+import { WatchdogNote, WatchdogViews } from '../ui/watchdog-note';
 
 // One installed package: what it is, who makes it, where to get help, what
 // it needs, the address of its own web page while it runs, its screenshots
@@ -242,6 +247,9 @@ export function PackageScreen({ id }: { id: string }) {
           onRemoved={setRemoved}
         />
       </header>
+      <WatchdogViews refresh={result}>
+        <WatchdogNote id={pkg.id} name={pkg.name} onStarted={() => void reload()} />
+      </WatchdogViews>
       {extra.description && <p class="details-description">{extra.description}</p>}
       <dl class="details-facts">
         <WebAddress url={extra.status === 'running' ? extra.url : undefined} />
@@ -249,6 +257,9 @@ export function PackageScreen({ id }: { id: string }) {
         <Person label="Distributor" name={extra.distributor} url={extra.distributor_url} />
         <Links extra={extra} />
         <Dependencies deps={extra.dependent_packages} />
+        <UsageViews refresh={result}>
+          <UsageFacts id={pkg.id} />
+        </UsageViews>
         {extra.installed_info?.path && (
           <>
             <dt>Installed in</dt>
@@ -258,7 +269,18 @@ export function PackageScreen({ id }: { id: string }) {
           </>
         )}
       </dl>
+      <KeptVersionPanel
+        id={pkg.id}
+        name={pkg.name}
+        onChanged={() => {
+          // Another version is installed: what is offered changes too.
+          setUpgraded((n) => n + 1);
+          void reload();
+        }}
+      />
+      <PackageHold id={pkg.id} name={pkg.name} />
       <Screenshots id={pkg.id} name={pkg.name} version={pkg.version} />
+      <PackageHistory id={pkg.id} changed={result} />
       <Log id={pkg.id} />
     </article>
   );

@@ -5,6 +5,7 @@ import { getSettings, setSettings, settingStepWords, type StoredSettings } from 
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
 import { Field, FormButtons } from '../ui/form';
+import { UpdateWindowSection } from '../ui/update-window';
 import { FeedsSection } from './feeds';
 import { KeyringsSection } from './keyrings';
 import './settings.css';
@@ -57,10 +58,12 @@ export function SettingsScreen() {
       <h1>Settings</h1>
       <nav class="settings-sections" aria-label="Settings sections">
         <a href="#preferences">Preferences</a>
+        <a href="#update-window">Update window</a>
         <a href="#feeds">Feeds</a>
         <a href="#keyring">Code-signing keys</a>
       </nav>
       <PreferencesSection />
+      <UpdateWindowSection />
       <FeedsSection />
       <KeyringsSection />
     </div>

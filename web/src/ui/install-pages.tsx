@@ -32,9 +32,11 @@ import { useState } from 'preact/hooks';
 import type { Api, ApiFailure, Params, Result } from '../api/client';
 import { checkInstall, type InstallValues } from '../api/installation';
 import { explain } from '../api/messages';
+import type { PackagePermissions } from '../api/permissions';
 import { getDefaultVolume } from '../api/setting';
 import { useSession } from '../session';
 import { usePackageNames } from './package-names';
+import { permissionsPage } from './package-permissions';
 import { Steps, type StepPage } from './steps';
 import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from './wizard';
 
@@ -52,6 +54,8 @@ export interface PackageFacts {
   installPages?: unknown;
   // The version this install replaces, for an upgrade.
   replaces?: string;
+  // What it will be allowed to do (ui/package-permissions.tsx).
+  permissions?: PackagePermissions;
 }
 
 export interface InstallChoices {
@@ -61,6 +65,8 @@ export interface InstallChoices {
   // Whether the package starts once installed, where the flow lets the user
   // choose (the summary then asks); undefined where the flow decides.
   startAfter?: boolean;
+  // The administrator allowed a package that asks for root to run as root.
+  rootConfirmed?: boolean;
 }
 
 function isObject(value: unknown): value is Record<string, unknown> {
@@ -237,12 +243,13 @@ export function summaryPage(facts: PackageFacts, choices: InstallChoices, extra:
   };
 }
 
-// Every page of an install, in order: licence, the package's wizard, volume,
-// summary.
+// Every page of an install, in order: what the package may do, licence, the
+// package's wizard, volume, summary.
 export function installPages(facts: PackageFacts, volumes: Volume[], choices: InstallChoices, onChange: Change): StepPage[] {
   const licence = decodeLicence(facts.licence);
   const steps = decodeWizard(facts.installPages);
   return [
+    ...(facts.permissions ? [permissionsPage(facts.name || facts.id, facts.permissions, choices, onChange)] : []),
     ...(licence !== null ? [licencePage(licence, choices, onChange)] : []),
     ...(steps ? wizardPages(steps, choices, onChange) : []),
     volumePage(volumes, choices, onChange),

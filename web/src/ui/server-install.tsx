@@ -15,6 +15,7 @@
 import { useEffect, useRef, useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
 import { cancelTask, checkDownloaded, quickInstall, startedTaskId, type InstallValues } from '../api/installation';
+import { entryPermissions } from '../api/permissions';
 import type { ServerEntry } from '../api/server';
 import { useSession } from '../session';
 import { Dialog } from './dialog';
@@ -87,6 +88,8 @@ export function ServerInstallBody({
         licence: file.data.license,
         installPages: file.data.install_pages,
         replaces: upgradeFrom,
+        // The checked file's own word; the catalogue's when the answer has none.
+        permissions: file.data.permissions ?? entryPermissions(entry),
       };
       const environment = await checkEnvironment<{ volume_path?: string }>(api, facts, {
         id: facts.id,
@@ -113,7 +116,7 @@ export function ServerInstallBody({
     setBusy(true);
     setFailure(null);
     const values = installParams(facts, chosen);
-    const started = await quickInstall(api, entry, values, switchOrigin);
+    const started = await quickInstall(api, entry, values, { switchOrigin });
     setBusy(false);
     if (!started.ok) return setFailure(started.error);
     onClose({ kind: 'started', taskId: startedTaskId(started.data, entry.id), values });

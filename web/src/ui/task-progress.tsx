@@ -20,13 +20,13 @@ const kPollMs = 500;
 
 // How a followed task ended: `done` with its last data; `gone` when it was
 // no longer there (another page read its end first); `failed` with the
-// reason in words (and the package tool's code, when the install refused,
-// with the running package an upgrade would break); `cancelled` by this
-// page.
+// reason in words (and the package tool's code and own words, when the
+// install refused, with the running package an upgrade would break);
+// `cancelled` by this page.
 export type TaskEnd =
   | { kind: 'done'; data: TaskData }
   | { kind: 'gone' }
-  | { kind: 'failed'; text: string; result?: number; dependent?: string }
+  | { kind: 'failed'; text: string; result?: number; dependent?: string; message?: string }
   | { kind: 'cancelled' };
 
 // Words for the download worker's own error codes (not API codes).
@@ -69,7 +69,7 @@ export function taskEnd(data: TaskData): TaskEnd {
   const failure = taskFailure(data);
   if (failure !== null) {
     const error = typeof data.error === 'object' ? data.error : undefined;
-    return { kind: 'failed', text: failure, result: error?.result, dependent: error?.deppkg };
+    return { kind: 'failed', text: failure, result: error?.result, dependent: error?.deppkg, message: error?.message };
   }
   return data.status === undefined ? { kind: 'gone' } : { kind: 'done', data };
 }

@@ -1,9 +1,9 @@
 // The upgrade of an installed package to the version a package server
 // offers, in one dialog from the download to its end, opened from the
 // catalogue, the installed list and the package's page alike: "Upgrade Demo
-// Web from 1.0.0-0001 to 1.1.0-0001", what the new version says about
-// itself, the download, the install wizard (ui/server-install.tsx), the
-// upgrade's progress and how it ended. The work runs in the appliance's
+// Web from 1.0.0-0001 to 1.1.0-0001", the new version's release notes
+// (ui/release-notes.tsx), the download, the install wizard
+// (ui/server-install.tsx), the upgrade's progress and how it ended. The work runs in the appliance's
 // task; closing the dialog leaves it running there.
 //
 // Packages that need this one may run meanwhile: the package tool judges
@@ -24,8 +24,10 @@ import { listCatalogue, markUpgradesSeen, type ServerEntry } from '../api/server
 import { useSession } from '../session';
 import { Dialog } from './dialog';
 import { ErrorText } from './error-text';
+import { ReleaseNotes } from './release-notes';
 import { ServerInstallBody } from './server-install';
 import { TaskProgress, type TaskEnd } from './task-progress';
+import { restoreWords, UpgradeRestored, type RestoreWords } from './upgrade-restored';
 
 // The installed package an upgrade replaces.
 export interface Installed {
@@ -60,6 +62,8 @@ type Stage =
   | { kind: 'upgrading'; taskId: string; values: InstallValues }
   | { kind: 'done'; now: string[] }
   | { kind: 'failed'; text: string; error?: ApiFailure }
+  | { kind: 'restored'; restore: RestoreWords; now: string[] }
+  | { kind: 'noCopyRoom'; text: string; values: InstallValues }
   | { kind: 'blocked'; dependent: Dependent; values: InstallValues; now: string[] }
   | { kind: 'acting'; dependent: Dependent; values: InstallValues }
   | { kind: 'acted'; steps: ActionStep[]; now: string[] };
@@ -149,6 +153,13 @@ export function UpgradeFlow({
         const dependent = await refusingDependent(api, entry, end.dependent);
         return setStage({ kind: 'blocked', dependent, values, now: [await stateNow(api, entry.id, name)] });
       }
+      if (end.kind === 'failed' && end.result === ToolCode.NoRoomForDataCopy) {
+        // The tool's first line says what was short; the rest is its log.
+        return setStage({ kind: 'noCopyRoom', text: (end.message ?? end.text).split('\n')[0], values });
+      }
+      if (end.kind === 'failed' && end.result === ToolCode.UpgradeRolledBack) {
+        return setStage({ kind: 'restored', restore: restoreWords(end.message), now: [await stateNow(api, entry.id, name)] });
+      }
       if (end.kind === 'failed') return setStage({ kind: 'failed', text: end.text });
       // Done, or read to its end by another page: what is installed now says
       // how it went.
@@ -166,8 +177,8 @@ export function UpgradeFlow({
   const title = current ? `Upgrade ${name} from ${current.version} to ${to}` : `Upgrade ${name} to ${to}`;
   return (
     <Dialog title={title} onClose={escape} wide>
-      <ReleaseNotes entry={entry} />
-      {stage.kind !== 'done' && stage.kind !== 'acted' && stage.kind !== 'blocked' && <DependentsNote name={name} dependents={dependents} />}
+      <ReleaseNotes version={to} notes={entry.changelog} description={entry.desc} />
+      {stage.kind !== 'done' && stage.kind !== 'acted' && stage.kind !== 'blocked' && stage.kind !== 'restored' && <DependentsNote name={name} dependents={dependents} />}
       <StageView
         stage={stage}
         entry={entry}
@@ -202,19 +213,6 @@ async function dependentsNow(api: Api, before: Dependent[]): Promise<string[]> {
     g.ok && g.data.additional?.status === 'running' ? before[i].id : '',
   ));
   return before.map((d) => (running.has(d.id) ? `${d.name} still runs.` : `${d.name} does not run now.`));
-}
-
-// What the catalogue says about the new version. Neither a package's INFO
-// nor a catalogue entry has release notes of their own: the new version's
-// description is what it says about itself.
-function ReleaseNotes({ entry }: { entry: ServerEntry }) {
-  if (!entry.desc) return null;
-  return (
-    <section class="release-notes" aria-labelledby="release-notes-title">
-      <h3 id="release-notes-title">About {offeredVersion(entry)}</h3>
-      <p>{entry.desc}</p>
-    </section>
-  );
 }
 
 function DependentsNote({ name, dependents }: { name: string; dependents: Dependent[] }) {
@@ -331,8 +329,18 @@ function StageView({
           <CloseButton onClose={onClose} />
         </>
       );
+    case 'restored':
+      return (
+        <>
+          <UpgradeRestored name={name} to={to} from={from} restore={stage.restore} />
+          <Now lines={stage.now} />
+          <CloseButton onClose={onClose} />
+        </>
+      );
     case 'blocked':
       return <Blocked stage={stage} entry={entry} name={name} onStage={onStage} onClose={onClose} />;
+    case 'noCopyRoom':
+      return <NoCopyRoom stage={stage} entry={entry} name={name} onStage={onStage} onClose={onClose} />;
     case 'acting':
       return <Acting stage={stage} entry={entry} name={name} onStage={onStage} />;
     case 'acted':
@@ -399,6 +407,43 @@ function Blocked({ stage, entry, name, onStage, onClose }: StageProps<'blocked'>
   );
 }
 
+// The volume has no room for the safety copy of the data that the upgrade
+// takes first; nothing was changed. The administrator may upgrade without
+// it, knowing what that gives up.
+function NoCopyRoom({ stage, entry, name, onStage, onClose }: StageProps<'noCopyRoom'> & { onClose: () => void }) {
+  const { api } = useSession();
+  const [error, setError] = useState<ApiFailure | undefined>();
+  const to = offeredVersion(entry);
+  const goOn = async () => {
+    const started = await quickInstall(api, entry, stage.values, { withoutDataCopy: true });
+    if (started.ok) onStage({ kind: 'upgrading', taskId: startedTaskId(started.data, entry.id), values: stage.values });
+    else setError(started.error);
+  };
+  return (
+    <>
+      <div role="alert" class="upgrade-blocked">
+        <p>
+          <strong>{stage.text}</strong>
+        </p>
+      </div>
+      <p class="hint">
+        Before an upgrade the appliance copies {name}&apos;s data, so that a failed upgrade can bring it back. Without the copy, {to} is
+        installed all the same, but if it fails, the data it changed cannot be brought back. Freeing room on the volume (for example by
+        dropping earlier versions kept on the packages&apos; pages) avoids the choice.
+      </p>
+      <ErrorText error={error} />
+      <div class="buttons">
+        <button type="button" onClick={onClose}>
+          Close
+        </button>
+        <button type="button" class="primary" onClick={() => void goOn()}>
+          Upgrade without a safety copy
+        </button>
+      </div>
+    </>
+  );
+}
+
 // The steps of "stop, upgrade, start again" as they go. A step that fails
 // is said with its reason; the dependent is started again whether the
 // upgrade worked or not (it ran before), and the end says what runs now,
@@ -425,7 +470,7 @@ function Acting({ stage, entry, name, onStage }: StageProps<'acting'>) {
     };
     const upgrade = async (): Promise<void> => {
       mark(1, 'running');
-      const started = await quickInstall(api, entry, values, false);
+      const started = await quickInstall(api, entry, values, {});
       if (!started.ok) return mark(1, 'failed', messageFor(started.error, nameOf));
       const ended = new Promise<TaskEnd>((resolve) => (upgradeEnded.current = resolve));
       setTaskId(startedTaskId(started.data, entry.id));

@@ -1,0 +1,139 @@
+// What the packages' control groups cost: a start and a stop of a package
+// through the package tool with its groups against the same package with
+// them turned off (package_cgroups="no"), turn about, and the installed list
+// of 300 packages that each have groups, with their usage
+// (KIVO.Core.Package.Usage list beside the module's list, as the page asks)
+// against the list alone. Medians in ms. Run as root on a kernel with the
+// controllers, or the "with" figures measure nothing.
+//
+//   confine_bench [start/stop rounds] [list rounds]     (default 40, 20)
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <string>
+#include <vector>
+
+#include "bench_setup.h"
+#include "pkgtool/package_cgroup.h"
+#include "pkgtool/package_manager.h"
+#include "pkgtool/registry.h"
+#include "testing/cgi_client.h"
+#include "testing/package_factory.h"
+#include "testing/temp_root.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+double Ms(Clock::time_point since) {
+  return std::chrono::duration<double, std::milli>(Clock::now() - since).count();
+}
+
+double Median(std::vector<double> v) {
+  std::sort(v.begin(), v.end());
+  return v.empty() ? 0 : v[v.size() / 2];
+}
+
+void SetGroups(const TempRoot& root, bool on) {
+  WriteOrExit(root.Path("/etc/kivo/pkgtool.conf"),
+              std::string("package_cgroups=\"") + (on ? "yes" : "no") + "\"\n");
+}
+
+// One start and one stop of `id` through the package tool, in ms.
+double StartStop(const std::string& id) {
+  Clock::time_point t = Clock::now();
+  PackageManager pm;
+  Require(pm.serviceControl(0, id, true, "enu", "root", nullptr, false, false), "start " + id);
+  Require(pm.serviceControl(0, id, false, "enu", "root", nullptr, false, false), "stop " + id);
+  return Ms(t);
+}
+
+void BenchStartStop(int rounds) {
+  TempRoot root;
+  WriteOrExit(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+  const std::string dir = root.Path("/tmp/src");
+  MakeDirOrExit(dir);
+  // A service that ends at once on SIGTERM, so that the stop takes no
+  // time of its own to blur the figures.
+  TestPackage svc;
+  svc.id = "bench-svc";
+  svc.daemon = false;
+  svc.info = {{"pidfile", "daemon.pid"}};
+  svc.scripts = {{"start-stop-status",
+                  "PIDFILE=\"$KIVO_PKG_VAR/daemon.pid\"\n"
+                  "case \"$1\" in\n"
+                  "  start) sleep 1000 >/dev/null 2>&1 </dev/null & echo $! >\"$PIDFILE\" ;;\n"
+                  "  stop) kill \"$(cat \"$PIDFILE\")\"; rm -f \"$PIDFILE\" ;;\n"
+                  "esac\n"}};
+  InstallOrExit(svc.Build(dir));
+  std::vector<double> with, without;
+  for (int i = 0; i < rounds; ++i) {
+    SetGroups(root, true);
+    with.push_back(StartStop("bench-svc"));
+    SetGroups(root, false);
+    without.push_back(StartStop("bench-svc"));
+  }
+  SetGroups(root, true);
+  // What each script start adds in the tool: finding or making the groups,
+  // setting the limits, opening them for the child.
+  std::vector<double> prepare;
+  for (int i = 0; i < rounds; ++i) {
+    Clock::time_point t = Clock::now();
+    const PackageCgroupJoin join = PackageCgroupPrepare("bench-svc", {64, 32});
+    prepare.push_back(Ms(t));
+  }
+  const PackageUsage usage = PackageCgroupUsage("bench-svc");
+  std::string problem;
+  Require(PackageCgroupRemove("bench-svc", &problem), problem);
+  printf(
+      "start+stop, median of %d: with groups %.2f ms, without %.2f ms, "
+      "difference %.2f ms per start+stop; preparing the groups %.3f ms per script%s\n",
+      rounds, Median(with), Median(without), Median(with) - Median(without), Median(prepare),
+      usage.process_limit.measured ? "" : " (groups not applied: no controller or not root)");
+}
+
+void BenchList(int rounds) {
+  TempRoot root;
+  root.AddAccount("admin", "secret", {"administrators"});
+  WriteOrExit(root.Path("/etc/kivoinfo.conf"), "pkg_source_trust_level=\"1\"\n");
+  const std::string dir = root.Path("/tmp/src");
+  MakeDirOrExit(dir);
+  for (int i = 0; i < 300; ++i) {
+    TestPackage p = PackageWithInfo("bench-" + std::to_string(i), {{"description", "Bench"}});
+    InstallOrExit(p.Build(dir));
+    // Groups as a start makes them, so that usage has something to read.
+    const PackageCgroupJoin groups = PackageCgroupPrepare(p.id, {64, 32});
+    if (i == 0 && !groups.missing().empty())
+      printf("groups not applied: %s", groups.missing().c_str());
+  }
+  ApiClient admin("admin", "secret");
+  Require(admin.signed_in(), "sign-in");
+  std::vector<double> alone, both;
+  for (int i = 0; i < rounds; ++i) {
+    Clock::time_point t = Clock::now();
+    Require(admin.Call("KIVO.Core.Package", "list", 1).Success(), "list");
+    alone.push_back(Ms(t));
+    t = Clock::now();
+    Require(admin.Call("KIVO.Core.Package", "list", 1).Success(), "list");
+    Require(admin.Call("KIVO.Core.Package.Usage", "list", 1).Success(), "usage");
+    both.push_back(Ms(t));
+  }
+  for (const std::string& id : PackageRegistry::List()) {
+    std::string problem;
+    Require(PackageCgroupRemove(id, &problem), problem);
+  }
+  printf("list of 300, median of %d: list %.1f ms, list + usage %.1f ms, ratio %.2f\n", rounds,
+         Median(alone), Median(both), Median(both) / Median(alone));
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const int rounds = argc > 1 ? std::max(1, atoi(argv[1])) : 40;
+  const int list_rounds = argc > 2 ? std::max(1, atoi(argv[2])) : 20;
+  UseBuildDirOfThisProgram();
+  BenchStartStop(rounds);
+  BenchList(list_rounds);
+  return 0;
+}

@@ -1,0 +1,641 @@
+#include "pkgtool/package_cgroup.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cinttypes>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <dirent.h>
+#include <fcntl.h>
+#include <set>
+#include <sstream>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "klibc/atomic_file.h"
+#include "klibc/sysroot.h"
+#include "pkgtool/registry.h"
+
+#include <time.h>
+
+namespace {
+
+constexpr char kDefaultParent[] = "kivo-packages";
+constexpr int kInfoLimitMax = 1048576;  // what INFO may say at all, whatever the appliance
+
+// One controller's group of a package: which controller, whether it lives
+// in the unified hierarchy, and its folder.
+struct Group {
+  std::string what;  // "memory", "pids" or "cpu"
+  bool v2 = false;
+  std::string dir;
+};
+
+// A mounted cgroup hierarchy as /proc/self/mountinfo shows it.
+struct Hierarchy {
+  bool v2 = false;
+  std::string root;   // the hierarchy path the mount shows ("/" mostly)
+  std::string point;  // where it is mounted
+  std::string options;
+};
+
+KeyValueMap ToolConf() {
+  KeyValueMap conf;
+  // A missing settings file means every built-in value.
+  static_cast<void>(KIVOKeyValueLoad(KIVORootPath("/etc/kivo/pkgtool.conf"), &conf));
+  return conf;
+}
+
+// A whole number from 1 to `max` written as plain digits, else -1.
+long WholeNumber(const std::string& text, long max) {
+  if (text.empty() || text.size() > 9 || text.find_first_not_of("0123456789") != std::string::npos)
+    return -1;
+  long value = std::strtol(text.c_str(), nullptr, 10);
+  return value >= 1 && value <= max ? value : -1;
+}
+
+int Setting(const KeyValueMap& conf, const char* key, int def) {
+  auto it = conf.find(key);
+  long value = it == conf.end() ? -1 : WholeNumber(it->second, kInfoLimitMax);
+  return value > 0 ? static_cast<int>(value) : def;
+}
+
+// A folder name: 1 to 64 of [A-Za-z0-9._-], not starting with a dot.
+bool IsGroupName(const std::string& name) {
+  if (name.empty() || name.size() > 64 || name[0] == '.') return false;
+  return name.find_first_not_of(
+             "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789._-") ==
+         std::string::npos;
+}
+
+std::string ParentName(const KeyValueMap& conf) {
+  auto it = conf.find("cgroup_parent");
+  return it != conf.end() && IsGroupName(it->second) ? it->second : kDefaultParent;
+}
+
+// "system" for the appliance's own root, else a name derived from the root's
+// path (64-bit FNV-1a), the same for every caller of the same root.
+std::string RootName(const std::string& root) {
+  if (root.empty()) return "system";
+  uint64_t hash = 1469598103934665603ULL;
+  for (unsigned char c : root) hash = (hash ^ c) * 1099511628211ULL;
+  char text[32];
+  snprintf(text, sizeof(text), "root-%016" PRIx64, hash);
+  return text;
+}
+
+std::vector<std::string> Fields(const std::string& line) {
+  std::vector<std::string> fields;
+  std::istringstream in(line);
+  std::string f;
+  while (in >> f) fields.push_back(f);
+  return fields;
+}
+
+std::vector<Hierarchy> Hierarchies() {
+  std::vector<Hierarchy> out;
+  std::string text;
+  if (!KIVOReadFile("/proc/self/mountinfo", &text, 1 << 20)) return out;
+  std::istringstream in(text);
+  std::string line;
+  while (std::getline(in, line)) {
+    std::vector<std::string> f = Fields(line);
+    size_t dash = 0;
+    while (dash < f.size() && f[dash] != "-") ++dash;
+    if (dash < 5 || dash + 3 >= f.size()) continue;
+    const std::string& type = f[dash + 1];
+    if (type != "cgroup" && type != "cgroup2") continue;
+    out.push_back({type == "cgroup2", f[3], f[4], "," + f[dash + 3] + ","});
+  }
+  return out;
+}
+
+// The tool's own group in the v1 hierarchy of `controller` ("" for the
+// unified one), from /proc/self/cgroup.
+std::string OwnGroup(const std::string& text, const std::string& controller) {
+  std::istringstream in(text);
+  std::string line;
+  while (std::getline(in, line)) {
+    size_t a = line.find(':'), b = line.find(':', a + 1);
+    if (a == std::string::npos || b == std::string::npos) continue;
+    const std::string names = "," + line.substr(a + 1, b - a - 1) + ",";
+    if (controller.empty() ? names == ",,"
+                           : names.find("," + controller + ",") != std::string::npos)
+      return line.substr(b + 1);
+  }
+  return "/";
+}
+
+// Where the group `path` of hierarchy `h` is in the file system.
+std::string FolderOf(const Hierarchy& h, const std::string& path) {
+  std::string rel = path;
+  if (h.root != "/" && rel.compare(0, h.root.size(), h.root) == 0) rel = rel.substr(h.root.size());
+  if (rel == "/") rel.clear();
+  return h.point + rel;
+}
+
+// What every step of one call reads once: the settings, the mounted
+// hierarchies and the tool's own groups.
+struct Env {
+  std::string root;       // the system root ("" for "/")
+  std::string tail_base;  // "/<cgroup_parent>/<root name>"
+  bool off = false;       // package_cgroups="no"
+  std::vector<Hierarchy> all;
+  std::string own;  // /proc/self/cgroup
+};
+
+Env LoadEnv(const std::string& root = KIVOSysRoot()) {
+  Env env;
+  const KeyValueMap conf = ToolConf();
+  env.root = root;
+  env.tail_base = "/" + ParentName(conf) + "/" + RootName(root);
+  auto it = conf.find("package_cgroups");
+  env.off = it != conf.end() && it->second == "no";
+  env.all = Hierarchies();
+  if (!KIVOReadFile("/proc/self/cgroup", &env.own, 1 << 16)) env.own.clear();
+  return env;
+}
+
+// "<cgroup_parent>/<root>/pkg-<id>": the part of a group's path that is ours.
+std::string OwnTail(const Env& env, const std::string& id) { return env.tail_base + "/pkg-" + id; }
+
+const Hierarchy* FindV1(const std::vector<Hierarchy>& all, const std::string& controller) {
+  for (const Hierarchy& h : all) {
+    if (!h.v2 && h.options.find("," + controller + ",") != std::string::npos) return &h;
+  }
+  return nullptr;
+}
+
+// The unified hierarchy when it offers the memory controller to the tool's
+// group (a system on cgroup v2); else nullptr and the v1 hierarchies count.
+const Hierarchy* UnifiedWithMemory(const Env& env) {
+  for (const Hierarchy& h : env.all) {
+    if (!h.v2) continue;
+    std::string controllers;
+    if (KIVOReadFile(FolderOf(h, OwnGroup(env.own, "")) + "/cgroup.controllers", &controllers,
+                     4096) &&
+        (" " + controllers).find(" memory") != std::string::npos) {
+      return &h;
+    }
+  }
+  return nullptr;
+}
+
+// Where the groups of `id` would be made by this caller, with what is
+// missing ("<what>: <reason>" lines).
+std::vector<Group> PlannedGroups(const Env& env, const std::string& id, std::string* missing) {
+  const std::string tail = OwnTail(env, id);
+  std::vector<Group> groups;
+  if (const Hierarchy* v2 = UnifiedWithMemory(env)) {
+    const std::string dir = FolderOf(*v2, OwnGroup(env.own, "")) + tail;
+    for (const char* what : {"memory", "pids", "cpu"}) groups.push_back({what, true, dir});
+    return groups;
+  }
+  const std::pair<const char*, const char*> wanted[] = {
+      {"memory", "memory"}, {"pids", "pids"}, {"cpu", "cpuacct"}};
+  for (const auto& w : wanted) {
+    const Hierarchy* h = FindV1(env.all, w.second);
+    if (h) {
+      groups.push_back({w.first, false, FolderOf(*h, OwnGroup(env.own, w.second)) + tail});
+    } else {
+      *missing += std::string(w.first) + ": the kernel offers no " + w.second + " controller\n";
+    }
+  }
+  return groups;
+}
+
+std::string RecordsDir(const std::string& root = KIVOSysRoot()) {
+  return root + "/run/kivo/pkgtool/cgroups";
+}
+
+std::string RecordPath(const std::string& id, const std::string& root = KIVOSysRoot()) {
+  return RecordsDir(root) + "/" + id;
+}
+
+// True when `dir` may be a group of `id`: under a mounted cgroup hierarchy
+// of the right kind, ending in our own tail, without "." or ".." steps.
+bool IsGroupDir(const Env& env, const Group& g, const std::string& id) {
+  const std::string tail = OwnTail(env, id);
+  if (g.dir.size() <= tail.size() || g.dir.compare(g.dir.size() - tail.size(), tail.size(), tail))
+    return false;
+  if (g.dir.find("/./") != std::string::npos || g.dir.find("/../") != std::string::npos)
+    return false;
+  const std::string controller = g.what == "cpu" ? "cpuacct" : g.what;
+  for (const Hierarchy& h : env.all) {
+    const bool fits =
+        h.v2 ? g.v2 : !g.v2 && h.options.find("," + controller + ",") != std::string::npos;
+    if (fits && PMSIsStrictlyInside(g.dir, h.point)) return true;
+  }
+  return false;
+}
+
+// The groups recorded for `id` ("<what> v1|v2 <dir>" lines), each checked
+// whole; none when the record is missing or any line is not valid.
+std::vector<Group> RecordedGroups(const Env& env, const std::string& id) {
+  std::vector<Group> groups;
+  std::string text;
+  if (!KIVOReadFile(RecordPath(id, env.root), &text, 1 << 14)) return groups;
+  std::istringstream in(text);
+  std::string line;
+  while (std::getline(in, line)) {
+    std::vector<std::string> f = Fields(line);
+    if (f.size() != 3 || (f[1] != "v1" && f[1] != "v2")) return {};
+    Group g{f[0], f[1] == "v2", f[2]};
+    if ((g.what != "memory" && g.what != "pids" && g.what != "cpu") || !IsGroupDir(env, g, id))
+      return {};
+    groups.push_back(g);
+  }
+  return groups;
+}
+
+[[nodiscard]] bool WriteRecord(const std::string& id, const std::vector<Group>& groups) {
+  std::string text;
+  for (const Group& g : groups) text += g.what + (g.v2 ? " v2 " : " v1 ") + g.dir + "\n";
+  const std::string path = RecordPath(id);
+  return KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str(), 0700) == 0 &&
+         KIVOWriteFileAtomic(path, text, SyncToDisk::No, 0600);
+}
+
+[[nodiscard]] bool WriteValue(const std::string& file, const std::string& value) {
+  int fd = open(file.c_str(), O_WRONLY | O_CLOEXEC);
+  if (fd < 0) return false;
+  bool ok = write(fd, value.data(), value.size()) == static_cast<ssize_t>(value.size());
+  close(fd);
+  return ok;
+}
+
+std::string ErrnoText() { return strerror(errno); }
+
+// In the unified hierarchy a controller reaches a group only when every
+// group above it hands it down: enables memory and pids from `top` (the
+// tool's group) down to the package's group.
+bool HandDown(const std::string& top, const std::string& dir, std::string* missing) {
+  std::string at = top;
+  size_t pos = top.size();
+  while (pos < dir.size()) {
+    for (const char* c : {"+memory", "+pids"}) {
+      if (!WriteValue(at + "/cgroup.subtree_control", c)) {
+        *missing += std::string(c + 1) + ": " + at + " does not hand the controller down (" +
+                    ErrnoText() + ")\n";
+        return false;
+      }
+    }
+    pos = dir.find('/', pos + 1);
+    if (pos == std::string::npos) pos = dir.size();
+    at = dir.substr(0, pos);
+  }
+  return true;
+}
+
+// Makes the group folder, trying again once when a removal of an emptied
+// parent raced with us.
+bool MakeGroupDir(const std::string& dir) {
+  for (int attempt = 0; attempt < 2; ++attempt) {
+    if (KIVOFSMkdirP(dir.c_str(), 0755) == 0) return true;
+  }
+  return false;
+}
+
+// Sets `limits` on the package's group `g`; false with `missing` when the
+// controller refused.
+bool SetLimit(const Group& g, const PackageLimits& limits, std::string* missing) {
+  const std::string bytes = std::to_string(static_cast<uint64_t>(limits.memory_mb) << 20);
+  bool ok = true;
+  if (g.what == "pids") {
+    ok = WriteValue(g.dir + "/pids.max", std::to_string(limits.processes));
+  } else if (g.what == "memory" && g.v2) {
+    ok = WriteValue(g.dir + "/memory.max", bytes);
+    // Swap would let a package past its bound; a whole group dies together.
+    if (ok && access((g.dir + "/memory.swap.max").c_str(), F_OK) == 0)
+      ok = WriteValue(g.dir + "/memory.swap.max", "0");
+    if (ok) static_cast<void>(WriteValue(g.dir + "/memory.oom.group", "1"));
+  } else if (g.what == "memory") {
+    // memory+swap may never be below memory alone: when the bound grows,
+    // the first write fails and succeeds after the second.
+    const std::string memsw = g.dir + "/memory.memsw.limit_in_bytes";
+    const bool has_memsw = access(memsw.c_str(), F_OK) == 0;
+    ok = WriteValue(g.dir + "/memory.limit_in_bytes", bytes);
+    if (has_memsw)
+      ok = WriteValue(memsw, bytes) && (ok || WriteValue(g.dir + "/memory.limit_in_bytes", bytes));
+  }
+  if (!ok) *missing += g.what + ": the limit could not be set (" + ErrnoText() + ")\n";
+  return ok;
+}
+
+// The groups to use for `id`: those recorded when they still exist
+// (*recorded true), else new ones where this caller runs.
+std::vector<Group> GroupsFor(const Env& env, const std::string& id, std::string* missing,
+                             bool* recorded = nullptr) {
+  // The administrator's switch (package-tool.md): no groups, and every
+  // figure says so.
+  if (env.off) {
+    for (const char* what : {"memory", "pids", "cpu"})
+      *missing += std::string(what) + ": turned off (package_cgroups in pkgtool.conf)\n";
+    return {};
+  }
+  std::vector<Group> groups = RecordedGroups(env, id);
+  bool all_there = !groups.empty();
+  for (const Group& g : groups) all_there = all_there && access(g.dir.c_str(), F_OK) == 0;
+  if (recorded) *recorded = all_there;
+  if (all_there) return groups;
+  return PlannedGroups(env, id, missing);
+}
+
+const Group* FindGroup(const std::vector<Group>& groups, const std::string& what) {
+  for (const Group& g : groups) {
+    if (g.what == what) return &g;
+  }
+  return nullptr;
+}
+
+bool ReadNumber(const std::string& file, uint64_t* value) {
+  std::string text;
+  if (!KIVOReadFile(file, &text, 256) || text.empty()) return false;
+  char* end = nullptr;
+  errno = 0;
+  unsigned long long v = std::strtoull(text.c_str(), &end, 10);
+  if (errno != 0 || end == text.c_str()) return false;
+  *value = v;
+  return true;
+}
+
+// "usage_usec <n>" of a unified group's cpu.stat, in nanoseconds.
+bool ReadCpuStat(const std::string& dir, uint64_t* ns) {
+  std::string text;
+  if (!KIVOReadFile(dir + "/cpu.stat", &text, 4096)) return false;
+  std::istringstream in(text);
+  std::string key;
+  unsigned long long value = 0;
+  while (in >> key >> value) {
+    if (key == "usage_usec") {
+      *ns = value * 1000ULL;
+      return true;
+    }
+  }
+  return false;
+}
+
+UsageFigure Figure(const std::vector<Group>& groups, const std::string& what,
+                   const std::string& missing, bool (*read)(const Group&, uint64_t*)) {
+  UsageFigure f;
+  const Group* g = FindGroup(groups, what);
+  if (!g) {
+    size_t at = missing.find(what + ": ");
+    f.reason =
+        at == std::string::npos
+            ? "no " + what + " controller"
+            : missing.substr(at + what.size() + 2, missing.find('\n', at) - at - what.size() - 2);
+  } else if (access(g->dir.c_str(), F_OK) != 0) {
+    f.reason = "the package has not run since the appliance started";
+  } else if (!read(*g, &f.value)) {
+    f.reason = "its control group cannot be read";
+  } else {
+    f.measured = true;
+  }
+  return f;
+}
+
+bool ReadCpu(const Group& g, uint64_t* v) {
+  return g.v2 ? ReadCpuStat(g.dir, v) : ReadNumber(g.dir + "/cpuacct.usage", v);
+}
+bool ReadMemory(const Group& g, uint64_t* v) {
+  return ReadNumber(g.dir + (g.v2 ? "/memory.current" : "/memory.usage_in_bytes"), v);
+}
+bool ReadMemoryLimit(const Group& g, uint64_t* v) {
+  return ReadNumber(g.dir + (g.v2 ? "/memory.max" : "/memory.limit_in_bytes"), v);
+}
+bool ReadProcessLimit(const Group& g, uint64_t* v) { return ReadNumber(g.dir + "/pids.max", v); }
+
+// Kills every process of the group at `dir` until none is left or about
+// two seconds have passed, then removes the folder.
+bool EmptyAndRemove(const std::string& dir) {
+  if (access(dir.c_str(), F_OK) != 0) return true;
+  // cgroup.kill (unified hierarchy, Linux 5.14) kills the group at once.
+  static_cast<void>(WriteValue(dir + "/cgroup.kill", "1"));
+  for (int round = 0; round < 200; ++round) {
+    if (rmdir(dir.c_str()) == 0 || errno == ENOENT) return true;
+    std::string procs;
+    if (KIVOReadFile(dir + "/cgroup.procs", &procs, 1 << 20)) {
+      std::istringstream in(procs);
+      long pid = 0;
+      while (in >> pid) {
+        if (pid > 0) kill(static_cast<pid_t>(pid), SIGKILL);
+      }
+    }
+    struct timespec pause = {0, 10 * 1000 * 1000};
+    nanosleep(&pause, nullptr);
+  }
+  return false;
+}
+
+}  // namespace
+
+PackageLimitSettings PackageLimitSettingsLoad() {
+  const KeyValueMap conf = ToolConf();
+  PackageLimitSettings s;
+  s.memory_mb_max = Setting(conf, "memory_limit_mb_max", s.memory_mb_max);
+  s.memory_mb_default =
+      std::min(Setting(conf, "memory_limit_mb_default", s.memory_mb_default), s.memory_mb_max);
+  s.processes_max = Setting(conf, "process_limit_max", s.processes_max);
+  s.processes_default =
+      std::min(Setting(conf, "process_limit_default", s.processes_default), s.processes_max);
+  return s;
+}
+
+std::string PackageLimitsInfoProblem(const KeyValueMap& info) {
+  for (const char* key : {"memory_limit_mb", "process_limit"}) {
+    auto it = info.find(key);
+    if (it != info.end() && WholeNumber(it->second, kInfoLimitMax) < 0)
+      return std::string(key) + ": must be a whole number from 1 to " +
+             std::to_string(kInfoLimitMax);
+  }
+  return "";
+}
+
+std::string PackageLimitsCheck(const KeyValueMap& info, const PackageLimitSettings& settings,
+                               PackageLimits* limits) {
+  struct Key {
+    const char* name;
+    int def, max;
+    int* out;
+  };
+  const Key keys[] = {
+      {"memory_limit_mb", settings.memory_mb_default, settings.memory_mb_max, &limits->memory_mb},
+      {"process_limit", settings.processes_default, settings.processes_max, &limits->processes}};
+  std::string problem;
+  for (const Key& k : keys) {
+    auto it = info.find(k.name);
+    long own = it == info.end() ? -1 : WholeNumber(it->second, kInfoLimitMax);
+    *k.out = own > 0 ? static_cast<int>(std::min<long>(own, k.max)) : k.def;
+    if (own > k.max && problem.empty()) {
+      problem = std::string(k.name) + ": " + it->second + " is above this appliance's bound of " +
+                std::to_string(k.max);
+    }
+  }
+  return problem;
+}
+
+PackageCgroupJoin::~PackageCgroupJoin() {
+  for (int i = 0; i < count_; ++i) close(fds_[i]);
+}
+
+PackageCgroupJoin::PackageCgroupJoin(PackageCgroupJoin&& other) noexcept {
+  *this = std::move(other);
+}
+
+PackageCgroupJoin& PackageCgroupJoin::operator=(PackageCgroupJoin&& other) noexcept {
+  if (this == &other) return *this;
+  for (int i = 0; i < count_; ++i) close(fds_[i]);
+  count_ = other.count_;
+  for (int i = 0; i < kMaxGroups; ++i) fds_[i] = other.fds_[i];
+  missing_ = std::move(other.missing_);
+  other.count_ = 0;
+  return *this;
+}
+
+bool PackageCgroupJoin::JoinInChild() const noexcept {
+  for (int i = 0; i < count_; ++i) {
+    // "0" is the writing process itself, in both hierarchies.
+    if (write(fds_[i], "0", 1) != 1) return false;
+  }
+  return true;
+}
+
+PackageCgroupJoin PackageCgroupPrepare(const std::string& id, const PackageLimits& limits) {
+  PackageCgroupJoin join;
+  if (!PMSIsValidPackageId(id)) {
+    join.missing_ = "control group: not a package id\n";
+    return join;
+  }
+  const Env env = LoadEnv();
+  bool recorded = false;
+  std::vector<Group> groups = GroupsFor(env, id, &join.missing_, &recorded);
+  std::vector<Group> used;
+  for (const Group& g : groups) {
+    const bool first_in_dir =
+        !FindGroup(used, g.what) && (used.empty() || used.back().dir != g.dir);
+    if (!recorded && !MakeGroupDir(g.dir)) {
+      join.missing_ += g.what + ": cannot make " + g.dir + " (" + ErrnoText() + ")\n";
+      continue;
+    }
+    if (g.v2 && g.what == "memory" &&
+        !HandDown(g.dir.substr(0, g.dir.size() - OwnTail(env, id).size()), g.dir, &join.missing_)) {
+      continue;
+    }
+    if (!SetLimit(g, limits, &join.missing_)) continue;
+    used.push_back(g);
+    if (!first_in_dir || join.count_ == PackageCgroupJoin::kMaxGroups) continue;
+    int fd = open((g.dir + "/cgroup.procs").c_str(), O_WRONLY | O_CLOEXEC);
+    if (fd < 0) {
+      join.missing_ += g.what + ": cannot open the group (" + ErrnoText() + ")\n";
+      used.pop_back();
+      continue;
+    }
+    join.fds_[join.count_++] = fd;
+  }
+  if (!recorded && !used.empty() && !WriteRecord(id, used))
+    join.missing_ += "control group: cannot record where the groups are\n";
+  return join;
+}
+
+PackageCgroupJoin PackageCgroupPrepareForScript(const std::string& script, int note_fd) {
+  const size_t at = script.rfind("/scripts/");
+  KeyValueMap info;
+  PackageCgroupJoin join;
+  if (at == std::string::npos || !KIVOKeyValueLoad(script.substr(0, at) + "/INFO", &info)) {
+    if (note_fd >= 0) dprintf(note_fd, "control group: not a package's script, none joined\n");
+    return join;
+  }
+  PackageLimits limits;
+  const std::string above = PackageLimitsCheck(info, PackageLimitSettingsLoad(), &limits);
+  join = PackageCgroupPrepare(info["package"], limits);
+  if (note_fd < 0) return join;
+  if (!above.empty()) dprintf(note_fd, "%s: lowered to the bound\n", above.c_str());
+  if (!join.missing().empty()) dprintf(note_fd, "not applied: %s", join.missing().c_str());
+  return join;
+}
+
+bool PackageCgroupRemove(const std::string& id, std::string* problem) {
+  if (!PMSIsValidPackageId(id)) return true;
+  // Whatever the switch says now: groups made earlier go with the package.
+  const Env env = LoadEnv();
+  std::string missing;
+  std::vector<Group> groups = RecordedGroups(env, id);
+  if (groups.empty()) groups = PlannedGroups(env, id, &missing);
+  bool ok = true;
+  for (const Group& g : groups) {
+    if (!EmptyAndRemove(g.dir)) {
+      *problem += "cannot remove " + g.dir + " (" + ErrnoText() + ")\n";
+      ok = false;
+      continue;
+    }
+    // The root's folder goes with its last package; one still in use stays.
+    rmdir(g.dir.substr(0, g.dir.rfind('/')).c_str());
+  }
+  if (ok) unlink(RecordPath(id).c_str());
+  return ok;
+}
+
+namespace {
+
+PackageUsage UsageIn(const Env& env, const std::string& id) {
+  PackageUsage usage;
+  std::string missing;
+  std::vector<Group> groups =
+      PMSIsValidPackageId(id) ? GroupsFor(env, id, &missing) : std::vector<Group>();
+  usage.cpu_ns = Figure(groups, "cpu", missing, ReadCpu);
+  usage.memory_bytes = Figure(groups, "memory", missing, ReadMemory);
+  usage.memory_limit_bytes = Figure(groups, "memory", missing, ReadMemoryLimit);
+  usage.process_limit = Figure(groups, "pids", missing, ReadProcessLimit);
+  return usage;
+}
+
+}  // namespace
+
+PackageUsage PackageCgroupUsage(const std::string& id) { return UsageIn(LoadEnv(), id); }
+
+std::vector<PackageUsage> PackageCgroupUsages(const std::vector<std::string>& ids) {
+  const Env env = LoadEnv();
+  std::vector<PackageUsage> all;
+  all.reserve(ids.size());
+  for (const std::string& id : ids) all.push_back(UsageIn(env, id));
+  return all;
+}
+
+bool PackageCgroupRemoveRoot(const std::string& root, std::string* problem) {
+  // The folders that hold the root's groups: where its records say, and
+  // where a caller in this group would make them.
+  std::set<std::string> folders;
+  const Env env = LoadEnv(root);
+  DIR* records = opendir(RecordsDir(root).c_str());
+  while (records) {
+    struct dirent* e = readdir(records);
+    if (!e) break;
+    if (!PMSIsValidPackageId(e->d_name)) continue;
+    for (const Group& g : RecordedGroups(env, e->d_name))
+      folders.insert(g.dir.substr(0, g.dir.rfind('/')));
+  }
+  if (records) closedir(records);
+  std::string missing;
+  for (const Group& g : PlannedGroups(env, "x", &missing))
+    folders.insert(g.dir.substr(0, g.dir.rfind('/')));
+  bool ok = true;
+  for (const std::string& folder : folders) {
+    DIR* d = opendir(folder.c_str());
+    while (d) {
+      struct dirent* e = readdir(d);
+      if (!e) break;
+      const std::string name = e->d_name;
+      if (name.compare(0, 4, "pkg-") != 0 || !PMSIsValidPackageId(name.substr(4))) continue;
+      if (!EmptyAndRemove(folder + "/" + name)) {
+        *problem += "cannot remove " + folder + "/" + name + " (" + ErrnoText() + ")\n";
+        ok = false;
+      }
+    }
+    if (d) closedir(d);
+    rmdir(folder.c_str());
+  }
+  return ok;
+}

@@ -1,0 +1,92 @@
+// Who a package's scripts (and the service they start) run as, and what they
+// may reach. Prepared here before the fork; entered in the child between
+// fork and exec by script_runner.cc, the one place that applies it.
+//
+// A package runs as its own account (package_account.h) with no
+// supplementary groups and PR_SET_NO_NEW_PRIVS, in a Landlock domain that
+// allows reading and executing the machine's system folders (/usr, /bin,
+// /sbin, /lib*, a fixed list of /etc files; never the system root's own
+// etc, var/packages, keyring or sessions), reading its record (scripts,
+// INFO) and payload, reading and writing its data folder, its temporary
+// folder (<root>/tmp/kivo-package/<id>, $TMPDIR) and this operation's
+// message and wizard files, and nothing else. Where the kernel's Landlock
+// offers scoping (ABI 6), the script may neither signal nor reach an
+// abstract unix socket outside its own domain; `start-stop-status stop`
+// and `status` are left out of the signal scope, since they must signal the
+// service that `start` left in a domain of its own (they still run as the
+// package's account, which signals only its own processes).
+//
+// A package whose INFO says run_as_root="yes", and every package while
+// "package_confinement" of etc/kivo/pkgtool.conf is "off", runs as root,
+// unconfined.
+//
+// What was applied and what not is written to the record's "confinement"
+// (var/packages/<id>/confinement), JSON:
+//   {"user": "pkg-demo", "uid": 30000, "gid": 30000, "root": false,
+//    "landlock_abi": 7,
+//    "applied": ["user", "no_new_privs", "landlock_filesystem",
+//                "landlock_scope_signal", "landlock_scope_abstract_unix_socket"],
+//    "missing": [{"what": "...", "reason": "..."}]}
+// and, when it changed or something is missing, to the script's log.
+#pragma once
+
+#include <map>
+#include <string>
+#include <sys/types.h>
+
+#include <json/value.h>
+
+// The name of the record's confinement file.
+inline constexpr char kPMSConfinementFile[] = "confinement";
+
+class PackageConfinement {
+ public:
+  PackageConfinement() = default;
+  ~PackageConfinement();
+  PackageConfinement(PackageConfinement&& other) noexcept;
+  PackageConfinement& operator=(PackageConfinement&& other) noexcept;
+  PackageConfinement(const PackageConfinement&) = delete;
+  PackageConfinement& operator=(const PackageConfinement&) = delete;
+
+  // What the child takes on, read by script_runner.cc (and nothing else):
+  bool drop_user = false;  // become uid:gid with no supplementary groups
+  uid_t uid = 0;
+  gid_t gid = 0;
+  bool no_new_privs = false;
+  int landlock_ruleset = -1;  // a Landlock ruleset to restrict the child with, or -1
+  std::string tmpdir;         // $TMPDIR for the script, "" for none
+
+  // The record described above.
+  const Json::Value& report() const { return report_; }
+
+ private:
+  friend PackageConfinement PackageConfinementPrepareForScript(
+      const std::string& script, const std::string& arg,
+      const std::map<std::string, std::string>& env, int note_fd);
+  Json::Value report_;
+};
+
+// For a package script "<record>/scripts/<name>" run with `arg` and `env`:
+// the record's INFO names the package. Writes the record's confinement file
+// when it changed, and a line to `note_fd` (the script's log, when >= 0)
+// when it changed or something is missing. A script outside a record gets
+// no confinement, and the report says so.
+[[nodiscard]] PackageConfinement PackageConfinementPrepareForScript(
+    const std::string& script, const std::string& arg,
+    const std::map<std::string, std::string>& env, int note_fd);
+
+// For the changing operations (install, upgrade, start, `kivoctl confine`):
+// finds or creates the account of `id` (package_account.h), gives the
+// package's data folder to it, makes the record, payload and data folder of
+// `record` reachable (PMSMakeReachable), and writes the record's
+// confinement file, saying so in the operation log `log_path` ("" for none)
+// when it changed. PKG_OK or the account's result code, with `*error`.
+[[nodiscard]] int PMSSettlePackageAccount(const std::string& id, const std::string& record,
+                                          const std::string& log_path, std::string* error);
+
+// At uninstall, after the package's folders were removed: what stays of its
+// data folder `data` (a removal that failed) is given to root, the
+// package's temporary folder is removed, and then its account. False (with
+// `*error`) when something could not be done.
+[[nodiscard]] bool PMSRetirePackageAccount(const std::string& id, const std::string& data,
+                                           std::string* error);

@@ -1,0 +1,24 @@
+// "KIVO.Core.Package.Usage" (docs/http-api.md): what each installed package
+// uses now, read from its control group, and the limits it has. A figure the
+// appliance could not read comes with the reason instead of a number.
+
+import type { Api, Result } from './client';
+
+const kUsage = 'KIVO.Core.Package.Usage';
+
+export type UsageFigure = { measured: true; value: number } | { measured: false; reason: string };
+
+export interface PackageUsage {
+  id: string;
+  cpu_ns: UsageFigure;
+  memory_bytes: UsageFigure;
+  memory_limit_bytes: UsageFigure;
+  process_limit: UsageFigure;
+}
+
+// Every installed package's usage, by id.
+export async function packageUsages(api: Api): Promise<Result<Map<string, PackageUsage>>> {
+  const answer = await api.call<{ packages: PackageUsage[] }>(kUsage, 'list', 1);
+  if (!answer.ok) return answer;
+  return { ok: true, data: new Map(answer.data.packages.map((p) => [p.id, p])) };
+}
