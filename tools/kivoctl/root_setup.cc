@@ -58,8 +58,22 @@ const DefaultFile kFiles[] = {
      "smb=\"running\"\n",
      0644},
     {"etc/kivo/pkgtool.conf",
-     "# Package tool settings: seconds a package script may run.\n"
-     "script_timeout=\"120\"\n",
+     "# Package tool settings (docs/package-tool.md), here with their defaults.\n"
+     "# Seconds a package script may run.\n"
+     "script_timeout=\"120\"\n"
+     "# The health gate of an upgrade: seconds to report running, and for scripts/health.\n"
+     "health_grace_seconds=\"30\"\n"
+     "health_check_timeout_seconds=\"10\"\n"
+     "# Earlier versions an upgrade keeps, with their data, for a rollback.\n"
+     "keep_revisions=\"1\"\n"
+     "# The accounts packages run as.\n"
+     "package_uid_first=\"30000\"\n"
+     "package_uid_last=\"39999\"\n"
+     "# Memory (MiB) and process limits of a package, and the most one may ask for.\n"
+     "memory_limit_mb_default=\"512\"\n"
+     "memory_limit_mb_max=\"4096\"\n"
+     "process_limit_default=\"256\"\n"
+     "process_limit_max=\"4096\"\n",
      0644},
     {"etc/kivo/webapi.conf",
      "# Web API host settings.\n"
