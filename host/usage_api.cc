@@ -3,6 +3,7 @@
 #include <string>
 
 #include "pkgtool/package_cgroup.h"
+#include "pkgtool/package_confinement.h"
 #include "pkgtool/registry.h"
 #include "webapi/api_codes.h"
 
@@ -26,6 +27,11 @@ Json::Value UsageJson(const std::string& id, const PackageUsage& usage) {
   out["memory_bytes"] = FigureJson(usage.memory_bytes);
   out["memory_limit_bytes"] = FigureJson(usage.memory_limit_bytes);
   out["process_limit"] = FigureJson(usage.process_limit);
+  // The record as the package's scripts last wrote it; null when there is
+  // none yet, which the page shows as not confined yet.
+  Json::Value confinement;
+  if (!PMSLoadConfinement(id, &confinement)) confinement = Json::Value(Json::nullValue);
+  out["confinement"] = confinement;
   return out;
 }
 

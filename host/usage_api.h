@@ -5,9 +5,11 @@
 //   get   one package, parameter "id": <usage>
 //
 // <usage> is {"id", "cpu_ns", "memory_bytes", "memory_limit_bytes",
-// "process_limit"}, each figure {"measured": true, "value": <number>} or
-// {"measured": false, "reason": <text>}: a figure the kernel cannot give
-// (no controller, the package has not run since the start) is never 0.
+// "process_limit", "confinement"}, each figure {"measured": true, "value":
+// <number>} or {"measured": false, "reason": <text>}: a figure the kernel
+// cannot give (no controller, the package has not run since the start) is
+// never 0. "confinement" is the package's confinement record as its scripts
+// last wrote it (pkgtool/package_confinement.h), or null when it has none.
 // Reading changes nothing, so it is not recorded in the activity log.
 #pragma once
 

@@ -24,6 +24,8 @@ constexpr ToolCodeMapping kControlErrors[] = {
     {PKG_ERR_BUSY, kErrBusy},
     {PKG_ERR_NO_VOLUME, kErrNoVolume},
     {PKG_ERR_VOLUME_CRASHED, kErrVolumeUnusable},
+    {PKG_ERR_NO_ACCOUNT_ID, kErrNoAccountId},
+    {PKG_ERR_ACCOUNT_FILES, kErrAccountFiles},
 };
 
 // The package tool's operation type for a start or stop.

@@ -70,6 +70,10 @@ enum ApiError : int {
   kErrLimitAboveBound = 4615,
   // a package that asks to run as root, not signed by a key of the appliance keyring
   kErrRootNotTrusted = 4620,
+  // no free id for the package's own account in pkgtool.conf's range
+  kErrNoAccountId = 4645,
+  // the appliance's account files cannot be read, locked or written
+  kErrAccountFiles = 4646,
 };
 
 // One row of a table that maps a code of something the module calls onto

@@ -86,6 +86,8 @@ constexpr ToolCodeMapping kInstallErrors[] = {
     {PKG_ERR_LIMIT_ABOVE_BOUND, kErrLimitAboveBound},
     {PKG_ERR_NO_ROOM_FOR_DATA_COPY, kErrNoRoomForDataCopy},
     {PKG_ERR_DATA_NOT_COPYABLE, kErrDataNotCopyable},
+    {PKG_ERR_NO_ACCOUNT_ID, kErrNoAccountId},
+    {PKG_ERR_ACCOUNT_FILES, kErrAccountFiles},
 };
 
 bool IsCodesignCode(int code) {

@@ -6,6 +6,7 @@
 
 #include "pkgtool/package_cgroup.h"
 
+#include <algorithm>
 #include <dirent.h>
 #include <signal.h>
 #include <sstream>
@@ -161,6 +162,31 @@ TEST_F(PackageCgroupTest, MemoryHogIsKilledInsideItsGroupAndTheRestKeepsWorking)
   EXPECT_GE(kills, 1) << "not killed by its group's memory bound";
 
   ExpectApplianceAndOtherPackageWork("calm");
+}
+
+// The script is in every group of its package before its first command:
+// the service that command starts is in each of them, whatever way the tool
+// joins the groups (on v1 thread by thread, and the whole process moves).
+TEST_F(PackageCgroupTest, ScriptAndItsServiceAreInEveryGroupFromTheFirstCommand) {
+  const char script[] =
+      "PIDFILE=\"$KIVO_PKG_VAR/daemon.pid\"\n"
+      "case \"$1\" in\n"
+      "  start) sleep 60 >/dev/null 2>&1 </dev/null & echo $! >\"$PIDFILE\" ;;\n"
+      "  stop) kill \"$(cat \"$PIDFILE\")\"; rm -f \"$PIDFILE\" ;;\n"
+      "  status) [ -f \"$PIDFILE\" ] && kill -0 \"$(cat \"$PIDFILE\")\" 2>/dev/null ;;\n"
+      "esac\n";
+  ASSERT_EQ(0, Install(Service("placed", script, {}))) << out_;
+  SKIP_UNLESS_CONFINABLE("placed");
+  const std::vector<std::string> dirs = GroupDirs("placed");
+  ASSERT_FALSE(dirs.empty());
+  const pid_t service = ServicePid("placed");
+  ASSERT_GT(service, 0);
+  for (const std::string& dir : dirs) {
+    std::istringstream procs(FileText(dir + "/cgroup.procs"));
+    std::vector<pid_t> in;
+    for (long pid = 0; procs >> pid;) in.push_back(static_cast<pid_t>(pid));
+    EXPECT_NE(in.end(), std::find(in.begin(), in.end(), service)) << dir;
+  }
 }
 
 TEST_F(PackageCgroupTest, ForkBombStopsAtTheProcessLimit) {

@@ -1,14 +1,16 @@
 // Packages run as accounts of their own, confined with Landlock: hostile
 // packages built by the project's tool try to reach what is not theirs on a
-// temporary root, and the tool's accounts, records and logs say what was
-// applied. Needs root (to change users) and a kernel with Landlock; skips
-// with the reason otherwise.
+// temporary root (its files, another package's port), and the tool's
+// accounts, records and logs, and the web API, say what was applied. Needs
+// root (to change users) and a kernel with Landlock; skips with the reason
+// otherwise.
 
 #include <algorithm>
 #include <chrono>
 #include <grp.h>
 #include <pwd.h>
 #include <set>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <thread>
@@ -21,11 +23,14 @@
 #include "pkgtool/package_account.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
+#include "testing/admin_api_test.h"
 #include "testing/gpg_keys.h"
 #include "testing/package_factory.h"
 #include "testing/temp_root.h"
 
+#include <arpa/inet.h>
 #include <linux/landlock.h>
+#include <netinet/in.h>
 
 namespace {
 
@@ -116,7 +121,77 @@ std::vector<std::string> LinesEndingIn(const std::string& report, const std::str
   return names;
 }
 
-class ConfinementTest : public ::testing::Test {
+// A service that listens on 127.0.0.1:<port> (0: any free port, written to
+// <var>/port) and answers each connection with its name; started by
+// `serve.py PORT VAR NAME`, it returns once it listens (or could not).
+const char kServePy[] =
+    "import errno, os, socket, sys\n"
+    "port, var, name = int(sys.argv[1]), sys.argv[2], sys.argv[3]\n"
+    "log = open(os.path.join(var, 'service.log'), 'a')\n"
+    "s = socket.socket(socket.AF_INET, socket.SOCK_STREAM)\n"
+    "try:\n"
+    "    s.bind(('127.0.0.1', port))\n"
+    "    s.listen(16)\n"
+    "except OSError as e:\n"
+    "    msg = '%s: cannot bind 127.0.0.1:%d: %s (%s)' % (name, port, os.strerror(e.errno),\n"
+    "                                                  errno.errorcode.get(e.errno, '?'))\n"
+    "    log.write(msg + '\\n')\n"
+    "    log.close()\n"
+    "    print(msg, file=sys.stderr)\n"
+    "    sys.exit(1)\n"
+    "bound = s.getsockname()[1]\n"
+    "log.write('%s: listening on 127.0.0.1:%d\\n' % (name, bound))\n"
+    "log.flush()\n"
+    "with open(os.path.join(var, 'port.tmp'), 'w') as f:\n"
+    "    f.write(str(bound))\n"
+    "os.rename(os.path.join(var, 'port.tmp'), os.path.join(var, 'port'))\n"
+    "pid = os.fork()\n"
+    "if pid > 0:\n"
+    "    with open(os.path.join(var, 'daemon.pid'), 'w') as f:\n"
+    "        f.write(str(pid))\n"
+    "    os._exit(0)\n"
+    "os.setsid()\n"
+    "null = os.open(os.devnull, os.O_RDWR)\n"
+    "for fd in (0, 1, 2):\n"
+    "    os.dup2(null, fd)\n"
+    "while True:\n"
+    "    c, _ = s.accept()\n"
+    "    c.sendall((name + '\\n').encode())\n"
+    "    c.close()\n";
+
+// Starts serve.py on the port its install was given (wizard value "port",
+// none: any free port).
+const char kServeStartStop[] =
+    "PIDFILE=\"$KIVO_PKG_VAR/daemon.pid\"\n"
+    "running() { [ -f \"$PIDFILE\" ] && kill -0 \"$(cat \"$PIDFILE\")\" 2>/dev/null; }\n"
+    "case \"$1\" in\n"
+    "  start) running && exit 0\n"
+    "    port=$(cat \"$KIVO_PKG_VAR/wanted-port\" 2>/dev/null || echo 0)\n"
+    "    exec /usr/bin/python3 \"$KIVO_PKG_DEST/bin/serve.py\" \"$port\" \"$KIVO_PKG_VAR\" "
+    "\"$KIVO_PKG_NAME\" ;;\n"
+    "  stop) running && kill \"$(cat \"$PIDFILE\")\"; rm -f \"$PIDFILE\" ;;\n"
+    "  status) running ;;\n"
+    "esac\n";
+
+// The first line a TCP server on 127.0.0.1:`port` answers, "" when none
+// answers.
+std::string FirstLineAt(int port) {
+  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) return "";
+  struct sockaddr_in addr = {};
+  addr.sin_family = AF_INET;
+  addr.sin_port = htons(static_cast<uint16_t>(port));
+  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  std::string line;
+  if (connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) == 0) {
+    char c;
+    while (read(fd, &c, 1) == 1 && c != '\n') line += c;
+  }
+  close(fd);
+  return line;
+}
+
+class ConfinementTest : public AdminApiTest {
  protected:
   void SetUp() override {
     missing_ = MissingForConfinement();
@@ -177,7 +252,6 @@ class ConfinementTest : public ::testing::Test {
   }
 
   std::string missing_;
-  TempRoot root_;
   std::string dir_;
   std::string out_;
 };
@@ -394,6 +468,98 @@ TEST_F(ConfinementTest, PackageDeclaringRootRunsAsRootAndSaysSo) {
   EXPECT_EQ("the package declares run_as_root", record["missing"][0]["reason"].asString());
   EXPECT_NE(std::string::npos, out_.find("not applied: user (the package declares run_as_root)"))
       << out_;
+}
+
+TEST_F(ConfinementTest, ServiceBindingAnotherPackagesPortFailsAndTheOtherKeepsIt) {
+  if (access("/usr/bin/python3", X_OK) != 0) GTEST_SKIP() << "skipped: needs /usr/bin/python3";
+  TestPackage holder;
+  holder.id = "holder";
+  holder.daemon = false;
+  holder.info = {{"pidfile", "daemon.pid"}, {"displayname", "holder"}};
+  holder.files = {{"bin/serve.py", kServePy}};
+  holder.scripts = {{"start-stop-status", kServeStartStop}};
+  ASSERT_EQ(0, Kivoctl({"install", Build(holder), "--run"}, &out_)) << out_;
+  const std::string port = FileText(root_.Path("/volume1/@appdata/holder/port"));
+  ASSERT_FALSE(port.empty()) << out_;
+  ASSERT_EQ("holder", FirstLineAt(std::stoi(port)));
+
+  // The squatter is given the holder's port and tries to take it.
+  TestPackage squatter = holder;
+  squatter.id = "squatter";
+  squatter.info["displayname"] = "squatter";
+  squatter.scripts["postinst"] = "echo \"$KIVO_WIZARD_port\" > \"$KIVO_PKG_VAR/wanted-port\"\n";
+  Json::Value wizard;
+  wizard["port"] = port;
+  ASSERT_EQ(0, Kivoctl({"install", Build(squatter), "--wizard", KIVOWriteJson(wizard)}, &out_))
+      << out_;
+  EXPECT_NE(0, Kivoctl({"start", "squatter"}, &out_)) << out_;
+  const std::string refusal =
+      "squatter: cannot bind 127.0.0.1:" + port + ": Address already in use (EADDRINUSE)";
+  EXPECT_NE(std::string::npos, out_.find(refusal)) << out_;
+  EXPECT_NE(std::string::npos,
+            FileText(root_.Path("/volume1/@appdata/squatter/service.log")).find(refusal));
+  // It ran confined, as its own user, and still could not take the port.
+  EXPECT_EQ("pkg-squatter", Confinement("squatter")["user"].asString());
+
+  // The appliance keeps answering, and the holder keeps its port.
+  CgiAnswer list = client().Call("KIVO.Core.Package.Usage", "list", 1);
+  ASSERT_TRUE(list.Success()) << list.body;
+  EXPECT_EQ(2u, list.Data()["total"].asUInt()) << list.body;
+  std::string status;
+  Kivoctl({"status", "holder"}, &status);
+  EXPECT_EQ("holder 1.0 running\n", status);
+  Kivoctl({"status", "squatter"}, &status);
+  EXPECT_EQ("squatter 1.0 stopped\n", status);
+  EXPECT_EQ("holder", FirstLineAt(std::stoi(port)));
+  EXPECT_EQ(0, Kivoctl({"stop", "holder"}, &out_)) << out_;
+}
+
+TEST_F(ConfinementTest, ControlGroupsThatWereNotMadeAreInTheRecordAndTheUsage) {
+  // The administrator's switch: no package gets control groups.
+  root_.Write("/etc/kivo/pkgtool.conf", "package_cgroups=\"no\"\n");
+  TestPackage app;
+  app.id = "ungrouped";
+  ASSERT_EQ(0, Kivoctl({"install", Build(app), "--run"}, &out_)) << out_;
+  const Json::Value record = Confinement("ungrouped");
+  std::set<std::string> missing;
+  for (const Json::Value& m : record["missing"]) {
+    if (m["what"].asString().rfind("cgroup", 0) != 0) continue;
+    missing.insert(m["what"].asString());
+    EXPECT_EQ("turned off (package_cgroups in pkgtool.conf)", m["reason"].asString());
+  }
+  EXPECT_EQ((std::set<std::string>{"cgroup_cpu", "cgroup_memory", "cgroup_pids"}), missing)
+      << KIVOWriteJson(record);
+  EXPECT_EQ("partly", record["state"].asString()) << KIVOWriteJson(record);
+  EXPECT_EQ("pkg-ungrouped", record["user"].asString());
+  // The log says it once per run, with the rest of the confinement.
+  EXPECT_NE(std::string::npos,
+            out_.find("cgroup_memory (turned off (package_cgroups in pkgtool.conf))"))
+      << out_;
+
+  // The web API carries the record as it is.
+  CgiAnswer got = client().Call("KIVO.Core.Package.Usage", "get", 1, {{"id", "ungrouped"}});
+  ASSERT_TRUE(got.Success()) << got.body;
+  EXPECT_EQ(record, got.Data()["confinement"]) << got.body;
+
+  // With the groups back, the next start makes them and the record says so.
+  root_.Write("/etc/kivo/pkgtool.conf", "");
+  ASSERT_EQ(0, Kivoctl({"stop", "ungrouped"}, &out_)) << out_;
+  ASSERT_EQ(0, Kivoctl({"start", "ungrouped"}, &out_)) << out_;
+  for (const Json::Value& m : Confinement("ungrouped")["missing"]) {
+    EXPECT_NE("turned off (package_cgroups in pkgtool.conf)", m["reason"].asString());
+  }
+}
+
+TEST_F(ConfinementTest, UsageOfAPackageWithoutARecordSaysNull) {
+  TestPackage old;
+  old.id = "unrecorded";
+  old.daemon = false;
+  ASSERT_EQ(0, Kivoctl({"install", Build(old)}, &out_)) << out_;
+  ForgetAccount("unrecorded");
+  CgiAnswer got = client().Call("KIVO.Core.Package.Usage", "get", 1, {{"id", "unrecorded"}});
+  ASSERT_TRUE(got.Success()) << got.body;
+  EXPECT_TRUE(got.Data().isMember("confinement")) << got.body;
+  EXPECT_TRUE(got.Data()["confinement"].isNull()) << got.body;
 }
 
 }  // namespace

@@ -144,7 +144,13 @@ struct Env {
   bool off = false;       // package_cgroups="no"
   std::vector<Hierarchy> all;
   std::string own;  // /proc/self/cgroup
+  // The unified hierarchy when it offers the memory controller to the
+  // tool's group (a system on cgroup v2), else -1: an index into `all`,
+  // found once per call rather than once per package.
+  int unified_with_memory = -1;
 };
+
+int FindUnifiedWithMemory(const Env& env);
 
 Env LoadEnv(const std::string& root = KIVOSysRoot()) {
   Env env;
@@ -155,6 +161,7 @@ Env LoadEnv(const std::string& root = KIVOSysRoot()) {
   env.off = it != conf.end() && it->second == "no";
   env.all = Hierarchies();
   if (!KIVOReadFile("/proc/self/cgroup", &env.own, 1 << 16)) env.own.clear();
+  env.unified_with_memory = FindUnifiedWithMemory(env);
   return env;
 }
 
@@ -170,17 +177,22 @@ const Hierarchy* FindV1(const std::vector<Hierarchy>& all, const std::string& co
 
 // The unified hierarchy when it offers the memory controller to the tool's
 // group (a system on cgroup v2); else nullptr and the v1 hierarchies count.
-const Hierarchy* UnifiedWithMemory(const Env& env) {
-  for (const Hierarchy& h : env.all) {
+int FindUnifiedWithMemory(const Env& env) {
+  for (size_t i = 0; i < env.all.size(); ++i) {
+    const Hierarchy& h = env.all[i];
     if (!h.v2) continue;
     std::string controllers;
     if (KIVOReadFile(FolderOf(h, OwnGroup(env.own, "")) + "/cgroup.controllers", &controllers,
                      4096) &&
         (" " + controllers).find(" memory") != std::string::npos) {
-      return &h;
+      return static_cast<int>(i);
     }
   }
-  return nullptr;
+  return -1;
+}
+
+const Hierarchy* UnifiedWithMemory(const Env& env) {
+  return env.unified_with_memory < 0 ? nullptr : &env.all[env.unified_with_memory];
 }
 
 // Where the groups of `id` would be made by this caller, with what is
@@ -289,6 +301,15 @@ bool HandDown(const std::string& top, const std::string& dir, std::string* missi
   return true;
 }
 
+// The file the child writes "0" into to join `g`. On v1 that is "tasks",
+// which moves the writing thread alone: the child between fork and exec has
+// one thread, so that is the whole process, and the kernel spares a thread's
+// move the lock over every thread group that a move through "cgroup.procs"
+// takes, whose first writer waits for an RCU grace period (8 to 25 ms per
+// script on a busy two-core machine). The unified hierarchy moves only whole
+// processes between its groups: "cgroup.procs".
+const char* JoinFile(const Group& g) { return g.v2 ? "/cgroup.procs" : "/tasks"; }
+
 // Makes the group folder, trying again once when a removal of an emptied
 // parent raced with us.
 bool MakeGroupDir(const std::string& dir) {
@@ -324,6 +345,13 @@ bool SetLimit(const Group& g, const PackageLimits& limits, std::string* missing)
   return ok;
 }
 
+const Group* FindGroup(const std::vector<Group>& groups, const std::string& what) {
+  for (const Group& g : groups) {
+    if (g.what == what) return &g;
+  }
+  return nullptr;
+}
+
 // The groups to use for `id`: those recorded when they still exist
 // (*recorded true), else new ones where this caller runs.
 std::vector<Group> GroupsFor(const Env& env, const std::string& id, std::string* missing,
@@ -339,24 +367,50 @@ std::vector<Group> GroupsFor(const Env& env, const std::string& id, std::string*
   bool all_there = !groups.empty();
   for (const Group& g : groups) all_there = all_there && access(g.dir.c_str(), F_OK) == 0;
   if (recorded) *recorded = all_there;
-  if (all_there) return groups;
-  return PlannedGroups(env, id, missing);
-}
-
-const Group* FindGroup(const std::vector<Group>& groups, const std::string& what) {
-  for (const Group& g : groups) {
-    if (g.what == what) return &g;
+  if (!all_there) return PlannedGroups(env, id, missing);
+  // A controller left out when the groups were made stays out until they
+  // are made again (after a restart): say so at every run, not just the
+  // first, with the kernel's reason where there is one.
+  std::string planned;
+  static_cast<void>(PlannedGroups(env, id, &planned));
+  for (const char* what : {"memory", "pids", "cpu"}) {
+    if (FindGroup(groups, what)) continue;
+    const size_t at = planned.find(std::string(what) + ": ");
+    *missing += at != std::string::npos
+                    ? planned.substr(at, planned.find('\n', at) + 1 - at)
+                    : std::string(what) +
+                          ": left out when its groups were made, at its first run since the "
+                          "appliance started\n";
   }
-  return nullptr;
+  return groups;
 }
 
+// A control file's number. A usage list reads hundreds of these: plain
+// open and read, without the size check of a general file read (a control
+// file says 4096 whatever it holds), and done at the newline that ends the
+// value, which the kernel writes with it in one piece.
 bool ReadNumber(const std::string& file, uint64_t* value) {
-  std::string text;
-  if (!KIVOReadFile(file, &text, 256) || text.empty()) return false;
+  int fd = open(file.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return false;
+  char text[64];
+  size_t size = 0;
+  while (size < sizeof(text) - 1) {
+    ssize_t n = read(fd, text + size, sizeof(text) - 1 - size);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) {
+      if (n < 0) size = 0;
+      break;
+    }
+    size += static_cast<size_t>(n);
+    if (text[size - 1] == '\n') break;
+  }
+  close(fd);
+  text[size] = '\0';
+  if (size == 0 || size == sizeof(text) - 1) return false;
   char* end = nullptr;
   errno = 0;
-  unsigned long long v = std::strtoull(text.c_str(), &end, 10);
-  if (errno != 0 || end == text.c_str()) return false;
+  unsigned long long v = std::strtoull(text, &end, 10);
+  if (errno != 0 || end == text) return false;
   *value = v;
   return true;
 }
@@ -387,12 +441,14 @@ UsageFigure Figure(const std::vector<Group>& groups, const std::string& what,
         at == std::string::npos
             ? "no " + what + " controller"
             : missing.substr(at + what.size() + 2, missing.find('\n', at) - at - what.size() - 2);
-  } else if (access(g->dir.c_str(), F_OK) != 0) {
-    f.reason = "the package has not run since the appliance started";
-  } else if (!read(*g, &f.value)) {
-    f.reason = "its control group cannot be read";
-  } else {
+  } else if (read(*g, &f.value)) {
     f.measured = true;
+  } else {
+    // Why there is no figure is asked only when there is none: the list
+    // reads four figures of every package.
+    f.reason = access(g->dir.c_str(), F_OK) != 0
+                   ? "the package has not run since the appliance started"
+                   : "its control group cannot be read";
   }
   return f;
 }
@@ -527,7 +583,7 @@ PackageCgroupJoin PackageCgroupPrepare(const std::string& id, const PackageLimit
     if (!SetLimit(g, limits, &join.missing_)) continue;
     used.push_back(g);
     if (!first_in_dir || join.count_ == PackageCgroupJoin::kMaxGroups) continue;
-    int fd = open((g.dir + "/cgroup.procs").c_str(), O_WRONLY | O_CLOEXEC);
+    int fd = open((g.dir + JoinFile(g)).c_str(), O_WRONLY | O_CLOEXEC);
     if (fd < 0) {
       join.missing_ += g.what + ": cannot open the group (" + ErrnoText() + ")\n";
       used.pop_back();
@@ -538,6 +594,13 @@ PackageCgroupJoin PackageCgroupPrepare(const std::string& id, const PackageLimit
   if (!recorded && !used.empty() && !WriteRecord(id, used))
     join.missing_ += "control group: cannot record where the groups are\n";
   return join;
+}
+
+std::string PackageCgroupPlannedMissing(const std::string& id) {
+  if (!PMSIsValidPackageId(id)) return "control group: not a package id\n";
+  std::string missing;
+  static_cast<void>(GroupsFor(LoadEnv(), id, &missing));
+  return missing;
 }
 
 PackageCgroupJoin PackageCgroupPrepareForScript(const std::string& script, int note_fd) {
@@ -552,8 +615,9 @@ PackageCgroupJoin PackageCgroupPrepareForScript(const std::string& script, int n
   const std::string above = PackageLimitsCheck(info, PackageLimitSettingsLoad(), &limits);
   join = PackageCgroupPrepare(info["package"], limits);
   if (note_fd < 0) return join;
+  // What is missing is logged with the rest of the confinement, by
+  // PackageConfinementPrepareForScript, which also records it.
   if (!above.empty()) dprintf(note_fd, "%s: lowered to the bound\n", above.c_str());
-  if (!join.missing().empty()) dprintf(note_fd, "not applied: %s", join.missing().c_str());
   return join;
 }
 
@@ -580,8 +644,32 @@ bool PackageCgroupRemove(const std::string& id, std::string* problem) {
 
 namespace {
 
+// The usage of `id` when its record names a group for every controller
+// and each of them answers: what a package that ran has, read without
+// checking the groups first (a figure read is proof enough that its group
+// is there). False when anything is missing: GroupsFor then says why.
+bool MeasuredInRecordedGroups(const Env& env, const std::string& id, PackageUsage* usage) {
+  if (env.off) return false;
+  const std::vector<Group> groups = RecordedGroups(env, id);
+  const Group* cpu = FindGroup(groups, "cpu");
+  const Group* memory = FindGroup(groups, "memory");
+  const Group* pids = FindGroup(groups, "pids");
+  if (!cpu || !memory || !pids) return false;
+  const std::pair<const Group*, bool (*)(const Group&, uint64_t*)> reads[] = {
+      {cpu, ReadCpu}, {memory, ReadMemory}, {memory, ReadMemoryLimit}, {pids, ReadProcessLimit}};
+  UsageFigure* figures[] = {&usage->cpu_ns, &usage->memory_bytes, &usage->memory_limit_bytes,
+                            &usage->process_limit};
+  for (size_t i = 0; i < 4; ++i) {
+    if (!reads[i].second(*reads[i].first, &figures[i]->value)) return false;
+    figures[i]->measured = true;
+  }
+  return true;
+}
+
 PackageUsage UsageIn(const Env& env, const std::string& id) {
   PackageUsage usage;
+  if (PMSIsValidPackageId(id) && MeasuredInRecordedGroups(env, id, &usage)) return usage;
+  usage = PackageUsage();  // a figure or two may have been read
   std::string missing;
   std::vector<Group> groups =
       PMSIsValidPackageId(id) ? GroupsFor(env, id, &missing) : std::vector<Group>();

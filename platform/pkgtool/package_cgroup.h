@@ -58,8 +58,9 @@ std::string PackageLimitsCheck(const KeyValueMap& info, const PackageLimitSettin
                                PackageLimits* limits);
 
 // What the child of a fork needs to join a package's groups: descriptors of
-// the groups' "cgroup.procs", opened before the fork, so that joining takes
-// nothing but write(2). Empty when nothing could be prepared.
+// the groups' "cgroup.procs" (v2) or "tasks" (v1), opened before the fork,
+// so that joining takes nothing but write(2). Empty when nothing could be
+// prepared.
 class PackageCgroupJoin {
  public:
   PackageCgroupJoin() = default;
@@ -70,7 +71,8 @@ class PackageCgroupJoin {
   PackageCgroupJoin& operator=(const PackageCgroupJoin&) = delete;
 
   // Moves the calling process into every prepared group. Only for the child
-  // between fork and exec (async-signal-safe, allocates nothing). False when
+  // between fork and exec, while it has a single thread (a v1 group is
+  // joined thread by thread); async-signal-safe, allocates nothing. False when
   // a group refused it: the caller must not run the script then, since it
   // would run without the bounds this object promised.
   [[nodiscard]] bool JoinInChild() const noexcept;
@@ -92,9 +94,17 @@ class PackageCgroupJoin {
 [[nodiscard]] PackageCgroupJoin PackageCgroupPrepare(const std::string& id,
                                                      const PackageLimits& limits);
 
+// What PackageCgroupPrepare would leave out for `id`, in missing()'s form,
+// found without making or changing any group: controllers the kernel lacks
+// or the administrator turned off, and those left out when the groups were
+// made.
+std::string PackageCgroupPlannedMissing(const std::string& id);
+
 // For a script of a package record ("<record>/scripts/<name>"): the record's
-// INFO names the package and its limits. Writes what could not be applied
-// to `note_fd` (the script's log) when it is >= 0.
+// INFO names the package and its limits. Writes to `note_fd` (the script's
+// log, when >= 0) a limit of INFO lowered to its bound; what could not be
+// prepared is missing() and PackageConfinementPrepareForScript records and
+// logs it.
 [[nodiscard]] PackageCgroupJoin PackageCgroupPrepareForScript(const std::string& script,
                                                               int note_fd);
 

@@ -20,6 +20,7 @@
 #include "klibc/sysroot.h"
 #include "pkgtool/lifecycle.h"
 #include "pkgtool/package_account.h"
+#include "pkgtool/package_cgroup.h"
 #include "pkgtool/pms.h"
 #include "pkgtool/registry.h"
 #include "pkgtool/result_codes.h"
@@ -294,7 +295,8 @@ void PrepareLandlock(const OwnFolders& own, bool scope_signals,
 }
 
 // The report of a package that runs as root, unconfined, for `reason`.
-void Unconfined(const std::string& reason, Json::Value* report) {
+void Unconfined(const std::string& reason, const char* state, Json::Value* report) {
+  (*report)["state"] = state;
   (*report)["user"] = "root";
   (*report)["uid"] = 0;
   (*report)["gid"] = 0;
@@ -303,6 +305,30 @@ void Unconfined(const std::string& reason, Json::Value* report) {
                            "landlock_scope_abstract_unix_socket"}) {
     Missing(report, what, reason);
   }
+}
+
+// Names in the report each control group that is missing: `text` has
+// lines "<controller>: <reason>" (package_cgroup.h), or "control group:
+// <reason>" for what concerns them all.
+void AddGroupsMissing(const std::string& text, Json::Value* report) {
+  size_t start = 0;
+  while (start < text.size()) {
+    size_t end = text.find('\n', start);
+    if (end == std::string::npos) end = text.size();
+    const std::string line = text.substr(start, end - start);
+    start = end + 1;
+    const size_t colon = line.find(": ");
+    if (colon == std::string::npos) continue;
+    const std::string controller = line.substr(0, colon);
+    const bool one = controller == "memory" || controller == "pids" || controller == "cpu";
+    Missing(report, one ? "cgroup_" + controller : "cgroup", line.substr(colon + 2));
+  }
+}
+
+// The state of a confined package's report (package_confinement.h).
+const char* ConfinedState(const Json::Value& report, bool has_account) {
+  if (!has_account) return "no_account";
+  return report["missing"].empty() ? "confined" : "partly";
 }
 
 // Writes the report into the record when it changed; logs it to `note_fd`
@@ -367,6 +393,7 @@ PackageConfinement& PackageConfinement::operator=(PackageConfinement&& other) no
 PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
                                                       const std::string& arg,
                                                       const std::map<std::string, std::string>& env,
+                                                      const std::string& groups_missing,
                                                       int note_fd) {
   PackageConfinement c;
   Json::Value& report = c.report_;
@@ -376,7 +403,7 @@ PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
   KeyValueMap info;
   if (record.empty() || !KIVOKeyValueLoad(record + "/INFO", &info) ||
       !PMSIsValidPackageId(info["package"])) {
-    Unconfined("not a script of an installed package", &report);
+    Unconfined("not a script of an installed package", "partly", &report);
     return c;
   }
   const std::string id = info["package"];
@@ -384,7 +411,8 @@ PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
   if (asks_for_root || ConfinementTurnedOff()) {
     Unconfined(asks_for_root ? "the package declares run_as_root"
                              : "package_confinement is off in etc/kivo/pkgtool.conf",
-               &report);
+               asks_for_root ? "root" : "turned_off", &report);
+    AddGroupsMissing(groups_missing, &report);
     Publish(record, id, report, note_fd);
     return c;
   }
@@ -417,6 +445,8 @@ PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
                                 script.compare(script.size() - 18, 18, "/start-stop-status") == 0 &&
                                 (arg == "stop" || arg == "status");
   PrepareLandlock(FoldersOf(record), !controls_service, env, owner, &c, &report);
+  AddGroupsMissing(groups_missing, &report);
+  report["state"] = ConfinedState(report, has_account);
   Publish(record, id, report, note_fd);
   return c;
 }
@@ -437,9 +467,11 @@ int PMSSettlePackageAccount(const std::string& id, const std::string& record,
     return PKG_ERR_INTERNAL;
   }
   // Written now, so the record says who the package is from its install on.
+  // What its control groups lack is known without making them (they are
+  // made when a script first runs).
   const int log = log_path.empty() ? -1 : open(log_path.c_str(), O_WRONLY | O_APPEND | O_CLOEXEC);
-  PackageConfinement prepared =
-      PackageConfinementPrepareForScript(record + "/scripts/start-stop-status", "", {}, log);
+  PackageConfinement prepared = PackageConfinementPrepareForScript(
+      record + "/scripts/start-stop-status", "", {}, PackageCgroupPlannedMissing(id), log);
   if (log >= 0) close(log);
   return PKG_OK;
 }
@@ -460,4 +492,11 @@ bool PMSRetirePackageAccount(const std::string& id, const std::string& data, std
     ok = false;
   }
   return ok;
+}
+
+bool PMSLoadConfinement(const std::string& id, Json::Value* record) {
+  if (!PMSIsValidPackageId(id)) return false;
+  std::string text;
+  return KIVOReadFile(PackageRegistry::RecordDir(id) + "/" + kPMSConfinementFile, &text, 1 << 16) &&
+         KIVOParseJson(text, record) && record->isObject();
 }

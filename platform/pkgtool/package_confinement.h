@@ -26,8 +26,18 @@
 //    "landlock_abi": 7,
 //    "applied": ["user", "no_new_privs", "landlock_filesystem",
 //                "landlock_scope_signal", "landlock_scope_abstract_unix_socket"],
-//    "missing": [{"what": "...", "reason": "..."}]}
-// and, when it changed or something is missing, to the script's log.
+//    "missing": [{"what": "...", "reason": "..."}],
+//    "state": "confined"}
+// and, when it changed or something is missing, to the script's log (the
+// one place that logs what was not applied). "missing" also names each
+// control group (package_cgroup.h) that could not be made or joined:
+// "cgroup_memory", "cgroup_pids", "cgroup_cpu", or "cgroup" for all of them.
+// "state" sums it up for the page:
+//   "confined"     its own user, and nothing is missing
+//   "partly"       something is missing (each named in "missing")
+//   "no_account"   no account yet: it gets one at its next start or upgrade
+//   "root"         it runs as root, unconfined, because INFO asks to
+//   "turned_off"   it runs as root, unconfined: package_confinement is off
 #pragma once
 
 #include <map>
@@ -62,18 +72,26 @@ class PackageConfinement {
  private:
   friend PackageConfinement PackageConfinementPrepareForScript(
       const std::string& script, const std::string& arg,
-      const std::map<std::string, std::string>& env, int note_fd);
+      const std::map<std::string, std::string>& env, const std::string& groups_missing,
+      int note_fd);
   Json::Value report_;
 };
 
 // For a package script "<record>/scripts/<name>" run with `arg` and `env`:
 // the record's INFO names the package. Writes the record's confinement file
 // when it changed, and a line to `note_fd` (the script's log, when >= 0)
-// when it changed or something is missing. A script outside a record gets
-// no confinement, and the report says so.
+// when it changed or something is missing. `groups_missing` is what the
+// package's control groups lack (PackageCgroupJoin::missing() of the same
+// script's, package_cgroup.h): it goes into the record. A script outside a
+// record gets no confinement, and the report says so.
 [[nodiscard]] PackageConfinement PackageConfinementPrepareForScript(
     const std::string& script, const std::string& arg,
-    const std::map<std::string, std::string>& env, int note_fd);
+    const std::map<std::string, std::string>& env, const std::string& groups_missing, int note_fd);
+
+// The confinement record of installed package `id` (valid: registry.h), as
+// its scripts last wrote it. False when there is none (a package installed
+// before packages had accounts, not started since) or it cannot be read.
+[[nodiscard]] bool PMSLoadConfinement(const std::string& id, Json::Value* record);
 
 // For the changing operations (install, upgrade, start, `kivoctl confine`):
 // finds or creates the account of `id` (package_account.h), gives the

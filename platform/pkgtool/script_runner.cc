@@ -95,7 +95,8 @@ bool IsScript(const std::string& script) {
 pid_t StartScript(const std::string& script, const std::string& arg,
                   const std::map<std::string, std::string>& env, int out) {
   const PackageCgroupJoin group = PackageCgroupPrepareForScript(script, out);
-  const PackageConfinement confinement = PackageConfinementPrepareForScript(script, arg, env, out);
+  const PackageConfinement confinement =
+      PackageConfinementPrepareForScript(script, arg, env, group.missing(), out);
   std::map<std::string, std::string> all = env;
   if (!confinement.tmpdir.empty()) all["TMPDIR"] = confinement.tmpdir;
   std::vector<std::string> vars;

@@ -1,7 +1,7 @@
 // What a package will be allowed to do, shown before the install: a package
 // that runs as its own user says so with its limits and signer; one that
 // asks to run as root, signed by the appliance's own publisher, must be
-// confirmed in words before the wizard goes on; one that asks for root but
+// confirmed in words before Install can be pressed; one that asks for root but
 // is signed only by a feed's key is refused when its download is checked.
 
 import { test } from 'node:test';
@@ -31,33 +31,33 @@ test('a package that runs as its own user shows its user, limits and signer befo
   const file = buildSample(suite.appliance, 'demo-unsigned', { package: 'demo-confined', displayname: 'Demo Confined', memory_limit_mb: '256' });
   const page = await uploadInManualInstall(file);
   const dialog = page.getByRole('dialog', { name: 'Install Demo Confined' });
-  await dialog.getByText(/Step 1 of \d+: Permissions/).waitFor();
-  const [runsAs, memory, processes, signer, ...more] = await dialog.getByRole('definition').allTextContents();
+  await dialog.getByText('Install on volume').waitFor();
+  await dialog.getByRole('button', { name: 'Next' }).click();
+  // The summary, right above Install, says what the package may do.
+  const permissions = dialog.getByRole('region', { name: 'Permissions' });
+  const [runsAs, memory, processes, signer, ...more] = await permissions.getByRole('definition').allTextContents();
   assert.deepEqual([runsAs, memory, processes, more], ['a user account of its own, not root', '256 MB', 'appliance default', []]);
   assert.match(signer, /^signed by key [0-9A-F]+, vouched for by appliance keyring$/);
   assert.equal(await dialog.getByText('asks to run with full control').count(), 0);
   await screenshot(page, 'permissions-confined');
-  // Nothing to confirm: the wizard goes on.
-  await dialog.getByRole('button', { name: 'Next' }).click();
-  await dialog.getByText('Install on volume').waitFor();
+  // Nothing to confirm: Install can be pressed.
+  assert.equal(await dialog.getByRole('button', { name: 'Install' }).isDisabled(), false);
 });
 
 test('a root package signed by the appliance keyring is installed only once the administrator confirms it in words', async () => {
   const file = buildSample(suite.appliance, 'demo-unsigned', { package: 'demo-root', displayname: 'Demo Root', run_as_root: 'yes' });
   const page = await uploadInManualInstall(file);
   const dialog = page.getByRole('dialog', { name: 'Install Demo Root' });
-  await dialog.getByText(/Step 1 of \d+: Permissions/).waitFor();
+  await dialog.getByText('Install on volume').waitFor();
+  await dialog.getByRole('button', { name: 'Next' }).click();
   await dialog.getByText('Demo Root asks to run with full control of the appliance.').waitFor();
   await dialog.getByText('root, with full control of the appliance').waitFor();
   await screenshot(page, 'permissions-root-confirm');
-  // Not confirmed: the wizard stays on the page and says why.
+  // Not confirmed: the summary says why, and Install cannot be pressed.
   await dialog.getByText('Confirm that Demo Root may run with full control of the appliance.').waitFor();
-  assert.equal(await dialog.getByRole('button', { name: 'Next' }).isDisabled(), true);
+  assert.equal(await dialog.getByRole('button', { name: 'Install' }).isDisabled(), true);
 
   await dialog.getByRole('checkbox', { name: 'I allow Demo Root to run with full control of the appliance' }).check();
-  await dialog.getByRole('button', { name: 'Next' }).click();
-  await dialog.getByText('Install on volume').waitFor();
-  await dialog.getByRole('button', { name: 'Next' }).click();
   await dialog.getByRole('button', { name: 'Install' }).click();
   await dialog.getByText(/Demo Root 1\.0 is installed/).waitFor({ timeout: 30_000 });
   assert.equal(installedState(suite.appliance, 'demo-root').version, '1.0');

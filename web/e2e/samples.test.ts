@@ -60,7 +60,7 @@ test('each sample package has an icon of its own, in the catalogue and in the in
   await screenshot(page, 'sample-icons');
 });
 
-test("the Demo Wizard's uninstall pages say that its data goes and that a kept copy stays", async () => {
+test("the Demo Wizard's uninstall pages say that its data goes and that it can say its greeting once more", async () => {
   suite.appliance.kivoctl('install', suite.appliance.file('/volume1/public/packages/demo-wizard.kpk'), '--wizard', '{"greeting":"Ahoy"}');
   const { page } = await pages.signedIn();
   const row = page.getByRole('listitem').filter({ has: page.getByRole('link', { name: 'Demo Wizard', exact: true }) });
@@ -69,8 +69,8 @@ test("the Demo Wizard's uninstall pages say that its data goes and that a kept c
   await dialog.getByText('deletes the data it keeps').waitFor();
   await dialog.getByRole('button', { name: 'Continue anyway' }).click();
   await dialog.getByText('The greeting is part of the data Demo Wizard keeps, which is deleted with it.', { exact: false }).waitFor();
-  await dialog.getByText('A copy kept in /volume1/public is not: it stays after the uninstall.', { exact: false }).waitFor();
-  await dialog.getByRole('checkbox', { name: 'Keep a copy in /volume1/public' }).waitFor();
+  await dialog.getByText('Demo Wizard can say it once more as it goes.', { exact: false }).waitFor();
+  await dialog.getByRole('checkbox', { name: "Keep a copy: say it in the uninstall's messages" }).waitFor();
   await screenshot(page, 'demo-wizard-uninstall-wizard');
   await checkAccessibility(page, 'demo-wizard uninstall wizard');
 });

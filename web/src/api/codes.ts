@@ -82,6 +82,9 @@ export const PackageCode = {
   LimitAboveBound: 4615,
   UsageNotInstalled: 4616,
   RootNotTrusted: 4620,
+  // The package's own account (docs/package-tool.md, "Accounts and confinement").
+  NoAccountId: 4645,
+  AccountFiles: 4646,
   // The window and holds of automatic updates (host/auto_update_api.h).
   HoldNotInstalled: 4630,
   AutoUpdateNotStored: 4631,

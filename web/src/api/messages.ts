@@ -99,6 +99,10 @@ const messages: Record<number, string> = {
   [PackageCode.RevisionNotInstalled]: 'This package is not installed.',
   [PackageCode.LimitAboveBound]:
     'This package asks for more memory or more processes than this appliance allows a package. Raise the bounds in the package tool\'s settings, or ask its publisher for a package that needs less.',
+  [PackageCode.NoAccountId]:
+    'This package could not get a user of its own: the range of ids the package tool gives packages is full. Widen it in the package tool\'s settings, or remove a package you no longer need.',
+  [PackageCode.AccountFiles]:
+    'This package could not get a user of its own: the appliance\'s account files cannot be read or written. Check the system volume, then try again.',
   [PackageCode.UsageNotInstalled]: 'This package is not installed, so it uses nothing.',
   [PackageCode.HoldNotInstalled]: 'This package is not installed, so there is nothing to hold.',
   [PackageCode.AutoUpdateNotStored]: 'The schedule of automatic updates could not be saved. Check the system volume, then try again.',

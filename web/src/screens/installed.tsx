@@ -8,6 +8,7 @@ import { routeHref } from '../route';
 import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
 import { PackageActions, type ActionFields } from '../ui/package-actions';
+import { ConfinementBadge } from '../ui/package-confinement';
 import { PackageIcon } from '../ui/package-icon';
 import { usePoll } from '../ui/poll';
 import { isBusyStatus, kBusyPollMs, StatusBadge } from '../ui/status-badge';
@@ -59,6 +60,7 @@ function Row({
       </div>
       <div class="installed-status">
         <StatusBadge status={extra.status} withReason />
+        <ConfinementBadge id={pkg.id} />
         {typeof progress === 'number' && progress >= 0 && <span class="hint"> {Math.round(progress * 100)}%</span>}
         <WatchdogNote id={pkg.id} name={pkg.name} onStarted={onChanged} />
         <UsageLine id={pkg.id} />

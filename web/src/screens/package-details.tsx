@@ -7,6 +7,7 @@ import { useSession } from '../session';
 import { ErrorText } from '../ui/error-text';
 import { KeptVersionPanel } from '../ui/kept-version';
 import { PackageActions, type ActionFields } from '../ui/package-actions';
+import { ConfinementFacts } from '../ui/package-confinement';
 import { PackageHistory } from '../ui/package-history';
 import { PackageHold } from '../ui/package-hold';
 import { PackageIcon } from '../ui/package-icon';
@@ -259,6 +260,7 @@ export function PackageScreen({ id }: { id: string }) {
         <Dependencies deps={extra.dependent_packages} />
         <UsageViews refresh={result}>
           <UsageFacts id={pkg.id} />
+          <ConfinementFacts id={pkg.id} />
         </UsageViews>
         {extra.installed_info?.path && (
           <>

@@ -36,7 +36,7 @@ import type { PackagePermissions } from '../api/permissions';
 import { getDefaultVolume } from '../api/setting';
 import { useSession } from '../session';
 import { usePackageNames } from './package-names';
-import { permissionsPage } from './package-permissions';
+import { PermissionsSection, permissionsProblem } from './package-permissions';
 import { Steps, type StepPage } from './steps';
 import { decodeWizard, initialWizardValues, WizardStepForm, wizardStepProblem, type WizardStep, type WizardValues } from './wizard';
 
@@ -232,6 +232,7 @@ export function summaryPage(facts: PackageFacts, choices: InstallChoices, extra:
             </div>
           ))}
         </dl>
+        {facts.permissions && <PermissionsSection name={facts.name || facts.id} permissions={facts.permissions} choices={choices} onChange={onChange} />}
         {choices.startAfter !== undefined && onChange && (
           <label class="choice">
             <input type="checkbox" checked={choices.startAfter} onChange={(e) => onChange({ ...choices, startAfter: e.currentTarget.checked })} /> Start{' '}
@@ -240,16 +241,16 @@ export function summaryPage(facts: PackageFacts, choices: InstallChoices, extra:
         )}
       </>
     ),
+    problem: facts.permissions ? permissionsProblem(facts.name || facts.id, facts.permissions, choices) : null,
   };
 }
 
-// Every page of an install, in order: what the package may do, licence, the
-// package's wizard, volume, summary.
+// Every page of an install, in order: licence, the package's wizard,
+// volume, summary (with what the package may do).
 export function installPages(facts: PackageFacts, volumes: Volume[], choices: InstallChoices, onChange: Change): StepPage[] {
   const licence = decodeLicence(facts.licence);
   const steps = decodeWizard(facts.installPages);
   return [
-    ...(facts.permissions ? [permissionsPage(facts.name || facts.id, facts.permissions, choices, onChange)] : []),
     ...(licence !== null ? [licencePage(licence, choices, onChange)] : []),
     ...(steps ? wizardPages(steps, choices, onChange) : []),
     volumePage(volumes, choices, onChange),

@@ -1,21 +1,20 @@
-// The install wizard's page that says what a package will be allowed to do
-// once installed, before every install and upgrade (a file, a catalogue
+// What a package will be allowed to do once installed, shown on the
+// summary of every install and upgrade, right above its Install button (a file, a catalogue
 // entry, an upgrade): whether it runs as its own user or as root, its
 // memory and process limits (as it declares them, or the appliance's
 // defaults), and who signed it.
 //
 // Contract:
-// - `permissionsPage` builds a StepPage (ui/steps.tsx) from the facts'
-//   `permissions` and holds no state: the root confirmation lives in the
-//   flow's `InstallChoices` (`rootConfirmed`), like the licence's.
-// - A package that asks for root keeps the user on the page until the
+// - `PermissionsSection` shows the facts' `permissions` and holds no
+//   state: the root confirmation lives in the flow's `InstallChoices`
+//   (`rootConfirmed`), like the licence's.
+// - A package that asks for root keeps the user on the summary until the
 //   administrator confirms, in words, that it may take full control of the
 //   appliance. The package tool itself accepts such a package only when a
 //   key of the appliance keyring signed it; the page asks on top of that.
 
 import './package-permissions.css';
 import type { PackagePermissions } from '../api/permissions';
-import type { StepPage } from './steps';
 
 export interface PermissionsChoice {
   rootConfirmed?: boolean;
@@ -53,36 +52,46 @@ export function PermissionsList({ name, permissions }: { name: string; permissio
   );
 }
 
-export function permissionsPage<C extends PermissionsChoice>(
-  name: string,
-  permissions: PackagePermissions,
-  choices: C,
-  onChange: (next: C) => void,
-): StepPage {
+// The summary's section on what the package may do, with the confirmation
+// a root package needs. `onChange` absent: shown, not confirmable.
+export function PermissionsSection<C extends PermissionsChoice>({
+  name,
+  permissions,
+  choices,
+  onChange,
+}: {
+  name: string;
+  permissions: PackagePermissions;
+  choices: C;
+  onChange?: (next: C) => void;
+}) {
   const root = permissions.run_as_root === true;
-  return {
-    title: 'Permissions',
-    body: (
-      <div class={root ? 'permissions-page root' : 'permissions-page'}>
-        <p>Once installed, {name} will be allowed to do this:</p>
-        <PermissionsList name={name} permissions={permissions} />
-        {root && (
-          <div class="root-request" role="alert">
-            <p class="warning">
-              <strong>{name} asks to run with full control of the appliance.</strong>
-            </p>
-            <p>
-              It can read and change everything on the appliance: every other package and its data, the accounts and the
-              settings. Allow it only if you trust its publisher with the whole appliance.
-            </p>
+  return (
+    <section class={root ? 'permissions-page root' : 'permissions-page'} aria-label="Permissions">
+      <p>Once installed, {name} will be allowed to do this:</p>
+      <PermissionsList name={name} permissions={permissions} />
+      {root && (
+        <div class="root-request" role="alert">
+          <p class="warning">
+            <strong>{name} asks to run with full control of the appliance.</strong>
+          </p>
+          <p>
+            It can read and change everything on the appliance: every other package and its data, the accounts and the settings. Allow it
+            only if you trust its publisher with the whole appliance.
+          </p>
+          {onChange && (
             <label class="choice">
               <input type="checkbox" checked={choices.rootConfirmed === true} onChange={(e) => onChange({ ...choices, rootConfirmed: e.currentTarget.checked })} /> I
               allow {name} to run with full control of the appliance
             </label>
-          </div>
-        )}
-      </div>
-    ),
-    problem: root && choices.rootConfirmed !== true ? `Confirm that ${name} may run with full control of the appliance.` : null,
-  };
+          )}
+        </div>
+      )}
+    </section>
+  );
+}
+
+// What keeps the install from going on: a root package not yet confirmed.
+export function permissionsProblem(name: string, permissions: PackagePermissions, choices: PermissionsChoice): string | null {
+  return permissions.run_as_root === true && choices.rootConfirmed !== true ? `Confirm that ${name} may run with full control of the appliance.` : null;
 }

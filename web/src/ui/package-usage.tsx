@@ -30,6 +30,12 @@ export function UsageViews({ refresh, children }: { refresh: unknown; children: 
   return <Usages.Provider value={usages}>{children}</Usages.Provider>;
 }
 
+// The usage of `id` from the surrounding UsageViews; undefined before (or
+// without) an answer.
+export function usePackageUsage(id: string): PackageUsage | undefined {
+  return useContext(Usages)?.get(id);
+}
+
 export function cpuText(ns: number): string {
   const s = ns / 1e9;
   if (s < 60) return `${s < 10 ? s.toFixed(2) : s.toFixed(1)} s`;
