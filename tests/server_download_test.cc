@@ -145,10 +145,11 @@ TEST_F(ServerDownloadTest, SecondRequestReportsTheRunningDownloadAndCancelCleans
   EXPECT_EQ(kTask, second.Data()["data"]["taskid"].asString());
   EXPECT_TRUE(second.Data().isMember("progress"));
   int pid = second.Data()["data"]["pid"].asInt();
+  ASSERT_GT(pid, 0) << second.body;
   EXPECT_EQ(1, DownloadFolders());
   CgiAnswer cancel = Call("cancel", {{"taskid", kTask}});
   ASSERT_TRUE(cancel.Success()) << cancel.body;
-  EXPECT_NE(1, KLIBCProcAlive(pid));
+  EXPECT_NE(1, KLIBCProcAlive(pid)) << cancel.body;
   EXPECT_EQ(0, DownloadFolders());
   EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask(kTask));
 }
