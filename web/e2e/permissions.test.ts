@@ -99,7 +99,10 @@ test('a root package signed only by a feed key is refused when its download is c
   await entry.getByRole('button', { name: 'Install Demo Root Feed' }).click();
   const dialog = page.getByRole('dialog', { name: 'Install Demo Root Feed' });
   const refusal = dialog.getByRole('alert');
-  await refusal.getByText('This package asks to run with full control of the appliance, which only a package signed by a key of the appliance keyring may.', { exact: false }).waitFor({ timeout: 30_000 });
+  await refusal
+    .getByText('This package asks to run with full control of the appliance, which only a package signed by a key of the appliance keyring may.', { exact: false })
+    .waitFor({ timeout: 90_000 })
+    .catch(async () => assert.fail(`no refusal; the dialog shows "${(await dialog.innerText()).replace(/\s+/g, ' ')}"`));
   assert.equal(await refusal.getAttribute('data-code'), '4620');
   await refusal.getByText('demo-root-feed asks to run as root', { exact: false }).waitFor();
   await screenshot(page, 'permissions-root-feed-refused');
