@@ -127,7 +127,8 @@ bool OpeningOn(const UpdateWindow& window, int64_t now, int offset, WindowOpenin
 }  // namespace
 
 bool ParseUpdateWindow(const KeyValueMap& conf, UpdateWindow* out, WindowError* error) {
-  for (const auto& [key, value] : conf) {
+  for (const auto& setting : conf) {
+    const std::string& key = setting.first;
     if (std::find_if(std::begin(kKeys), std::end(kKeys), [&](const char* k) { return key == k; }) ==
         std::end(kKeys))
       return Fail(kDaysKey, "unknown setting \"" + key.substr(0, 40) + "\"", error);
