@@ -153,8 +153,8 @@ struct Samples {
 
 // One round: cp -a of the data folder to a sibling (then removed, timed
 // apart), the upgrade to `major`.0 without the copy, the upgrade to
-// `major`+1 with it (the copy kept by the round before dropped first). Checks from the tool's log that each upgrade did what
-// it is timed as.
+// `major`+1 with it (the copy kept by the round before dropped first). Checks from the tool's log
+// that each upgrade did what it is timed as.
 void MeasureRoundOrExit(const std::string& packages, const std::string& data, int major,
                         Samples* s) {
   const std::string sibling = data + ".cp";
