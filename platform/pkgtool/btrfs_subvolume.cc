@@ -8,6 +8,8 @@
 #include <sys/vfs.h>
 #include <unistd.h>
 
+#include "klibc/scoped_fd.h"
+
 #include <linux/btrfs.h>
 #include <linux/magic.h>
 
@@ -16,21 +18,6 @@ namespace {
 // The inode number of every subvolume's top folder (the kernel's
 // BTRFS_FIRST_FREE_OBJECTID, which the user headers do not export).
 constexpr ino_t kSubvolumeTopInode = 256;
-
-// A descriptor closed when it goes out of scope.
-class Fd {
- public:
-  explicit Fd(int fd) : fd_(fd) {}
-  ~Fd() {
-    if (fd_ >= 0) close(fd_);
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 std::string Parent(const std::string& path) {
   const size_t slash = path.rfind('/');
@@ -68,7 +55,7 @@ bool PMSIsSubvolume(const std::string& path) {
 
 bool PMSCopiesBySnapshot(const std::string& path) {
   if (!PMSIsSubvolume(path)) return false;
-  Fd dir(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  ScopedFd dir(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (dir.get() < 0) return false;
   // The subvolumes whose parent is this one, wherever in it they lie; more
   // than fit in one answer fail with EOVERFLOW, which says as much.
@@ -78,7 +65,7 @@ bool PMSCopiesBySnapshot(const std::string& path) {
 }
 
 bool PMSMakeSubvolume(const std::string& path, unsigned mode) {
-  Fd parent(OpenParent(path));
+  ScopedFd parent(OpenParent(path));
   if (parent.get() < 0) return false;
   struct btrfs_ioctl_vol_args args;
   memset(&args, 0, sizeof(args));
@@ -89,9 +76,9 @@ bool PMSMakeSubvolume(const std::string& path, unsigned mode) {
 }
 
 bool PMSSnapshotSubvolume(const std::string& from, const std::string& to) {
-  Fd source(open(from.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  ScopedFd source(open(from.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (source.get() < 0) return false;
-  Fd parent(OpenParent(to));
+  ScopedFd parent(OpenParent(to));
   if (parent.get() < 0) return false;
   struct btrfs_ioctl_vol_args_v2 args;
   memset(&args, 0, sizeof(args));
@@ -105,7 +92,7 @@ bool PMSDestroySubvolume(const std::string& path) {
     errno = EINVAL;
     return false;
   }
-  Fd parent(OpenParent(path));
+  ScopedFd parent(OpenParent(path));
   if (parent.get() < 0) return false;
   struct btrfs_ioctl_vol_args_v2 args;
   memset(&args, 0, sizeof(args));

@@ -15,6 +15,7 @@
 #include <utility>
 #include <vector>
 
+#include "klibc/scoped_fd.h"
 #include "pkgtool/registry.h"
 
 #include <linux/fs.h>
@@ -24,21 +25,6 @@ namespace {
 constexpr int kMaxDepth = 128;
 constexpr uint64_t kBlock = 4096;
 constexpr size_t kMaxXattrValue = 65536;  // the kernel's own limit (XATTR_SIZE_MAX)
-
-// A descriptor closed when it goes out of scope.
-class Fd {
- public:
-  explicit Fd(int fd) : fd_(fd) {}
-  ~Fd() {
-    if (fd_ >= 0) close(fd_);
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 using FileKey = std::pair<dev_t, ino_t>;
 
@@ -150,7 +136,7 @@ bool Surveyor::Visit(int dir, const std::string& name, const std::string& rel, i
   out_->bytes += Room(st);
   if (S_ISLNK(st.st_mode)) return true;
   if (S_ISDIR(st.st_mode) && depth > kMaxDepth) return Fail(rel + " is nested too deep");
-  Fd fd(OpenSame(dir, name, st, S_ISDIR(st.st_mode) ? O_DIRECTORY : 0));
+  ScopedFd fd(OpenSame(dir, name, st, S_ISDIR(st.st_mode) ? O_DIRECTORY : 0));
   if (fd.get() < 0) return Fail(Unreadable(rel, errno));
   return !S_ISDIR(st.st_mode) || Walk(fd.get(), rel, depth + 1);
 }
@@ -297,13 +283,13 @@ class Copier {
 };
 
 TreeCopyResult Copier::Copy(const std::string& from, const std::string& to) {
-  Fd src(open(from.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  ScopedFd src(open(from.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   struct stat st;
   if (src.get() < 0 || fstat(src.get(), &st) != 0) {
     return Fail(TreeCopyResult::kRefused, Unreadable("", errno));
   }
   if (mkdir(to.c_str(), 0700) != 0) return FailErrno("cannot make the copy's folder", errno);
-  Fd dst(open(to.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  ScopedFd dst(open(to.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (dst.get() < 0) return FailErrno("cannot open the copy's folder", errno);
   to_root_ = dst.get();
   TreeCopyResult result = Children(src.get(), dst.get(), "", 1);
@@ -343,10 +329,10 @@ TreeCopyResult Copier::Entry(int from, int to, const std::string& name, const st
 TreeCopyResult Copier::Folder(int from, int to, const std::string& name, const std::string& rel,
                               const struct stat& st, int depth) {
   if (depth > kMaxDepth) return Fail(TreeCopyResult::kRefused, rel + " is nested too deep");
-  Fd src(OpenSame(from, name, st, O_DIRECTORY));
+  ScopedFd src(OpenSame(from, name, st, O_DIRECTORY));
   if (src.get() < 0) return Fail(TreeCopyResult::kRefused, Unreadable(rel, errno));
   if (mkdirat(to, name.c_str(), 0700) != 0) return FailErrno("cannot copy " + rel, errno);
-  Fd dst(openat(to, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  ScopedFd dst(openat(to, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (dst.get() < 0) return FailErrno("cannot copy " + rel, errno);
   TreeCopyResult result = Children(src.get(), dst.get(), rel, depth + 1);
   if (result != TreeCopyResult::kCopied) return result;
@@ -371,9 +357,10 @@ TreeCopyResult Copier::File(int from, int to, const std::string& name, const std
                             const struct stat& st) {
   TreeCopyResult linked;
   if (LinkedBefore(st, to, name, rel, &linked)) return linked;
-  Fd src(OpenSame(from, name, st, 0));
+  ScopedFd src(OpenSame(from, name, st, 0));
   if (src.get() < 0) return Fail(TreeCopyResult::kRefused, Unreadable(rel, errno));
-  Fd dst(openat(to, name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
+  ScopedFd dst(
+      openat(to, name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (dst.get() < 0) return FailErrno("cannot copy " + rel, errno);
   int err = CopyContent(src.get(), dst.get(), st.st_size);
   if (err != 0) return FailErrno("cannot copy " + rel, err);
@@ -402,7 +389,7 @@ TreeCopyResult Copier::Link(int from, int to, const std::string& name, const std
 
 bool PMSSurveyTree(const std::string& root, TreeSurvey* survey) {
   *survey = TreeSurvey();
-  Fd dir(open(root.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  ScopedFd dir(open(root.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
   if (dir.get() < 0) {
     survey->problem = Unreadable("", errno);
     return false;
