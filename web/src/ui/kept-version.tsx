@@ -6,6 +6,7 @@
 // and will not try again.
 
 import './kept-version.css';
+import type { ComponentChildren } from 'preact';
 import { useCallback, useEffect, useRef, useState } from 'preact/hooks';
 import type { ApiFailure } from '../api/client';
 import { ToolCode } from '../api/codes';
@@ -144,21 +145,35 @@ function AutoUpdateNote({ failed, name, installed }: { failed: AutoUpdateFailure
   );
 }
 
-function ConfirmRollback({
-  name,
-  installed,
-  previous,
-  onCancel,
-  onConfirm,
-}: {
+// The confirmation of one of the actions on the kept version: what it does
+// in words, then Cancel before the action.
+function Confirm({ title, action, onCancel, onConfirm, children }: { title: string; action: string; onCancel: () => void; onConfirm: () => void; children: ComponentChildren }) {
+  return (
+    <Dialog title={title} onClose={onCancel}>
+      {children}
+      <div class="buttons">
+        <button type="button" onClick={onCancel}>
+          Cancel
+        </button>
+        <button type="button" class="primary" onClick={onConfirm}>
+          {action}
+        </button>
+      </div>
+    </Dialog>
+  );
+}
+
+interface ConfirmProps {
   name: string;
   installed: string;
   previous: KeptVersion;
   onCancel: () => void;
   onConfirm: () => void;
-}) {
+}
+
+function ConfirmRollback({ name, installed, previous, onCancel, onConfirm }: ConfirmProps) {
   return (
-    <Dialog title={`Roll back ${name} to ${previous.version}?`} onClose={onCancel}>
+    <Confirm title={`Roll back ${name} to ${previous.version}?`} action="Roll back" onCancel={onCancel} onConfirm={onConfirm}>
       <p>
         {name} {installed} will be replaced by {previous.version}, with the data as it was when {previous.version} was replaced on{' '}
         {whenText(previous.replaced * 1000)}. {name} is stopped for the rollback and started again if it runs now.
@@ -166,45 +181,17 @@ function ConfirmRollback({
       <p>
         The data {installed} has written is not lost: it is kept with {installed}, so you can undo the rollback by rolling back again.
       </p>
-      <div class="buttons">
-        <button type="button" onClick={onCancel}>
-          Cancel
-        </button>
-        <button type="button" class="primary" onClick={onConfirm}>
-          Roll back
-        </button>
-      </div>
-    </Dialog>
+    </Confirm>
   );
 }
 
-function ConfirmDrop({
-  name,
-  installed,
-  previous,
-  onCancel,
-  onConfirm,
-}: {
-  name: string;
-  installed: string;
-  previous: KeptVersion;
-  onCancel: () => void;
-  onConfirm: () => void;
-}) {
+function ConfirmDrop({ name, installed, previous, onCancel, onConfirm }: ConfirmProps) {
   return (
-    <Dialog title={`Drop the copy of ${name} ${previous.version}?`} onClose={onCancel}>
+    <Confirm title={`Drop the copy of ${name} ${previous.version}?`} action="Drop copy" onCancel={onCancel} onConfirm={onConfirm}>
       <p>
         {previous.version} and the copy of its data are removed, which frees {formatBytes(previous.bytes)}. {name} can then no longer be rolled
         back to {previous.version}. {name} {installed} and its data stay as they are.
       </p>
-      <div class="buttons">
-        <button type="button" onClick={onCancel}>
-          Cancel
-        </button>
-        <button type="button" class="primary" onClick={onConfirm}>
-          Drop copy
-        </button>
-      </div>
-    </Dialog>
+    </Confirm>
   );
 }
