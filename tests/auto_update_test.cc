@@ -20,6 +20,7 @@
 
 #include <gtest/gtest.h>
 
+#include "pkgserver/update_window.h"
 #include "pkgtool/registry.h"
 #include "settings/web_utils.h"
 #include "testing/catalogue_feed.h"
@@ -357,17 +358,12 @@ TEST_F(AutoUpdateTest, AnAbsentAllSwitchMeansEveryPackageToEveryReader) {
   EXPECT_EQ("au-b", chosen[0].asString());
 }
 
-// Seconds since the epoch of local time "YYYY-MM-DDTHH:MM", as kivoctl's
-// --now reads it.
+// Seconds since the epoch of local time "YYYY-MM-DDTHH:MM", read as
+// kivoctl's --now reads it.
 long long LocalEpoch(const std::string& text) {
-  struct tm t {};
-  t.tm_year = std::stoi(text.substr(0, 4)) - 1900;
-  t.tm_mon = std::stoi(text.substr(5, 2)) - 1;
-  t.tm_mday = std::stoi(text.substr(8, 2));
-  t.tm_hour = std::stoi(text.substr(11, 2));
-  t.tm_min = std::stoi(text.substr(14, 2));
-  t.tm_isdst = -1;
-  return static_cast<long long>(mktime(&t));
+  int64_t when = 0;
+  EXPECT_TRUE(KIVOPackageServer::ParseLocalTime(text, &when)) << text;
+  return static_cast<long long>(when);
 }
 
 constexpr char kMondayWindow[] =
