@@ -129,10 +129,14 @@ TreeCopyResult PMSTakeSnapshot(const DataSnapshot& s, std::string* error) {
     *error = Because("cannot prepare the folder of the copy");
     return TreeCopyResult::kFailed;
   }
-  TreeCopyResult result = PMSCopiesBySnapshot(s.data_dir())
-                              ? Snapshot(s.data_dir(), partial, error)
-                              : PMSCopyTree(s.data_dir(), partial, error);
-  if (result == TreeCopyResult::kCopied && !PMSRenameDurably(partial, s.copy())) {
+  // A snapshot is made whole in the transaction that creates it, and the
+  // call returns once that transaction is on disk: it takes its final name
+  // at once, with nothing partial to hide and nothing left to sync (a
+  // rename and a sync of the folder would cost as much again).
+  const bool by_snapshot = PMSCopiesBySnapshot(s.data_dir());
+  TreeCopyResult result = by_snapshot ? Snapshot(s.data_dir(), s.copy(), error)
+                                      : PMSCopyTree(s.data_dir(), partial, error);
+  if (result == TreeCopyResult::kCopied && !by_snapshot && !PMSRenameDurably(partial, s.copy())) {
     *error = Because("cannot complete the copy");
     result = TreeCopyResult::kFailed;
   }

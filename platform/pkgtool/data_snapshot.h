@@ -4,7 +4,9 @@
 // The copy lies beside the data folder D = <volume>/@appdata/<id>, on the
 // same file system so that it moves back by rename, and never inside it:
 //
-//   <volume>/@appdata/.snapshots/<id>/<R>.copying   a copy being made
+//   <volume>/@appdata/.snapshots/<id>/<R>.copying   a copy being made file by file
+//                                                   (a Btrfs snapshot appears
+//                                                   whole as <R>)
 //   <volume>/@appdata/.snapshots/<id>/<R>           D as version R left it
 //   <volume>/@appdata/.snapshots/<id>/<R>.replaced  D as the failed version
 //                                                   left it, moved aside by
