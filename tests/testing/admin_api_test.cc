@@ -7,7 +7,7 @@
 AdminApiTest::AdminApiTest() { root_.AddAccount("admin", "secret", {"administrators"}); }
 
 const ApiClient& AdminApiTest::client() {
-  if (!client_) client_.reset(new ApiClient("admin", "secret"));
+  std::call_once(signed_in_, [this] { client_ = std::make_unique<ApiClient>("admin", "secret"); });
   return *client_;
 }
 

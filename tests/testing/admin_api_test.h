@@ -4,6 +4,7 @@
 #pragma once
 
 #include <memory>
+#include <mutex>
 #include <string>
 
 #include <gtest/gtest.h>
@@ -18,7 +19,8 @@ class AdminApiTest : public ::testing::Test {
   AdminApiTest();
 
   // The administrator's client, signed in on the first call (so after SetUp
-  // has configured the root) and kept for the rest of the test.
+  // has configured the root) and kept for the rest of the test. Threads of
+  // a test may make that first call at once: one of them signs in.
   const ApiClient& client();
   // Makes kivoinfo.conf hold nothing but the package source trust level.
   void Trust(int level) const;
@@ -26,6 +28,7 @@ class AdminApiTest : public ::testing::Test {
   TempRoot root_;
 
  private:
+  std::once_flag signed_in_;
   std::unique_ptr<ApiClient> client_;
 };
 
