@@ -7,8 +7,10 @@
 #include <csignal>
 #include <ctime>
 #include <memory>
+#include <string>
 #include <syslog.h>
 #include <unistd.h>
+#include <utility>
 
 #include "klibc/process.h"
 #include "klibc/sysroot.h"
@@ -139,13 +141,25 @@ bool SameHex(const std::string& a, const std::string& b) {
   return a.size() == b.size() && strcasecmp(a.c_str(), b.c_str()) == 0;
 }
 
-// The transfer itself; on failure the task says why.
+// Why a transfer failed: the code and message its task gets.
+struct TransferFailure {
+  int code = 0;
+  std::string message;
+};
+
+// The transfer itself. False with `*failure` when it failed: the caller
+// removes the download folder before the task says so, so that a client
+// that sees the task finished finds nothing left of it.
 bool Transfer(NVX::Task* task, const std::string& name, const std::string& link,
               const std::string& md5, const std::string& sha256, uint64_t size,
-              const std::string& path) {
+              const std::string& path, TransferFailure* failure) {
+  auto fail = [failure](int code, std::string message) {
+    *failure = {code, std::move(message)};
+    return false;
+  };
   std::string error;
   const PackageServerNetOps* net = PMSServerNetOps(&error);
-  if (!net) return Fail(task, PMS_DL_ERR_NETWORK, error), false;
+  if (!net) return fail(PMS_DL_ERR_NETWORK, error);
   PkgServerConfig config = PMSLoadServerConfig();
   ProgressWriter writer{task};
   HttpDownload d;
@@ -159,18 +173,15 @@ bool Transfer(NVX::Task* task, const std::string& name, const std::string& link,
   d.context = &writer;
   if (net->download(config.DownloadLimits(size), d)) {
     if (d.want_md5 && !SameHex(md5, d.md5_hex))
-      return Fail(task, PMS_DL_ERR_CHECKSUM,
-                  "the file's md5 " + d.md5_hex + " differs from the catalogue's " + md5),
-             false;
+      return fail(PMS_DL_ERR_CHECKSUM,
+                  "the file's md5 " + d.md5_hex + " differs from the catalogue's " + md5);
     if (d.want_sha256 && !SameHex(sha256, d.sha256_hex))
-      return Fail(task, PMS_DL_ERR_CHECKSUM,
-                  "the file's sha256 " + d.sha256_hex + " differs from the catalogue's " + sha256),
-             false;
+      return fail(PMS_DL_ERR_CHECKSUM,
+                  "the file's sha256 " + d.sha256_hex + " differs from the catalogue's " + sha256);
     if (size && d.bytes != size)
-      return Fail(task, d.bytes > size ? PMS_DL_ERR_TOO_LARGE : PMS_DL_ERR_NETWORK,
+      return fail(d.bytes > size ? PMS_DL_ERR_TOO_LARGE : PMS_DL_ERR_NETWORK,
                   "the file has " + std::to_string(d.bytes) + " bytes, the catalogue says " +
-                      std::to_string(size)),
-             false;
+                      std::to_string(size));
     return true;
   }
   DOWNLOAD_LOG("%s from %s: %s", name.c_str(), link.c_str(), d.error.c_str());
@@ -179,8 +190,7 @@ bool Transfer(NVX::Task* task, const std::string& name, const std::string& link,
              : d.outcome == O::kTooLarge ? PMS_DL_ERR_TOO_LARGE
              : d.outcome == O::kDisk     ? PMS_DL_ERR_DISK
                                          : PMS_DL_ERR_NETWORK;
-  Fail(task, code, "download of " + link + " failed: " + d.error);
-  return false;
+  return fail(code, "download of " + link + " failed: " + d.error);
 }
 
 }  // namespace
@@ -239,14 +249,17 @@ bool DownloadPackage(NVX::Task* task, const std::string& user, const std::string
   Json::Value data = task->getProperty("data");
   uint64_t size = data["size"].isUInt64() ? data["size"].asUInt64() : 0;
   if (link.empty() || !PMSIsServerUrl(link)) {
-    Fail(task, PMS_DL_ERR_REQUEST, "no http or https link for " + name);
     PMSRemoveDownloadDir(folder);
+    Fail(task, PMS_DL_ERR_REQUEST, "no http or https link for " + name);
     return false;
   }
   resultPath = folder + "/" + task->getTaskId();
   std::string sha256 = CatalogueSha256(name, link, language);
-  if (!Transfer(task, name, link, checksum, sha256, size, resultPath) || isCanceled()) {
+  TransferFailure failure;
+  const bool transferred = Transfer(task, name, link, checksum, sha256, size, resultPath, &failure);
+  if (!transferred || isCanceled()) {
     PMSRemoveDownloadDir(folder);
+    if (!transferred) Fail(task, failure.code, failure.message);
     return false;
   }
   if (!TaskExists(task)) return false;
