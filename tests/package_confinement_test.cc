@@ -398,6 +398,40 @@ TEST_F(ConfinementTest, AccountOwnsTheDataAndLivesAsLongAsThePackage) {
   EXPECT_FALSE(KLIBCFileExist(root_.Path("/tmp/kivo-package/app").c_str()));
 }
 
+TEST_F(ConfinementTest, StartWalksTheDataFolderOnlyUntilAFullPassIsRecorded) {
+  TestPackage app;
+  app.id = "walked";
+  ASSERT_EQ(0, Kivoctl({"install", Build(app)}, &out_)) << out_;
+  const unsigned uid = Confinement("walked")["uid"].asUInt();
+  const std::string marker = root_.Path("/var/packages/walked/data_owner");
+  EXPECT_EQ(std::to_string(uid) + ":" + std::to_string(uid) + "\n", FileText(marker));
+  // Root leaves a file deep in the data folder, and the folder itself.
+  const std::string data = root_.Path("/volume1/@appdata/walked");
+  ASSERT_EQ(0, mkdir((data + "/deep").c_str(), 0755));
+  root_.Write("/volume1/@appdata/walked/deep/by-root", "x");
+  ASSERT_EQ(0, chown(data.c_str(), 0, 0));
+  auto owner = [](const std::string& path) {
+    struct stat st;
+    return stat(path.c_str(), &st) == 0 ? st.st_uid : 12345u;
+  };
+  ASSERT_EQ(0, Kivoctl({"start", "walked"}, &out_)) << out_;
+  ASSERT_EQ(0, Kivoctl({"stop", "walked"}, &out_)) << out_;
+  // A start after a recorded full pass gives back the folder alone...
+  EXPECT_EQ(uid, owner(data));
+  EXPECT_EQ(0u, owner(data + "/deep/by-root"));
+  // ...kivoctl confine makes the full pass...
+  ASSERT_EQ(0, Kivoctl({"confine", "walked"}, &out_)) << out_;
+  EXPECT_EQ(uid, owner(data + "/deep/by-root"));
+  EXPECT_EQ(uid, owner(data + "/deep"));
+  // ...and so does a start whose record names another owner.
+  root_.Write("/var/packages/walked/data_owner", "1:1\n");
+  ASSERT_EQ(0, chown((data + "/deep/by-root").c_str(), 0, 0));
+  ASSERT_EQ(0, Kivoctl({"start", "walked"}, &out_)) << out_;
+  ASSERT_EQ(0, Kivoctl({"stop", "walked"}, &out_)) << out_;
+  EXPECT_EQ(uid, owner(data + "/deep/by-root"));
+  EXPECT_EQ(std::to_string(uid) + ":" + std::to_string(uid) + "\n", FileText(marker));
+}
+
 TEST_F(ConfinementTest, NameTakenByAnotherAccountGetsAnotherName) {
   root_.AddAccount("pkg-demo", "secret-password", {"users"});
   TestPackage demo;

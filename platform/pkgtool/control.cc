@@ -152,7 +152,8 @@ int PackageManager::RunStartStop(const std::string& id, const PackageInfo& info,
   const std::string record = PackageRegistry::RecordDir(id);
   // A package installed before packages had accounts gets its own here.
   if (std::string error;
-      start && PMSSettlePackageAccount(id, record, op.log_path(), &error) != PKG_OK) {
+      start && PMSSettlePackageAccount(id, record, op.log_path(), DataOwnership::kUnlessSettled,
+                                       &error) != PKG_OK) {
     op.Log("cannot give " + id + " an account of its own: " + error);
     return PKG_ERR_INTERNAL;
   }

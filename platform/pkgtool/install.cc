@@ -447,7 +447,8 @@ int Installer::PrepareUpgrade(const PackageInfo& info,
 
 int Installer::SettleAccount(Staging* s) {
   std::string error;
-  const int code = PMSSettlePackageAccount(id_, s->record, op_->log_path(), &error);
+  const int code =
+      PMSSettlePackageAccount(id_, s->record, op_->log_path(), DataOwnership::kWhole, &error);
   s->fresh_account = !upgrade_;
   if (code == PKG_OK) return PKG_OK;
   op_->Log("account: " + error);

@@ -451,9 +451,40 @@ PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
   return c;
 }
 
+namespace {
+
+std::string DataOwnerText(const PackageAccount& account) {
+  return std::to_string(account.uid) + ":" + std::to_string(account.gid) + "\n";
+}
+
+// Gives `data` to `account`: every entry, or, when `ownership` allows and a
+// full pass for the same account was recorded in `record`, the folder
+// alone. A full pass that succeeds is recorded.
+bool GiveData(const std::string& record, const std::string& data, const PackageAccount& account,
+              bool account_is_new, DataOwnership ownership, std::string* error) {
+  const std::string marker = record + "/" + kPMSDataOwnerFile;
+  std::string recorded;
+  // A new account may have the uid an earlier one had: what that one owned
+  // then proves nothing now.
+  if (ownership == DataOwnership::kUnlessSettled && !account_is_new &&
+      KIVOReadFile(marker, &recorded, 64) && recorded == DataOwnerText(account)) {
+    if (lchown(data.c_str(), account.uid, account.gid) == 0) return true;
+    *error = "cannot change the owner of " + data + ": " + strerror(errno);
+    return false;
+  }
+  if (!PMSChownTree(data, account.uid, account.gid, error)) return false;
+  // Without the marker the next start only does the full pass again.
+  static_cast<void>(KIVOWriteFileAtomic(marker, DataOwnerText(account), SyncToDisk::No));
+  return true;
+}
+
+}  // namespace
+
 int PMSSettlePackageAccount(const std::string& id, const std::string& record,
-                            const std::string& log_path, std::string* error) {
+                            const std::string& log_path, DataOwnership ownership,
+                            std::string* error) {
   PackageAccount account;
+  const bool account_is_new = !PMSFindPackageAccount(id, &account);
   int code = PMSEnsurePackageAccount(id, &account, error);
   if (code != PKG_OK) return code;
   const OwnFolders own = FoldersOf(record);
@@ -463,7 +494,7 @@ int PMSSettlePackageAccount(const std::string& id, const std::string& record,
        {own.record + "/scripts/x", own.payload + "/x", own.data + "/x"}) {
     if (inside[0] == '/') PMSMakeReachable(inside);
   }
-  if (!own.data.empty() && !PMSChownTree(own.data, account.uid, account.gid, error)) {
+  if (!own.data.empty() && !GiveData(record, own.data, account, account_is_new, ownership, error)) {
     return PKG_ERR_INTERNAL;
   }
   // Written now, so the record says who the package is from its install on.

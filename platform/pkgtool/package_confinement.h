@@ -93,14 +93,34 @@ class PackageConfinement {
 // before packages had accounts, not started since) or it cannot be read.
 [[nodiscard]] bool PMSLoadConfinement(const std::string& id, Json::Value* record);
 
+// The member of a package record that says the whole data folder was
+// given to the account "<uid>:<gid>" (one line), by the last full pass.
+inline constexpr char kPMSDataOwnerFile[] = "data_owner";
+
+// How much of the data folder PMSSettlePackageAccount gives to the account.
+enum class DataOwnership {
+  // Every entry, whatever was done before: install, upgrade and
+  // `kivoctl confine`, after which scripts that ran as root or an older
+  // version may have left files of others.
+  kWhole,
+  // The folder itself only, when the record's data_owner says a full pass
+  // gave everything to this same account; else every entry. For a start:
+  // a data folder may hold millions of files, and walking them at every
+  // start (at every boot, with cold caches) would cost far more than the
+  // start itself.
+  kUnlessSettled,
+};
+
 // For the changing operations (install, upgrade, start, `kivoctl confine`):
 // finds or creates the account of `id` (package_account.h), gives the
-// package's data folder to it, makes the record, payload and data folder of
-// `record` reachable (PMSMakeReachable), and writes the record's
-// confinement file, saying so in the operation log `log_path` ("" for none)
-// when it changed. PKG_OK or the account's result code, with `*error`.
+// package's data folder to it as `ownership` says, makes the record, payload
+// and data folder of `record` reachable (PMSMakeReachable), and writes the
+// record's confinement file, saying so in the operation log `log_path` (""
+// for none) when it changed. PKG_OK or the account's result code, with
+// `*error`.
 [[nodiscard]] int PMSSettlePackageAccount(const std::string& id, const std::string& record,
-                                          const std::string& log_path, std::string* error);
+                                          const std::string& log_path, DataOwnership ownership,
+                                          std::string* error);
 
 // At uninstall, after the package's folders were removed: what stays of its
 // data folder `data` (a removal that failed) is given to root, the

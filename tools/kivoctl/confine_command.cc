@@ -34,7 +34,8 @@ int KivoctlConfine(const std::vector<std::string>& args) {
     return Fail(id + ": " + PMSResultText(PKG_ERR_NOT_INSTALLED), PKG_ERR_NOT_INSTALLED);
   }
   std::string error;
-  const int code = PMSSettlePackageAccount(id, PackageRegistry::RecordDir(id), "", &error);
+  const int code = PMSSettlePackageAccount(id, PackageRegistry::RecordDir(id), "",
+                                           DataOwnership::kWhole, &error);
   if (code != PKG_OK) return Fail(id + ": " + PMSResultText(code) + ": " + error, code);
   std::string record;
   if (!KIVOReadFile(PackageRegistry::RecordDir(id) + "/" + kPMSConfinementFile, &record, 1 << 16)) {
