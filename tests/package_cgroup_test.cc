@@ -187,6 +187,18 @@ TEST_F(PackageCgroupTest, ScriptAndItsServiceAreInEveryGroupFromTheFirstCommand)
     for (long pid = 0; procs >> pid;) in.push_back(static_cast<pid_t>(pid));
     EXPECT_NE(in.end(), std::find(in.begin(), in.end(), service)) << dir;
   }
+
+  // A root about to be removed drops its groups, killing the service;
+  // the running system's groups are never dropped so.
+  EXPECT_EQ(2, Kivoctl({"drop-groups"}, &out_, {{"KIVO_ROOT", ""}})) << out_;
+  EXPECT_NE(std::string::npos, out_.find("never the running system")) << out_;
+  ASSERT_EQ(0, Kivoctl({"drop-groups"}, &out_)) << out_;
+  for (const std::string& dir : dirs) EXPECT_NE(0, access(dir.c_str(), F_OK)) << dir;
+  // Gone, or dead and waiting for whoever adopted it to reap it.
+  std::string stat;
+  const bool ended = !KIVOReadFile("/proc/" + std::to_string(service) + "/stat", &stat) ||
+                     stat.find(") Z ") != std::string::npos;
+  EXPECT_TRUE(ended) << "the service outlived its groups: " << stat;
 }
 
 TEST_F(PackageCgroupTest, ForkBombStopsAtTheProcessLimit) {

@@ -3,6 +3,8 @@
 #include <iostream>
 
 #include "klibc/atomic_file.h"
+#include "klibc/sysroot.h"
+#include "pkgtool/package_cgroup.h"
 #include "pkgtool/package_confinement.h"
 #include "pkgtool/package_manager.h"
 #include "pkgtool/pms.h"
@@ -42,5 +44,24 @@ int KivoctlConfine(const std::vector<std::string>& args) {
     return Fail(id + ": the confinement record cannot be read", PKG_ERR_INTERNAL);
   }
   std::cout << record;
+  return 0;
+}
+
+int KivoctlDropGroups(const std::vector<std::string>& args) {
+  if (!args.empty()) {
+    std::cerr << "kivoctl: drop-groups takes no argument\n";
+    return 2;
+  }
+  const std::string root = KIVOSysRoot();
+  if (root.empty() || root == "/") {
+    std::cerr << "kivoctl: drop-groups is for a root about to be removed (--root DIR), never "
+                 "the running system\n";
+    return 2;
+  }
+  std::string problem;
+  if (!PackageCgroupRemoveRoot(root, &problem)) {
+    std::cerr << "kivoctl: " << problem << "\n";
+    return 1;
+  }
   return 0;
 }

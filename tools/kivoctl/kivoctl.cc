@@ -12,6 +12,7 @@
 //   kivoctl [--root DIR] auto-update [--dry-run] [--now TIME] [--seed N]
 //   kivoctl [--root DIR] watchdog [--once]
 //   kivoctl [--root DIR] confine ID
+//   kivoctl --root DIR drop-groups
 
 #include <cstdio>
 #include <cstdlib>
@@ -105,6 +106,9 @@ const char kUsage[] =
     "                                     until SIGTERM (--once: one check)\n"
     "  confine ID                         give an installed package its own account now\n"
     "                                     and print what confines it\n"
+    "  drop-groups                        remove every control group of the root given\n"
+    "                                     with --root, killing what runs in them: for a\n"
+    "                                     root about to be removed, never the system's\n"
     "\n"
     "--root DIR selects the system root (default: $KIVO_ROOT, else /).\n";
 
@@ -271,6 +275,7 @@ int RunCommand(const std::string& command, const std::vector<std::string>& args)
   if (command == "install-server") return KivoctlInstallServer(args);
   if (command == "watchdog") return KivoctlWatchdog(args);
   if (command == "confine") return KivoctlConfine(args);
+  if (command == "drop-groups") return KivoctlDropGroups(args);
   std::cerr << kUsage;
   return Fail("unknown command: " + command);
 }

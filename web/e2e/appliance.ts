@@ -149,6 +149,12 @@ export class Appliance {
     } catch {
       // a package that will not stop is left to the root's removal
     }
+    try {
+      // The packages' control groups outlive the root's folder otherwise.
+      this.kivoctl('drop-groups');
+    } catch {
+      // without root or cgroups there were none to drop
+    }
     rmSync(this.root, { recursive: true, force: true });
   }
 }

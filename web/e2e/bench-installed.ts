@@ -147,6 +147,12 @@ async function main(): Promise<void> {
   } finally {
     await browser.close();
     server.kill('SIGTERM');
+    // The packages' control groups outlive the root's folder otherwise.
+    try {
+      execFileSync(kKivoctl, ['--root', root, 'drop-groups'], { stdio: 'ignore' });
+    } catch {
+      // without root or cgroups there were none to drop
+    }
     rmSync(root, { recursive: true, force: true });
   }
 }
