@@ -4,15 +4,12 @@
 
 #include <gtest/gtest.h>
 
-#include "testing/cgi_client.h"
-#include "testing/temp_root.h"
+#include "testing/admin_api_test.h"
 
 namespace {
 
-class ParamCheckTest : public ::testing::Test {
+class ParamCheckTest : public AdminApiTest {
  protected:
-  void SetUp() override { root_.AddAccount("admin", "secret", {"administrators"}); }
-
   // Expects a refusal of `param` for `reason`.
   void ExpectRefused(const std::string& api, int version, const std::string& method,
                      const Params& params, const std::string& param, const std::string& reason) {
@@ -29,14 +26,6 @@ class ParamCheckTest : public ::testing::Test {
     EXPECT_TRUE(a.json.isObject()) << a.body;
     EXPECT_NE(120, a.Code()) << api << " " << method << ": " << a.body;
   }
-
-  const ApiClient& client() {
-    if (!client_) client_.reset(new ApiClient("admin", "secret"));
-    return *client_;
-  }
-
-  TempRoot root_;
-  std::unique_ptr<ApiClient> client_;
 };
 
 constexpr char kPkg[] = "KIVO.Core.Package";
