@@ -430,6 +430,18 @@ TEST_F(ConfinementTest, StartWalksTheDataFolderOnlyUntilAFullPassIsRecorded) {
   ASSERT_EQ(0, Kivoctl({"stop", "walked"}, &out_)) << out_;
   EXPECT_EQ(uid, owner(data + "/deep/by-root"));
   EXPECT_EQ(std::to_string(uid) + ":" + std::to_string(uid) + "\n", FileText(marker));
+
+  // Scripts that ran as root may have left root's files: the record no
+  // longer vouches for the folder, and the next confined start walks it.
+  root_.Write("/etc/kivo/pkgtool.conf", "package_confinement=\"off\"\n");
+  ASSERT_EQ(0, Kivoctl({"start", "walked"}, &out_)) << out_;
+  ASSERT_EQ(0, chown((data + "/deep/by-root").c_str(), 0, 0));  // as such a script would
+  ASSERT_EQ(0, Kivoctl({"stop", "walked"}, &out_)) << out_;
+  EXPECT_FALSE(KLIBCFileExist(marker.c_str()));
+  root_.Write("/etc/kivo/pkgtool.conf", "");
+  ASSERT_EQ(0, Kivoctl({"start", "walked"}, &out_)) << out_;
+  ASSERT_EQ(0, Kivoctl({"stop", "walked"}, &out_)) << out_;
+  EXPECT_EQ(uid, owner(data + "/deep/by-root"));
 }
 
 TEST_F(ConfinementTest, NameTakenByAnotherAccountGetsAnotherName) {

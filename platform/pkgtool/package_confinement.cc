@@ -390,6 +390,18 @@ PackageConfinement& PackageConfinement::operator=(PackageConfinement&& other) no
   return *this;
 }
 
+namespace {
+
+// A script about to run as root may leave files of root's in the data
+// folder: the next start must walk it again (DataOwnership::kUnlessSettled).
+void ForgetDataOwner(const std::string& record) {
+  const std::string marker = record + "/" + kPMSDataOwnerFile;
+  if (unlink(marker.c_str()) != 0 && errno != ENOENT)
+    syslog(LOG_WARNING, "pkgtool: cannot remove %s: %m", marker.c_str());
+}
+
+}  // namespace
+
 PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
                                                       const std::string& arg,
                                                       const std::map<std::string, std::string>& env,
@@ -409,6 +421,7 @@ PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
   const std::string id = info["package"];
   const bool asks_for_root = PMSAsksForRoot(PackageInfo(info));
   if (asks_for_root || ConfinementTurnedOff()) {
+    ForgetDataOwner(record);
     Unconfined(asks_for_root ? "the package declares run_as_root"
                              : "package_confinement is off in etc/kivo/pkgtool.conf",
                asks_for_root ? "root" : "turned_off", &report);
@@ -436,6 +449,7 @@ PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
   report["uid"] = static_cast<Json::UInt>(c.drop_user ? c.uid : geteuid());
   report["gid"] = static_cast<Json::UInt>(c.drop_user ? c.gid : getegid());
   report["root"] = !c.drop_user && as_root;
+  if (!c.drop_user && as_root) ForgetDataOwner(record);
   c.no_new_privs = true;
   report["applied"].append("no_new_privs");
   const PackageAccount* owner = c.drop_user ? &account : nullptr;

@@ -94,7 +94,8 @@ class PackageConfinement {
 [[nodiscard]] bool PMSLoadConfinement(const std::string& id, Json::Value* record);
 
 // The member of a package record that says the whole data folder was
-// given to the account "<uid>:<gid>" (one line), by the last full pass.
+// given to the account "<uid>:<gid>" (one line), by the last full pass, and
+// that no script ran as root since (preparing one removes it).
 inline constexpr char kPMSDataOwnerFile[] = "data_owner";
 
 // How much of the data folder PMSSettlePackageAccount gives to the account.
