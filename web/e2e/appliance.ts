@@ -5,7 +5,7 @@
 // other's installs.
 
 import { execFileSync, spawn, type ChildProcess } from 'node:child_process';
-import { mkdirSync, mkdtempSync, readFileSync, renameSync, rmSync, writeFileSync } from 'node:fs';
+import { existsSync, mkdirSync, mkdtempSync, readFileSync, renameSync, rmSync, writeFileSync } from 'node:fs';
 import { createServer } from 'node:net';
 import { tmpdir } from 'node:os';
 import { dirname, join, resolve } from 'node:path';
@@ -15,6 +15,13 @@ export const kPassword = 'admin';
 // The build the appliances run: build/, or $BUILD_DIR as scripts/build.sh
 // takes it (relative to the checkout).
 export const kBuild = resolve(kRepo, process.env.BUILD_DIR ?? 'build');
+
+// Whether packages can be confined here: root (to run them as their own
+// users) and the kernel's memory and pids controllers (the unified
+// hierarchy, or v1's). Landlock is judged by each package's record.
+export const kConfinable =
+  process.getuid?.() === 0 &&
+  (existsSync('/sys/fs/cgroup/cgroup.controllers') || (existsSync('/sys/fs/cgroup/memory') && existsSync('/sys/fs/cgroup/pids')));
 
 export function freePort(): Promise<number> {
   return new Promise((done, fail) => {
@@ -115,6 +122,19 @@ export class Appliance {
     const temporary = join(dirname(target), `.${Date.now()}-${process.pid}.tmp`);
     writeFileSync(temporary, content);
     renameSync(temporary, target);
+  }
+
+  // Runs `body` with `line` added to the root's etc/kivo/pkgtool.conf, then
+  // puts the file back as it was (each change by replace()).
+  async withToolSetting<T>(line: string, body: () => Promise<T>): Promise<T> {
+    const conf = '/etc/kivo/pkgtool.conf';
+    const before = existsSync(this.file(conf)) ? readFileSync(this.file(conf), 'utf8') : '';
+    this.replace(conf, `${before}${line}\n`);
+    try {
+      return await body();
+    } finally {
+      this.replace(conf, before);
+    }
   }
 
   // Replaces a file that this appliance's web server serves at `address`

@@ -5,7 +5,8 @@
 
 import { test } from 'node:test';
 import assert from 'node:assert/strict';
-import { existsSync, readFileSync } from 'node:fs';
+import { readFileSync } from 'node:fs';
+import { kConfinable } from './appliance.ts';
 import type { Page } from 'playwright-core';
 import { checkAccessibility, screenshot } from './browser.ts';
 import { row } from './screens.ts';
@@ -13,12 +14,6 @@ import { pagesPerTest, useSuite } from './suite.ts';
 
 const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
 const pages = pagesPerTest(suite);
-
-// Confinement needs root (to run packages as their own users) and the memory
-// and pids controllers; Landlock is judged by the record itself.
-const confinable =
-  process.getuid?.() === 0 &&
-  (existsSync('/sys/fs/cgroup/cgroup.controllers') || (existsSync('/sys/fs/cgroup/memory') && existsSync('/sys/fs/cgroup/pids')));
 
 // The record as the package tool wrote it.
 function record(id: string): { state: string; missing: { what: string; reason: string }[] } {
@@ -32,7 +27,7 @@ async function openDetails(page: Page, name: string): Promise<void> {
 }
 
 test('a confined package says so in the list and in its details', async (t) => {
-  if (!confinable) return t.skip('needs root and the memory and pids controllers');
+  if (!kConfinable) return t.skip('needs root and the memory and pids controllers');
   const state = record('demo-web').state;
   if (state !== 'confined') return t.skip(`demo-web is not fully confined here: ${JSON.stringify(record('demo-web'))}`);
   const { page } = await pages.signedIn();
@@ -53,31 +48,29 @@ test('a confined package says so in the list and in its details', async (t) => {
 });
 
 test('a package without its control groups is partly confined, with what and why', async (t) => {
-  if (!confinable) return t.skip('needs root and the memory and pids controllers');
-  const conf = '/etc/kivo/pkgtool.conf';
-  const before = existsSync(suite.appliance.file(conf)) ? readFileSync(suite.appliance.file(conf), 'utf8') : '';
+  if (!kConfinable) return t.skip('needs root and the memory and pids controllers');
   // The administrator's switch leaves every package without groups; the
   // package tool records it at the package's next run (here: kivoctl confine).
-  suite.appliance.replace(conf, `${before}package_cgroups="no"\n`);
   try {
-    suite.appliance.kivoctl('confine', 'demo-notes');
-    assert.equal(record('demo-notes').state, 'partly');
-    const { page } = await pages.signedIn();
-    await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
-    const badge = row(page, 'Demo Notes').locator('.badge.confinement');
-    await badge.waitFor();
-    assert.equal(await badge.innerText(), 'Partly confined');
+    await suite.appliance.withToolSetting('package_cgroups="no"', async () => {
+      suite.appliance.kivoctl('confine', 'demo-notes');
+      assert.equal(record('demo-notes').state, 'partly');
+      const { page } = await pages.signedIn();
+      await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
+      const badge = row(page, 'Demo Notes').locator('.badge.confinement');
+      await badge.waitFor();
+      assert.equal(await badge.innerText(), 'Partly confined');
 
-    await openDetails(page, 'Demo Notes');
-    const fact = page.locator('.details-facts dd.confinement-fact');
-    await fact.waitFor();
-    assert.equal(
-      await fact.innerText(),
-      'Partly confined: the memory limit, the process limit and the CPU time measurement were not applied because turned off (package_cgroups in pkgtool.conf)',
-    );
-    await screenshot(page, 'confinement-partly');
+      await openDetails(page, 'Demo Notes');
+      const fact = page.locator('.details-facts dd.confinement-fact');
+      await fact.waitFor();
+      assert.equal(
+        await fact.innerText(),
+        'Partly confined: the memory limit, the process limit and the CPU time measurement were not applied because turned off (package_cgroups in pkgtool.conf)',
+      );
+      await screenshot(page, 'confinement-partly');
+    });
   } finally {
-    suite.appliance.replace(conf, before);
     suite.appliance.kivoctl('confine', 'demo-notes');
   }
 });

@@ -5,7 +5,7 @@
 
 import { test } from 'node:test';
 import assert from 'node:assert/strict';
-import { existsSync, readFileSync } from 'node:fs';
+import { kConfinable } from './appliance.ts';
 import { checkAccessibility, screenshot } from './browser.ts';
 import { row } from './screens.ts';
 import { pagesPerTest, useSuite } from './suite.ts';
@@ -13,13 +13,8 @@ import { pagesPerTest, useSuite } from './suite.ts';
 const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
 const pages = pagesPerTest(suite);
 
-// Groups need root and the kernel's memory and pids controllers.
-const confinable =
-  process.getuid?.() === 0 &&
-  (existsSync('/sys/fs/cgroup/cgroup.controllers') || (existsSync('/sys/fs/cgroup/memory') && existsSync('/sys/fs/cgroup/pids')));
-
 test('the list and the details show what a running package uses', async (t) => {
-  if (!confinable) return t.skip('needs root and the memory and pids controllers');
+  if (!kConfinable) return t.skip('needs root and the memory and pids controllers');
   const { page } = await pages.signedIn();
   await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
   const line = row(page, 'Demo Web').locator('.usage-line');
@@ -38,18 +33,13 @@ test('the list and the details show what a running package uses', async (t) => {
 });
 
 test('a figure the appliance cannot read says "not measured" and why, never 0', async () => {
-  const conf = '/etc/kivo/pkgtool.conf';
-  const before = existsSync(suite.appliance.file(conf)) ? readFileSync(suite.appliance.file(conf), 'utf8') : '';
   // The administrator's switch leaves every package without groups.
-  suite.appliance.replace(conf, `${before}package_cgroups="no"\n`);
-  try {
+  await suite.appliance.withToolSetting('package_cgroups="no"', async () => {
     const { page } = await pages.signedIn();
     await page.getByRole('heading', { name: 'Installed packages' }).waitFor();
     const line = row(page, 'Demo Web').locator('.usage-line');
     await line.waitFor();
     assert.equal(await line.innerText(), 'CPU not measured · Memory not measured (turned off (package_cgroups in pkgtool.conf))');
     await screenshot(page, 'usage-not-measured');
-  } finally {
-    suite.appliance.replace(conf, before);
-  }
+  });
 });
