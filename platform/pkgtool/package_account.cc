@@ -206,7 +206,9 @@ bool PMSFindPackageAccount(const std::string& id, PackageAccount* account) {
   return false;
 }
 
-int PMSEnsurePackageAccount(const std::string& id, PackageAccount* account, std::string* error) {
+int PMSEnsurePackageAccount(const std::string& id, PackageAccount* account, std::string* error,
+                            bool* created) {
+  if (created) *created = false;
   if (!PMSIsValidPackageId(id)) return (*error = "not a valid package id"), PKG_ERR_INTERNAL;
   const std::string lock_path = KIVOAccountsLockPath();
   static_cast<void>(KIVOFSMkdirP(lock_path.substr(0, lock_path.rfind('/')).c_str()));
@@ -249,6 +251,7 @@ int PMSEnsurePackageAccount(const std::string& id, PackageAccount* account, std:
       return PKG_ERR_ACCOUNT_FILES;
     }
     *account = {name, static_cast<uid_t>(id_num), static_cast<gid_t>(id_num)};
+    if (created) *created = true;
   }
   return PKG_OK;
 }

@@ -34,10 +34,11 @@ std::string PMSPackageAccountName(const std::string& id, int attempt);
 bool PMSFindPackageAccount(const std::string& id, PackageAccount* account);
 
 // Finds the account of `id`, or creates it (with its group) under the
-// accounts lock (KIVOAccountsLockPath), each file replaced atomically.
-// PKG_OK, PKG_ERR_NO_ACCOUNT_ID or PKG_ERR_ACCOUNT_FILES (with `*error`).
+// accounts lock (KIVOAccountsLockPath), each file replaced atomically;
+// `*created` (when given) says which. PKG_OK, PKG_ERR_NO_ACCOUNT_ID or
+// PKG_ERR_ACCOUNT_FILES (with `*error`).
 [[nodiscard]] int PMSEnsurePackageAccount(const std::string& id, PackageAccount* account,
-                                          std::string* error);
+                                          std::string* error, bool* created = nullptr);
 
 // Removes the account and group of `id`, when it has them. False (with
 // `*error`) when the accounts files cannot be written.

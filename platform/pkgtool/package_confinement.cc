@@ -498,8 +498,8 @@ int PMSSettlePackageAccount(const std::string& id, const std::string& record,
                             const std::string& log_path, DataOwnership ownership,
                             std::string* error) {
   PackageAccount account;
-  const bool account_is_new = !PMSFindPackageAccount(id, &account);
-  int code = PMSEnsurePackageAccount(id, &account, error);
+  bool account_is_new = false;
+  int code = PMSEnsurePackageAccount(id, &account, error, &account_is_new);
   if (code != PKG_OK) return code;
   const OwnFolders own = FoldersOf(record);
   // Each path below names something inside the folder, so that the
