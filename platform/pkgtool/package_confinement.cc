@@ -367,6 +367,14 @@ bool ConfinementTurnedOff() {
          conf["package_confinement"] == "off";
 }
 
+// A script about to run as root may leave files of root's in the data
+// folder: the next start must walk it again (DataOwnership::kUnlessSettled).
+void ForgetDataOwner(const std::string& record) {
+  const std::string marker = record + "/" + kPMSDataOwnerFile;
+  if (unlink(marker.c_str()) != 0 && errno != ENOENT)
+    syslog(LOG_WARNING, "pkgtool: cannot remove %s: %m", marker.c_str());
+}
+
 }  // namespace
 
 PackageConfinement::~PackageConfinement() {
@@ -389,18 +397,6 @@ PackageConfinement& PackageConfinement::operator=(PackageConfinement&& other) no
   report_ = std::move(other.report_);
   return *this;
 }
-
-namespace {
-
-// A script about to run as root may leave files of root's in the data
-// folder: the next start must walk it again (DataOwnership::kUnlessSettled).
-void ForgetDataOwner(const std::string& record) {
-  const std::string marker = record + "/" + kPMSDataOwnerFile;
-  if (unlink(marker.c_str()) != 0 && errno != ENOENT)
-    syslog(LOG_WARNING, "pkgtool: cannot remove %s: %m", marker.c_str());
-}
-
-}  // namespace
 
 PackageConfinement PackageConfinementPrepareForScript(const std::string& script,
                                                       const std::string& arg,
