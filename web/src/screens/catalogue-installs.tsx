@@ -54,15 +54,16 @@ export function useInstalls(api: Api, { load, phases, setPhase, lastLoad }: Cata
   // way the page learns it: its progress reading the task's end, or a
   // catalogue answer that reports the download done before the progress
   // read it (a refresh as the download ends), which ends the progress.
+  // This effect only ever opens: it may run with the phases of a render
+  // from before the Install click (Preact runs a render's pending effects
+  // before the next one), which know nothing of the download yet. The
+  // download is forgotten where the page learns that it ended otherwise.
   useEffect(() => {
     for (const [id, entry] of mine.current) {
       const phase = phases[id];
-      if (phase?.kind === 'downloaded') {
-        mine.current.delete(id);
-        setWizard({ entry, taskId: phase.taskId });
-      } else if (phase?.kind !== 'starting' && phase?.kind !== 'running') {
-        mine.current.delete(id);
-      }
+      if (phase?.kind !== 'downloaded') continue;
+      mine.current.delete(id);
+      setWizard({ entry, taskId: phase.taskId });
     }
   }, [phases]);
 
@@ -73,8 +74,9 @@ export function useInstalls(api: Api, { load, phases, setPhase, lastLoad }: Cata
     else switching.current.delete(entry.id);
     // A plain download first: the wizard needs what the package file says.
     const answer = await startDownload(api, entry, switchOrigin);
-    if (answer.ok) setPhase(entry.id, { kind: 'running', taskId: startedTaskId(answer.data, entry.id) });
-    else setPhase(entry.id, { kind: 'note', text: messageFor(answer.error), failed: true });
+    if (answer.ok) return setPhase(entry.id, { kind: 'running', taskId: startedTaskId(answer.data, entry.id) });
+    mine.current.delete(entry.id);
+    setPhase(entry.id, { kind: 'note', text: messageFor(answer.error), failed: true });
   };
 
   const ended = (entry: ServerEntry, taskId: string, end: TaskEnd) => {
@@ -82,6 +84,7 @@ export function useInstalls(api: Api, { load, phases, setPhase, lastLoad }: Cata
       setPhase(entry.id, { kind: 'downloaded', taskId });
       return;
     }
+    mine.current.delete(entry.id);
     setPhase(entry.id, endPhase(entry, end, lastLoad()));
     // What the package is now (installed, running) comes from the appliance.
     if (end.kind !== 'cancelled') void load();
