@@ -12,7 +12,7 @@ import { join } from 'node:path';
 import { kBuild } from './appliance.ts';
 import { screenshot } from './browser.ts';
 import { buildSample, callApi, installedState } from './published.ts';
-import { card, openCatalogue } from './screens.ts';
+import { card, openCatalogue, shown } from './screens.ts';
 import { pagesPerTest, useSuite } from './suite.ts';
 
 const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
@@ -102,7 +102,7 @@ test('a root package signed only by a feed key is refused when its download is c
   await refusal
     .getByText('This package asks to run with full control of the appliance, which only a package signed by a key of the appliance keyring may.', { exact: false })
     .waitFor({ timeout: 90_000 })
-    .catch(async () => assert.fail(`no refusal; the dialog shows "${(await dialog.innerText()).replace(/\s+/g, ' ')}"`));
+    .catch(async () => assert.fail(`no refusal; the dialog: ${await shown(dialog)}`));
   assert.equal(await refusal.getAttribute('data-code'), '4620');
   await refusal.getByText('demo-root-feed asks to run as root', { exact: false }).waitFor();
   await screenshot(page, 'permissions-root-feed-refused');

@@ -15,7 +15,7 @@ import { readFileSync, readlinkSync, rmSync, writeFileSync } from 'node:fs';
 import type { Locator, Page } from 'playwright-core';
 import { checkAccessibility, screenshot } from './browser.ts';
 import { buildSample, installedState, offerInVendorCatalogue } from './published.ts';
-import { row } from './screens.ts';
+import { row, shown } from './screens.ts';
 import { pagesPerTest, useSuite } from './suite.ts';
 
 const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
@@ -38,7 +38,7 @@ async function upgradeFromInstalledList(page: Page, from: string, to: string): P
   await dialog
     .getByRole('button', { name: 'Next' })
     .waitFor({ timeout: 60_000 })
-    .catch(async () => assert.fail(`the wizard did not come; the dialog shows "${(await dialog.innerText()).replace(/\s+/g, ' ')}"`));
+    .catch(async () => assert.fail(`the wizard did not come; the dialog: ${await shown(dialog)}`));
   const upgrade = dialog.getByRole('button', { name: 'Upgrade', exact: true });
   for (let step = 0; step < 6 && !(await upgrade.isVisible()); ++step) await dialog.getByRole('button', { name: 'Next' }).click();
   await upgrade.click();
@@ -160,7 +160,7 @@ test('a volume without room for the safety copy: the dialog says so, and the adm
     await alert
       .getByText(/^The upgrade of demo-web needs [3-9] MiB for a safety copy of its data besides .+ and \/volume1 has 2 MiB free\. Nothing was changed\./)
       .waitFor({ timeout: 90_000 })
-      .catch(async () => assert.fail(`the dialog shows "${(await dialog.innerText()).replace(/\s+/g, ' ')}"`));
+      .catch(async () => assert.fail(`the dialog: ${await shown(dialog)}`));
     assert.deepEqual(installedState(suite.appliance, 'demo-web'), { version: from, running: true });
     await screenshot(page, 'upgrade-no-room-for-copy');
     await checkAccessibility(page, 'upgrade dialog, no room for the copy');

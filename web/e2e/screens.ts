@@ -10,7 +10,22 @@ import type { Appliance } from './appliance.ts';
 // first and this waits in vain.
 export async function openCatalogue(page: Page, appliance: Appliance): Promise<void> {
   await page.goto(new URL('#/catalogue', appliance.url).href);
-  await page.getByRole('heading', { name: 'Recommended' }).waitFor();
+  await page
+    .getByRole('heading', { name: 'Recommended' })
+    .waitFor()
+    .catch(async (e: unknown) => {
+      throw new Error(`the catalogue lists no packages; ${await shown(page.locator('body'))}`, { cause: e });
+    });
+}
+
+// What `where` (a dialog, say) shows now, in one line, for the message of a
+// wait that failed; the whole page's text when `where` is not on it, since
+// a dialog that never opened or closed early is what went wrong then.
+export async function shown(where: Locator): Promise<string> {
+  const oneLine = (text: string) => `"${text.replace(/\s+/g, ' ').trim()}"`;
+  const text = await where.innerText({ timeout: 1_000 }).catch(() => null);
+  if (text !== null) return `it shows ${oneLine(text)}`;
+  return `it is not shown; the page shows ${oneLine(await where.page().locator('body').innerText())}`;
 }
 
 // The catalogue's card of the package displayed as `name`.

@@ -14,7 +14,7 @@ import assert from 'node:assert/strict';
 import type { Locator, Page } from 'playwright-core';
 import { checkAccessibility, screenshot } from './browser.ts';
 import { buildSample, installedState, offerInVendorCatalogue, waitUntil } from './published.ts';
-import { card, openCatalogue, row } from './screens.ts';
+import { card, openCatalogue, row, shown } from './screens.ts';
 import { pagesPerTest, useSuite } from './suite.ts';
 
 const suite = useSuite({ prepare: (appliance) => appliance.agreeToTerms() });
@@ -37,7 +37,7 @@ async function runWizard(dialog: Locator): Promise<void> {
   await dialog
     .getByText('Install on volume')
     .waitFor({ timeout: 60_000 })
-    .catch(async () => assert.fail(`the wizard did not come; the dialog shows "${(await dialog.innerText()).replace(/\s+/g, ' ')}"`));
+    .catch(async () => assert.fail(`the wizard did not come; the dialog: ${await shown(dialog)}`));
   await dialog.getByRole('button', { name: 'Next' }).click();
   await dialog.getByText('Summary').waitFor();
   await dialog.getByRole('button', { name: 'Upgrade', exact: true }).click();
