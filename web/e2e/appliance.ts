@@ -23,15 +23,28 @@ export const kConfinable =
   process.getuid?.() === 0 &&
   (existsSync('/sys/fs/cgroup/cgroup.controllers') || (existsSync('/sys/fs/cgroup/memory') && existsSync('/sys/fs/cgroup/pids')));
 
-export function freePort(): Promise<number> {
-  return new Promise((done, fail) => {
+// Whether nothing listens on `port` now, on any address.
+function unused(port: number): Promise<boolean> {
+  return new Promise((done) => {
     const server = createServer();
-    server.once('error', fail);
-    server.listen(0, '127.0.0.1', () => {
-      const address = server.address();
-      server.close(() => done(typeof address === 'object' && address ? address.port : 0));
-    });
+    server.once('error', () => done(false));
+    server.listen(port, '0.0.0.0', () => server.close(() => done(true)));
   });
+}
+
+// A port nothing listens on, chosen below the kernel's range of ephemeral
+// ports: a port of that range can be taken, between its choice and its use,
+// by any outgoing connection (the browser's, the web API's own fetches),
+// and demo-web's install then refuses it as in use.
+export async function freePort(): Promise<number> {
+  const range = readFileSync('/proc/sys/net/ipv4/ip_local_port_range', 'utf8');
+  const top = Math.min(Number(range.trim().split(/\s+/)[0]) || 32768, 65536) - 1;
+  const bottom = Math.max(1024, top - 12_000);
+  for (let attempt = 0; attempt < 100; ++attempt) {
+    const port = bottom + Math.floor(Math.random() * (top - bottom + 1));
+    if (await unused(port)) return port;
+  }
+  throw new Error(`no free port between ${bottom} and ${top}`);
 }
 
 async function waitForPage(url: string, server: ChildProcess): Promise<void> {
@@ -56,42 +69,42 @@ export class Appliance {
     private readonly server: ChildProcess,
   ) {}
 
+  // An appliance that cannot start leaves nothing running behind: a web
+  // server left running would keep the test file's process from ending.
   static async start(): Promise<Appliance> {
     const root = mkdtempSync(join(tmpdir(), 'kivo-page-'));
     const port = await freePort();
     // demo-web gets a port of its own too, so that appliances of other test
     // files, or a demo left running, never take it.
     const demoWebPort = await freePort();
-    execFileSync(join(kRepo, 'scripts/demo-root.sh'), [root, String(port)], {
-      env: { ...process.env, KIVO_DEMO_PASSWORD: kPassword, DEMO_WEB_PORT: String(demoWebPort) },
-      stdio: ['ignore', 'ignore', 'inherit'],
-    });
+    try {
+      execFileSync(join(kRepo, 'scripts/demo-root.sh'), [root, String(port)], {
+        env: { ...process.env, KIVO_DEMO_PASSWORD: kPassword, DEMO_WEB_PORT: String(demoWebPort) },
+        stdio: ['ignore', 'ignore', 'inherit'],
+      });
+      expectDemoRunning(root, demoWebPort);
+    } catch (e) {
+      dropRoot(root);
+      throw e;
+    }
     const server = spawn('/usr/sbin/lighttpd', ['-D', '-f', join(root, 'lighttpd.conf')], {
       stdio: ['ignore', 'ignore', 'pipe'],
     });
     server.stderr?.on('data', (chunk: Buffer) => process.env.KIVO_E2E_VERBOSE && process.stderr.write(chunk));
     const url = `http://127.0.0.1:${port}/`;
-    await waitForPage(url, server);
     const appliance = new Appliance(root, url, demoWebPort, server);
-    appliance.expectDemoRunning();
-    return appliance;
-  }
-
-  // demo-web and demo-notes (which needs it) run from the start: if another
-  // program took demo-web's port between its choice and the start, every
-  // test here would fail for no visible reason, so say so at once.
-  private expectDemoRunning(): void {
-    const listed = this.kivoctl('list');
-    for (const id of ['demo-web', 'demo-notes']) {
-      if (!new RegExp(`^${id} .* running$`, 'm').test(listed)) {
-        throw new Error(`${id} does not run in the test appliance; is something else holding port ${this.demoWebPort}?\n${listed}`);
-      }
+    try {
+      await waitForPage(url, server);
+    } catch (e) {
+      await appliance.stop();
+      throw e;
     }
+    return appliance;
   }
 
   // Runs kivoctl on this appliance's root, e.g. kivoctl('status', 'demo-web').
   kivoctl(...args: string[]): string {
-    return execFileSync(join(kBuild, 'bin/kivoctl'), ['--root', this.root, ...args], { encoding: 'utf8' });
+    return kivoctlOn(this.root, ...args);
   }
 
   // Records that `account` agreed to the terms of service the demo's vendor
@@ -163,18 +176,40 @@ export class Appliance {
       this.server.kill('SIGTERM');
       await ended;
     }
-    // Package services the tests started run on after the web server.
-    try {
-      for (const id of this.kivoctl('list').split('\n').filter(Boolean)) this.kivoctl('stop', id.split(/\s/)[0]);
-    } catch {
-      // a package that will not stop is left to the root's removal
-    }
-    try {
-      // The packages' control groups outlive the root's folder otherwise.
-      this.kivoctl('drop-groups');
-    } catch {
-      // without root or cgroups there were none to drop
-    }
-    rmSync(this.root, { recursive: true, force: true });
+    dropRoot(this.root);
   }
+}
+
+function kivoctlOn(root: string, ...args: string[]): string {
+  return execFileSync(join(kBuild, 'bin/kivoctl'), ['--root', root, ...args], { encoding: 'utf8' });
+}
+
+// demo-web and demo-notes (which needs it) run from the start: if another
+// program took demo-web's port between its choice and the start, every
+// test here would fail for no visible reason, so say so at once.
+function expectDemoRunning(root: string, demoWebPort: number): void {
+  const listed = kivoctlOn(root, 'list');
+  for (const id of ['demo-web', 'demo-notes']) {
+    if (!new RegExp(`^${id} .* running$`, 'm').test(listed)) {
+      throw new Error(`${id} does not run in the test appliance; is something else holding port ${demoWebPort}?\n${listed}`);
+    }
+  }
+}
+
+// Stops what runs from `root` (the web server is stopped already) and
+// removes it.
+function dropRoot(root: string): void {
+  // Package services the tests started run on after the web server.
+  try {
+    for (const id of kivoctlOn(root, 'list').split('\n').filter(Boolean)) kivoctlOn(root, 'stop', id.split(/\s/)[0]);
+  } catch {
+    // a package that will not stop is left to the root's removal
+  }
+  try {
+    // The packages' control groups outlive the root's folder otherwise.
+    kivoctlOn(root, 'drop-groups');
+  } catch {
+    // without root or cgroups there were none to drop
+  }
+  rmSync(root, { recursive: true, force: true });
 }
