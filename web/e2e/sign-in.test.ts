@@ -14,6 +14,22 @@ const suite = useSuite({
 });
 const pages = pagesPerTest(suite);
 
+test('an address changed while the signed-in page first appears is followed', async () => {
+  const { page } = await pages.signedOut();
+  // The moment the header with its tabs enters the document, before the
+  // page has painted it, the address moves to the catalogue, as a link
+  // followed or a test's goto at that moment does.
+  await page.evaluate(() => {
+    new MutationObserver((_, observer) => {
+      if (!document.querySelector('nav[aria-label="Sections"]')) return;
+      observer.disconnect();
+      location.hash = '#/catalogue';
+    }).observe(document.body, { childList: true, subtree: true });
+  });
+  await signIn(page);
+  await page.getByRole('navigation', { name: 'Sections' }).locator('a[aria-current="page"]', { hasText: 'All packages' }).waitFor();
+});
+
 test('an administrator signs in, stays signed in across a reload and signs out', async () => {
   const { context, page } = await pages.signedOut();
   await screenshot(page, 'sign-in');

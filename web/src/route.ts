@@ -22,11 +22,22 @@ export function routeHref(route: Route): string {
   return route.id ? `#/${route.screen}/${encodeURIComponent(route.id)}` : `#/${route.screen}`;
 }
 
+function sameRoute(a: Route, b: Route): boolean {
+  return a.screen === b.screen && a.id === b.id;
+}
+
 export function useRoute(): Route {
   const [route, setRoute] = useState(() => parseRoute(location.hash));
   useEffect(() => {
-    const follow = () => setRoute(parseRoute(location.hash));
+    const follow = () => {
+      const next = parseRoute(location.hash);
+      setRoute((current) => (sameRoute(current, next) ? current : next));
+    };
     addEventListener('hashchange', follow);
+    // The listener starts after the first paint: an address changed
+    // before it (a link followed, or a tab opened, as the page appears)
+    // sent its hashchange to nobody, so read the address once more.
+    follow();
     return () => removeEventListener('hashchange', follow);
   }, []);
   return route;
