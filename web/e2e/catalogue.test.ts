@@ -13,6 +13,7 @@ import type { AddressInfo } from 'node:net';
 import type { Locator, Page } from 'playwright-core';
 import { kPassword } from './appliance.ts';
 import { checkAccessibility, openPage, screenshot } from './browser.ts';
+import { card, shown } from './screens.ts';
 import { pagesPerTest, useSuite, type Opened } from './suite.ts';
 
 // The slow package: large enough, and sent slowly enough (64 KiB a second),
@@ -79,17 +80,19 @@ async function addFeed(feed: string, name: string): Promise<void> {
   assert.equal(answer.success, true, JSON.stringify(answer));
 }
 
-function card(page: Page, name: string): Locator {
-  return page.getByRole('listitem', { name, exact: true });
-}
-
 // Opens the catalogue, agreeing to the terms of service when the package
 // center asks first (the account's first visit).
 async function openCatalogue(page: Page): Promise<void> {
   await page.goto(new URL('#/catalogue', suite.appliance.url).href);
   const agree = page.getByRole('button', { name: 'I agree' });
   const listed = page.getByRole('heading', { name: 'Recommended' });
-  await agree.or(listed).first().waitFor();
+  await agree
+    .or(listed)
+    .first()
+    .waitFor()
+    .catch(async (e: unknown) => {
+      throw new Error(`neither the terms nor the catalogue show; ${await shown(page.locator('body'))}`, { cause: e });
+    });
   if (await agree.isVisible()) await agree.click();
   await listed.waitFor();
 }
