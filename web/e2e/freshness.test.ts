@@ -88,8 +88,8 @@ test('a feed that starts failing is shown failing, with why, since when and its 
 test('a feed that answers but lists nothing says so when added and in the catalogue', async () => {
   const { page } = await pages.signedIn();
   await page.goto(new URL('#/settings', suite.appliance.url).href);
-  await page.getByLabel('Name').fill('Empty feed');
-  await page.getByLabel('Address').fill(feedUrl('/empty.json'));
+  await page.getByLabel('Name', { exact: true }).fill('Empty feed');
+  await page.getByLabel('Address', { exact: true }).fill(feedUrl('/empty.json'));
   await page.getByRole('button', { name: 'Add feed' }).click();
   await page.getByText('It answers, but its catalogue lists no packages').waitFor({ timeout: 20_000 });
   await openCatalogue(page, suite.appliance);

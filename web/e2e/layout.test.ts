@@ -157,8 +157,8 @@ test('every screen of the package center fits a phone, the header with its tabs 
   // publisher's key in the keyring.
   const feeds = page.getByRole('region', { name: 'Feeds' });
   const address = new URL('community/catalogue.json?channel=stable-and-more', suite.appliance.url).href;
-  await feeds.getByLabel('Name').fill('community');
-  await feeds.getByLabel('Address').fill(address);
+  await feeds.getByLabel('Name', { exact: true }).fill('community');
+  await feeds.getByLabel('Address', { exact: true }).fill(address);
   await feeds.getByRole('button', { name: 'Add feed' }).click();
   const row = feeds.getByRole('row', { name: /community/ });
   await row.waitFor();

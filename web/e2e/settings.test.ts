@@ -164,12 +164,12 @@ test('the community feed is added with its keys, renamed and deleted; a dead fee
   await feeds.getByText('No feed is added.').waitFor();
   const community = `${suite.appliance.url}community/catalogue.json`;
 
-  await feeds.getByLabel('Address').fill(`${suite.appliance.url}nothing-here/catalogue.json`);
+  await feeds.getByLabel('Address', { exact: true }).fill(`${suite.appliance.url}nothing-here/catalogue.json`);
   await feeds.getByRole('button', { name: 'Add feed' }).click();
   await feeds.getByRole('alert').filter({ hasText: /package server|package source/i }).waitFor();
 
-  await feeds.getByLabel('Name').fill('Community');
-  await feeds.getByLabel('Address').fill(community);
+  await feeds.getByLabel('Name', { exact: true }).fill('Community');
+  await feeds.getByLabel('Address', { exact: true }).fill(community);
   await feeds.getByRole('button', { name: 'Add feed' }).click();
   await feeds.getByRole('cell', { name: 'Community', exact: true }).waitFor();
   await feeds.getByRole('status').filter({ hasText: /brings its publishers' signing keys/ }).waitFor();
