@@ -10,6 +10,7 @@ import { mkdirSync } from 'node:fs';
 import { join } from 'node:path';
 import type { BrowserContext, Locator, Page } from 'playwright-core';
 import { checkAccessibility, kScreenshots, openPage, screenshot, signIn } from './browser.ts';
+import { shown } from './screens.ts';
 import { useSuite } from './suite.ts';
 
 const kPhone = { width: 390, height: 844 };
@@ -99,7 +100,9 @@ async function expectGoneFailureInside(page: Page, what: string): Promise<void> 
   const card = page.getByRole('listitem', { name: 'Demo Gone', exact: true });
   await card.getByRole('button', { name: 'Install Demo Gone' }).click();
   const failure = card.getByRole('alert').filter({ hasText: /download of http:\/\/\S+\/feed\/demo-gone\.kpk failed/ });
-  await failure.waitFor();
+  await failure.waitFor().catch(async (e: unknown) => {
+    throw new Error(`no failure in the card of Demo Gone; the card: ${await shown(card)}`, { cause: e });
+  });
   await expectTextInside(failure, card, what);
 }
 
