@@ -1,6 +1,7 @@
 #include "host/usage_api.h"
 
 #include <string>
+#include <utility>
 
 #include "pkgtool/package_cgroup.h"
 #include "pkgtool/package_confinement.h"
@@ -20,7 +21,7 @@ Json::Value FigureJson(const UsageFigure& f) {
   return out;
 }
 
-Json::Value UsageJson(const std::string& id, const PackageUsage& usage) {
+Json::Value UsageJson(const std::string& id, const PackageUsage& usage, KIVOJsonParser* parser) {
   Json::Value out(Json::objectValue);
   out["id"] = id;
   out["cpu_ns"] = FigureJson(usage.cpu_ns);
@@ -30,8 +31,8 @@ Json::Value UsageJson(const std::string& id, const PackageUsage& usage) {
   // The record as the package's scripts last wrote it; null when there is
   // none yet, which the page shows as not confined yet.
   Json::Value confinement;
-  if (!PMSLoadConfinement(id, &confinement)) confinement = Json::Value(Json::nullValue);
-  out["confinement"] = confinement;
+  if (!PMSLoadConfinement(id, &confinement, parser)) confinement = Json::Value(Json::nullValue);
+  out["confinement"] = std::move(confinement);
   return out;
 }
 
@@ -41,11 +42,12 @@ void UsageList(const APIRequest&, APIResponse* response) {
   Json::Value packages(Json::arrayValue);
   const std::vector<std::string> ids = PackageRegistry::List();
   const std::vector<PackageUsage> usages = PackageCgroupUsages(ids);
-  for (size_t i = 0; i < ids.size(); ++i) packages.append(UsageJson(ids[i], usages[i]));
+  KIVOJsonParser parser;
+  for (size_t i = 0; i < ids.size(); ++i) packages.append(UsageJson(ids[i], usages[i], &parser));
   Json::Value data(Json::objectValue);
   data["total"] = packages.size();
-  data["packages"] = packages;
-  response->SetSuccess(data);
+  data["packages"] = std::move(packages);
+  response->SetSuccess(std::move(data));
 }
 
 void UsageGet(const APIRequest& request, APIResponse* response) {
@@ -61,5 +63,6 @@ void UsageGet(const APIRequest& request, APIResponse* response) {
     data["message"] = id.Get() + " is not installed";
     return response->SetError(kErrUsageNotInstalled, data);
   }
-  response->SetSuccess(UsageJson(id.Get(), PackageCgroupUsage(id.Get())));
+  KIVOJsonParser parser;
+  response->SetSuccess(UsageJson(id.Get(), PackageCgroupUsage(id.Get()), &parser));
 }

@@ -78,8 +78,9 @@ class PackageCgroupTest : public AdminApiTest {
   std::vector<std::string> GroupDirs(const std::string& id) {
     std::vector<std::string> dirs;
     std::istringstream in(FileText(root_.Path("/run/kivo/pkgtool/cgroups/" + id)));
-    std::string what, kind, dir;
-    while (in >> what >> kind >> dir) dirs.push_back(dir);
+    // "<what> v1|v2 <dir> <bound>" lines.
+    std::string what, kind, dir, bound;
+    while (in >> what >> kind >> dir >> bound) dirs.push_back(dir);
     return dirs;
   }
   // The group folder of `id` that has `file`.
@@ -240,6 +241,16 @@ TEST_F(PackageCgroupTest, LimitsAboveTheBoundsAreRefusedAndWithinThemApplied) {
   Json::Value usage = client().Call(kUsage, "get", 1, {{"id", "edge"}}).Data();
   EXPECT_EQ(50u, usage["process_limit"]["value"].asUInt()) << usage;
   EXPECT_EQ(64u << 20, usage["memory_limit_bytes"]["value"].asUInt64()) << usage;
+
+  // A bound lowered later holds from the next start, and the usage says so
+  // as the kernel does.
+  root_.Write("/etc/kivo/pkgtool.conf", "memory_limit_mb_max=\"48\"\nprocess_limit_max=\"40\"\n");
+  ASSERT_EQ(0, Kivoctl({"stop", "edge"}, &out_)) << out_;
+  ASSERT_EQ(0, Kivoctl({"start", "edge"}, &out_)) << out_;
+  usage = client().Call(kUsage, "list", 1).Data()["packages"][0];
+  EXPECT_EQ(40u, usage["process_limit"]["value"].asUInt()) << usage;
+  EXPECT_EQ(48u << 20, usage["memory_limit_bytes"]["value"].asUInt64()) << usage;
+  EXPECT_EQ("40\n", FileText(GroupWith("edge", "pids.max") + "/pids.max"));
 }
 
 TEST_F(PackageCgroupTest, UsageOfAPackageThatNeverRanIsNotMeasuredAndSaysWhy) {

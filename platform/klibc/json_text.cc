@@ -6,7 +6,7 @@
 
 #include <json/reader.h>
 
-bool KIVOParseJson(std::string_view text, Json::Value* out, JsonSyntax syntax) {
+KIVOJsonParser::KIVOJsonParser(JsonSyntax syntax) {
   Json::CharReaderBuilder builder;
   if (syntax == JsonSyntax::Strict) {
     Json::CharReaderBuilder::strictMode(&builder.settings_);
@@ -14,16 +14,23 @@ bool KIVOParseJson(std::string_view text, Json::Value* out, JsonSyntax syntax) {
   }
   builder["collectComments"] = false;
   builder["stackLimit"] = kMaxJsonDepth;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  reader_.reset(builder.newCharReader());
+}
+
+bool KIVOJsonParser::Parse(std::string_view text, Json::Value* out) {
   Json::Value parsed;
   bool ok = false;
   try {
-    ok = reader->parse(text.data(), text.data() + text.size(), &parsed, nullptr);
+    ok = reader_->parse(text.data(), text.data() + text.size(), &parsed, nullptr);
   } catch (const std::exception&) {
     ok = false;  // nested past the stack limit
   }
   *out = ok ? std::move(parsed) : Json::Value();
   return ok;
+}
+
+bool KIVOParseJson(std::string_view text, Json::Value* out, JsonSyntax syntax) {
+  return KIVOJsonParser(syntax).Parse(text, out);
 }
 
 std::unique_ptr<Json::StreamWriter> KIVONewJsonWriter(const std::string& indentation) {

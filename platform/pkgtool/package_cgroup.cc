@@ -9,6 +9,7 @@
 #include <cstring>
 #include <dirent.h>
 #include <fcntl.h>
+#include <map>
 #include <set>
 #include <sstream>
 #include <sys/stat.h>
@@ -26,11 +27,14 @@ constexpr char kDefaultParent[] = "kivo-packages";
 constexpr int kInfoLimitMax = 1048576;  // what INFO may say at all, whatever the appliance
 
 // One controller's group of a package: which controller, whether it lives
-// in the unified hierarchy, and its folder.
+// in the unified hierarchy, its folder and the bound the tool last set on it.
 struct Group {
   std::string what;  // "memory", "pids" or "cpu"
   bool v2 = false;
   std::string dir;
+  // Bytes of memory or a number of processes, as written to the group; 0
+  // when none was (cpu, or a controller that refused it).
+  uint64_t limit = 0;
 };
 
 // A mounted cgroup hierarchy as /proc/self/mountinfo shows it.
@@ -86,11 +90,15 @@ std::string RootName(const std::string& root) {
   return text;
 }
 
+// The words of `line`, split at spaces and tabs.
 std::vector<std::string> Fields(const std::string& line) {
   std::vector<std::string> fields;
-  std::istringstream in(line);
-  std::string f;
-  while (in >> f) fields.push_back(f);
+  size_t at = 0;
+  while ((at = line.find_first_not_of(" \t", at)) != std::string::npos) {
+    const size_t end = std::min(line.find_first_of(" \t", at), line.size());
+    fields.push_back(line.substr(at, end - at));
+    at = end;
+  }
   return fields;
 }
 
@@ -243,18 +251,38 @@ bool IsGroupDir(const Env& env, const Group& g, const std::string& id) {
   return false;
 }
 
-// The groups recorded for `id` ("<what> v1|v2 <dir>" lines), each checked
-// whole; none when the record is missing or any line is not valid.
+// A count of up to 18 digits (a bound in bytes or processes) into *value.
+bool Counted(const std::string& text, uint64_t* value) {
+  if (text.empty() || text.size() > 18 || text.find_first_not_of("0123456789") != std::string::npos)
+    return false;
+  *value = std::strtoull(text.c_str(), nullptr, 10);
+  return true;
+}
+
+// The record of `groups`: a "<what> v1|v2 <dir> <limit>" line each.
+std::string RecordText(const std::vector<Group>& groups) {
+  std::string text;
+  for (const Group& g : groups)
+    text += g.what + (g.v2 ? " v2 " : " v1 ") + g.dir + " " + std::to_string(g.limit) + "\n";
+  return text;
+}
+
+// The groups recorded for `id`, each line checked whole; none when the
+// record is missing or any line is not valid.
 std::vector<Group> RecordedGroups(const Env& env, const std::string& id) {
   std::vector<Group> groups;
   std::string text;
   if (!KIVOReadFile(RecordPath(id, env.root), &text, 1 << 14)) return groups;
-  std::istringstream in(text);
-  std::string line;
-  while (std::getline(in, line)) {
-    std::vector<std::string> f = Fields(line);
-    if (f.size() != 3 || (f[1] != "v1" && f[1] != "v2")) return {};
-    Group g{f[0], f[1] == "v2", f[2]};
+  size_t at = 0;
+  while (at < text.size()) {
+    const size_t end = std::min(text.find('\n', at), text.size());
+    const std::vector<std::string> f = Fields(text.substr(at, end - at));
+    at = end + 1;
+    Group g;
+    if (f.size() != 4 || (f[1] != "v1" && f[1] != "v2") || !Counted(f[3], &g.limit)) return {};
+    g.what = f[0];
+    g.v2 = f[1] == "v2";
+    g.dir = f[2];
     if ((g.what != "memory" && g.what != "pids" && g.what != "cpu") || !IsGroupDir(env, g, id))
       return {};
     groups.push_back(g);
@@ -263,11 +291,9 @@ std::vector<Group> RecordedGroups(const Env& env, const std::string& id) {
 }
 
 [[nodiscard]] bool WriteRecord(const std::string& id, const std::vector<Group>& groups) {
-  std::string text;
-  for (const Group& g : groups) text += g.what + (g.v2 ? " v2 " : " v1 ") + g.dir + "\n";
   const std::string path = RecordPath(id);
   return KIVOFSMkdirP(path.substr(0, path.rfind('/')).c_str(), 0700) == 0 &&
-         KIVOWriteFileAtomic(path, text, SyncToDisk::No, 0600);
+         KIVOWriteFileAtomic(path, RecordText(groups), SyncToDisk::No, 0600);
 }
 
 [[nodiscard]] bool WriteValue(const std::string& file, const std::string& value) {
@@ -319,10 +345,13 @@ bool MakeGroupDir(const std::string& dir) {
   return false;
 }
 
-// Sets `limits` on the package's group `g`; false with `missing` when the
-// controller refused.
-bool SetLimit(const Group& g, const PackageLimits& limits, std::string* missing) {
-  const std::string bytes = std::to_string(static_cast<uint64_t>(limits.memory_mb) << 20);
+// Sets `limits` on the package's group *g and keeps the bound in g->limit;
+// false with `missing` when the controller refused (g->limit is then 0).
+bool SetLimit(Group* group, const PackageLimits& limits, std::string* missing) {
+  const Group& g = *group;
+  const uint64_t memory = static_cast<uint64_t>(limits.memory_mb) << 20;
+  const std::string bytes = std::to_string(memory);
+  group->limit = 0;
   bool ok = true;
   if (g.what == "pids") {
     ok = WriteValue(g.dir + "/pids.max", std::to_string(limits.processes));
@@ -341,8 +370,12 @@ bool SetLimit(const Group& g, const PackageLimits& limits, std::string* missing)
     if (has_memsw)
       ok = WriteValue(memsw, bytes) && (ok || WriteValue(g.dir + "/memory.limit_in_bytes", bytes));
   }
-  if (!ok) *missing += g.what + ": the limit could not be set (" + ErrnoText() + ")\n";
-  return ok;
+  if (!ok) {
+    *missing += g.what + ": the limit could not be set (" + ErrnoText() + ")\n";
+    return false;
+  }
+  if (g.what != "cpu") group->limit = g.what == "pids" ? limits.processes : memory;
+  return true;
 }
 
 const Group* FindGroup(const std::vector<Group>& groups, const std::string& what) {
@@ -385,28 +418,72 @@ std::vector<Group> GroupsFor(const Env& env, const std::string& id, std::string*
   return groups;
 }
 
-// A control file's number. A usage list reads hundreds of these: plain
-// open and read, without the size check of a general file read (a control
-// file says 4096 whatever it holds), and done at the newline that ends the
-// value, which the kernel writes with it in one piece.
-bool ReadNumber(const std::string& file, uint64_t* value) {
-  int fd = open(file.c_str(), O_RDONLY | O_CLOEXEC);
+// Opens the control files of groups. The kernel walks a cgroup path one
+// component at a time (each a lookup and a revalidation in its own file
+// system), and the paths are long, while a usage list opens files of
+// hundreds of groups that share their parent folder: each file is opened
+// relative to its group's parent, which is opened once. A parent that
+// cannot be opened leaves its groups to the whole path.
+class ControlFiles {
+ public:
+  ControlFiles() = default;
+  ~ControlFiles() {
+    for (const auto& parent : parents_) {
+      if (parent.second >= 0) close(parent.second);
+    }
+  }
+  ControlFiles(const ControlFiles&) = delete;
+  ControlFiles& operator=(const ControlFiles&) = delete;
+
+  // `file` ("/memory.current") of the group folder `dir`, opened to read;
+  // -1 with errno when it cannot be.
+  int Open(const std::string& dir, const char* file) {
+    const size_t slash = dir.rfind('/');
+    const int parent = slash == std::string::npos || slash == 0 ? -1 : Parent(dir.substr(0, slash));
+    if (parent < 0) return open((dir + file).c_str(), O_RDONLY | O_CLOEXEC);
+    return openat(parent, (dir.substr(slash + 1) + file).c_str(), O_RDONLY | O_CLOEXEC);
+  }
+
+ private:
+  int Parent(const std::string& folder) {
+    auto it = parents_.find(folder);
+    if (it == parents_.end()) {
+      const int fd = open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+      it = parents_.emplace(folder, fd).first;
+    }
+    return it->second;
+  }
+
+  std::map<std::string, int> parents_;  // folder -> descriptor, -1 when it would not open
+};
+
+// The text of an open control file, which the kernel writes in one piece
+// ending in a newline; closes `fd`. False when it cannot be read or does
+// not fit `size`.
+bool ReadControl(int fd, char* text, size_t size) {
   if (fd < 0) return false;
-  char text[64];
-  size_t size = 0;
-  while (size < sizeof(text) - 1) {
-    ssize_t n = read(fd, text + size, sizeof(text) - 1 - size);
+  size_t used = 0;
+  while (used < size - 1) {
+    ssize_t n = read(fd, text + used, size - 1 - used);
     if (n < 0 && errno == EINTR) continue;
     if (n <= 0) {
-      if (n < 0) size = 0;
+      if (n < 0) used = 0;
       break;
     }
-    size += static_cast<size_t>(n);
-    if (text[size - 1] == '\n') break;
+    used += static_cast<size_t>(n);
+    if (text[used - 1] == '\n') break;
   }
   close(fd);
-  text[size] = '\0';
-  if (size == 0 || size == sizeof(text) - 1) return false;
+  text[used] = '\0';
+  return used > 0 && used < size - 1;
+}
+
+// A control file's number. A usage list reads hundreds of these: plain
+// open and read, without the size check of a general file read (a control
+// file says 4096 whatever it holds).
+bool ReadNumber(ControlFiles* files, const std::string& dir, const char* file, uint64_t* value) {
+  char text[64];
+  if (!ReadControl(files->Open(dir, file), text, sizeof(text))) return false;
   char* end = nullptr;
   errno = 0;
   unsigned long long v = std::strtoull(text, &end, 10);
@@ -416,9 +493,9 @@ bool ReadNumber(const std::string& file, uint64_t* value) {
 }
 
 // "usage_usec <n>" of a unified group's cpu.stat, in nanoseconds.
-bool ReadCpuStat(const std::string& dir, uint64_t* ns) {
-  std::string text;
-  if (!KIVOReadFile(dir + "/cpu.stat", &text, 4096)) return false;
+bool ReadCpuStat(ControlFiles* files, const std::string& dir, uint64_t* ns) {
+  char text[4096];
+  if (!ReadControl(files->Open(dir, "/cpu.stat"), text, sizeof(text))) return false;
   std::istringstream in(text);
   std::string key;
   unsigned long long value = 0;
@@ -431,8 +508,10 @@ bool ReadCpuStat(const std::string& dir, uint64_t* ns) {
   return false;
 }
 
-UsageFigure Figure(const std::vector<Group>& groups, const std::string& what,
-                   const std::string& missing, bool (*read)(const Group&, uint64_t*)) {
+using FigureRead = bool (*)(ControlFiles*, const Group&, uint64_t*);
+
+UsageFigure Figure(ControlFiles* files, const std::vector<Group>& groups, const std::string& what,
+                   const std::string& missing, FigureRead read) {
   UsageFigure f;
   const Group* g = FindGroup(groups, what);
   if (!g) {
@@ -441,7 +520,7 @@ UsageFigure Figure(const std::vector<Group>& groups, const std::string& what,
         at == std::string::npos
             ? "no " + what + " controller"
             : missing.substr(at + what.size() + 2, missing.find('\n', at) - at - what.size() - 2);
-  } else if (read(*g, &f.value)) {
+  } else if (read(files, *g, &f.value)) {
     f.measured = true;
   } else {
     // Why there is no figure is asked only when there is none: the list
@@ -453,16 +532,18 @@ UsageFigure Figure(const std::vector<Group>& groups, const std::string& what,
   return f;
 }
 
-bool ReadCpu(const Group& g, uint64_t* v) {
-  return g.v2 ? ReadCpuStat(g.dir, v) : ReadNumber(g.dir + "/cpuacct.usage", v);
+bool ReadCpu(ControlFiles* files, const Group& g, uint64_t* v) {
+  return g.v2 ? ReadCpuStat(files, g.dir, v) : ReadNumber(files, g.dir, "/cpuacct.usage", v);
 }
-bool ReadMemory(const Group& g, uint64_t* v) {
-  return ReadNumber(g.dir + (g.v2 ? "/memory.current" : "/memory.usage_in_bytes"), v);
+bool ReadMemory(ControlFiles* files, const Group& g, uint64_t* v) {
+  return ReadNumber(files, g.dir, g.v2 ? "/memory.current" : "/memory.usage_in_bytes", v);
 }
-bool ReadMemoryLimit(const Group& g, uint64_t* v) {
-  return ReadNumber(g.dir + (g.v2 ? "/memory.max" : "/memory.limit_in_bytes"), v);
+bool ReadMemoryLimit(ControlFiles* files, const Group& g, uint64_t* v) {
+  return ReadNumber(files, g.dir, g.v2 ? "/memory.max" : "/memory.limit_in_bytes", v);
 }
-bool ReadProcessLimit(const Group& g, uint64_t* v) { return ReadNumber(g.dir + "/pids.max", v); }
+bool ReadProcessLimit(ControlFiles* files, const Group& g, uint64_t* v) {
+  return ReadNumber(files, g.dir, "/pids.max", v);
+}
 
 // Kills every process of the group at `dir` until none is left or about
 // two seconds have passed, then removes the folder.
@@ -568,8 +649,10 @@ PackageCgroupJoin PackageCgroupPrepare(const std::string& id, const PackageLimit
   const Env env = LoadEnv();
   bool recorded = false;
   std::vector<Group> groups = GroupsFor(env, id, &join.missing_, &recorded);
+  const std::string before = recorded ? RecordText(groups) : "";
   std::vector<Group> used;
-  for (const Group& g : groups) {
+  for (Group& g : groups) {
+    g.limit = 0;
     const bool first_in_dir =
         !FindGroup(used, g.what) && (used.empty() || used.back().dir != g.dir);
     if (!recorded && !MakeGroupDir(g.dir)) {
@@ -580,7 +663,7 @@ PackageCgroupJoin PackageCgroupPrepare(const std::string& id, const PackageLimit
         !HandDown(g.dir.substr(0, g.dir.size() - OwnTail(env, id).size()), g.dir, &join.missing_)) {
       continue;
     }
-    if (!SetLimit(g, limits, &join.missing_)) continue;
+    if (!SetLimit(&g, limits, &join.missing_)) continue;
     used.push_back(g);
     if (!first_in_dir || join.count_ == PackageCgroupJoin::kMaxGroups) continue;
     int fd = open((g.dir + JoinFile(g)).c_str(), O_WRONLY | O_CLOEXEC);
@@ -591,7 +674,10 @@ PackageCgroupJoin PackageCgroupPrepare(const std::string& id, const PackageLimit
     }
     join.fds_[join.count_++] = fd;
   }
-  if (!recorded && !used.empty() && !WriteRecord(id, used))
+  // The record says where the groups are and the bounds they have now,
+  // which the usage list shows without asking the kernel for them again.
+  const std::vector<Group>& record = recorded ? groups : used;
+  if (!record.empty() && RecordText(record) != before && !WriteRecord(id, record))
     join.missing_ += "control group: cannot record where the groups are\n";
   return join;
 }
@@ -644,51 +730,60 @@ bool PackageCgroupRemove(const std::string& id, std::string* problem) {
 
 namespace {
 
-// The usage of `id` when its record names a group for every controller
-// and each of them answers: what a package that ran has, read without
-// checking the groups first (a figure read is proof enough that its group
-// is there). False when anything is missing: GroupsFor then says why.
-bool MeasuredInRecordedGroups(const Env& env, const std::string& id, PackageUsage* usage) {
+// The usage of `id` when its record names a group for every controller,
+// with the bounds set on them, and each of them answers: what a package
+// that ran has, read without checking the groups first (a figure read is
+// proof enough that its group is there). The bounds are those the tool set
+// at the package's last start, as recorded; the kernel is asked only for
+// what changes. False when anything is missing: GroupsFor then says why.
+bool MeasuredInRecordedGroups(const Env& env, ControlFiles* files, const std::string& id,
+                              PackageUsage* usage) {
   if (env.off) return false;
   const std::vector<Group> groups = RecordedGroups(env, id);
   const Group* cpu = FindGroup(groups, "cpu");
   const Group* memory = FindGroup(groups, "memory");
   const Group* pids = FindGroup(groups, "pids");
-  if (!cpu || !memory || !pids) return false;
-  const std::pair<const Group*, bool (*)(const Group&, uint64_t*)> reads[] = {
-      {cpu, ReadCpu}, {memory, ReadMemory}, {memory, ReadMemoryLimit}, {pids, ReadProcessLimit}};
-  UsageFigure* figures[] = {&usage->cpu_ns, &usage->memory_bytes, &usage->memory_limit_bytes,
-                            &usage->process_limit};
-  for (size_t i = 0; i < 4; ++i) {
-    if (!reads[i].second(*reads[i].first, &figures[i]->value)) return false;
-    figures[i]->measured = true;
+  if (!cpu || !memory || !pids || memory->limit == 0 || pids->limit == 0) return false;
+  if (!ReadCpu(files, *cpu, &usage->cpu_ns.value) ||
+      !ReadMemory(files, *memory, &usage->memory_bytes.value)) {
+    return false;
+  }
+  usage->memory_limit_bytes.value = memory->limit;
+  usage->process_limit.value = pids->limit;
+  for (UsageFigure* f :
+       {&usage->cpu_ns, &usage->memory_bytes, &usage->memory_limit_bytes, &usage->process_limit}) {
+    f->measured = true;
   }
   return true;
 }
 
-PackageUsage UsageIn(const Env& env, const std::string& id) {
+PackageUsage UsageIn(const Env& env, ControlFiles* files, const std::string& id) {
   PackageUsage usage;
-  if (PMSIsValidPackageId(id) && MeasuredInRecordedGroups(env, id, &usage)) return usage;
+  if (PMSIsValidPackageId(id) && MeasuredInRecordedGroups(env, files, id, &usage)) return usage;
   usage = PackageUsage();  // a figure or two may have been read
   std::string missing;
   std::vector<Group> groups =
       PMSIsValidPackageId(id) ? GroupsFor(env, id, &missing) : std::vector<Group>();
-  usage.cpu_ns = Figure(groups, "cpu", missing, ReadCpu);
-  usage.memory_bytes = Figure(groups, "memory", missing, ReadMemory);
-  usage.memory_limit_bytes = Figure(groups, "memory", missing, ReadMemoryLimit);
-  usage.process_limit = Figure(groups, "pids", missing, ReadProcessLimit);
+  usage.cpu_ns = Figure(files, groups, "cpu", missing, ReadCpu);
+  usage.memory_bytes = Figure(files, groups, "memory", missing, ReadMemory);
+  usage.memory_limit_bytes = Figure(files, groups, "memory", missing, ReadMemoryLimit);
+  usage.process_limit = Figure(files, groups, "pids", missing, ReadProcessLimit);
   return usage;
 }
 
 }  // namespace
 
-PackageUsage PackageCgroupUsage(const std::string& id) { return UsageIn(LoadEnv(), id); }
+PackageUsage PackageCgroupUsage(const std::string& id) {
+  ControlFiles files;
+  return UsageIn(LoadEnv(), &files, id);
+}
 
 std::vector<PackageUsage> PackageCgroupUsages(const std::vector<std::string>& ids) {
   const Env env = LoadEnv();
   std::vector<PackageUsage> all;
   all.reserve(ids.size());
-  for (const std::string& id : ids) all.push_back(UsageIn(env, id));
+  ControlFiles files;
+  for (const std::string& id : ids) all.push_back(UsageIn(env, &files, id));
   return all;
 }
 

@@ -536,8 +536,13 @@ bool PMSRetirePackageAccount(const std::string& id, const std::string& data, std
 }
 
 bool PMSLoadConfinement(const std::string& id, Json::Value* record) {
+  KIVOJsonParser parser;
+  return PMSLoadConfinement(id, record, &parser);
+}
+
+bool PMSLoadConfinement(const std::string& id, Json::Value* record, KIVOJsonParser* parser) {
   if (!PMSIsValidPackageId(id)) return false;
   std::string text;
   return KIVOReadFile(PackageRegistry::RecordDir(id) + "/" + kPMSConfinementFile, &text, 1 << 16) &&
-         KIVOParseJson(text, record) && record->isObject();
+         parser->Parse(text, record) && record->isObject();
 }

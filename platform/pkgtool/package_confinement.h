@@ -46,6 +46,8 @@
 
 #include <json/value.h>
 
+#include "klibc/json_text.h"
+
 // The name of the record's confinement file.
 inline constexpr char kPMSConfinementFile[] = "confinement";
 
@@ -92,6 +94,9 @@ class PackageConfinement {
 // its scripts last wrote it. False when there is none (a package installed
 // before packages had accounts, not started since) or it cannot be read.
 [[nodiscard]] bool PMSLoadConfinement(const std::string& id, Json::Value* record);
+// The same with `parser` (strict), for a list of records.
+[[nodiscard]] bool PMSLoadConfinement(const std::string& id, Json::Value* record,
+                                      KIVOJsonParser* parser);
 
 // The member of a package record that says the whole data folder was
 // given to the account "<uid>:<gid>" (one line), by the last full pass, and
