@@ -209,7 +209,7 @@ TEST_P(BtrfsCrashTest, FailedUpgrade) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Steps, BtrfsCrashTest,
-                         ::testing::Values("staged", "extracted", "snapshot_taken",
-                                           "restore_begun", "restore_half_done", "old_published"));
+                         ::testing::Values("staged", "extracted", "snapshot_taken", "restore_begun",
+                                           "restore_half_done", "old_published"));
 
 }  // namespace
