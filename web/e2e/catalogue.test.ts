@@ -224,6 +224,42 @@ test('a download goes on across a reload and shows in a second tab; cancelling i
   assert.deepEqual(status.data, { finished: true });
 });
 
+test('status answers lost on the way do not stop a card following its download', async () => {
+  const { page } = await signedInCatalogue();
+  // The next three status questions of the download get no answer at all,
+  // as from a busy appliance or a network blip.
+  let dropped = 0;
+  await page.route('**/webapi/entry.cgi', async (route) => {
+    const asked = new URLSearchParams(route.request().postData() ?? '');
+    if (dropped < 3 && asked.get('api') === 'KIVO.Core.Package.Installation' && asked.get('method') === 'status') {
+      dropped += 1;
+      await route.abort('connectionreset');
+      return;
+    }
+    await route.continue();
+  });
+
+  const slow = card(page, 'Demo Slow');
+  await slow.getByRole('button', { name: 'Install Demo Slow' }).click();
+  for (const deadline = Date.now() + 20_000; dropped < 3; await page.waitForTimeout(100)) {
+    assert.ok(Date.now() < deadline, `only ${dropped} status questions were asked; ${await shown(slow)}`);
+  }
+  // The card asks again and follows the download on.
+  const seen = await downloadPercent(slow);
+  await page.waitForFunction(
+    ([label, before]) => {
+      const value = document.querySelector(`progress[aria-label^="${label}"]`)?.getAttribute('value');
+      return value !== null && value !== undefined && Number(value) > before;
+    },
+    ['Downloading Demo Slow', seen] as const,
+  );
+  assert.equal(dropped, 3);
+  assert.equal(await slow.getByRole('button', { name: 'Check again' }).count(), 0, await shown(slow));
+
+  await slow.getByRole('button', { name: 'Cancel' }).click();
+  await slow.getByText('The download of Demo Slow was cancelled.').waitFor({ timeout: 20_000 });
+});
+
 test('a withdrawn package file fails with the server message, and a community package installs from its feed', async () => {
   const { page } = await signedInCatalogue();
 

@@ -4,7 +4,7 @@
 // change by itself, and stops with the component.
 
 import { useCallback, useEffect, useRef, useState } from 'preact/hooks';
-import type { Result } from '../api/client';
+import { kNoAnswer, type Result } from '../api/client';
 
 export interface PollOptions<T> {
   // How long after an answer the next question goes out.
@@ -17,6 +17,10 @@ export interface PollOptions<T> {
   // The first question, too, waits `everyMs`: for a task whose start goes
   // out at the same moment.
   waitFirst?: boolean;
+  // Questions in a row that may bring no answer at all (kNoAnswer: a busy
+  // appliance, a network blip) and are asked again regardless of `again`
+  // before that result counts: while they are, `retrying` is true.
+  missesRetried?: number;
 }
 
 export interface Polled<T> {
@@ -24,6 +28,12 @@ export interface Polled<T> {
   result: Result<T> | null;
   // Asks again now.
   reload: () => Promise<void>;
+  // `result` brought no answer and is being asked again (missesRetried).
+  retrying: boolean;
+}
+
+function isMiss<T>(result: Result<T>): boolean {
+  return !result.ok && result.error.code === kNoAnswer;
 }
 
 // Asks `load` at once (after `everyMs` with `waitFirst`) and again whenever
@@ -32,13 +42,19 @@ export interface Polled<T> {
 // after a newer question went out, or after the component is gone or made
 // inactive, is dropped, so `result` is always the answer to the latest
 // question.
-export function usePoll<T>(load: () => Promise<Result<T>>, { everyMs, again, active = true, waitFirst = false }: PollOptions<T>): Polled<T> {
+export function usePoll<T>(
+  load: () => Promise<Result<T>>,
+  { everyMs, again, active = true, waitFirst = false, missesRetried = 0 }: PollOptions<T>,
+): Polled<T> {
   const [result, setResult] = useState<Result<T> | null>(null);
   const latest = useRef(0);
+  const misses = useRef(0);  // answers in a row, up to `result`, that did not come
   const reload = useCallback(async () => {
     const mine = ++latest.current;
     const answer = await load();
-    if (mine === latest.current) setResult(answer);
+    if (mine !== latest.current) return;
+    misses.current = isMiss(answer) ? misses.current + 1 : 0;
+    setResult(answer);
   }, [load]);
   useEffect(() => {
     if (!active) return;
@@ -50,11 +66,12 @@ export function usePoll<T>(load: () => Promise<Result<T>>, { everyMs, again, act
       ++latest.current;
     };
   }, [reload, active]);
-  const polling = active && result !== null && again(result);
+  const retrying = result !== null && isMiss(result) && misses.current <= missesRetried;
+  const polling = active && result !== null && (retrying || again(result));
   useEffect(() => {
     if (!polling) return;
     const timer = setTimeout(reload, everyMs);
     return () => clearTimeout(timer);
   }, [polling, result, reload, everyMs]);
-  return { result, reload };
+  return { result, reload, retrying };
 }

@@ -17,6 +17,9 @@ import { usePoll } from './poll';
 import { ProgressBar } from './progress';
 
 const kPollMs = 500;
+// Status questions in a row that may bring no answer before the card says
+// so: the task goes on on the appliance whatever the page heard.
+const kMissesRetried = 5;
 
 // How a followed task ended: `done` with its last data; `gone` when it was
 // no longer there (another page read its end first); `failed` with the
@@ -111,9 +114,14 @@ export function TaskProgress({
 }) {
   const { api } = useSession();
   const load = useCallback(() => taskStatus(api, taskId), [api, taskId]);
-  // A failed status is not asked again: the user retries ("Check again")
+  // A status that failed with an answer (the session ended, the task is not
+  // this account's) is not asked again: the user retries ("Check again")
   // once the cause is seen to.
-  const { result, reload } = usePoll(load, { everyMs: kPollMs, again: (r) => r.ok && !r.data.finished });
+  const { result, reload, retrying } = usePoll(load, {
+    everyMs: kPollMs,
+    again: (r) => r.ok && !r.data.finished,
+    missesRetried: kMissesRetried,
+  });
   const data = useLastData(result);
   const [cancelFailure, setCancelFailure] = useState<ApiFailure | null>(null);
   const [cancelling, setCancelling] = useState(false);
@@ -134,7 +142,7 @@ export function TaskProgress({
     else setCancelFailure(answer.error);
   };
 
-  const failure = cancelFailure ?? (result && !result.ok ? result.error : null);
+  const failure = cancelFailure ?? (result && !result.ok && !retrying ? result.error : null);
   const progress = progressOf(data);
   const words = (data?.status && kStatusWords[data.status]) || 'Starting';
   return (
