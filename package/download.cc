@@ -5,6 +5,8 @@
 
 #include "pkgserver/download.h"
 
+#include <cerrno>
+#include <chrono>
 #include <cstdlib>
 #include <fcntl.h>
 #include <memory>
@@ -22,6 +24,8 @@
 #include "remove_tree.h"
 #include "request_values.h"
 #include "task_record.h"
+
+#include <poll.h>
 
 namespace KIVO_PACKAGE {
 
@@ -124,13 +128,30 @@ void DetachFromRequest() {
   if (null > 2) close(null);
 }
 
-// In the worker: waits (up to a minute) until the task's data names `self`
-// as its worker.
-void WaitToBeRecorded(NVX::Task& task, pid_t self) {
-  for (int i = 0; i < 1200; ++i) {
-    const Json::Value data = task.getProperty("data");
-    if (data["pid"].isInt() && data["pid"].asInt() == static_cast<int>(self)) return;
-    usleep(50000);
+// In the worker: waits (up to a minute) until the request says through
+// `release` (the reading end of a pipe) that it recorded the worker in the
+// task. True then; false when the request ended without doing so, or the
+// download was cancelled meanwhile (SIGTERM ends the wait at once).
+//
+// The worker does not read the task store to learn it: a connection opened
+// in a forked child while the parent writes could go on seeing the task
+// without its worker, and the worker then waited out the minute, deaf to a
+// cancel.
+bool WaitToBeReleased(int release) {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::minutes(1);
+  for (;;) {
+    if (KIVOPackageServer::isCanceled()) return false;
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+        deadline - std::chrono::steady_clock::now());
+    if (left.count() <= 0) return false;
+    struct pollfd p = {release, POLLIN, 0};
+    const int ready = poll(&p, 1, static_cast<int>(left.count()));
+    if (ready < 0 && errno == EINTR) continue;
+    if (ready <= 0) return false;
+    char byte = 0;
+    const ssize_t n = read(release, &byte, 1);
+    if (n < 0 && errno == EINTR) continue;
+    return n == 1;
   }
 }
 
@@ -198,27 +219,43 @@ pid_t PackageWebAPI::ForkProcess(NVX::Task* task, Json::Value& result, const std
                                  uint64_t size, const std::string& link, const std::string& folder,
                                  bool quickInstall, const PMSInstallChoices& choices) {
   if (name.empty() || !task || link.empty() || folder.empty()) return -1;
-  pid_t pid = KLIBCProcFork();
+  int release[2] = {-1, -1};
+  const bool piped = pipe2(release, O_CLOEXEC) == 0;
+  const pid_t pid = piped ? KLIBCProcFork() : -1;
   if (pid < 0) {
+    if (piped) {
+      close(release[0]);
+      close(release[1]);
+    }
     DropTask(*task);
     KLIBCErrSetEx(kForkFailed, __FILE__, __LINE__);
     return -1;
   }
   if (pid == 0) {
+    close(release[1]);
     DetachFromRequest();
     KIVOPackageServer::RegisterCancel();
     // The task has its data from the start; the worker begins once the
     // request has recorded it as the task's worker, so that its reports are
     // never overwritten by that record.
-    WaitToBeRecorded(*task, getpid());
-    return 0;
+    const bool released = WaitToBeReleased(release[0]);
+    close(release[0]);
+    if (released) return 0;
+    // Cancelled before it began (the cancel removed the task and its
+    // folder), or never recorded: nothing to do but say how it ended.
+    EndDownloadEntry(task, KIVOPackageServer::isCanceled());
+    _exit(0);
   }
+  close(release[0]);
   // Before the worker is released: its end is the install's outcome.
   HandDownloadEntryTo(pid);
   if (KIVOPackageServer::InitDownload(task, name, size, link, folder, quickInstall, pid, choices)) {
     result["taskid"] = task->getTaskId();
     result["progress"] = "0.00001";  // a string, as clients have always received it
+    // A worker that is never released ends on its own.
+    static_cast<void>(write(release[1], "1", 1));
   }
+  close(release[1]);
   return pid;
 }
 
