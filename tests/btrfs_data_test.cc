@@ -129,6 +129,28 @@ TEST_F(BtrfsDataTest, RollbackAndItsUndo) {
   ExpectNothingLeftBut(1);
 }
 
+// Killed after its commit, before the snapshot's rename reached the disk:
+// the next operation makes the snapshot the kept revision.
+TEST_F(BtrfsDataTest, UpgradeKilledAfterItsCommitKeepsItsSnapshot) {
+  ASSERT_EQ(0, Install(v1_)) << out_;
+  const std::string v1_data = Fingerprint();
+  EXPECT_EQ(128 + 9,
+            Kivoctl({"install", v2_.Build(dir_)}, &out_, {{"KIVO_PKGTOOL_FAULT", "confirmed"}}))
+      << out_;
+  const std::string v2_data = Fingerprint();
+  TestPackage other = v1_;
+  other.id = "other-app";
+  other.scripts = {};
+  ASSERT_EQ(0, Install(other)) << out_;
+  EXPECT_EQ("2\n", Code());
+  EXPECT_EQ(v2_data, Fingerprint());
+  EXPECT_TRUE(PMSIsSubvolume(KeptCopy()));
+  ExpectNothingLeftBut(1);
+  ASSERT_EQ(0, Tool("rollback")) << out_;
+  EXPECT_EQ("1\n", Code());
+  EXPECT_EQ(v1_data, Fingerprint());
+}
+
 TEST_F(BtrfsDataTest, UninstallRemovesTheDataAndItsSnapshots) {
   ASSERT_EQ(0, Install(v1_)) << out_;
   ASSERT_EQ(0, Install(v2_)) << out_;

@@ -117,6 +117,32 @@ TEST_F(CrashTest, StartAfterACrashStartsTheOldVersionOnItsOwnData) {
   ExpectWholeWithData("1.0");
 }
 
+// Killed right after its commit (UPGRADED_FROM on disk), before its copy
+// is renamed: the new version stays with its data, and the clean-up makes
+// the copy the kept revision that a rollback returns to; with no revisions
+// kept, it drops the copy.
+TEST_F(CrashTest, UpgradeKilledAfterItsCommitStaysAndKeepsTheOldVersion) {
+  std::string out;
+  for (const char* keep : {"1", "0"}) {
+    SCOPED_TRACE(std::string("keep_revisions=") + keep);
+    root_.Write("/etc/kivo/pkgtool.conf", std::string("keep_revisions=\"") + keep + "\"\n");
+    ASSERT_EQ(0, Kivoctl({"install", v1_.Build(dir_), "--run"}, &out)) << out;
+    CrashAt("confirmed", {"install", v2_.Build(dir_)});
+    ExpectWholeWithData("2.0");
+    ExpectRecoveredByNextOperation();
+    ExpectWholeWithData("2.0");
+    const DataCopies copies = ListDataCopies(root_.Path("/volume1/@appdata/.snapshots"));
+    EXPECT_EQ(std::string(keep) == "1" ? 1u : 0u, copies.kept);
+    if (std::string(keep) == "1") {
+      ASSERT_EQ(0, Kivoctl({"rollback", "test-app"}, &out)) << out;
+      ExpectWholeWithData("1.0");
+    } else {
+      EXPECT_NE(0, Kivoctl({"rollback", "test-app"}, &out)) << out;
+    }
+    ASSERT_EQ(0, Kivoctl({"uninstall", "test-app"}, &out)) << out;
+  }
+}
+
 // The steps of an upgrade's safety copy and of a restore.
 const char* const kRestoreSteps[] = {"snapshot_taken", "restore_begun", "restore_half_done",
                                      "old_published"};

@@ -74,6 +74,33 @@ TreeCopyResult Snapshot(const std::string& data, const std::string& to, std::str
 
 }  // namespace
 
+bool PMSConfirmUpgrade(const DataSnapshot& s, const std::string& new_record) {
+  if (!s.IsValid()) {
+    errno = EINVAL;
+    return false;
+  }
+  if (KIVOWriteFileAtomic(new_record + "/" + kPMSUpgradedFromMember, s.record() + "\n"))
+    return true;
+  if (errno == 0) errno = EIO;
+  return false;
+}
+
+std::string PMSUpgradedFrom(const std::string& id, const std::string& record) {
+  std::string text;
+  if (!PackageRegistry::IsRecordNameOf(id, record) ||
+      !KIVOReadFile(PackageRegistry::Dir() + "/" + record + "/" + kPMSUpgradedFromMember, &text,
+                    256)) {
+    return "";
+  }
+  if (!text.empty() && text.back() == '\n') text.pop_back();
+  return PackageRegistry::IsRecordNameOf(id, ".records/" + text) ? text : "";
+}
+
+bool PMSRenameCopy(const std::string& from, const std::string& to, PMSRenameSync sync) {
+  if (sync == PMSRenameSync::kNow) return PMSRenameDurably(from, to);
+  return rename(from.c_str(), to.c_str()) == 0;
+}
+
 bool PMSRenameDurably(const std::string& from, const std::string& to) {
   if (rename(from.c_str(), to.c_str()) != 0) return false;
   SyncDir(Parent(to));
@@ -148,13 +175,13 @@ TreeCopyResult PMSTakeSnapshot(const DataSnapshot& s, std::string* error) {
   return result;
 }
 
-bool PMSDiscardSnapshot(const DataSnapshot& s) {
+bool PMSDiscardSnapshot(const DataSnapshot& s, PMSRenameSync sync) {
   const std::string gone = s.Named(".discard");
   if (!s.IsValid()) {
     errno = EINVAL;
     return false;
   }
-  if (!PMSRenameDurably(s.copy(), gone)) return false;
+  if (!PMSRenameCopy(s.copy(), gone, sync)) return false;
   static_cast<void>(PMSRemoveTree(s.folder(), gone));
   RemoveEmptyFolders(s);
   return true;

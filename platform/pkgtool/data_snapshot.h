@@ -23,12 +23,18 @@
 // letter or a digit.
 //
 // The names are the upgrade's journal, each changed by one rename. While
-// <R> exists, the upgrade away from R is not confirmed, and a crash leaves
-// the next operation to put R back with its data (upgrade_recovery.h). The
-// upgrade's last step renames <R> to <R>.discard: from then on the new
-// version stays. A restore renames D to <R>.replaced, then <R> to D, then
-// publishes R again; while <R>.replaced exists, those steps are under way
-// for R.
+// <R> exists and the published version's record does not name R in its
+// UPGRADED_FROM member, the upgrade away from R is not confirmed, and a
+// crash leaves the next operation to put R back with its data
+// (upgrade_recovery.h). The upgrade's commit writes UPGRADED_FROM into the
+// new version's record, on disk before it goes on: from then on the new
+// version stays. Only then is <R> renamed to <R>.kept (revisions.h) or
+// <R>.discard, without waiting for the volume to write the rename: a rename
+// of a Btrfs subvolume reaches the disk only with a commit of the whole
+// file system (about 2 ms), and after a crash the clean-up finishes what
+// UPGRADED_FROM says. A restore renames D to <R>.replaced, then <R> to D,
+// then publishes R again; while <R>.replaced exists, those steps are under
+// way for R.
 #pragma once
 
 #include <string>
@@ -68,6 +74,30 @@ class DataSnapshot {
 // names of the copies are journals. False (errno set) when it failed.
 [[nodiscard]] bool PMSRenameDurably(const std::string& from, const std::string& to);
 
+// When a rename that ends a step must be on disk: before the call returns,
+// or with the volume's next write-back, when a record already on disk says
+// what the rename finishes (UPGRADED_FROM), so that the clean-up after a
+// crash can finish it.
+enum class PMSRenameSync { kNow, kWithTheVolume };
+
+// Renames `from` to `to`, durably (PMSRenameDurably) with kNow. False
+// (errno set) when it failed.
+[[nodiscard]] bool PMSRenameCopy(const std::string& from, const std::string& to,
+                                 PMSRenameSync sync);
+
+// The member of a version's record that confirms the upgrade to it: the
+// record name R of the version it replaced, one line.
+inline constexpr char kPMSUpgradedFromMember[] = "UPGRADED_FROM";
+
+// The upgrade's commit: writes kPMSUpgradedFromMember, naming the record of
+// `s`, into the record folder `new_record` of the version that replaces it,
+// and waits until it is on disk. False (errno set) when it could not.
+[[nodiscard]] bool PMSConfirmUpgrade(const DataSnapshot& s, const std::string& new_record);
+
+// The record name R that the upgrade to record folder `record` of `id`
+// confirmed, checked whole (a record name of `id`); "" for none.
+std::string PMSUpgradedFrom(const std::string& id, const std::string& record);
+
 // "<appdata>/.snapshots", the folder of every package's copies on a volume.
 // It exists only while a copy is in it.
 std::string PMSSnapshotsDir(const std::string& appdata);
@@ -94,11 +124,12 @@ std::string PMSSnapshotsDir(const std::string& appdata);
 // removes a .copying) and *error says why; D is never changed.
 [[nodiscard]] TreeCopyResult PMSTakeSnapshot(const DataSnapshot& s, std::string* error);
 
-// Confirms the upgrade: the copy is renamed to <R>.discard, then removed.
-// False (errno set) when it could not be renamed: the upgrade is then not
-// confirmed. A .discard that could not be removed now is removed by the
-// next operation's clean-up.
-[[nodiscard]] bool PMSDiscardSnapshot(const DataSnapshot& s);
+// Drops the copy: it is renamed to <R>.discard, then removed. False (errno
+// set) when it could not be renamed. A .discard that could not be removed
+// now is removed by the next operation's clean-up. `sync` kWithTheVolume
+// only once the upgrade is confirmed (PMSConfirmUpgrade).
+[[nodiscard]] bool PMSDiscardSnapshot(const DataSnapshot& s,
+                                      PMSRenameSync sync = PMSRenameSync::kNow);
 
 enum class RestoreState {
   kRestored,      // D holds the copy again and R is published

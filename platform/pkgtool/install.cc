@@ -263,7 +263,7 @@ class Installer {
   int StartUpgraded(const PackageInfo& info, Staging* s);
   // The commit of an upgrade that copied the data: the copy becomes the old
   // version's kept revision, or is dropped when keep_revisions is 0.
-  [[nodiscard]] bool ConfirmUpgrade();
+  [[nodiscard]] bool ConfirmUpgrade(const Staging& s);
   [[nodiscard]] bool RemoveOldVersion();
 
   const InstallJob& job_;
@@ -634,7 +634,7 @@ int Installer::Finish(const PackageInfo& info, Staging* s) {
     int code = StartUpgraded(info, s);
     if (code != PKG_OK) return code;
     // The commit of the upgrade: from here on the new version stays.
-    if (copy_taken_ && !ConfirmUpgrade()) {
+    if (copy_taken_ && !ConfirmUpgrade(*s)) {
       return RestoreAfterFailure(info, s,
                                  std::string("could not be confirmed (") + strerror(errno) + ")");
     }
@@ -671,11 +671,30 @@ int Installer::StartUpgraded(const PackageInfo& info, Staging* s) {
   return RestoreAfterFailure(info, s, PMSHealthVerdictText(verdict, PMSHealthLimits(info)));
 }
 
-bool Installer::ConfirmUpgrade() {
-  if (PMSKeepRevisionsSetting() == 0) return PMSDiscardSnapshot(*snapshot_);
-  old_kept_ = PMSKeepAsRevision(*snapshot_, snapshot_->copy());
-  if (old_kept_) op_->Log(old_.getVersion() + " and its data are kept: a rollback returns to them");
-  return old_kept_;
+bool Installer::ConfirmUpgrade(const Staging& s) {
+  const bool keep = PMSKeepRevisionsSetting() > 0;
+  // REPLACED before the commit: a kept revision the clean-up finishes
+  // needs it.
+  if (keep && !PMSMarkReplaced(*snapshot_)) return false;
+  if (!PMSConfirmUpgrade(*snapshot_, s.record)) return false;
+  PMSFaultPoint("confirmed");
+  // From here on the new version stays: a rename lost in a crash is
+  // finished by the clean-up.
+  if (!keep) {
+    if (!PMSDiscardSnapshot(*snapshot_, PMSRenameSync::kWithTheVolume))
+      op_->Log("the copy of the data stays until the next operation: " + snapshot_->copy());
+    return true;
+  }
+  // The old version's record and payload stay with it either way.
+  old_kept_ = true;
+  if (PMSRenameCopy(snapshot_->copy(), snapshot_->Named(kPMSKeptSuffix),
+                    PMSRenameSync::kWithTheVolume)) {
+    op_->Log(old_.getVersion() + " and its data are kept: a rollback returns to them");
+  } else {
+    op_->Log(old_.getVersion() + " and its data are kept from the next operation on (" +
+             strerror(errno) + ")");
+  }
+  return true;
 }
 
 bool Installer::RemoveOldVersion() {

@@ -8,6 +8,8 @@
 //       target ->   <volume>/@appstore/<id>.<n>  (the payload)
 //       var    ->   <volume>/@appdata/<id>       (data, kept across upgrades)
 //       enabled     present while the package is meant to run
+//       UPGRADED_FROM   the record this version replaced, once the upgrade
+//                   to it is confirmed (data_snapshot.h)
 //       restarts, crashed   the watchdog's restarts and its giving up
 //                   (watchdog_record.h)
 //

@@ -148,6 +148,10 @@ std::vector<PMSRevision> PMSListRevisions(const std::string& id) {
 }
 
 bool PMSKeepAsRevision(const DataSnapshot& s, const std::string& from) {
+  return PMSMarkReplaced(s) && PMSRenameDurably(from, s.Named(kPMSKeptSuffix));
+}
+
+bool PMSMarkReplaced(const DataSnapshot& s) {
   if (!s.IsValid()) {
     errno = EINVAL;
     return false;
@@ -164,7 +168,7 @@ bool PMSKeepAsRevision(const DataSnapshot& s, const std::string& from) {
     if (errno == 0) errno = EIO;
     return false;
   }
-  return PMSRenameDurably(from, s.Named(kPMSKeptSuffix));
+  return true;
 }
 
 bool PMSDropRevision(const PMSRevision& r) {

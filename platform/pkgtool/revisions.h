@@ -11,11 +11,12 @@
 //   <volume>/@appstore/<R>                       R's payload (R/target)
 //
 // The name <R>.kept is what makes R a revision: the upgrade's copy <R>
-// (data_snapshot.h) is renamed to it in one step, the upgrade's commit,
-// after REPLACED was written. A package file cannot hold a member named
-// REPLACED, so no package can claim a replacement time. Up to
-// `keep_revisions` (etc/kivo/pkgtool.conf, 1 by default, 0 for none) are
-// kept per package, the newest; an upgrade or a rollback drops the older.
+// (data_snapshot.h) is renamed to it in one step after REPLACED was written
+// and the upgrade confirmed (a crash before the rename is on disk leaves it
+// to the clean-up, which UPGRADED_FROM tells what to finish). A package file cannot hold a member
+// named REPLACED, so no package can claim a replacement time. Up to `keep_revisions`
+// (etc/kivo/pkgtool.conf, 1 by default, 0 for none) are kept per package, the newest; an upgrade or
+// a rollback drops the older.
 //
 // Everything read here is checked whole before it is trusted: a name that
 // is not "<record of the id>.kept", a record without INFO or REPLACED, a
@@ -66,11 +67,15 @@ struct PMSRevision {
 std::vector<PMSRevision> PMSListRevisions(const std::string& id);
 
 // Makes the folder `from` the kept copy of version R (the record of `s`):
-// writes REPLACED (now) into R's record, then renames `from` to
-// <R>.kept. The upgrade's commit passes its copy <R>; a rollback passes
-// the data folder of the version it leaves. False (errno set) when either
-// step failed: `from` is then where it was.
+// writes REPLACED (now) into R's record, then renames `from` to <R>.kept
+// durably. A rollback passes the data folder of the version it leaves.
+// False (errno set) when either step failed: `from` is then where it was.
 [[nodiscard]] bool PMSKeepAsRevision(const DataSnapshot& s, const std::string& from);
+
+// The first step of PMSKeepAsRevision: REPLACED (now) into the record of
+// `s`, on disk. An upgrade's commit takes it before it confirms the upgrade
+// and renames its copy <R> to <R>.kept. False (errno set) when it failed.
+[[nodiscard]] bool PMSMarkReplaced(const DataSnapshot& s);
 
 // Removes a kept revision: its copy is renamed to <R>.discard (from then on
 // it is no revision) and removed, then its record and payload. False when

@@ -1,5 +1,7 @@
 #include "pkgtool/upgrade_recovery.h"
 
+#include <cerrno>
+#include <cstring>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -157,6 +159,32 @@ bool FinishRollback(const std::string& appdata, const std::string& id, const std
   return ok;
 }
 
+// An upgrade to the published version that was confirmed (its record names
+// the version R it replaced, PMSUpgradedFrom) while its copy still has the
+// name <R> of an upgrade under way: the tool stopped between the commit and
+// the rename, or the rename never reached the disk. Finishes what the
+// upgrade would have done: <R> becomes <R>.kept, or is dropped when no
+// revision is kept. A restore under way goes on instead (it began because
+// the commit failed). False when the rename stays to be done: then <R> must
+// stay as it is, never be put back.
+bool FinishConfirmedUpgrade(const std::string& appdata, const std::string& id,
+                            const std::string& published, PackageCopies* copies) {
+  const std::string from = PMSUpgradedFrom(id, published);
+  if (from.empty() || !copies->restores.empty() || copies->whole.count(from) == 0) return true;
+  const DataSnapshot s(appdata, id, from);
+  const bool keep = PMSKeepRevisionsSetting() > 0;
+  if (keep ? !PMSRenameDurably(s.copy(), s.Named(kPMSKeptSuffix)) : !PMSDiscardSnapshot(s)) {
+    syslog(LOG_ERR, "pkgtool: %s: the confirmed upgrade away from %s cannot be finished yet: %s",
+           id.c_str(), from.c_str(), strerror(errno));
+    return false;
+  }
+  copies->whole.erase(from);
+  if (keep) copies->kept.insert(from);
+  syslog(LOG_NOTICE, "pkgtool: %s: the confirmed upgrade away from %s was finished", id.c_str(),
+         from.c_str());
+  return true;
+}
+
 // Keeps the kept revisions that are whole (their records go into `kept`)
 // and removes the others; a package that is not installed keeps none.
 bool SortOutRevisions(const std::string& appdata, const std::string& id, const std::string& folder,
@@ -194,6 +222,13 @@ bool RecoverPackage(const std::string& appdata, const std::string& id,
     copies = SortCopies(id, folder);
   }
   const std::string published = PackageRegistry::PublishedRecord(id);
+  if (!published.empty() && !FinishConfirmedUpgrade(appdata, id, published, &copies)) {
+    if (kept) {
+      for (const auto* names : {&copies.kept, &copies.whole})
+        kept->insert(names->begin(), names->end());
+    }
+    return false;
+  }
   const std::string record = published.empty() ? "" : ChooseRecord(copies, published);
   ok &= RemoveOthers(folder, copies, record);
   if (!record.empty() && !Restore(DataSnapshot(appdata, id, record))) {
