@@ -62,6 +62,14 @@ class BtrfsDataTest : public UpgradeFixture {
   }
 
   int Tool(const std::string& command) { return Kivoctl({command, "test-app"}, &out_); }
+  // Another package's install: an operation that first cleans up what a
+  // crash left.
+  int InstallAnother() {
+    TestPackage other = v1_;
+    other.id = "other-app";
+    other.scripts = {};
+    return Install(other);
+  }
   std::string Code() { return FileText(root_.Path("/var/packages/test-app/target/version.txt")); }
   std::string Snapshots() { return root_.Path("/volume1/@appdata/.snapshots/test-app"); }
   // The one copy kept of the version replaced last, a subvolume or not.
@@ -138,10 +146,7 @@ TEST_F(BtrfsDataTest, UpgradeKilledAfterItsCommitKeepsItsSnapshot) {
             Kivoctl({"install", v2_.Build(dir_)}, &out_, {{"KIVO_PKGTOOL_FAULT", "confirmed"}}))
       << out_;
   const std::string v2_data = Fingerprint();
-  TestPackage other = v1_;
-  other.id = "other-app";
-  other.scripts = {};
-  ASSERT_EQ(0, Install(other)) << out_;
+  ASSERT_EQ(0, InstallAnother()) << out_;
   EXPECT_EQ("2\n", Code());
   EXPECT_EQ(v2_data, Fingerprint());
   EXPECT_TRUE(PMSIsSubvolume(KeptCopy()));
@@ -218,10 +223,7 @@ TEST_P(BtrfsCrashTest, FailedUpgrade) {
     EXPECT_EQ("2\n", code) << step;
     EXPECT_NE(v1_data, Fingerprint());
   }
-  TestPackage other = v1_;
-  other.id = "other-app";
-  other.scripts = {};
-  ASSERT_EQ(0, Install(other)) << out_;
+  ASSERT_EQ(0, InstallAnother()) << out_;
   EXPECT_EQ("1\n", Code());
   EXPECT_EQ(v1_data, Fingerprint());
   EXPECT_TRUE(PMSIsSubvolume(data_));
