@@ -62,6 +62,12 @@ class BtrfsDataTest : public UpgradeFixture {
   }
 
   int Tool(const std::string& command) { return Kivoctl({command, "test-app"}, &out_); }
+  // The installed code is version `code` ("1", "2") over the data `data`
+  // (a Fingerprint).
+  void ExpectVersion(const std::string& code, const std::string& data) {
+    EXPECT_EQ(code + "\n", Code());
+    EXPECT_EQ(data, Fingerprint());
+  }
   // Another package's install: an operation that first cleans up what a
   // crash left.
   int InstallAnother() {
@@ -115,8 +121,7 @@ TEST_F(BtrfsDataTest, FailedUpgradePutsTheSnapshotBackByteForByte) {
   broken.scripts = {{"postupgrade", std::string(kRewriteTestData) + "exit 1\n"}};
   EXPECT_NE(0, Install(broken)) << out_;
   ExpectSaid("The upgrade to 2.0 failed in postupgrade; 1.0 and its data were restored.");
-  EXPECT_EQ("1\n", Code());
-  EXPECT_EQ(v1_data, Fingerprint());
+  ExpectVersion("1", v1_data);
   EXPECT_TRUE(PMSIsSubvolume(data_));
   ExpectNothingLeftBut(0);
 }
@@ -127,13 +132,11 @@ TEST_F(BtrfsDataTest, RollbackAndItsUndo) {
   ASSERT_EQ(0, Install(v2_)) << out_;
   const std::string v2_data = Fingerprint();
   ASSERT_EQ(0, Tool("rollback")) << out_;
-  EXPECT_EQ("1\n", Code());
-  EXPECT_EQ(v1_data, Fingerprint());
+  ExpectVersion("1", v1_data);
   EXPECT_TRUE(PMSIsSubvolume(KeptCopy()));
   ExpectNothingLeftBut(1);
   ASSERT_EQ(0, Tool("rollback")) << out_;
-  EXPECT_EQ("2\n", Code());
-  EXPECT_EQ(v2_data, Fingerprint());
+  ExpectVersion("2", v2_data);
   ExpectNothingLeftBut(1);
 }
 
@@ -147,13 +150,11 @@ TEST_F(BtrfsDataTest, UpgradeKilledAfterItsCommitKeepsItsSnapshot) {
       << out_;
   const std::string v2_data = Fingerprint();
   ASSERT_EQ(0, InstallAnother()) << out_;
-  EXPECT_EQ("2\n", Code());
-  EXPECT_EQ(v2_data, Fingerprint());
+  ExpectVersion("2", v2_data);
   EXPECT_TRUE(PMSIsSubvolume(KeptCopy()));
   ExpectNothingLeftBut(1);
   ASSERT_EQ(0, Tool("rollback")) << out_;
-  EXPECT_EQ("1\n", Code());
-  EXPECT_EQ(v1_data, Fingerprint());
+  ExpectVersion("1", v1_data);
 }
 
 TEST_F(BtrfsDataTest, UninstallRemovesTheDataAndItsSnapshots) {
@@ -224,8 +225,7 @@ TEST_P(BtrfsCrashTest, FailedUpgrade) {
     EXPECT_NE(v1_data, Fingerprint());
   }
   ASSERT_EQ(0, InstallAnother()) << out_;
-  EXPECT_EQ("1\n", Code());
-  EXPECT_EQ(v1_data, Fingerprint());
+  ExpectVersion("1", v1_data);
   EXPECT_TRUE(PMSIsSubvolume(data_));
   ExpectNothingLeftBut(0);
   ASSERT_EQ(0, Install(v2_)) << out_;

@@ -272,7 +272,6 @@ class Installer {
   std::unique_ptr<Operation> op_;
   bool upgrade_ = false;
   bool was_running_ = false;
-  bool running_known_ = false;              // was_running_ was found before the unpacking
   bool published_ = false;                  // the new version is published
   bool new_started_ = false;                // the new version was started: a restore stops it first
   std::unique_ptr<DataSnapshot> snapshot_;  // the planned copy of the data; null for none
@@ -351,6 +350,10 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
   int code = PMSChooseVolume(info, job_.volume, needed, &volume, &text);
   if (code != PKG_OK) return Refuse(code, text);
   if (upgrade_ && (code = PlanDataCopy(info, volume, needed)) != PKG_OK) return code;
+  // Whether the old version runs decides when its data may be copied (and
+  // whether it is stopped and started again); the package's lock keeps it
+  // so until the upgrade ends.
+  if (upgrade_) was_running_ = PMSIsRunning(id_, old_);
   SnapshotBesideUnpacking();
   code = Unpack(reader, info, volume, s);
   if (code != PKG_OK) DropEarlySnapshot();
@@ -454,7 +457,6 @@ int Installer::PrepareInstall(const std::map<std::string, std::string>& env, Sta
 
 int Installer::PrepareUpgrade(const PackageInfo& info,
                               const std::map<std::string, std::string>& env, Staging* s) {
-  if (!running_known_) was_running_ = PMSIsRunning(info.getId(), old_);
   const std::string old_record = PackageRegistry::RecordDir(info.getId());
   if (was_running_ && !ControlRecord(old_record, old_, "stop", *op_)) {
     return Refuse(PKG_ERR_SCRIPT_FAILED,
@@ -487,10 +489,7 @@ int Installer::SettleAccount(Staging* s) {
 // collects it. A running version is copied only once PrepareUpgrade has
 // stopped it, and a copy file by file reports progress and stays in line.
 void Installer::SnapshotBesideUnpacking() {
-  if (!snapshot_ || !PMSCopiesBySnapshot(snapshot_->data_dir())) return;
-  was_running_ = PMSIsRunning(id_, old_);
-  running_known_ = true;
-  if (was_running_) return;
+  if (!snapshot_ || was_running_ || !PMSCopiesBySnapshot(snapshot_->data_dir())) return;
   const DataSnapshot* copy = snapshot_.get();
   std::string* error = &early_error_;
   try {

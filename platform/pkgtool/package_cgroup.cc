@@ -53,11 +53,19 @@ KeyValueMap ToolConf() {
 }
 
 // A whole number from 1 to `max` written as plain digits, else -1.
+// Plain decimal digits, at most `digits` of them, into *value.
+bool Digits(const std::string& text, size_t digits, uint64_t* value) {
+  if (text.empty() || text.size() > digits ||
+      text.find_first_not_of("0123456789") != std::string::npos)
+    return false;
+  *value = std::strtoull(text.c_str(), nullptr, 10);
+  return true;
+}
+
 long WholeNumber(const std::string& text, long max) {
-  if (text.empty() || text.size() > 9 || text.find_first_not_of("0123456789") != std::string::npos)
-    return -1;
-  long value = std::strtol(text.c_str(), nullptr, 10);
-  return value >= 1 && value <= max ? value : -1;
+  uint64_t value = 0;
+  if (!Digits(text, 9, &value)) return -1;
+  return value >= 1 && value <= static_cast<uint64_t>(max) ? static_cast<long>(value) : -1;
 }
 
 int Setting(const KeyValueMap& conf, const char* key, int def) {
@@ -251,14 +259,6 @@ bool IsGroupDir(const Env& env, const Group& g, const std::string& id) {
   return false;
 }
 
-// A count of up to 18 digits (a bound in bytes or processes) into *value.
-bool Counted(const std::string& text, uint64_t* value) {
-  if (text.empty() || text.size() > 18 || text.find_first_not_of("0123456789") != std::string::npos)
-    return false;
-  *value = std::strtoull(text.c_str(), nullptr, 10);
-  return true;
-}
-
 // The record of `groups`: a "<what> v1|v2 <dir> <limit>" line each.
 std::string RecordText(const std::vector<Group>& groups) {
   std::string text;
@@ -279,7 +279,7 @@ std::vector<Group> RecordedGroups(const Env& env, const std::string& id) {
     const std::vector<std::string> f = Fields(text.substr(at, end - at));
     at = end + 1;
     Group g;
-    if (f.size() != 4 || (f[1] != "v1" && f[1] != "v2") || !Counted(f[3], &g.limit)) return {};
+    if (f.size() != 4 || (f[1] != "v1" && f[1] != "v2") || !Digits(f[3], 18, &g.limit)) return {};
     g.what = f[0];
     g.v2 = f[1] == "v2";
     g.dir = f[2];
