@@ -260,6 +260,35 @@ test('status answers lost on the way do not stop a card following its download',
   await slow.getByText('The download of Demo Slow was cancelled.').waitFor({ timeout: 20_000 });
 });
 
+test('a download failure that another reader took first still shows in the card', async () => {
+  const { page } = await signedInCatalogue();
+  // The appliance drops a failed download's task on the first status read
+  // that sees the failure. Here that read is taken on the page's behalf and
+  // its answer kept from it: the page only hears the next one, that the task
+  // is gone, as a second tab would.
+  let takenFirst = false;
+  await page.route('**/webapi/entry.cgi', async (route) => {
+    const asked = new URLSearchParams(route.request().postData() ?? '');
+    if (takenFirst || asked.get('method') !== 'status' || asked.get('api') !== 'KIVO.Core.Package.Installation') {
+      await route.continue();
+      return;
+    }
+    let answer = await route.fetch();
+    const body = (await answer.json()) as { data?: { finished?: boolean; error?: unknown } };
+    if (body.data?.finished && body.data.error !== undefined) {
+      takenFirst = true;
+      answer = await route.fetch();
+    }
+    await route.fulfill({ response: answer });
+  });
+
+  const gone = card(page, 'Demo Gone');
+  await gone.getByRole('button', { name: 'Install Demo Gone' }).click();
+  await gone.getByRole('alert').filter({ hasText: 'the server answered HTTP 404' }).waitFor();
+  assert.ok(takenFirst, 'the failure reached the page without being read first elsewhere');
+  await gone.getByRole('button', { name: 'Install Demo Gone' }).waitFor();
+});
+
 test('a withdrawn package file fails with the server message, and a community package installs from its feed', async () => {
   const { page } = await signedInCatalogue();
 

@@ -67,6 +67,14 @@ export function listActivity(api: Api, filter: ActivityFilter, offset: number, l
   return api.call<ActivityPage>(kActivity, 'list', 1, { ...filterParams(filter), offset: String(offset), limit: String(limit) });
 }
 
+// The newest install of `packageId` on record, from a file or a package
+// server, by any page or tool; null when there is none or the log cannot be
+// read.
+export async function lastInstall(api: Api, packageId: string): Promise<ActivityEntry | null> {
+  const page = await listActivity(api, { package: packageId, operation: 'Installation.install' }, 0, 1);
+  return page.ok ? (page.data.entries[0] ?? null) : null;
+}
+
 export type ExportFormat = 'csv' | 'json';
 
 // Every entry that matches `filter`, as a file.

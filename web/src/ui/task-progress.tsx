@@ -6,10 +6,11 @@
 
 import './task-progress.css';
 import { useCallback, useEffect, useRef, useState } from 'preact/hooks';
-import type { ApiFailure, Result } from '../api/client';
+import { lastInstall } from '../api/activity';
+import type { Api, ApiFailure, Result } from '../api/client';
 import { messageFor } from '../api/messages';
-import { DownloadCode, ToolCode } from '../api/codes';
-import { cancelTask, taskStatus, type TaskData } from '../api/installation';
+import { DownloadCode, PackageCode, ToolCode } from '../api/codes';
+import { cancelTask, kDownloadTaskPrefix, taskStatus, type TaskData } from '../api/installation';
 import { useSession } from '../session';
 import { ErrorText } from './error-text';
 import { formatBytes } from './install-pages';
@@ -22,7 +23,7 @@ const kPollMs = 500;
 const kMissesRetried = 5;
 
 // How a followed task ended: `done` with its last data; `gone` when it was
-// no longer there (another page read its end first); `failed` with the
+// no longer there and nothing on record says how it ended; `failed` with the
 // reason in words (and the package tool's code and own words, when the
 // install refused, with the running package an upgrade would break);
 // `cancelled` by this page.
@@ -75,6 +76,25 @@ export function taskEnd(data: TaskData): TaskEnd {
     return { kind: 'failed', text: failure, result: error?.result, dependent: error?.deppkg, message: error?.message };
   }
   return data.status === undefined ? { kind: 'gone' } : { kind: 'done', data };
+}
+
+// The end of a task that another reader took first. The appliance drops a
+// failed download's task on the first status read that sees the failure
+// (and a quick install's on its end), so a second reader (another page, a
+// question repeated after a lost answer) only learns that it is gone. Every
+// install through the appliance is on record in the activity log before its
+// task exists and is ended there before its task reads as finished, so the
+// newest install of the package on record is this task's.
+async function endOnRecord(api: Api, taskId: string): Promise<TaskEnd> {
+  if (!taskId.startsWith(kDownloadTaskPrefix)) return { kind: 'gone' };
+  const entry = await lastInstall(api, taskId.slice(kDownloadTaskPrefix.length));
+  if (entry?.state === 'failure') {
+    if (entry.code === PackageCode.Cancelled) return { kind: 'cancelled' };
+    const text = taskFailure({ error: { code: entry.code ?? undefined, message: entry.words || undefined } });
+    return { kind: 'failed', text: text ?? 'The download failed.' };
+  }
+  if (entry?.state === 'success' && entry.words === 'installed') return { kind: 'done', data: { status: 'installed', finished: true } };
+  return { kind: 'gone' };
 }
 
 const kStatusWords: Record<string, string> = {
@@ -131,8 +151,17 @@ export function TaskProgress({
   useEffect(() => {
     if (!result?.ok) return;
     setCancelFailure(null);
-    if (result.data.finished) ended.current(taskEnd(result.data));
-  }, [result]);
+    if (!result.data.finished) return;
+    const end = taskEnd(result.data);
+    if (end.kind !== 'gone') return ended.current(end);
+    let live = true;
+    void endOnRecord(api, taskId).then((recorded) => {
+      if (live) ended.current(recorded);
+    });
+    return () => {
+      live = false;
+    };
+  }, [result, api, taskId]);
 
   const cancel = async () => {
     setCancelling(true);
