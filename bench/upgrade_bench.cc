@@ -8,7 +8,9 @@
 // volume (this needs root, mkfs.xfs or mkfs.btrfs and a free loop device;
 // the benchmark says which is missing).
 //
-//   upgrade_bench [data MiB] [files] [rounds]      (default 1024, 10000, 3)
+//   upgrade_bench [data MiB] [files] [rounds] [file systems]
+//
+// (default 1024, 10000, 3, and every file system: "root,xfs,btrfs").
 //
 // Each figure is the median of `rounds` measurements. Every timed step
 // starts after a sync, so that none pays for writing back what the one
@@ -43,22 +45,49 @@ constexpr char kId[] = "bench-data";
 // What the tool's operation log says when the package declines the copy.
 constexpr char kNoCopyNote[] = "no safety copy of the data";
 
+// Where the benchmark measures: the temporary root's own file system, XFS
+// with reflinks, Btrfs.
+enum FileSystems : unsigned { kOnRoot = 1, kOnXfs = 2, kOnBtrfs = 4, kOnAll = 7 };
+
 struct Options {
   uint64_t data_bytes = 1024ull << 20;
   uint64_t files = 10000;
   int rounds = 3;
+  unsigned file_systems = kOnAll;
 };
 
-// Reads the command line into *o; false when an argument is not a positive
-// number.
+// Reads a comma-separated list of "root", "xfs" and "btrfs" into *set;
+// false when it names anything else.
+bool ParseFileSystems(const std::string& list, unsigned* set) {
+  *set = 0;
+  for (size_t start = 0; start <= list.size();) {
+    size_t end = list.find(',', start);
+    if (end == std::string::npos) end = list.size();
+    const std::string name = list.substr(start, end - start);
+    if (name == "root")
+      *set |= kOnRoot;
+    else if (name == "xfs")
+      *set |= kOnXfs;
+    else if (name == "btrfs")
+      *set |= kOnBtrfs;
+    else
+      return false;
+    start = end + 1;
+  }
+  return *set != 0;
+}
+
+// Reads the command line into *o; false when one of the first three
+// arguments is not a positive number or the fourth names no file system.
 bool ParseOptions(int argc, char** argv, Options* o) {
   uint64_t values[3] = {o->data_bytes >> 20, o->files, static_cast<uint64_t>(o->rounds)};
-  if (argc > 4) return false;
-  for (int i = 1; i < argc; ++i) {
+  if (argc > 5) return false;
+  for (int i = 1; i < argc && i <= 3; ++i) {
     char* end = nullptr;
     values[i - 1] = std::strtoull(argv[i], &end, 10);
     if (*end != '\0' || values[i - 1] == 0 || values[i - 1] > 1000000) return false;
   }
+  if (argc == 5 && !ParseFileSystems(argv[4], &o->file_systems)) return false;
   o->data_bytes = values[0] << 20;
   o->files = values[1];
   o->rounds = static_cast<int>(values[2]);
@@ -205,6 +234,17 @@ const char* Verdict(bool applies, bool met) {
   return met ? "met" : "NOT met";
 }
 
+// How much the rounds differ: the copy's part of each round, with the
+// upgrade without the copy of the same round taken from the one with it.
+void PrintSpread(const Samples& s) {
+  std::vector<double> parts;
+  for (size_t i = 0; i < s.with_copy.size() && i < s.without_copy.size(); ++i)
+    parts.push_back((s.with_copy[i] - s.without_copy[i]) * 1000);
+  std::sort(parts.begin(), parts.end());
+  printf("  the copy's part per round: least %.1f ms, median %.1f ms, most %.1f ms\n",
+         parts.front(), Median(parts), parts.back());
+}
+
 void Report(const Samples& s, double mib, bool reflinks) {
   const double a = Median(s.with_copy), b = Median(s.without_copy);
   const double cp = Median(s.cp), copy = a - b;
@@ -214,6 +254,7 @@ void Report(const Samples& s, double mib, bool reflinks) {
   PrintRow("    the copy's part, a - b", copy, mib);
   PrintRow("(c) cp -a of the data folder", cp, mib);
   PrintRow("    rm -rf of cp -a's copy (not in c)", Median(s.rm), 0);
+  PrintSpread(s);
   const double overhead = copy / b * 100;
   printf("  copy overhead (a - b) / b: %.1f%%; target with reflinks < 5%%: %s\n", overhead,
          Verdict(reflinks, overhead < 5));
@@ -423,6 +464,7 @@ LoopFs::~LoopFs() {
 // On the file system of the temporary root, volume /volume1 as the root is
 // made.
 bool MeasureOnTempRoot(const Options& o) {
+  printf("\nOn the temporary root's file system:\n");
   TempRoot root;
   HoldSignals held;
   return RunInChild([&] { MeasureVolume(root, "/volume1", o); });
@@ -461,10 +503,11 @@ int main(int argc, char** argv) {
   std::string cp_version;
   Require(Succeeds({"cp", "--version"}, &cp_version), "cp --version");
   printf("cp -a is %s\n", cp_version.substr(0, cp_version.find('\n')).c_str());
-  printf("\nOn the temporary root's file system:\n");
   // A pass that failed or was interrupted ends the benchmark.
-  return MeasureOnTempRoot(o) && MeasureOnLoop(o, kXfs, "XFS (reflink=1)") &&
-                 MeasureOnLoop(o, kBtrfs, "Btrfs (data folders are subvolumes)")
-             ? 0
-             : 1;
+  if ((o.file_systems & kOnRoot) && !MeasureOnTempRoot(o)) return 1;
+  if ((o.file_systems & kOnXfs) && !MeasureOnLoop(o, kXfs, "XFS (reflink=1)")) return 1;
+  if ((o.file_systems & kOnBtrfs) &&
+      !MeasureOnLoop(o, kBtrfs, "Btrfs (data folders are subvolumes)"))
+    return 1;
+  return 0;
 }

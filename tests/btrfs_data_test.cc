@@ -197,6 +197,42 @@ TEST_F(BtrfsDataTest, SubvolumeInsideTheDataIsCopiedFileByFile) {
   ExpectNothingLeftBut(0);
 }
 
+// A running package's snapshot is taken once it is stopped, while the
+// upgrade gives its data to its account: the data the snapshot holds and a
+// failed upgrade puts back is as the old version left it, a file that
+// belonged to root included, and a snapshot that fails leaves the data
+// untouched.
+TEST_F(BtrfsDataTest, RunningPackagesDataIsCopiedBeforeItsOwnersChange) {
+  fingerprint_folder_itself_ = false;
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  // As a version that ran as root would leave it; the upgrade gives it to
+  // the package's account.
+  ASSERT_TRUE(KIVOWriteFileAtomic(data_ + "/left-by-root", "root's\n", SyncToDisk::No));
+  ASSERT_EQ(0, lchown((data_ + "/left-by-root").c_str(), 0, 0));
+  const std::string v1_data = Fingerprint();
+
+  TestPackage broken = v2_;
+  broken.scripts = {{"postupgrade", std::string(kRewriteTestData) + "exit 1\n"}};
+  EXPECT_NE(0, Install(broken)) << out_;
+  ExpectSaid("The upgrade to 2.0 failed in postupgrade; 1.0 and its data were restored.");
+  EXPECT_EQ("test-app 1.0 running\n", Status());
+  ExpectVersion("1", v1_data);
+
+  // No snapshot can be made in an immutable folder.
+  const std::string snapshots = root_.Path("/volume1/@appdata/.snapshots");
+  std::string out;
+  ASSERT_EQ(0, KIVOFSMkdirP(snapshots.c_str()));
+  ASSERT_EQ(0, RunProgram({"chattr", "+i", snapshots}, &out)) << out;
+  const int refused = Install(v2_);
+  ASSERT_EQ(0, RunProgram({"chattr", "-i", snapshots}, &out)) << out;
+  EXPECT_NE(0, refused) << out_;
+  ExpectSaid("could not be copied before the upgrade");
+  ExpectSaid("Nothing was changed; 1.0 runs again.");
+  EXPECT_EQ("test-app 1.0 running\n", Status());
+  ExpectVersion("1", v1_data);
+  ExpectNothingLeftBut(0);
+}
+
 // kill -9 at each step of a failed upgrade's snapshot and restore: the
 // package is 1.0 or 2.1 with that version's data, and the next operation
 // finishes the restore and removes what is left. The package does not run,

@@ -221,9 +221,12 @@ class Installer {
   // Stage's folders, record and payload on `volume`.
   int Unpack(PackageFileReader* reader, const PackageInfo& info, const VolumeConfig& volume,
              Staging* s);
-  // Starts the snapshot of the data beside the unpacking when it can be
-  // taken now (see the definition).
-  void SnapshotBesideUnpacking();
+  // Starts the planned copy of the data on a thread of its own when it is
+  // a snapshot (see the definition).
+  void SnapshotOnAThread();
+  // Whether the data may change: once the snapshot on its thread is whole,
+  // or when none is under way. Waits for it.
+  bool SnapshotAllowsChanges();
   // Drops a snapshot taken beside an unpacking that then failed.
   void DropEarlySnapshot();
   // Before anything is written: whether the upgrade can copy the data
@@ -237,12 +240,13 @@ class Installer {
   int PrepareInstall(const std::map<std::string, std::string>& env, Staging* s);
   int PrepareUpgrade(const PackageInfo& info, const std::map<std::string, std::string>& env,
                      Staging* s);
-  // Takes the planned copy of the data, or collects the one taken beside
-  // the unpacking.
+  // Takes the planned copy of the data, or collects the one taken on a
+  // thread.
   int TakeDataCopy();
   // The package's own account (package_confinement.h), before its first
-  // script of this operation.
-  int SettleAccount(Staging* s);
+  // script of this operation; nothing in the data changes unless
+  // `may_change` allows it.
+  int SettleAccount(Staging* s, const DataChangeGate& may_change = {});
   // After a refusal that changed nothing but stopping the old version: it
   // runs again, and the answer says so.
   int RestartOld(int code);
@@ -276,9 +280,11 @@ class Installer {
   bool new_started_ = false;                // the new version was started: a restore stops it first
   std::unique_ptr<DataSnapshot> snapshot_;  // the planned copy of the data; null for none
   bool copy_taken_ = false;
-  std::future<TreeCopyResult> early_snapshot_;  // taken beside the unpacking; else invalid
-  std::string early_error_;                     // its error, once early_snapshot_ is ready
-  bool old_kept_ = false;  // the old version stays as a kept revision (revisions.h)
+  // The snapshot taken on a thread (beside the unpacking, or beside the
+  // settling of the account); else invalid.
+  std::shared_future<TreeCopyResult> snapshot_thread_;
+  std::string thread_error_;  // its error, once snapshot_thread_ is ready
+  bool old_kept_ = false;     // the old version stays as a kept revision (revisions.h)
   PackageInfo old_;
   std::string old_record_;
   std::string id_;
@@ -354,7 +360,7 @@ int Installer::Stage(PackageFileReader* reader, const PackageInfo& info, Staging
   // whether it is stopped and started again); the package's lock keeps it
   // so until the upgrade ends.
   if (upgrade_) was_running_ = PMSIsRunning(id_, old_);
-  SnapshotBesideUnpacking();
+  if (!was_running_) SnapshotOnAThread();
   code = Unpack(reader, info, volume, s);
   if (code != PKG_OK) DropEarlySnapshot();
   return code;
@@ -462,18 +468,25 @@ int Installer::PrepareUpgrade(const PackageInfo& info,
     return Refuse(PKG_ERR_SCRIPT_FAILED,
                   old_.getVersion() + " did not stop; it stays installed and running");
   }
-  int code = TakeDataCopy();
+  // The data of the old version, stopped now, changes no more: its
+  // snapshot is taken beside the settling of the account, which changes
+  // nothing in the data before the snapshot is whole.
+  if (was_running_) SnapshotOnAThread();
+  const bool on_thread = snapshot_thread_.valid();
+  int code = on_thread ? PKG_OK : TakeDataCopy();
   if (code != PKG_OK) return RestartOld(code);
   // Only now: the old version, stopped above, may have run as root.
-  if ((code = SettleAccount(s)) != PKG_OK) return RestoreAfterFailure(info, s, *message_);
+  const int settled = SettleAccount(s, [this] { return SnapshotAllowsChanges(); });
+  if (on_thread && (code = TakeDataCopy()) != PKG_OK) return RestartOld(code);
+  if (settled != PKG_OK) return RestoreAfterFailure(info, s, *message_);
   if (PMSRunPackageScript(s->record, "preupgrade", "", env, *op_)) return PKG_OK;
   return RestoreAfterFailure(info, s, "failed in preupgrade");
 }
 
-int Installer::SettleAccount(Staging* s) {
+int Installer::SettleAccount(Staging* s, const DataChangeGate& may_change) {
   std::string error;
-  const int code =
-      PMSSettlePackageAccount(id_, s->record, op_->log_path(), DataOwnership::kWhole, &error);
+  const int code = PMSSettlePackageAccount(id_, s->record, op_->log_path(), DataOwnership::kWhole,
+                                           &error, may_change);
   s->fresh_account = !upgrade_;
   if (code == PKG_OK) return PKG_OK;
   op_->Log("account: " + error);
@@ -482,26 +495,32 @@ int Installer::SettleAccount(Staging* s) {
 
 // A snapshot is one step, but one that waits for the file system to commit
 // a transaction: about 2 ms whatever the data holds, several percent of a
-// short upgrade. When the old version does not run, nothing changes its
-// data from here on (the package's lock keeps every other operation out),
-// so the snapshot is taken on a thread of its own while this one unpacks
-// the new version, which writes nothing in the data folder; TakeDataCopy
-// collects it. A running version is copied only once PrepareUpgrade has
-// stopped it, and a copy file by file reports progress and stays in line.
-void Installer::SnapshotBesideUnpacking() {
-  if (!snapshot_ || was_running_ || !PMSCopiesBySnapshot(snapshot_->data_dir())) return;
+// short upgrade. So it is taken on a thread of its own while this one goes
+// on with work that changes nothing in the data folder: when the old
+// version does not run, beside the unpacking of the new version (nothing
+// changes the data from here on: the package's lock keeps every other
+// operation out); when it runs, once it is stopped, beside the settling of
+// the account, whose changes to the data wait for the snapshot. A copy
+// file by file reports progress and stays in line.
+void Installer::SnapshotOnAThread() {
+  if (!snapshot_ || snapshot_thread_.valid() || !PMSCopiesBySnapshot(snapshot_->data_dir())) return;
   const DataSnapshot* copy = snapshot_.get();
-  std::string* error = &early_error_;
+  std::string* error = &thread_error_;
   try {
-    early_snapshot_ =
-        std::async(std::launch::async, [copy, error] { return PMSTakeSnapshot(*copy, error); });
+    snapshot_thread_ = std::async(std::launch::async, [copy, error] {
+                         return PMSTakeSnapshot(*copy, error);
+                       }).share();
   } catch (const std::system_error&) {
     // No thread to spare: TakeDataCopy takes the snapshot in line.
   }
 }
 
+bool Installer::SnapshotAllowsChanges() {
+  return !snapshot_thread_.valid() || snapshot_thread_.get() == TreeCopyResult::kCopied;
+}
+
 void Installer::DropEarlySnapshot() {
-  if (!early_snapshot_.valid() || early_snapshot_.get() != TreeCopyResult::kCopied) return;
+  if (!snapshot_thread_.valid() || snapshot_thread_.get() != TreeCopyResult::kCopied) return;
   if (!PMSDiscardSnapshot(*snapshot_))
     op_->Log("the copy of the data taken before the unpacking failed stays: " + snapshot_->copy());
 }
@@ -510,9 +529,10 @@ int Installer::TakeDataCopy() {
   if (!snapshot_) return PKG_OK;
   std::string error;
   const std::string what = "The data of " + id_;
-  const bool early = early_snapshot_.valid();
-  const TreeCopyResult result = early ? early_snapshot_.get() : PMSTakeSnapshot(*snapshot_, &error);
-  if (early) error = early_error_;
+  const bool on_thread = snapshot_thread_.valid();
+  const TreeCopyResult result =
+      on_thread ? snapshot_thread_.get() : PMSTakeSnapshot(*snapshot_, &error);
+  if (on_thread) error = thread_error_;
   switch (result) {
     case TreeCopyResult::kCopied:
       copy_taken_ = true;

@@ -144,37 +144,48 @@ void IdRange(unsigned* first, unsigned* last) {
   *last = static_cast<unsigned>(l);
 }
 
-bool ChownAt(int dir, const char* name, uid_t uid, gid_t gid, std::string* error,
-             const std::string& path);
+// What a walk that gives a tree to an account needs at every entry.
+struct ChownWalk {
+  uid_t uid;
+  gid_t gid;
+  const DataChangeGate& may_change;
+  std::string* error;
+};
+
+bool ChownAt(int dir, const char* name, const ChownWalk& walk, const std::string& path);
 
 // Gives what folder `dir` (open) holds to uid:gid, depth first.
-bool ChownEntries(int dir, uid_t uid, gid_t gid, std::string* error, const std::string& path) {
+bool ChownEntries(int dir, const ChownWalk& walk, const std::string& path) {
   DIR* d = fdopendir(dup(dir));
-  if (!d) return (*error = "cannot read " + path), false;
+  if (!d) return (*walk.error = "cannot read " + path), false;
   bool ok = true;
   while (struct dirent* e = readdir(d)) {
     if (strcmp(e->d_name, ".") == 0 || strcmp(e->d_name, "..") == 0) continue;
-    ok &= ChownAt(dir, e->d_name, uid, gid, error, path + "/" + e->d_name);
+    ok &= ChownAt(dir, e->d_name, walk, path + "/" + e->d_name);
   }
   closedir(d);
   return ok;
 }
 
-bool ChownAt(int dir, const char* name, uid_t uid, gid_t gid, std::string* error,
-             const std::string& path) {
+bool ChownAt(int dir, const char* name, const ChownWalk& walk, const std::string& path) {
   struct stat st;
+  std::string* error = walk.error;
   if (fstatat(dir, name, &st, AT_SYMLINK_NOFOLLOW) != 0) {
     return (*error = "cannot read " + path), false;
   }
   if (!S_ISDIR(st.st_mode) && st.st_nlink > 1) return true;  // see the header
-  if ((st.st_uid != uid || st.st_gid != gid) &&
-      fchownat(dir, name, uid, gid, AT_SYMLINK_NOFOLLOW) != 0) {
-    return (*error = "cannot change the owner of " + path + ": " + strerror(errno)), false;
+  if (st.st_uid != walk.uid || st.st_gid != walk.gid) {
+    if (walk.may_change && !walk.may_change()) {
+      return (*error = "the owner of " + path + " may not be changed now"), false;
+    }
+    if (fchownat(dir, name, walk.uid, walk.gid, AT_SYMLINK_NOFOLLOW) != 0) {
+      return (*error = "cannot change the owner of " + path + ": " + strerror(errno)), false;
+    }
   }
   if (!S_ISDIR(st.st_mode)) return true;
   int sub = openat(dir, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
   if (sub < 0) return (*error = "cannot open " + path), false;
-  bool ok = ChownEntries(sub, uid, gid, error, path);
+  bool ok = ChownEntries(sub, walk, path);
   close(sub);
   return ok;
 }
@@ -283,13 +294,14 @@ bool PMSRemovePackageAccount(const std::string& id, std::string* error) {
   return true;
 }
 
-bool PMSChownTree(const std::string& dir, uid_t uid, gid_t gid, std::string* error) {
+bool PMSChownTree(const std::string& dir, uid_t uid, gid_t gid, std::string* error,
+                  const DataChangeGate& may_change) {
   const size_t slash = dir.rfind('/');
   if (slash == std::string::npos || slash + 1 >= dir.size()) return (*error = "bad folder"), false;
   int parent =
       open(slash == 0 ? "/" : dir.substr(0, slash).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   if (parent < 0) return (*error = "cannot open the folder above " + dir), false;
-  bool ok = ChownAt(parent, dir.c_str() + slash + 1, uid, gid, error, dir);
+  bool ok = ChownAt(parent, dir.c_str() + slash + 1, ChownWalk{uid, gid, may_change, error}, dir);
   close(parent);
   return ok;
 }

@@ -16,6 +16,7 @@
 // "<id>#1", "<id>#2", ... instead, up to 99 tries.
 #pragma once
 
+#include <functional>
 #include <string>
 #include <sys/types.h>
 
@@ -44,11 +45,19 @@ bool PMSFindPackageAccount(const std::string& id, PackageAccount* account);
 // `*error`) when the accounts files cannot be written.
 [[nodiscard]] bool PMSRemovePackageAccount(const std::string& id, std::string* error);
 
+// Asked before a change to a package's data folder: true lets it go ahead,
+// false forbids it. An upgrade that copies the data on a thread of its own
+// meanwhile answers once the copy is whole, and false when the copy failed:
+// the data must then stay as the old version left it. It may be asked
+// before every change and keeps its first answer; an empty gate allows all.
+using DataChangeGate = std::function<bool()>;
+
 // Gives `dir` and everything in it to `uid`:`gid`, never following a
 // symbolic link; a file with more than one hard link keeps its owner (it
 // may be a name for a file outside the folder). False (with `*error`) when
-// something could not be changed.
-[[nodiscard]] bool PMSChownTree(const std::string& dir, uid_t uid, gid_t gid, std::string* error);
+// something could not be changed, or `may_change` forbade a change.
+[[nodiscard]] bool PMSChownTree(const std::string& dir, uid_t uid, gid_t gid, std::string* error,
+                                const DataChangeGate& may_change = {});
 
 // Adds search permission for everyone (o+x, never read) to each folder from
 // the system root down to `path`'s parent, those strictly above the system

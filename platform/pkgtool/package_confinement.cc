@@ -469,22 +469,38 @@ std::string DataOwnerText(const PackageAccount& account) {
 
 // Gives `data` to `account`: every entry, or, when `ownership` allows and a
 // full pass for the same account was recorded in `record`, the folder
-// alone. A full pass that succeeds is recorded.
+// alone; and lets everyone search the folder (PMSMakeReachable). A full
+// pass that succeeds is recorded. Changes nothing unless `may_change`
+// allows it.
 bool GiveData(const std::string& record, const std::string& data, const PackageAccount& account,
-              bool account_is_new, DataOwnership ownership, std::string* error) {
+              bool account_is_new, DataOwnership ownership, const DataChangeGate& may_change,
+              std::string* error) {
   const std::string marker = record + "/" + kPMSDataOwnerFile;
   std::string recorded;
   // A new account may have the uid an earlier one had: what that one owned
   // then proves nothing now.
-  if (ownership == DataOwnership::kUnlessSettled && !account_is_new &&
-      KIVOReadFile(marker, &recorded, 64) && recorded == DataOwnerText(account)) {
-    if (lchown(data.c_str(), account.uid, account.gid) == 0) return true;
-    *error = "cannot change the owner of " + data + ": " + strerror(errno);
+  const bool settled = ownership == DataOwnership::kUnlessSettled && !account_is_new &&
+                       KIVOReadFile(marker, &recorded, 64) && recorded == DataOwnerText(account);
+  struct stat st;
+  if (lstat(data.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
+    *error = "cannot read the data folder " + data;
     return false;
   }
-  if (!PMSChownTree(data, account.uid, account.gid, error)) return false;
-  // Without the marker the next start only does the full pass again.
-  static_cast<void>(KIVOWriteFileAtomic(marker, DataOwnerText(account), SyncToDisk::No));
+  // Asked only before a change: the gate may wait.
+  const auto allowed = [&may_change] { return !may_change || may_change(); };
+  if (!settled) {
+    if (!PMSChownTree(data, account.uid, account.gid, error, may_change)) return false;
+    // Without the marker the next start only does the full pass again.
+    static_cast<void>(KIVOWriteFileAtomic(marker, DataOwnerText(account), SyncToDisk::No));
+  } else if (st.st_uid != account.uid || st.st_gid != account.gid) {
+    if (!allowed()) return (*error = "the owner of " + data + " may not be changed now"), false;
+    if (lchown(data.c_str(), account.uid, account.gid) != 0) {
+      *error = "cannot change the owner of " + data + ": " + strerror(errno);
+      return false;
+    }
+  }
+  if (!(st.st_mode & S_IXOTH) && allowed())
+    static_cast<void>(chmod(data.c_str(), (st.st_mode & 07777) | S_IXOTH));
   return true;
 }
 
@@ -492,7 +508,7 @@ bool GiveData(const std::string& record, const std::string& data, const PackageA
 
 int PMSSettlePackageAccount(const std::string& id, const std::string& record,
                             const std::string& log_path, DataOwnership ownership,
-                            std::string* error) {
+                            std::string* error, const DataChangeGate& may_change) {
   PackageAccount account;
   bool account_is_new = false;
   int code = PMSEnsurePackageAccount(id, &account, error, &account_is_new);
@@ -500,11 +516,13 @@ int PMSSettlePackageAccount(const std::string& id, const std::string& record,
   const OwnFolders own = FoldersOf(record);
   // Each path below names something inside the folder, so that the
   // folder itself is made reachable too.
-  for (const std::string& inside :
-       {own.record + "/scripts/x", own.payload + "/x", own.data + "/x"}) {
+  // The data folder itself is made searchable by GiveData, which may
+  // change it.
+  for (const std::string& inside : {own.record + "/scripts/x", own.payload + "/x", own.data}) {
     if (inside[0] == '/') PMSMakeReachable(inside);
   }
-  if (!own.data.empty() && !GiveData(record, own.data, account, account_is_new, ownership, error)) {
+  if (!own.data.empty() &&
+      !GiveData(record, own.data, account, account_is_new, ownership, may_change, error)) {
     return PKG_ERR_INTERNAL;
   }
   // Written now, so the record says who the package is from its install on.

@@ -47,6 +47,7 @@
 #include <json/value.h>
 
 #include "klibc/json_text.h"
+#include "pkgtool/package_account.h"
 
 // The name of the record's confinement file.
 inline constexpr char kPMSConfinementFile[] = "confinement";
@@ -122,11 +123,13 @@ enum class DataOwnership {
 // package's data folder to it as `ownership` says, makes the record, payload
 // and data folder of `record` reachable (PMSMakeReachable), and writes the
 // record's confinement file, saying so in the operation log `log_path` (""
-// for none) when it changed. PKG_OK or the account's result code, with
+// for none) when it changed. Nothing in the data folder changes unless
+// `may_change` allows it. PKG_OK or the account's result code, with
 // `*error`.
 [[nodiscard]] int PMSSettlePackageAccount(const std::string& id, const std::string& record,
                                           const std::string& log_path, DataOwnership ownership,
-                                          std::string* error);
+                                          std::string* error,
+                                          const DataChangeGate& may_change = {});
 
 // At uninstall, after the package's folders were removed: what stays of its
 // data folder `data` (a removal that failed) is given to root, the
