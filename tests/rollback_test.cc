@@ -28,6 +28,15 @@ class RollbackTest : public UpgradeFixture {
 
   int Tool(const std::string& command) { return Kivoctl({command, "test-app"}, &out_); }
   std::string Code() { return FileText(root_.Path("/var/packages/test-app/target/version.txt")); }
+  // The record name of the one version kept.
+  std::string KeptRecord() {
+    std::string record;
+    EXPECT_EQ(0, RunProgram({"sh", "-c", "cd \"$1\" && ls -d test-app.*.kept", "sh",
+                             root_.Path("/volume1/@appdata/.snapshots/test-app")},
+                            &record))
+        << record;
+    return record.substr(0, record.size() - 6);  // "<record>.kept\n"
+  }
 };
 
 TEST_F(RollbackTest, RollbackBringsTheOldVersionBackWithItsDataAndASecondOneUndoesIt) {
@@ -139,12 +148,7 @@ TEST_F(RollbackTest, UninstallTakesTheKeptVersionWithIt) {
 TEST_F(RollbackTest, KeptVersionThatIsNotWholeIsNotTrusted) {
   ASSERT_EQ(0, Install(v1_)) << out_;
   ASSERT_EQ(0, Install(v2_)) << out_;
-  std::string record;
-  ASSERT_EQ(0, RunProgram({"sh", "-c", "cd \"$1\" && ls -d test-app.*.kept", "sh",
-                           root_.Path("/volume1/@appdata/.snapshots/test-app")},
-                          &record))
-      << record;
-  record = record.substr(0, record.size() - 6);  // "<record>.kept\n"
+  const std::string record = KeptRecord();
   root_.Write("/var/packages/.records/" + record + "/REPLACED", "yesterday\n");
   ASSERT_EQ(0, Tool("revisions")) << out_;
   ExpectSaid("no earlier version of test-app is kept");
@@ -153,6 +157,37 @@ TEST_F(RollbackTest, KeptVersionThatIsNotWholeIsNotTrusted) {
   EXPECT_EQ("test-app 2.0 stopped\n", Status());
   EXPECT_EQ("migrated\n", FileText(data_ + "/db/main.db"));
   ASSERT_EQ(0, Install(PackageWithInfo("other-app"))) << out_;
+  ExpectNothingLeftBut(0);
+}
+
+// Dropping a kept version renames its copy without waiting for the volume,
+// then removes the copy, the payload and the record: a crash may keep any
+// part of that. Whatever of the version stays without the rest is removed
+// by the next operation, and never offered for a rollback.
+TEST_F(RollbackTest, KeptVersionHalfDroppedInACrashIsRemovedByTheNextOperation) {
+  ASSERT_EQ(0, Install(v1_)) << out_;
+  ASSERT_EQ(0, Install(v2_)) << out_;
+  std::string out;
+  // The record's removal stayed, the rest was lost.
+  ASSERT_EQ(0,
+            RunProgram({"rm", "-rf", root_.Path("/var/packages/.records/" + KeptRecord())}, &out))
+      << out;
+  ASSERT_EQ(0, Tool("revisions")) << out_;
+  ExpectSaid("no earlier version of test-app is kept");
+  ASSERT_EQ(0, Install(PackageWithInfo("other-app"))) << out_;
+  ExpectNothingLeftBut(0);
+
+  // The copy's removal stayed, the record and the payload were lost.
+  TestPackage v3 = v2_;
+  v3.version = "3.0";
+  ASSERT_EQ(0, Install(v3)) << out_;
+  const std::string copy =
+      root_.Path("/volume1/@appdata/.snapshots/test-app/" + KeptRecord() + ".kept");
+  ASSERT_EQ(0, RunProgram({"rm", "-rf", copy}, &out)) << out;
+  EXPECT_EQ(1, Tool("rollback")) << out_;
+  ExpectSaid("[" + std::to_string(PKG_ERR_NO_REVISION) + "]");
+  EXPECT_EQ("2\n", Code());
+  ASSERT_EQ(0, Install(PackageWithInfo("another-app"))) << out_;
   ExpectNothingLeftBut(0);
 }
 

@@ -174,7 +174,12 @@ bool PMSMarkReplaced(const DataSnapshot& s) {
 bool PMSDropRevision(const PMSRevision& r) {
   const DataSnapshot s = r.snapshot();
   const std::string gone = s.Named(".discard");
-  if (!s.IsValid() || (!PMSRenameDurably(r.copy(), gone) && errno != ENOENT)) return false;
+  // Not synced: a crash that loses the rename loses the removals that
+  // follow it on the same volume too, and the clean-up removes whatever of
+  // the revision is left without the rest (upgrade_recovery.h).
+  if (!s.IsValid() ||
+      (!PMSRenameCopy(r.copy(), gone, PMSRenameSync::kWithTheVolume) && errno != ENOENT))
+    return false;
   bool ok = PMSRemoveTree(s.folder(), gone);
   ok &= PMSRemoveTree(PMSVolumeFolderHolding(r.payload, "@appstore"), r.payload);
   ok &=
