@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <cstring>
 #include <sys/mount.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -231,6 +232,31 @@ TEST_F(BtrfsDataTest, RunningPackagesDataIsCopiedBeforeItsOwnersChange) {
   EXPECT_EQ("test-app 1.0 running\n", Status());
   ExpectVersion("1", v1_data);
   ExpectNothingLeftBut(0);
+}
+
+// Killed once the snapshot beside the settling of the account is taken
+// and the settling gave a file of root's to the package: the next
+// operation puts 1.0 back with its data as it was when it stopped, and a
+// start runs it again.
+TEST_F(BtrfsDataTest, RunningPackageKilledAfterItsSnapshotGetsItsDataBack) {
+  fingerprint_folder_itself_ = false;
+  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+  ASSERT_TRUE(KIVOWriteFileAtomic(data_ + "/left-by-root", "root's\n", SyncToDisk::No));
+  ASSERT_EQ(0, lchown((data_ + "/left-by-root").c_str(), 0, 0));
+  const std::string v1_data = Fingerprint();
+  TestPackage v3 = v2_;
+  v3.version = "3.0";
+  EXPECT_EQ(128 + 9,
+            Kivoctl({"install", v3.Build(dir_)}, &out_, {{"KIVO_PKGTOOL_FAULT", "snapshot_taken"}}))
+      << out_;
+  struct stat st;
+  ASSERT_EQ(0, lstat((data_ + "/left-by-root").c_str(), &st));
+  EXPECT_NE(0u, st.st_uid) << "the settling had not changed the data yet";
+  ASSERT_EQ(0, InstallAnother()) << out_;
+  ExpectVersion("1", v1_data);
+  ExpectNothingLeftBut(0);
+  ASSERT_EQ(0, Tool("start")) << out_;
+  EXPECT_EQ("test-app 1.0 running\n", Status());
 }
 
 // kill -9 at each step of a failed upgrade's snapshot and restore: the
