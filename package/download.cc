@@ -48,6 +48,12 @@ void PackageWebAPI::ReadProgress() {
     response->SetSuccess(done);
     return;
   }
+  // Whether the task is finished is read before its data: a job writes its
+  // last data and then finishes, so data read after a finish was seen is
+  // the job's last, while data read first could be older than a finish
+  // read after it, and the answer would end the job with the data of its
+  // middle ("downloading", finished).
+  const bool finished = task->isFinished();
   task->waitForDataReady("data", 60);
   Json::Value data = task->getProperty("data");
   if (data.isNull()) {
@@ -60,7 +66,7 @@ void PackageWebAPI::ReadProgress() {
   if (!queued && WorkerGone(*task, data) && !RecordWorkerGone(*task, data)) {
     PKG_LOG_ERR("Failed to record the end of task '%s'", task->getTaskId().c_str());
   }
-  data["finished"] = task->isFinished() || data["error"].isInt();
+  data["finished"] = finished || data["error"].isInt();
   if (data["installing"].isBool() && data["installing"].asBool()) {
     double progress = data.isMember("id") ? PMSGetProgress(data["id"].asString()) : -1.0;
     if (progress != -1.0) data["progress"] = progress;
@@ -70,16 +76,17 @@ void PackageWebAPI::ReadProgress() {
   // A server download's worker puts its outcome on record from the task
   // once it has finished it (download_record.h): until the worker is gone
   // the task is neither reported finished nor dropped.
-  if (task->isFinished() && data["link"].isString() && data["pid"].isInt() &&
+  if (finished && data["link"].isString() && data["pid"].isInt() &&
       KLIBCProcAlive(data["pid"].asInt()) == 1) {
     data["finished"] = false;
     response->SetSuccess(data);
     return;
   }
   if (queued) {
-    bool gone =
-        !task->isFinished() && data["pid"].isInt() && KLIBCProcAlive(data["pid"].asInt()) != 1;
-    if (task->isFinished() || gone) {
+    // Dead, and then still unfinished: the worker ended without finishing.
+    const bool gone = !finished && data["pid"].isInt() &&
+                      KLIBCProcAlive(data["pid"].asInt()) != 1 && !task->isFinished();
+    if (finished || gone) {
       data["finished"] = true;
       DropTask(*task);
     }

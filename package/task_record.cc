@@ -13,8 +13,11 @@ bool TaskProcessAlive(const Json::Value& data) {
 }
 
 bool WorkerGone(NVX::Task& task, const Json::Value& data) {
-  return data.isObject() && data["pid"].isInt() && !data["error"].isInt() && !task.isFinished() &&
-         !TaskProcessAlive(data);
+  // The process first, then the task: a worker found dead cannot finish
+  // its task any more, while one that finishes and exits between the two
+  // questions asked the other way round would be taken for one that died.
+  return data.isObject() && data["pid"].isInt() && !data["error"].isInt() &&
+         !TaskProcessAlive(data) && !task.isFinished();
 }
 
 bool RecordWorkerGone(NVX::Task& task, Json::Value& data) {
