@@ -71,6 +71,12 @@ end_demo() {
   stop_packages
 }
 trap end_demo EXIT
-# Ctrl-C reaches lighttpd, which ends; the shell goes on to the trap above.
-trap : INT TERM
-/usr/sbin/lighttpd -D -f "$ROOT/lighttpd.conf"
+/usr/sbin/lighttpd -D -f "$ROOT/lighttpd.conf" &
+LIGHTTPD=$!
+# Ctrl-C, or a TERM sent to this script (kill PID), ends lighttpd; the shell
+# then goes on to the trap above. (lighttpd, started in the background,
+# does not see Ctrl-C itself.)
+trap 'kill -TERM "$LIGHTTPD" 2>/dev/null || true' INT TERM
+while kill -0 "$LIGHTTPD" 2>/dev/null; do
+  wait "$LIGHTTPD" || true
+done
