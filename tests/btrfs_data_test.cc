@@ -94,6 +94,16 @@ class BtrfsDataTest : public UpgradeFixture {
     return out;
   }
 
+  // 1.0 installed and running, with a file of root's in its data, as a
+  // version that ran as root would leave it: an upgrade gives it to the
+  // package's account.
+  void RunWithAFileOfRoots() {
+    fingerprint_folder_itself_ = false;  // the daemon's pid file changes it
+    ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
+    ASSERT_TRUE(KIVOWriteFileAtomic(data_ + "/left-by-root", "root's\n", SyncToDisk::No));
+    ASSERT_EQ(0, lchown((data_ + "/left-by-root").c_str(), 0, 0));
+  }
+
   bool mounted_ = false;
 };
 
@@ -204,12 +214,7 @@ TEST_F(BtrfsDataTest, SubvolumeInsideTheDataIsCopiedFileByFile) {
 // belonged to root included, and a snapshot that fails leaves the data
 // untouched.
 TEST_F(BtrfsDataTest, RunningPackagesDataIsCopiedBeforeItsOwnersChange) {
-  fingerprint_folder_itself_ = false;
-  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
-  // As a version that ran as root would leave it; the upgrade gives it to
-  // the package's account.
-  ASSERT_TRUE(KIVOWriteFileAtomic(data_ + "/left-by-root", "root's\n", SyncToDisk::No));
-  ASSERT_EQ(0, lchown((data_ + "/left-by-root").c_str(), 0, 0));
+  ASSERT_NO_FATAL_FAILURE(RunWithAFileOfRoots());
   const std::string v1_data = Fingerprint();
 
   TestPackage broken = v2_;
@@ -239,10 +244,7 @@ TEST_F(BtrfsDataTest, RunningPackagesDataIsCopiedBeforeItsOwnersChange) {
 // operation puts 1.0 back with its data as it was when it stopped, and a
 // start runs it again.
 TEST_F(BtrfsDataTest, RunningPackageKilledAfterItsSnapshotGetsItsDataBack) {
-  fingerprint_folder_itself_ = false;
-  ASSERT_EQ(0, Install(v1_, {"--run"})) << out_;
-  ASSERT_TRUE(KIVOWriteFileAtomic(data_ + "/left-by-root", "root's\n", SyncToDisk::No));
-  ASSERT_EQ(0, lchown((data_ + "/left-by-root").c_str(), 0, 0));
+  ASSERT_NO_FATAL_FAILURE(RunWithAFileOfRoots());
   const std::string v1_data = Fingerprint();
   TestPackage v3 = v2_;
   v3.version = "3.0";
