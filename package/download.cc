@@ -91,7 +91,16 @@ void PackageWebAPI::ReadProgress() {
       DropTask(*task);
     }
   } else if (task->getDoubleProperty("progress", 0.0) < 0) {
-    // A failed download: drop its task and its folder.
+    // A failed download: drop its task and its folder. Its worker wrote the
+    // failure with this progress and finishes the task after, maybe after
+    // the reads above: this answer, the last there will be, carries the
+    // failure and ends the job.
+    Json::Value failed = task->getProperty("data");
+    if (failed.isObject()) {
+      failed["progress"] = 0.0;
+      data = failed;
+    }
+    data["finished"] = true;
     DropTask(*task);
     if (data["tmp_folder"].isString()) RemoveTree(data["tmp_folder"].asString());
   }

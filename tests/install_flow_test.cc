@@ -351,9 +351,16 @@ TEST_F(InstallFlowTest, StatusAndCancelOfJobs) {
   root_.Write(folder.substr(root_.dir().size()) + "/@KIVOPKG_DOWNLOAD_y", "payload");
   EXPECT_DOUBLE_EQ(
       1.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
-  make_task("@KIVOPKG_DOWNLOAD_y", job, -1.0);
-  EXPECT_DOUBLE_EQ(
-      0.0, Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}}).Data()["progress"].asDouble());
+  // The worker writes its failure with the negative progress and finishes
+  // the task after: a read in between is the last one, and it ends the job.
+  Json::Value failed = job;
+  failed["error"]["code"] = 2;
+  failed["error"]["message"] = "the server answered HTTP 404";
+  make_task("@KIVOPKG_DOWNLOAD_y", failed, -1.0);
+  CgiAnswer last = Call("status", {{"task_id", "@KIVOPKG_DOWNLOAD_y"}});
+  EXPECT_DOUBLE_EQ(0.0, last.Data()["progress"].asDouble());
+  EXPECT_TRUE(last.Data()["finished"].asBool()) << last.body;
+  EXPECT_EQ(2, last.Data()["error"]["code"].asInt()) << last.body;
   EXPECT_FALSE(NVX::TaskMgr("@administrators").hasTask("@KIVOPKG_DOWNLOAD_y"));
   EXPECT_FALSE(KLIBCFileExist(folder.c_str()));
 
